@@ -1,0 +1,103 @@
+// The daemon's one container of long-lived service objects. Every service object is made with a
+// reference to the Assembly and finds its peers through it instead of through globals.
+//
+// Fields are set during start-up on the main thread, in the order of start-up, before any client
+// can connect, and only read afterwards: no locking. An object may use, in its constructor, only
+// the fields set before it; anything later it fetches lazily.
+#pragma once
+
+#include <memory>
+
+#include "platform/files.h"
+
+namespace tavix {
+
+namespace platform {
+class ActivityScheduler;
+class Clock;
+class DispatchPool;
+class NotificationCenter;
+class TransactionTracker;
+class UserDefaults;
+namespace http {
+class URLSession;
+}
+}  // namespace platform
+
+// Service objects made by later subsystems; a slot stays empty until its subsystem is built.
+class TVXNetworkRequestFactory;
+class TavixBagController;
+class DownloadManager;
+class UploadManager;
+class ClientStateManager;
+class TavixUserGUIDController;
+class ClientSessionManager;
+class Lookup;
+class TavixSubscriptionManager;
+class TavixFlusherIPC;
+class AppWhitelistController;
+class TavixPersistentStorage;
+class LocationManager;
+class MotionManager;
+
+class Assembly {
+ public:
+  Assembly() = default;
+  Assembly(const Assembly&) = delete;
+  Assembly& operator=(const Assembly&) = delete;
+
+  // The platform services every object may use. Not owned: they outlive the assembly.
+  platform::DispatchPool* dispatchPool = nullptr;
+  platform::Clock* clock = nullptr;
+  platform::TransactionTracker* transactions = nullptr;
+  platform::ActivityScheduler* activityScheduler = nullptr;
+  platform::Paths paths;
+
+  // Whether all clients share one feedback session; set by TavixService at start.
+  bool sharedSession = false;
+
+  std::shared_ptr<platform::UserDefaults> userDefaults;
+  std::shared_ptr<platform::NotificationCenter> notificationCenter;
+
+  std::shared_ptr<TVXNetworkRequestFactory> requestFactory;
+  std::shared_ptr<TavixBagController> bagController;
+  std::shared_ptr<DownloadManager> downloadManager;
+  std::shared_ptr<UploadManager> uploadManager;
+  std::shared_ptr<ClientStateManager> clientStateManager;
+  std::shared_ptr<TavixUserGUIDController> guidController;
+  std::shared_ptr<ClientSessionManager> clientSessionManager;
+  std::shared_ptr<Lookup> lookup;
+  std::shared_ptr<TavixSubscriptionManager> subscriptionManager;
+  std::shared_ptr<TavixFlusherIPC> flusherIPCListener;
+  std::shared_ptr<AppWhitelistController> appWhitelistController;
+  std::shared_ptr<TavixPersistentStorage> persistentStorage;
+  std::shared_ptr<LocationManager> locationManager;
+  std::shared_ptr<MotionManager> motionManager;
+
+  // The bag controller asks before it reads or writes its disk cache; always true.
+  bool diskBagCacheEnabled() const { return true; }
+
+  // The current "TVXUseMarvola" default, read on every call so a change needs no restart.
+  bool useMarvola() const;
+
+  // The four process-wide URL sessions (queries, bag, resource downloads, feedback uploads).
+  // Each is made once, on first use, by the HTTP layer; until that layer is in, they are empty.
+  std::shared_ptr<platform::http::URLSession> urlSession() const { return urlSession_; }
+  std::shared_ptr<platform::http::URLSession> bagSession() const { return bagSession_; }
+  std::shared_ptr<platform::http::URLSession> downloadURLSession() const { return downloadURLSession_; }
+  std::shared_ptr<platform::http::URLSession> uploadURLSession() const { return uploadURLSession_; }
+
+  // The daemon's folder in the user's caches directory: "<caches>/com.norvel.tavixd".
+  platform::fs::path cachesFolder() const;
+
+ private:
+  std::shared_ptr<platform::http::URLSession> urlSession_;
+  std::shared_ptr<platform::http::URLSession> bagSession_;
+  std::shared_ptr<platform::http::URLSession> downloadURLSession_;
+  std::shared_ptr<platform::http::URLSession> uploadURLSession_;
+};
+
+// The application domain of the daemon's defaults and its folder names.
+inline constexpr const char* kTavixdDomain = "com.norvel.tavixd";
+
+}  // namespace tavix

@@ -1,0 +1,86 @@
+#include <gtest/gtest.h>
+
+#include <fstream>
+
+#include "core/custom_feedback_dirs.h"
+#include "core/logging.h"
+#include "daemon/options.h"
+#include "daemon/startup.h"
+#include "support/temp_home.h"
+
+namespace tavix {
+namespace {
+
+platform::Paths pathsIn(const testing::TempHome& home) {
+  return platform::Paths{home.cache(), home.config(), home.runtime()};
+}
+
+TEST(CustomFeedbackDirectories, MakesSixTypeFoldersAndASecondRunLogsNothing) {
+  testing::TempHome home;
+  platform::LogCapture capture;
+  createCustomFeedbackDirectories(pathsIn(home));
+  const auto root = home.cache() / "com.norvel.tavixd" / "CustomFeedback";
+  int folders = 0;
+  for (int type = 0; type <= 8; ++type) {
+    if (auto name = customFeedbackDirectoryForType(type)) {
+      EXPECT_TRUE(std::filesystem::is_directory(root / *name)) << type;
+      folders++;
+    }
+  }
+  EXPECT_EQ(folders, 6);
+  EXPECT_FALSE(customFeedbackDirectoryForType(0));
+  EXPECT_FALSE(customFeedbackDirectoryForType(2));
+  createCustomFeedbackDirectories(pathsIn(home));
+  EXPECT_EQ(capture.count("failed"), 0u);
+}
+
+TEST(CustomFeedbackDirectories, EachFailedTypeFolderIsLoggedAndTheLoopGoesOn) {
+  testing::TempHome home;
+  const auto folder = home.cache() / "com.norvel.tavixd";
+  std::filesystem::create_directories(folder);
+  // CustomFeedback leads into procfs, where no folder can be made, not even by root.
+  std::filesystem::create_directory_symlink("/proc/self", folder / "CustomFeedback");
+  platform::LogCapture capture;
+  createCustomFeedbackDirectories(pathsIn(home));
+  EXPECT_EQ(capture.count("failed creating a CustomFeedback subdir:"), 6u);
+  EXPECT_EQ(capture.count("failed creating CustomFeedback dir:"), 0u);
+}
+
+TEST(CustomFeedbackDirectories, AnUnusableCachesFolderIsLoggedNotFatal) {
+  testing::TempHome home;
+  std::ofstream(home.root() / "notadir") << "x";
+  platform::Paths paths{home.root() / "notadir", home.config(), home.runtime()};
+  platform::LogCapture capture;
+  createCustomFeedbackDirectories(paths);
+  EXPECT_EQ(capture.count("failed getting a caches dir:"), 1u);
+}
+
+TEST(RegisteredDefaults, AreTheSixSettingsWithTheirValues) {
+  auto d = tavixdRegisteredDefaults();
+  ASSERT_EQ(d.size(), 6u);
+  EXPECT_EQ(*d.at("TVXSharedSession").boolean(), true);
+  EXPECT_EQ(*d.at("TVXSessionSizeLimit").integer(), 2097152);
+  EXPECT_EQ(*d.at("TVXSessionMaxAge").integer(), 172800);
+  EXPECT_EQ(*d.at("TVXUseMarvola").boolean(), true);
+  EXPECT_EQ(*d.at("TVXSessionSoftLimitOverride").integer(), 600);
+  EXPECT_EQ(*d.at("TVXSessionIdleTimeOverride").integer(), 180);
+}
+
+TEST(DaemonOptions, ParsesFlagsAndRejectsBadOnesWithAReason) {
+  std::string error;
+  auto o = parseDaemonOptions({"--socket", "/tmp/s", "--exit-when-idle", "2.5", "--log-level", "debug"}, &error);
+  ASSERT_TRUE(o) << error;
+  EXPECT_EQ(o->socketPath, "/tmp/s");
+  EXPECT_DOUBLE_EQ(o->exitWhenIdle, 2.5);
+  EXPECT_EQ(o->logLevel, platform::LogLevel::Debug);
+
+  EXPECT_FALSE(parseDaemonOptions({"--exit-when-idle", "soon"}, &error));
+  EXPECT_NE(error.find("soon"), std::string::npos);
+  EXPECT_FALSE(parseDaemonOptions({"--log-level", "loud"}, &error));
+  EXPECT_FALSE(parseDaemonOptions({"--socket"}, &error));
+  EXPECT_FALSE(parseDaemonOptions({"--frobnicate"}, &error));
+  EXPECT_NE(error.find("--frobnicate"), std::string::npos);
+}
+
+}  // namespace
+}  // namespace tavix

@@ -1,0 +1,164 @@
+#include "daemon/startup.h"
+
+#include <signal.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <csignal>
+
+#include "core/assembly.h"
+#include "core/custom_feedback_dirs.h"
+#include "core/diagnostics.h"
+#include "core/logging.h"
+#include "daemon/tavix_service.h"
+#include "network/tracing.h"
+#include "platform/activity.h"
+#include "platform/clock.h"
+#include "platform/counters.h"
+#include "platform/defaults.h"
+#include "platform/dispatch.h"
+#include "platform/notification_center.h"
+#include "platform/run_loop.h"
+#include "platform/transactions.h"
+
+namespace tavix {
+
+using platform::PropertyValue;
+
+namespace {
+
+// How often the background activities fall due. The launch configuration of the original
+// platform is not ours to read; these are the daemon's own.
+constexpr double kFlusherIntervalSeconds = 3600;
+constexpr double kCustomFeedbackIntervalSeconds = 4 * 3600;
+// Counters are saved this often (when changed) and at exit.
+constexpr double kCounterSaveIntervalSeconds = 300;
+
+std::string describe(const platform::fs::path& path, const std::error_code& ec) {
+  return path.string() + ": " + ec.message();
+}
+
+}  // namespace
+
+platform::Dictionary tavixdRegisteredDefaults() {
+  return {
+      {"TVXSharedSession", PropertyValue(true)},
+      {"TVXSessionSizeLimit", PropertyValue(std::int64_t{2097152})},
+      {"TVXSessionMaxAge", PropertyValue(std::int64_t{172800})},
+      {"TVXUseMarvola", PropertyValue(true)},
+      {"TVXSessionSoftLimitOverride", PropertyValue(std::int64_t{600})},
+      {"TVXSessionIdleTimeOverride", PropertyValue(std::int64_t{180})},
+  };
+}
+
+void createCustomFeedbackDirectories(const platform::Paths& paths) {
+  auto& log = TavixLogForCategory(TavixLoggingCategoryDefault);
+  if (auto ec = platform::createDirectory(paths.cacheHome, true, 0700)) {
+    log.error("failed getting a caches dir: {}", describe(paths.cacheHome, ec));
+    return;
+  }
+  const auto root = paths.cachesFolder(kTavixdDomain) / kTVXCustomFeedbackDir;
+  if (auto ec = platform::createDirectory(root, true, 0700)) {
+    log.error("failed creating CustomFeedback dir:{}", describe(root, ec));
+    return;
+  }
+  for (int type = 1; type <= 7; ++type) {
+    auto name = customFeedbackDirectoryForType(type);
+    if (!name) continue;
+    const auto dir = root / *name;
+    auto ec = platform::createDirectory(dir, false, 0700);
+    if (ec && ec != std::errc::file_exists) log.error("failed creating a CustomFeedback subdir:{}", describe(dir, ec));
+  }
+}
+
+int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
+  platform::setLogLevel(options.logLevel);
+  auto& log = TavixLogForCategory(TavixLoggingCategoryDefault);
+
+  platform::DispatchPool pool;
+  platform::SystemClock clock(pool);
+  platform::TransactionTracker transactions;
+  platform::SerialQueue activityQueue(pool, "com.norvel.tavixd.activities");
+  platform::ActivityScheduler activities(clock, activityQueue, transactions);
+  platform::RunLoop runLoop;
+
+  auto defaults = std::make_shared<platform::UserDefaults>(paths.configFolder(kTavixdDomain), kTavixdDomain, &log);
+  defaults->watch(pool);
+
+  TVXTracingSetup(*defaults);
+  defaults->registerDefaults(tavixdRegisteredDefaults());
+  createCustomFeedbackDirectories(paths);
+
+  Assembly assembly;
+  assembly.dispatchPool = &pool;
+  assembly.clock = &clock;
+  assembly.transactions = &transactions;
+  assembly.activityScheduler = &activities;
+  assembly.paths = paths;
+  assembly.userDefaults = defaults;
+  assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
+
+  const auto countersFile = assembly.cachesFolder() / "counters.plist";
+  auto& counters = TavixDiagnosticDataReporter::store();
+  if (auto ec = counters.load(countersFile)) log.error("cannot read counters {}", describe(countersFile, ec));
+  TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.launch");
+
+  TavixService service(assembly);
+
+  // The activities' work (the feedback flushers) plugs into these handlers.
+  for (const auto& [name, interval] : {std::pair{kFlusherActivity, kFlusherIntervalSeconds},
+                                       std::pair{kCustomFeedbackActivity, kCustomFeedbackIntervalSeconds}}) {
+    activities.checkIn(name, platform::seconds(interval), [name = std::string(name)](const auto& activity) {
+      TavixLogForCategory(TavixLoggingCategoryFlusher)
+          .debug("activity {} delivered in state {}", name, platform::activityStateName(activity->state()));
+    });
+  }
+
+  pool.post([center = assembly.notificationCenter] { center->post("TVXStartup"); });
+
+  platform::SignalSource sigint(pool, SIGINT, [&] {
+    log.debug("SIGINT");
+    runLoop.stop();
+  });
+  platform::SignalSource sigterm(pool, SIGTERM, [&] {
+    log.debug("SIGTERM");
+    runLoop.stop();
+  });
+
+  platform::SerialQueue housekeeping(pool, "com.norvel.tavixd.housekeeping");
+  platform::RepeatingTimer saveCounters(clock, housekeeping);
+  platform::RepeatingTimer idleCheck(clock, housekeeping);
+  housekeeping.sync([&] {
+    saveCounters.start(platform::seconds(kCounterSaveIntervalSeconds), [&] {
+      if (!counters.dirty()) return;
+      if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
+    });
+    if (options.exitWhenIdle > 0) {
+      // Idle means: no open transaction (client connections will hold one too).
+      auto idleSince = std::make_shared<platform::TimePoint>(clock.now());
+      const double step = std::min(1.0, options.exitWhenIdle);
+      idleCheck.start(platform::seconds(step), [&, idleSince] {
+        if (transactions.openCount() > 0) {
+          *idleSince = clock.now();
+        } else if (clock.now() - *idleSince >= platform::seconds(options.exitWhenIdle)) {
+          log.info("idle for {} s, exiting", options.exitWhenIdle);
+          runLoop.stop();
+        }
+      });
+    }
+  });
+
+  log.info("tavixd started (pid {}), caches in {}", getpid(), assembly.cachesFolder().string());
+  runLoop.run();
+
+  housekeeping.sync([&] {
+    saveCounters.stop();
+    idleCheck.stop();
+  });
+  pool.drain();  // let queued work finish while everything it may touch is still alive
+  if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
+  log.info("tavixd stopped");
+  return 0;
+}
+
+}  // namespace tavix

@@ -1,0 +1,99 @@
+#include "platform/clock.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <vector>
+
+#include "support/temp_home.h"
+
+namespace tavix::platform {
+namespace {
+
+using namespace std::chrono_literals;
+
+struct VirtualClockTest : ::testing::Test {
+  DispatchPool pool{2};
+  SerialQueue queue{pool, "test.clock"};
+  VirtualClock clock;
+};
+
+TEST_F(VirtualClockTest, WorkScheduled900SecondsAheadFiresOnceWhenTimePassesIt) {
+  const auto realStart = std::chrono::steady_clock::now();
+  const TimePoint start = clock.now();
+  int fired = 0;
+  TimePoint firedAt{};
+  clock.after(seconds(900), queue, [&] {
+    fired++;
+    firedAt = clock.now();
+  });
+  clock.advance(seconds(899.999));
+  EXPECT_EQ(fired, 0);
+  clock.advance(1ms);
+  EXPECT_EQ(fired, 1);
+  EXPECT_EQ(firedAt, start + seconds(900));
+  clock.advance(seconds(3600));
+  EXPECT_EQ(fired, 1);
+  EXPECT_EQ(clock.pendingTimers(), 0u);
+  EXPECT_LT(std::chrono::steady_clock::now() - realStart, 500ms);
+}
+
+TEST_F(VirtualClockTest, FiresInDueOrderWithTiesInOrderSetAndFollowsTimersSetByTimers) {
+  std::vector<std::string> order;
+  clock.after(seconds(20), queue, [&] { order.push_back("b@20"); });
+  clock.after(seconds(10), queue, [&] {
+    order.push_back("a@10");
+    // Falls inside the same advance: must fire within it, before c.
+    clock.after(seconds(5), queue, [&] { order.push_back("nested@15"); });
+  });
+  clock.after(seconds(20), queue, [&] { order.push_back("c@20"); });
+  clock.advance(seconds(30));
+  EXPECT_EQ(order, (std::vector<std::string>{"a@10", "nested@15", "b@20", "c@20"}));
+}
+
+TEST_F(VirtualClockTest, CancelledTimerNeverRuns) {
+  int fired = 0;
+  TimerHandle handle = clock.after(seconds(5), queue, [&] { fired++; });
+  TimerHandle copy = handle;
+  copy.cancel();
+  EXPECT_TRUE(handle.isCancelled());
+  clock.advance(seconds(10));
+  EXPECT_EQ(fired, 0);
+}
+
+TEST_F(VirtualClockTest, RepeatingTimerRunsEveryIntervalUntilStopped) {
+  std::vector<double> at;
+  const double t0 = toUnixSeconds(clock.now());
+  RepeatingTimer timer(clock, queue);
+  queue.sync([&] { timer.start(seconds(60), [&] { at.push_back(toUnixSeconds(clock.now()) - t0); }); });
+  clock.advance(seconds(185));
+  EXPECT_EQ(at, (std::vector<double>{60, 120, 180}));
+  queue.sync([&] { timer.stop(); });
+  clock.advance(seconds(600));
+  EXPECT_EQ(at.size(), 3u);
+}
+
+TEST(SystemClock, TimerFiresOnItsQueueAfterTheDelay) {
+  DispatchPool pool(2);
+  SerialQueue queue(pool, "test.system");
+  SystemClock clock(pool);
+  std::atomic<bool> onQueue{false};
+  std::atomic<int> fired{0};
+  const auto start = std::chrono::steady_clock::now();
+  clock.after(30ms, queue, [&] {
+    onQueue = queue.isCurrent();
+    fired++;
+  });
+  TimerHandle cancelled = clock.after(10ms, queue, [&] { fired += 100; });
+  cancelled.cancel();
+  ASSERT_TRUE(testing::waitFor([&] { return fired.load() > 0; }, 2000));
+  EXPECT_GE(std::chrono::steady_clock::now() - start, 30ms);
+  EXPECT_TRUE(onQueue.load());
+  pool.drain();
+  std::this_thread::sleep_for(20ms);
+  EXPECT_EQ(fired.load(), 1);
+}
+
+}  // namespace
+}  // namespace tavix::platform

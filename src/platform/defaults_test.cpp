@@ -1,0 +1,132 @@
+#include "platform/defaults.h"
+
+#include <sys/stat.h>
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <fstream>
+#include <mutex>
+
+#include "support/temp_home.h"
+
+namespace tavix::platform {
+namespace {
+
+struct DefaultsTest : ::testing::Test {
+  testing::TempHome home;
+  fs::path folder = home.config() / "com.norvel.tavixd";
+};
+
+TEST_F(DefaultsTest, PersistentValueWinsOverRegisteredAndRemovalFallsBack) {
+  UserDefaults defaults(folder, "com.norvel.tavixd");
+  defaults.registerDefaults({{"TVXSessionSizeLimit", PropertyValue(std::int64_t{2097152})},
+                             {"TVXSharedSession", PropertyValue(true)}});
+  EXPECT_EQ(defaults.integerForKey("TVXSessionSizeLimit"), 2097152);
+  EXPECT_TRUE(defaults.boolForKey("TVXSharedSession"));
+  EXPECT_FALSE(defaults.boolForKey("TVXFeedbackFlushDisabled"));  // unregistered: false
+
+  ASSERT_TRUE(defaults.setObject("TVXSharedSession", PropertyValue(false)));
+  EXPECT_FALSE(defaults.boolForKey("TVXSharedSession"));
+  ASSERT_TRUE(defaults.removeObject("TVXSharedSession"));
+  EXPECT_TRUE(defaults.boolForKey("TVXSharedSession"));
+}
+
+TEST_F(DefaultsTest, TypedValuesSurviveTheFileAndTheFileIsPrivate) {
+  const TimePoint when = fromUnixSeconds(1767225600);  // whole seconds: XML dates keep seconds
+  {
+    UserDefaults writer(folder, "com.norvel.tavixd");
+    writer.setObject("b", PropertyValue(true));
+    writer.setObject("i", PropertyValue(std::int64_t{-600}));
+    writer.setObject("d", PropertyValue(0.25));
+    writer.setObject("s", PropertyValue("a <b> & c"));
+    writer.setObject("t", PropertyValue(Date{when}));
+    writer.setObject("data", PropertyValue(PropertyValue::Data{0, 1, 2, 250, 255}));
+    writer.setObject("list", PropertyValue(PropertyValue::Array{PropertyValue(1), PropertyValue("x")}));
+    writer.setObject("dict", PropertyValue(Dictionary{{"k", PropertyValue(2.5)}}));
+  }
+  UserDefaults reader(folder, "com.norvel.tavixd");
+  EXPECT_TRUE(reader.boolForKey("b"));
+  EXPECT_EQ(reader.integerForKey("i"), -600);
+  EXPECT_DOUBLE_EQ(reader.doubleForKey("d"), 0.25);
+  EXPECT_EQ(reader.stringForKey("s"), "a <b> & c");
+  EXPECT_EQ(reader.dateForKey("t"), when);
+  EXPECT_EQ(*reader.objectForKey("data")->data(), (PropertyValue::Data{0, 1, 2, 250, 255}));
+  EXPECT_EQ(reader.objectForKey("list")->array()->size(), 2u);
+  EXPECT_DOUBLE_EQ(*reader.objectForKey("dict")->dictionary()->at("k").real(), 2.5);
+
+  struct stat st {};
+  ASSERT_EQ(stat(reader.filePath().c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+}
+
+TEST_F(DefaultsTest, AWriteDoesNotLoseAValueAnotherWriterPutInTheFile) {
+  UserDefaults daemon(folder, "com.norvel.tavixd");
+  UserDefaults tool(folder, "com.norvel.tavixd");
+  tool.setObject("fromTool", PropertyValue(1));
+  daemon.setObject("fromDaemon", PropertyValue(2));  // without a synchronize in between
+  UserDefaults fresh(folder, "com.norvel.tavixd");
+  EXPECT_EQ(fresh.integerForKey("fromTool"), 1);
+  EXPECT_EQ(fresh.integerForKey("fromDaemon"), 2);
+}
+
+TEST_F(DefaultsTest, SynchronizeSeesAHandEditAndTellsObserversWhatChanged) {
+  UserDefaults defaults(folder, "com.norvel.tavixd");
+  defaults.setObject("keep", PropertyValue("same"));
+  defaults.setObject("old", PropertyValue(1));
+  std::vector<std::string> heard;
+  auto sub = defaults.addObserver([&](const std::string& key) { heard.push_back(key); });
+
+  std::ofstream(defaults.filePath()) << toXmlPlist(PropertyValue(
+      Dictionary{{"keep", PropertyValue("same")}, {"TVXNoQueryCache", PropertyValue(true)}}));
+  EXPECT_FALSE(defaults.boolForKey("TVXNoQueryCache"));
+  ASSERT_TRUE(defaults.synchronize());
+  EXPECT_TRUE(defaults.boolForKey("TVXNoQueryCache"));
+  std::sort(heard.begin(), heard.end());
+  EXPECT_EQ(heard, (std::vector<std::string>{"TVXNoQueryCache", "old"}));
+
+  sub.reset();
+  defaults.setObject("after", PropertyValue(1));
+  EXPECT_EQ(heard.size(), 2u);
+}
+
+TEST_F(DefaultsTest, ACorruptFileIsReportedAndTheValuesInMemoryStay) {
+  UserDefaults defaults(folder, "com.norvel.tavixd");
+  defaults.setObject("k", PropertyValue(5));
+  std::ofstream(defaults.filePath()) << "<plist><dict><key>k</key>";
+  EXPECT_FALSE(defaults.synchronize());
+  EXPECT_EQ(defaults.integerForKey("k"), 5);
+}
+
+TEST_F(DefaultsTest, WatchPicksUpAFileWrittenByHand) {
+  DispatchPool pool(2);
+  UserDefaults defaults(folder, "com.norvel.tavixd");
+  std::mutex lock;
+  std::vector<std::string> heard;
+  auto sub = defaults.addObserver([&](const std::string& key) {
+    std::lock_guard<std::mutex> guard(lock);
+    heard.push_back(key);
+  });
+  defaults.watch(pool);
+  // An editor's save: write a temporary file and rename it over the old one.
+  const fs::path tmp = folder / "edit.tmp";
+  std::ofstream(tmp) << toXmlPlist(PropertyValue(Dictionary{{"TVXBagURL", PropertyValue("http://127.0.0.1:1/bag")}}));
+  fs::rename(tmp, defaults.filePath());
+  ASSERT_TRUE(testing::waitFor([&] { return defaults.stringForKey("TVXBagURL").has_value(); }));
+  EXPECT_EQ(*defaults.stringForKey("TVXBagURL"), "http://127.0.0.1:1/bag");
+  std::lock_guard<std::mutex> guard(lock);
+  EXPECT_NE(std::find(heard.begin(), heard.end(), "TVXBagURL"), heard.end());
+}
+
+TEST_F(DefaultsTest, SuitesAreSeparateDomainsInTheSameFolder) {
+  UserDefaults app(folder, "com.norvel.tavixd");
+  auto shared = app.suite("com.norvel.lookup.shared");
+  shared->setObject("k", PropertyValue("shared"));
+  app.setObject("k", PropertyValue("app"));
+  EXPECT_EQ(shared->stringForKey("k"), "shared");
+  EXPECT_EQ(app.stringForKey("k"), "app");
+  EXPECT_TRUE(fs::exists(folder / "com.norvel.lookup.shared.plist"));
+}
+
+}  // namespace
+}  // namespace tavix::platform

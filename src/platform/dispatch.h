@@ -1,0 +1,113 @@
+// Serial queues on one shared thread pool: the daemon's concurrency model.
+//
+// Every object that owns state owns a SerialQueue and runs its private operations on it. Public
+// operations hop onto the queue: reads with sync(), writes with async(). A queue is an Asio strand
+// over the process's pool, so queues cost nothing while idle and never need a thread of their own.
+//
+// Threading: every method of SerialQueue and ReaderWriterQueue is safe from any thread.
+#pragma once
+
+#include <atomic>
+#include <condition_variable>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <shared_mutex>
+#include <string>
+
+namespace tavix::platform {
+
+using Task = std::function<void()>;
+
+// The process's worker pool. One per process, created at start-up (or per test) and outliving
+// every queue made on it. The destructor stops the workers after the queued work has drained.
+class DispatchPool {
+ public:
+  explicit DispatchPool(unsigned threads = 0);  // 0 picks a size fit for the machine
+  ~DispatchPool();
+  DispatchPool(const DispatchPool&) = delete;
+  DispatchPool& operator=(const DispatchPool&) = delete;
+
+  // Runs `task` on some pool thread: the platform's "global queue". No ordering between tasks.
+  void post(Task task);
+
+  // Waits until every task posted so far, and everything they post in turn, has run.
+  // Only for tests and shutdown; never call it from a pool thread.
+  void drain();
+
+  unsigned threadCount() const;
+
+  // The Asio io_context behind the pool, as an opaque pointer for the few platform pieces
+  // (timers, signals, file watches) that need it. Cast with asioContext() in platform sources.
+  void* nativeContext();
+
+ private:
+  friend class SerialQueue;
+  void beginWork();
+  void endWork();
+
+  struct Impl;
+  std::unique_ptr<Impl> impl_;
+};
+
+// A serial queue: tasks run one at a time, in submission order, on some pool thread.
+class SerialQueue {
+ public:
+  SerialQueue(DispatchPool& pool, std::string label);
+  ~SerialQueue();
+  SerialQueue(const SerialQueue&) = delete;
+  SerialQueue& operator=(const SerialQueue&) = delete;
+
+  const std::string& label() const { return label_; }
+
+  // Queues `task` and returns at once.
+  void async(Task task);
+
+  // Runs `task` on the queue and waits for it. Never call sync() on the queue you are running
+  // on (directly or through a chain of sync calls): that would wait on itself for ever, so it is
+  // checked and stops the process with a message naming the queue.
+  void sync(const Task& task);
+
+  // True while the calling thread runs a task of this queue.
+  bool isCurrent() const;
+
+  // Aborts with `what` unless the caller runs on this queue: the sequence check of private
+  // operations. Compiled in debug builds only.
+  void assertCurrent(const char* what) const;
+
+ private:
+  struct Impl;
+  std::string label_;
+  std::unique_ptr<Impl> impl_;
+};
+
+// "Synchronous reads, barrier writes": reads run on the caller's thread and may overlap one
+// another; a write waits for reads in progress, runs alone, and every read submitted after the
+// write was submitted sees its effect. Writes run in submission order.
+class ReaderWriterQueue {
+ public:
+  ReaderWriterQueue(DispatchPool& pool, std::string label);
+  ~ReaderWriterQueue();
+
+  // Runs `task` on the calling thread under shared access, after every earlier write.
+  void read(const Task& task);
+
+  // Queues `task` as a barrier and returns at once.
+  void writeAsync(Task task);
+
+  // Runs `task` as a barrier and waits for it. Not from inside a read or write of this queue.
+  void writeSync(const Task& task);
+
+ private:
+  void runWrite(const Task& task);
+
+  SerialQueue writes_;
+  std::shared_mutex access_;
+  std::mutex progressLock_;
+  std::condition_variable progress_;
+  std::uint64_t submittedWrites_ = 0;
+  std::uint64_t finishedWrites_ = 0;
+};
+
+}  // namespace tavix::platform

@@ -1,0 +1,128 @@
+#include "platform/dispatch.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <thread>
+#include <vector>
+
+namespace tavix::platform {
+namespace {
+
+TEST(SerialQueue, RunsTasksOneAtATimeInSubmissionOrder) {
+  DispatchPool pool(4);
+  SerialQueue queue(pool, "test.serial");
+  std::vector<int> order;
+  std::atomic<int> running{0};
+  std::atomic<int> overlap{0};
+  for (int i = 0; i < 500; ++i) {
+    queue.async([&, i] {
+      if (running.fetch_add(1) != 0) overlap++;
+      order.push_back(i);
+      running.fetch_sub(1);
+    });
+  }
+  queue.sync([] {});
+  EXPECT_EQ(overlap.load(), 0);
+  ASSERT_EQ(order.size(), 500u);
+  for (int i = 0; i < 500; ++i) EXPECT_EQ(order[i], i);
+}
+
+TEST(SerialQueue, SyncWaitsForEarlierAsyncWorkAndKnowsItsQueue) {
+  DispatchPool pool(2);
+  SerialQueue a(pool, "test.a");
+  SerialQueue b(pool, "test.b");
+  int value = 0;
+  a.async([&] { value = 41; });
+  a.sync([&] { value += 1; });
+  EXPECT_EQ(value, 42);
+  EXPECT_FALSE(a.isCurrent());
+  bool onA = false, onBFromA = true;
+  a.sync([&] {
+    onA = a.isCurrent();
+    onBFromA = b.isCurrent();
+  });
+  EXPECT_TRUE(onA);
+  EXPECT_FALSE(onBFromA);
+}
+
+TEST(SerialQueue, NestedSyncAcrossQueuesWorks) {
+  DispatchPool pool(2);
+  SerialQueue a(pool, "test.a");
+  SerialQueue b(pool, "test.b");
+  int seen = 0;
+  a.sync([&] { b.sync([&] { seen = 7; }); });
+  EXPECT_EQ(seen, 7);
+}
+
+TEST(SerialQueueDeathTest, SyncOntoItselfStopsWithTheQueueName) {
+  EXPECT_DEATH(
+      {
+        DispatchPool pool(2);
+        SerialQueue a(pool, "test.self");
+        a.sync([&] { a.sync([] {}); });
+      },
+      "test.self");
+}
+
+TEST(DispatchPool, DrainWaitsForQueueWorkPostedByQueueWork) {
+  DispatchPool pool(3);
+  SerialQueue a(pool, "test.a");
+  std::atomic<int> done{0};
+  a.async([&] {
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    a.async([&] { done++; });
+    pool.post([&] { done++; });
+  });
+  pool.drain();
+  EXPECT_EQ(done.load(), 2);
+}
+
+TEST(ReaderWriterQueue, ReadsSeeEveryWriteSubmittedBeforeThem) {
+  DispatchPool pool(4);
+  ReaderWriterQueue rw(pool, "test.rw");
+  int value = 0;
+  for (int i = 1; i <= 200; ++i) {
+    rw.writeAsync([&, i] {
+      std::this_thread::yield();
+      value = i;
+    });
+    int seen = -1;
+    rw.read([&] { seen = value; });
+    ASSERT_EQ(seen, i);
+  }
+}
+
+TEST(ReaderWriterQueue, WritesExcludeReadersAndEachOther) {
+  DispatchPool pool(4);
+  ReaderWriterQueue rw(pool, "test.rw");
+  std::atomic<int> readers{0};
+  std::atomic<bool> violated{false};
+  std::vector<int> log;
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 4; ++t) {
+    threads.emplace_back([&] {
+      for (int i = 0; i < 200; ++i) {
+        rw.read([&] {
+          readers++;
+          std::this_thread::yield();
+          readers--;
+        });
+      }
+    });
+  }
+  for (int i = 0; i < 200; ++i) {
+    rw.writeAsync([&, i] {
+      if (readers.load() != 0) violated = true;
+      log.push_back(i);
+    });
+  }
+  for (auto& t : threads) t.join();
+  rw.writeSync([] {});
+  EXPECT_FALSE(violated.load());
+  ASSERT_EQ(log.size(), 200u);
+  for (int i = 0; i < 200; ++i) EXPECT_EQ(log[i], i);
+}
+
+}  // namespace
+}  // namespace tavix::platform

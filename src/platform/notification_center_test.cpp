@@ -1,0 +1,82 @@
+#include "platform/notification_center.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <thread>
+
+namespace tavix::platform {
+namespace {
+
+TEST(NotificationCenter, DeliversByNameAndSenderWithObjectAndUserInfo) {
+  NotificationCenter center;
+  int a = 0, b = 0;
+  int senderA = 0, other = 0;
+  int all = 0;
+  std::string payload;
+  auto byName = center.addObserver("TVXBagChangeNotification", nullptr, nullptr, [&](const Notification& n) {
+    a++;
+    payload = std::any_cast<std::string>(n.object) + *n.userInfo.at("k").string();
+  });
+  auto bySender = center.addObserver("X", &senderA, nullptr, [&](const Notification&) { b++; });
+  auto everything = center.addObserver("", nullptr, nullptr, [&](const Notification&) { all++; });
+
+  center.post("TVXBagChangeNotification", nullptr, std::string("bag"), Dictionary{{"k", PropertyValue("!")}});
+  center.post("X", &other);
+  center.post("X", &senderA);
+  EXPECT_EQ(a, 1);
+  EXPECT_EQ(payload, "bag!");
+  EXPECT_EQ(b, 1);
+  EXPECT_EQ(all, 3);
+}
+
+TEST(NotificationCenter, RemovedObserverHearsNothingEvenWhenQueued) {
+  DispatchPool pool(2);
+  SerialQueue queue(pool, "test.observer");
+  NotificationCenter center;
+  std::atomic<int> heard{0};
+  auto reg = center.addObserver("N", nullptr, &queue, [&](const Notification&) { heard++; });
+  queue.async([] { std::this_thread::sleep_for(std::chrono::milliseconds(20)); });
+  center.post("N");  // queued behind the sleeper
+  reg.reset();
+  queue.sync([] {});
+  EXPECT_EQ(heard.load(), 0);
+}
+
+TEST(NotificationCenter, AnObserverMayRemoveItselfAndOthersStillHear) {
+  NotificationCenter center;
+  NotificationCenter::Registration self;
+  int selfCount = 0, otherCount = 0;
+  self = center.addObserver("N", nullptr, nullptr, [&](const Notification&) {
+    selfCount++;
+    self.reset();
+  });
+  auto other = center.addObserver("N", nullptr, nullptr, [&](const Notification&) { otherCount++; });
+  center.post("N");
+  center.post("N");
+  EXPECT_EQ(selfCount, 1);
+  EXPECT_EQ(otherCount, 2);
+}
+
+TEST(NotificationCenter, NoDeliveryStartsAfterRemovalReturnsUnderConcurrentPosts) {
+  NotificationCenter center;
+  std::atomic<bool> stop{false};
+  std::atomic<int> lateDeliveries{0};
+  std::thread poster([&] {
+    while (!stop) center.post("N");
+  });
+  for (int i = 0; i < 2000; ++i) {
+    auto removed = std::make_shared<std::atomic<bool>>(false);
+    auto reg = center.addObserver("N", nullptr, nullptr, [removed, &lateDeliveries](const Notification&) {
+      if (removed->load()) lateDeliveries++;
+    });
+    reg.reset();
+    removed->store(true);
+  }
+  stop = true;
+  poster.join();
+  EXPECT_EQ(lateDeliveries.load(), 0);
+}
+
+}  // namespace
+}  // namespace tavix::platform

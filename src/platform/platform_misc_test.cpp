@@ -1,0 +1,146 @@
+// Smaller platform pieces: property lists, files, counters, transactions, logging.
+#include <sys/stat.h>
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+
+#include "platform/counters.h"
+#include "platform/files.h"
+#include "platform/log.h"
+#include "platform/property_value.h"
+#include "platform/transactions.h"
+#include "support/temp_home.h"
+
+namespace tavix::platform {
+namespace {
+
+TEST(PropertyList, BinaryAndXmlRoundTripEveryType) {
+  PropertyValue value(Dictionary{
+      {"neg", PropertyValue(std::int64_t{-1})},
+      {"big", PropertyValue(std::int64_t{1} << 40)},
+      {"real", PropertyValue(-2.5)},
+      {"flag", PropertyValue(false)},
+      {"text", PropertyValue("ü & <x>")},
+      {"when", PropertyValue(Date{fromUnixSeconds(1767225600)})},
+      {"blob", PropertyValue(PropertyValue::Data{1, 2, 3, 4})},
+      {"list", PropertyValue(PropertyValue::Array{PropertyValue(Dictionary{}), PropertyValue(PropertyValue::Array{})})},
+  });
+  auto fromXml = parsePlist(toXmlPlist(value));
+  ASSERT_TRUE(fromXml);
+  EXPECT_EQ(*fromXml, value);
+  auto fromBinary = parsePlist(toBinaryPlist(value));
+  ASSERT_TRUE(fromBinary);
+  EXPECT_EQ(*fromBinary, value);
+}
+
+TEST(PropertyList, GarbageIsRejected) {
+  EXPECT_FALSE(parsePlist(""));
+  EXPECT_FALSE(parsePlist("not a plist"));
+  EXPECT_FALSE(parsePlist("bplist00\x01\x02"));
+}
+
+TEST(PropertyValue, LenientReadingsFollowTheDefaultsRules) {
+  EXPECT_EQ(PropertyValue("YES").asBool(), true);
+  EXPECT_EQ(PropertyValue("0").asBool(), false);
+  EXPECT_EQ(PropertyValue(std::int64_t{2}).asBool(), true);
+  EXPECT_EQ(PropertyValue("42").asInteger(), 42);
+  EXPECT_EQ(PropertyValue(3.9).asInteger(), 3);
+  EXPECT_EQ(PropertyValue("1.5").asReal(), 1.5);
+  EXPECT_FALSE(PropertyValue("abc").asInteger());
+  EXPECT_FALSE(PropertyValue(PropertyValue::Array{}).asBool());
+}
+
+TEST(Files, CreateDirectoryReportsExistingEntriesOnlyWithoutIntermediates) {
+  testing::TempHome home;
+  const fs::path deep = home.root() / "a" / "b" / "c";
+  EXPECT_FALSE(createDirectory(deep, true));
+  EXPECT_FALSE(createDirectory(deep, true));  // again: fine
+  EXPECT_EQ(createDirectory(deep, false).value(), EEXIST);
+  EXPECT_EQ(createDirectory(home.root() / "x" / "y", false).value(), ENOENT);
+  std::ofstream(home.root() / "file") << "x";
+  EXPECT_TRUE(createDirectory(home.root() / "file" / "sub", true));
+}
+
+TEST(Files, AtomicWriteReplacesWholeFilesWithTheAskedModeAndLeavesNoTemporaries) {
+  testing::TempHome home;
+  const fs::path file = home.root() / "bag.plist";
+  ASSERT_FALSE(writeFileAtomically(file, "first version", 0600));
+  ASSERT_FALSE(writeFileAtomically(file, "second", 0600));
+  std::string read;
+  ASSERT_FALSE(readFile(file, &read));
+  EXPECT_EQ(read, "second");
+  struct stat st {};
+  ASSERT_EQ(stat(file.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  int entries = 0;
+  for (auto& e : fs::directory_iterator(home.root())) entries += e.path().filename() == "bag.plist" ? 0 : 1;
+  EXPECT_EQ(entries, 3);  // cache, config, runtime: no temporary left behind
+  EXPECT_EQ(writeFileAtomically(home.root() / "missing" / "f", "x").value(), ENOENT);
+}
+
+TEST(CounterStore, SurvivesASaveAndLoadAndRejectsACorruptFile) {
+  testing::TempHome home;
+  const fs::path file = home.root() / "counters.plist";
+  CounterStore counters;
+  counters.addValue(1, "com.norvel.tavixd.launch");
+  counters.addValue(2, "com.norvel.tavixd.launch");
+  counters.setValue(-7, "x");
+  counters.addValue(1, "gone");
+  counters.clear("gone");
+  EXPECT_TRUE(counters.dirty());
+  ASSERT_FALSE(counters.save(file));
+  EXPECT_FALSE(counters.dirty());
+
+  CounterStore again;
+  ASSERT_FALSE(again.load(file));
+  EXPECT_EQ(again.snapshot(), (std::map<std::string, std::int64_t>{{"com.norvel.tavixd.launch", 3}, {"x", -7}}));
+
+  std::ofstream(file) << "garbage";
+  EXPECT_TRUE(again.load(file));
+  EXPECT_EQ(again.value("com.norvel.tavixd.launch"), 3);
+  CounterStore missing;
+  EXPECT_FALSE(missing.load(home.root() / "none.plist"));
+}
+
+TEST(TransactionTracker, CountsByNameAndCallsTheIdleHandlerWhenTheLastCloses) {
+  TransactionTracker tracker;
+  int idle = 0;
+  tracker.setIdleHandler([&] { idle++; });
+  auto a = tracker.begin("addFeedback");
+  auto b = tracker.begin("addFeedback");
+  auto c = tracker.begin("bagFetch");
+  EXPECT_EQ(tracker.openCount(), 3u);
+  EXPECT_EQ(tracker.open().at("addFeedback"), 2u);
+  a.reset();
+  auto moved = std::move(b);
+  b.reset();  // moved-from: closes nothing
+  EXPECT_EQ(tracker.openCount(), 2u);
+  moved.reset();
+  EXPECT_EQ(idle, 0);
+  c.reset();
+  EXPECT_EQ(idle, 1);
+  EXPECT_TRUE(tracker.open().empty());
+}
+
+TEST(Logging, CaptureSeesEveryLevelWhateverTheOutputLevel) {
+  setLogLevel(LogLevel::Error);
+  Logger log("com.norvel.tavixd", "Tavix_Test");
+  LogCapture capture;
+  log.debug("launch event for {}", "x");
+  log.fault("Couldn't transition flusher activity to {} state.", "done");
+  auto lines = capture.lines();
+  ASSERT_EQ(lines.size(), 2u);
+  EXPECT_EQ(lines[0].level, LogLevel::Debug);
+  EXPECT_EQ(lines[1].message, "Couldn't transition flusher activity to done state.");
+  EXPECT_EQ(lines[1].category, "Tavix_Test");
+  setLogLevel(LogLevel::Info);
+
+  LogLevel parsed;
+  EXPECT_TRUE(parseLogLevel("fault", &parsed));
+  EXPECT_EQ(parsed, LogLevel::Fault);
+  EXPECT_FALSE(parseLogLevel("verbose", &parsed));
+}
+
+}  // namespace
+}  // namespace tavix::platform
