@@ -1,0 +1,34 @@
+#include "platform/http/url_request.h"
+
+#include <algorithm>
+#include <cctype>
+
+namespace tavix::platform::http {
+
+bool equalsIgnoringCase(std::string_view a, std::string_view b) {
+  return a.size() == b.size() && std::equal(a.begin(), a.end(), b.begin(), [](char x, char y) {
+           return std::tolower(static_cast<unsigned char>(x)) == std::tolower(static_cast<unsigned char>(y));
+         });
+}
+
+void HeaderFields::set(std::string_view name, std::string value) {
+  remove(name);
+  fields_.emplace_back(std::string(name), std::move(value));
+}
+
+void HeaderFields::add(std::string name, std::string value) { fields_.emplace_back(std::move(name), std::move(value)); }
+
+void HeaderFields::remove(std::string_view name) {
+  fields_.erase(std::remove_if(fields_.begin(), fields_.end(),
+                               [&](const auto& f) { return equalsIgnoringCase(f.first, name); }),
+                fields_.end());
+}
+
+std::optional<std::string> HeaderFields::get(std::string_view name) const {
+  for (const auto& [n, v] : fields_) {
+    if (equalsIgnoringCase(n, name)) return v;
+  }
+  return std::nullopt;
+}
+
+}  // namespace tavix::platform::http

@@ -1,0 +1,68 @@
+// The values that cross the HTTP layer: a request to send, the response head that came back and
+// a transport error. Plain values, no I/O; the URL session moves them over the wire.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+namespace tavix::platform::http {
+
+// Header fields in the order set. Names compare case-insensitively, as HTTP says.
+class HeaderFields {
+ public:
+  // Replaces every field of that name.
+  void set(std::string_view name, std::string value);
+  void add(std::string name, std::string value);
+  void remove(std::string_view name);
+  std::optional<std::string> get(std::string_view name) const;
+  bool contains(std::string_view name) const { return get(name).has_value(); }
+  const std::vector<std::pair<std::string, std::string>>& all() const { return fields_; }
+  bool empty() const { return fields_.empty(); }
+
+ private:
+  std::vector<std::pair<std::string, std::string>> fields_;
+};
+
+bool equalsIgnoringCase(std::string_view a, std::string_view b);
+
+struct URLRequest {
+  std::string url;  // absolute, already percent-encoded
+  std::string method = "GET";
+  HeaderFields headers;
+  std::string body;
+  double timeoutInterval = 60;  // seconds without progress before the task fails
+};
+
+struct HTTPURLResponse {
+  long statusCode = 0;
+  std::string url;  // after redirects
+  HeaderFields headers;
+  std::int64_t expectedContentLength = -1;
+};
+
+// A transport failure: no HTTP response (or not a whole one) came back.
+struct URLError {
+  std::string domain;  // kURLErrorDomain for transport failures
+  long code = 0;
+  std::string description;
+};
+
+inline constexpr const char* kURLErrorDomain = "TavixURLErrorDomain";
+
+// The transport error codes the daemon tells apart.
+enum URLErrorCode : long {
+  URLErrorUnknown = -1,
+  URLErrorCancelled = -999,
+  URLErrorBadURL = -1000,
+  URLErrorTimedOut = -1001,
+  URLErrorCannotConnectToHost = -1004,
+  URLErrorNetworkConnectionLost = -1005,
+  URLErrorBadServerResponse = -1011,
+  URLErrorSecureConnectionFailed = -1200,
+};
+
+}  // namespace tavix::platform::http
