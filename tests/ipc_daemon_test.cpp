@@ -8,6 +8,7 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <fstream>
 #include <future>
 #include <sstream>
@@ -231,6 +232,37 @@ TEST(IpcDaemon, BadConfigurationGetsNoReplyAndAClosedConnection) {
   ASSERT_TRUE(error);
   EXPECT_EQ(error->code, tavix::client::kConnectionLost);
   EXPECT_TRUE(d.alive());
+}
+
+TEST(IpcDaemon, ClientFailsCallsInFlightOnceAndReconnectsToTheNextDaemon) {
+  tavix::testing::TempHome home;
+  auto d = std::make_unique<Daemon>(home, "first.log");
+  Client client(options(*d));
+  ASSERT_FALSE(client.connect());
+
+  // Frozen, then killed, with a call in flight: the call fails once, with "connection lost".
+  kill(d->pid, SIGSTOP);
+  std::atomic<int> calls{0};
+  std::promise<std::optional<tavix::client::Error>> failed;
+  client.notify("never", [&](auto error) {
+    if (calls++ == 0) failed.set_value(error);
+  });
+  kill(d->pid, SIGKILL);
+  waitpid(d->pid, nullptr, 0);
+  d->pid = -1;
+  auto future = failed.get_future();
+  ASSERT_EQ(future.wait_for(std::chrono::seconds(5)), std::future_status::ready);
+  auto error = future.get();
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, tavix::client::kConnectionLost);
+  EXPECT_FALSE(client.isConnected());
+
+  Daemon next(home, "second.log");
+  ASSERT_TRUE(next.waitForLog("tavixd started")) << next.log();
+  EXPECT_FALSE(client.notifySync("again")) << next.log();
+  EXPECT_TRUE(next.waitForLog("client configuration {identifier: tests, userAgent: tests/1}")) << next.log();
+  EXPECT_TRUE(next.waitForLog("launch event for again")) << next.log();
+  EXPECT_EQ(calls, 1);
 }
 
 TEST(IpcDaemon, ServesTheSocketHandedOverBySystemd) {
