@@ -13,6 +13,8 @@
 #include <future>
 #include <sstream>
 #include <string>
+#include <thread>
+#include <vector>
 
 #include "support/temp_home.h"
 #include "tavix/client.h"
@@ -26,7 +28,8 @@ struct Daemon {
   std::filesystem::path logFile;
   std::string socket;
 
-  explicit Daemon(const tavix::testing::TempHome& home, const std::string& logName = "tavixd.log") {
+  explicit Daemon(const tavix::testing::TempHome& home, const std::string& logName = "tavixd.log",
+                  std::vector<std::string> extra = {}) {
     logFile = home.root() / logName;
     socket = (home.runtime() / "com.norvel.tavixd" / "socket").string();
     pid = fork();
@@ -34,7 +37,12 @@ struct Daemon {
       home.exportEnvironment();
       int fd = open(logFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
       dup2(fd, 2);
-      execl(TAVIXD_BINARY, TAVIXD_BINARY, "--log-level", "debug", static_cast<char*>(nullptr));
+      std::vector<std::string> args{TAVIXD_BINARY, "--log-level", "debug"};
+      args.insert(args.end(), extra.begin(), extra.end());
+      std::vector<char*> argv;
+      for (auto& a : args) argv.push_back(a.data());
+      argv.push_back(nullptr);
+      execv(TAVIXD_BINARY, argv.data());
       _exit(127);
     }
     tavix::testing::waitFor([&] { return std::filesystem::exists(socket); });
@@ -263,6 +271,20 @@ TEST(IpcDaemon, ClientFailsCallsInFlightOnceAndReconnectsToTheNextDaemon) {
   EXPECT_TRUE(next.waitForLog("client configuration {identifier: tests, userAgent: tests/1}")) << next.log();
   EXPECT_TRUE(next.waitForLog("launch event for again")) << next.log();
   EXPECT_EQ(calls, 1);
+}
+
+TEST(IpcDaemon, IdleExitComesOnceTheLastClientHasLeft) {
+  tavix::testing::TempHome home;
+  Daemon d(home, "idle.log", {"--exit-when-idle", "0.3"});
+  {
+    Client client(options(d));
+    ASSERT_FALSE(client.connect()) << d.log();
+    std::this_thread::sleep_for(std::chrono::milliseconds(1500));
+    EXPECT_TRUE(d.alive()) << d.log();
+  }
+  EXPECT_TRUE(tavix::testing::waitFor([&] { return !d.alive(); }, 5000)) << d.log();
+  d.pid = -1;
+  EXPECT_TRUE(d.waitForLog("exiting"));
 }
 
 TEST(IpcDaemon, ServesTheSocketHandedOverBySystemd) {

@@ -165,11 +165,11 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
       if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
     });
     if (options.exitWhenIdle > 0) {
-      // Idle means: no open transaction (client connections will hold one too).
+      // Idle means: no open transaction and no client connected.
       auto idleSince = std::make_shared<platform::TimePoint>(clock.now());
       const double step = std::min(1.0, options.exitWhenIdle);
       idleCheck.start(platform::seconds(step), [&, idleSince] {
-        if (transactions.openCount() > 0) {
+        if (transactions.openCount() > 0 || !service.getClientConnections().empty()) {
           *idleSince = clock.now();
         } else if (clock.now() - *idleSince >= platform::seconds(options.exitWhenIdle)) {
           log.info("idle for {} s, exiting", options.exitWhenIdle);
