@@ -8,6 +8,7 @@
 #include "core/logging.h"
 #include "tavix_proto/ipc.pb.h"
 #include "platform/activity.h"
+#include "platform/notification_center.h"
 #include "platform/ipc/launch_events.h"
 #include "platform/ipc/server.h"
 
@@ -72,9 +73,40 @@ ClientConnection::~ClientConnection() {
   closeTransaction();
 }
 
-void ClientConnection::start() { openOrExtendTransaction(); }
+void ClientConnection::start() {
+  if (assembly_.notificationCenter) {
+    std::weak_ptr<ClientConnection> weak = weak_from_this();
+    downloadObserver_ = assembly_.notificationCenter->addObserver(
+        "TVXFileDownloadCompletedNotification", nullptr, nullptr, [weak](const platform::Notification& n) {
+          if (auto self = weak.lock()) self->relayResourceNotification(n, true);
+        });
+    deleteObserver_ = assembly_.notificationCenter->addObserver(
+        "TVXFileDeletedNotification", nullptr, nullptr, [weak](const platform::Notification& n) {
+          if (auto self = weak.lock()) self->relayResourceNotification(n, false);
+        });
+  }
+  openOrExtendTransaction();
+}
+
+void ClientConnection::relayResourceNotification(const platform::Notification& notification, bool downloaded) {
+  auto it = notification.userInfo.find("identifier");
+  if (it == notification.userInfo.end() || !it->second.string()) return;
+  proto::Envelope out;
+  if (downloaded) {
+    out.mutable_did_download_resource()->set_identifier(*it->second.string());
+  } else {
+    out.mutable_did_delete_resource()->set_identifier(*it->second.string());
+  }
+  // Off the poster's thread; the connection is held weakly, so a client gone meanwhile is skipped.
+  std::weak_ptr<platform::ipc::IpcConnection> weak = connection_;
+  assembly_.dispatchPool->post([weak, bytes = out.SerializeAsString()]() mutable {
+    if (auto connection = weak.lock()) connection->send(std::move(bytes));
+  });
+}
 
 void ClientConnection::invalidated() {
+  downloadObserver_.reset();
+  deleteObserver_.reset();
   idleTimer_.cancel();
   closeTransaction();
 }

@@ -14,6 +14,7 @@
 #include <string>
 
 #include "platform/clock.h"
+#include "platform/notification_center.h"
 #include "platform/transactions.h"
 
 namespace tavix {
@@ -49,7 +50,9 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   ClientConnection(const ClientConnection&) = delete;
   ClientConnection& operator=(const ClientConnection&) = delete;
 
-  // Opens the keep-alive transaction and arms its idle timer. Call once, before messages flow.
+  // Opens the keep-alive transaction, arms its idle timer and starts relaying resource
+  // notifications ("TVXFileDownloadCompletedNotification", "TVXFileDeletedNotification") to the
+  // client. Call once, before messages flow.
   void start();
 
   // One frame from the client. Malformed or unknown messages are logged; a call among them is
@@ -72,6 +75,7 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void closeTransaction();
   void configure(std::uint64_t callId, const proto::Envelope& in);
   void send(std::uint64_t callId, proto::Envelope& out);
+  void relayResourceNotification(const platform::Notification& notification, bool downloaded);
 
   Assembly& assembly_;
   std::shared_ptr<platform::ipc::IpcConnection> connection_;
@@ -83,6 +87,8 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   std::mutex transactionLock_;
   platform::TransactionTracker::Transaction transaction_;
   platform::TimerHandle idleTimer_;
+  platform::NotificationCenter::Registration downloadObserver_;
+  platform::NotificationCenter::Registration deleteObserver_;
 };
 
 }  // namespace tavix

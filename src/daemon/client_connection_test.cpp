@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
 
 #include "core/assembly.h"
@@ -42,6 +43,7 @@ struct Harness {
     assembly.clock = &clock;
     assembly.transactions = &transactions;
     assembly.activityScheduler = &activities;
+    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
     int fds[2];
     EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
     client.reset(fds[1]);
@@ -63,6 +65,9 @@ struct Harness {
     auto frame = ipc::encodeFrame(e.SerializeAsString());
     std::size_t sent = 0;
     EXPECT_FALSE(ipc::sendWithFds(client.get(), frame, {}, true, &sent));
+    return receive();
+  }
+  proto::Envelope receive() {
     proto::Envelope reply;
     char buf[4096];
     for (;;) {
@@ -131,6 +136,24 @@ TEST(ClientConnection, DeliversLaunchEventsAndRunsActivitiesOrSaysWhyNot) {
   reply = h.call(run);
   EXPECT_EQ(reply.run_activity_reply().error().code(), 404);
   EXPECT_EQ(reply.run_activity_reply().error().domain(), kTVXErrorDomain);
+}
+
+TEST(ClientConnection, RelaysResourceNotificationsThatNameAResource) {
+  Harness h;
+  auto& center = *h.assembly.notificationCenter;
+  center.post("TVXFileDownloadCompletedNotification", nullptr, {}, {});  // no identifier: nothing sent
+  center.post("TVXFileDownloadCompletedNotification", nullptr, {}, {{"identifier", platform::PropertyValue("hints")}});
+  center.post("TVXFileDeletedNotification", nullptr, {}, {{"identifier", platform::PropertyValue("old")}});
+  h.pool.drain();
+  std::vector<std::string> got;
+  for (int i = 0; i < 2; ++i) {
+    auto e = h.receive();
+    EXPECT_EQ(e.call_id(), 0u);
+    if (e.has_did_download_resource()) got.push_back("+" + e.did_download_resource().identifier());
+    if (e.has_did_delete_resource()) got.push_back("-" + e.did_delete_resource().identifier());
+  }
+  std::sort(got.begin(), got.end());
+  EXPECT_EQ(got, (std::vector<std::string>{"+hints", "-old"}));
 }
 
 TEST(ClientConnection, KeepsItsFirstIdentifierAndBuildsTheFullUserAgent) {
