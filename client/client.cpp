@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <condition_variable>
+#include <deque>
 #include <cstdlib>
 #include <future>
 #include <map>
@@ -47,7 +48,7 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
   };
   struct Pending {
     std::shared_ptr<Link> link;
-    EnvelopeReply reply;
+    DescriptorReply reply;
   };
 
   Options options;
@@ -78,7 +79,9 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
     if (auto ec = ipc::sendWithFds(fresh->fd.get(), bytes, {}, true, &sent)) {
       return clientError(kCannotConnect, "sending the configuration: " + ec.message());
     }
-    pending[id] = {fresh, [](const proto::Envelope*, std::optional<Error>) {}};
+    pending[id] = {fresh, [](const proto::Envelope*, std::vector<int> fds, std::optional<Error>) {
+                     for (int fd : fds) ::close(fd);
+                   }};
     link = fresh;
     everConnected = true;
     ++readers;
@@ -90,23 +93,31 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
     tCurrentReader = this;
     ipc::FrameDecoder decoder;
     std::string buffer(64 * 1024, '\0');
+    // Descriptors arrive with the first byte of their frame; each frame takes as many as it
+    // announces, oldest first.
+    std::deque<ipc::UniqueFd> received;
     for (;;) {
       std::vector<int> fds;
       std::size_t n = 0;
       auto ec = ipc::receiveWithFds(l->fd.get(), buffer.data(), buffer.size(), true, &fds, &n);
-      for (int fd : fds) ::close(fd);  // no reply this client understands carries descriptors yet
+      for (int fd : fds) received.emplace_back(fd);
       if (ec || n == 0) break;
       decoder.append(buffer.data(), n);
-      while (auto payload = decoder.next()) dispatch(*payload);
+      while (auto payload = decoder.next()) dispatch(*payload, received);
       if (decoder.failed()) break;
     }
     finishLink(l);
     tCurrentReader = nullptr;
   }
 
-  void dispatch(const std::string& payload) {
+  void dispatch(const std::string& payload, std::deque<ipc::UniqueFd>& received) {
     proto::Envelope in;
     if (!in.ParseFromString(payload)) return;  // nothing to match it with; drop it
+    std::vector<ipc::UniqueFd> fds;
+    for (std::uint32_t i = 0; i < in.attached_fds() && !received.empty(); ++i) {
+      fds.push_back(std::move(received.front()));
+      received.pop_front();
+    }
     if (in.call_id() == 0) {
       std::unique_lock l(lock);
       auto bag = onBag;
@@ -118,7 +129,7 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
       if (in.has_did_delete_resource() && deleted) deleted(in.did_delete_resource().identifier());
       return;
     }
-    EnvelopeReply reply;
+    DescriptorReply reply;
     {
       std::lock_guard l(lock);
       auto it = pending.find(in.call_id());
@@ -126,15 +137,17 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
       reply = std::move(it->second.reply);
       pending.erase(it);
     }
+    std::vector<int> raw;
+    for (auto& fd : fds) raw.push_back(fd.release());
     if (in.has_call_failed()) {
-      reply(nullptr, Error::fromProto(in.call_failed()));
+      reply(nullptr, std::move(raw), Error::fromProto(in.call_failed()));
     } else {
-      reply(&in, std::nullopt);
+      reply(&in, std::move(raw), std::nullopt);
     }
   }
 
   void finishLink(const std::shared_ptr<Link>& l) {
-    std::vector<EnvelopeReply> failed;
+    std::vector<DescriptorReply> failed;
     bool wasClosed;
     {
       std::lock_guard g(lock);
@@ -150,7 +163,7 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
       wasClosed = closed;
     }
     for (auto& reply : failed) {
-      reply(nullptr, wasClosed ? clientError(kClosed, "client closed")
+      reply(nullptr, {}, wasClosed ? clientError(kClosed, "client closed")
                                : clientError(kConnectionLost, "connection to tavixd lost"));
     }
     std::lock_guard g(lock);
@@ -158,22 +171,22 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
     readersDone.notify_all();
   }
 
-  void call(proto::Envelope message, EnvelopeReply reply) {
+  void call(proto::Envelope message, DescriptorReply reply) {
     std::unique_lock l(lock);
     if (closed) {
       l.unlock();
-      reply(nullptr, clientError(kClosed, "client closed"));
+      reply(nullptr, {}, clientError(kClosed, "client closed"));
       return;
     }
     if (!link) {
       if (everConnected && !options.reconnect) {
         l.unlock();
-        reply(nullptr, clientError(kConnectionLost, "connection to tavixd lost"));
+        reply(nullptr, {}, clientError(kConnectionLost, "connection to tavixd lost"));
         return;
       }
       if (auto error = connectLocked()) {
         l.unlock();
-        reply(nullptr, error);
+        reply(nullptr, {}, error);
         return;
       }
     }
@@ -183,7 +196,7 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
     pending[id] = {target, std::move(reply)};
     l.unlock();
     if (!write(target, message)) {
-      EnvelopeReply failed;
+      DescriptorReply failed;
       {
         std::lock_guard g(lock);
         auto it = pending.find(id);
@@ -191,7 +204,7 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
         failed = std::move(it->second.reply);
         pending.erase(it);
       }
-      failed(nullptr, clientError(kConnectionLost, "cannot send to tavixd"));
+      failed(nullptr, {}, clientError(kConnectionLost, "cannot send to tavixd"));
     }
   }
 
@@ -212,7 +225,8 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
     };
     auto result = std::make_shared<Result>();
     auto future = result->done.get_future();
-    call(std::move(message), [result](const proto::Envelope* reply, std::optional<Error> error) {
+    call(std::move(message), [result](const proto::Envelope* reply, std::vector<int> fds, std::optional<Error> error) {
+      for (int fd : fds) ::close(fd);
       if (reply) result->reply = *reply;
       result->done.set_value(std::move(error));
     });
@@ -236,7 +250,37 @@ Client::~Client() {
   impl_->readersDone.wait(l, [&] { return impl_->readers == 0; });
 }
 
-void Client::call(proto::Envelope message, EnvelopeReply reply) { impl_->call(std::move(message), std::move(reply)); }
+void Client::call(proto::Envelope message, EnvelopeReply reply) {
+  impl_->call(std::move(message), [reply = std::move(reply)](const proto::Envelope* in, std::vector<int> fds,
+                                                             std::optional<Error> error) {
+    for (int fd : fds) ::close(fd);  // nobody asked for them
+    reply(in, std::move(error));
+  });
+}
+
+void Client::callWithDescriptors(proto::Envelope message, DescriptorReply reply) {
+  impl_->call(std::move(message), std::move(reply));
+}
+
+void Client::listenToFlusher(std::function<void(int fd, std::optional<Error>)> reply) {
+  proto::Envelope message;
+  message.mutable_listen_to_flusher();
+  callWithDescriptors(std::move(message), [reply = std::move(reply)](const proto::Envelope* in, std::vector<int> fds,
+                                                                     std::optional<Error> error) {
+    int endpoint = -1;
+    if (!error && !in->has_listen_to_flusher_reply()) error = clientError(kProtocol, "unexpected reply");
+    if (!error && in->listen_to_flusher_reply().has_error()) error = Error::fromProto(in->listen_to_flusher_reply().error());
+    if (!error && (!in->listen_to_flusher_reply().has_endpoint() || fds.empty())) {
+      error = clientError(kProtocol, "reply without an endpoint");
+    }
+    if (!error) {
+      endpoint = fds.front();
+      fds.erase(fds.begin());
+    }
+    for (int fd : fds) ::close(fd);
+    reply(endpoint, std::move(error));
+  });
+}
 
 bool Client::post(proto::Envelope message) {
   std::shared_ptr<Impl::Link> target;

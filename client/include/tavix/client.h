@@ -16,6 +16,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "tavix_proto/ipc.pb.h"
 
@@ -63,6 +64,13 @@ class Client {
   // Sends `message` as a call (a call id is assigned) and calls `reply` once. A reply whose
   // message is `call_failed` arrives as an error.
   void call(proto::Envelope message, EnvelopeReply reply);
+  // As call(), for replies that carry descriptors (a flusher endpoint, a resource's file). The
+  // descriptors the reply announces in `attached_fds` are handed over in order; the callback owns
+  // them and must close them.
+  using DescriptorReply =
+      std::function<void(const proto::Envelope* reply, std::vector<int> fds, std::optional<Error> error)>;
+  void callWithDescriptors(proto::Envelope message, DescriptorReply reply);
+
   // Sends a one-way message. False when it could not be sent.
   bool post(proto::Envelope message);
 
@@ -73,6 +81,8 @@ class Client {
   void bag(std::function<void(std::optional<proto::TVXBagData>, std::optional<Error>)> reply);
   void notify(const std::string& eventName, std::function<void(std::optional<Error>)> reply);
   void runActivity(const std::string& name, std::function<void(std::optional<Error>)> reply);
+  // The flush command channel's endpoint: a connected socket (yours to close) or -1 with an error.
+  void listenToFlusher(std::function<void(int fd, std::optional<Error>)> reply);
 
   // Blocking helpers: the same calls, waiting up to the options' time-out.
   std::optional<Error> connect();  // connects and configures now
