@@ -187,6 +187,10 @@ TEST(IpcDaemon, BadFramesAndVanishingClientsDoNotStopTheDaemon) {
   EXPECT_NE(rawReceive(fd), "<eof>");
   rawSend(fd, std::string("\xff\xff\xff\xff garbage", 12));  // not a protobuf message
   EXPECT_TRUE(d.waitForLog("malformed message of 12 bytes")) << d.log();
+  // A notify call whose name is not UTF-8: refused with our one line, not protobuf's.
+  rawSend(fd, std::string("\xe2\x03\x03\x0a\x01\xff", 6));
+  EXPECT_TRUE(d.waitForLog("malformed message of 6 bytes")) << d.log();
+  EXPECT_EQ(d.log().find("libprotobuf"), std::string::npos) << d.log();
   // A kind the daemon does not take from clients is answered, not ignored.
   tavix::proto::Envelope unknown;
   unknown.set_call_id(7);

@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <cstring>
 
+#include <google/protobuf/stubs/logging.h>
+
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
@@ -22,6 +24,9 @@ TavixService::TavixService(Assembly& assembly, platform::ipc::LaunchEventRegistr
       queue_(*assembly.dispatchPool, "com.norvel.tavix.serviceQueue"),
       self_(std::make_shared<TavixService*>(this)) {
   assembly_.sharedSession = assembly_.userDefaults->boolForKey("TVXSharedSession");
+  // A malformed message is logged once by the connection; protobuf's own parse complaints would
+  // let any peer write to our log at will.
+  google::protobuf::SetLogHandler(nullptr);
 }
 
 TavixService::~TavixService() {
