@@ -167,6 +167,11 @@ void ClientConnection::handleMessage(const std::string& payload) {
       notAvailable(out.mutable_bag_reply()->mutable_error());
       break;
     case proto::Envelope::kRequest: {
+      if (in.request().request().kind_case() == proto::TVXRequest::KIND_NOT_SET) {
+        // A kind we do not route gets no reply at all, as a class we do not know would.
+        connectionLog().error("request of unknown kind from pid {}", pid);
+        return;
+      }
       auto* reply = out.mutable_request_reply();
       reply->set_query_id(in.request().request().query_id());
       notAvailable(reply->mutable_error());

@@ -156,6 +156,27 @@ TEST(ClientConnection, RelaysResourceNotificationsThatNameAResource) {
   EXPECT_EQ(got, (std::vector<std::string>{"+hints", "-old"}));
 }
 
+TEST(ClientConnection, RequestsOfKnownKindsAreRefusedClearlyAndOfUnknownKindNotAnswered) {
+  Harness h;
+  proto::Envelope request;
+  request.mutable_request()->mutable_request()->set_query_id(9);
+  request.mutable_request()->mutable_request()->mutable_flight_search()->set_flight_query("NV 12");
+  auto reply = h.call(request, 3);
+  EXPECT_EQ(reply.call_id(), 3u);
+  EXPECT_EQ(reply.request_reply().query_id(), 9u);
+  EXPECT_FALSE(reply.request_reply().has_reply()) << "never a made-up reply";
+  EXPECT_EQ(reply.request_reply().error().code(), 500);
+  EXPECT_EQ(reply.request_reply().error().reason(), "not available");
+
+  request.mutable_request()->mutable_request()->clear_kind();
+  proto::Envelope unanswered = request;
+  unanswered.set_call_id(4);
+  auto frame = ipc::encodeFrame(unanswered.SerializeAsString());
+  std::size_t sent = 0;
+  ASSERT_FALSE(ipc::sendWithFds(h.client.get(), frame, {}, true, &sent));
+  EXPECT_EQ(h.call(notify("after"), 5).call_id(), 5u) << "the kind-less request got no reply";
+}
+
 TEST(ClientConnection, KeepsItsFirstIdentifierAndBuildsTheFullUserAgent) {
   Harness h;
   platform::LogCapture capture;
