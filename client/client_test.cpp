@@ -89,6 +89,21 @@ Client::Options optionsFor(const ScriptedServer& s) {
   return o;
 }
 
+// Clients and daemons of different builds must understand each other: these bytes never change.
+TEST(Client, WireFormatOfAConfigureCallIsStable) {
+  proto::Envelope e;
+  e.set_call_id(1);
+  e.mutable_configure()->mutable_configuration()->set_identifier("a");
+  e.mutable_configure()->mutable_configuration()->set_user_agent("b");
+  EXPECT_EQ(e.SerializeAsString(), std::string("\x08\x01\xa2\x01\x08\x0a\x06\x0a\x01" "a" "\x12\x01" "b", 13));
+
+  proto::Envelope reply;
+  reply.set_call_id(2);
+  reply.mutable_request_reply()->set_query_id(3);
+  reply.mutable_request_reply()->mutable_error()->set_code(500);
+  EXPECT_EQ(reply.SerializeAsString(), std::string("\x08\x02\xca\x01\x07\x08\x03\x1a\x03\x10\xf4\x03", 12));
+}
+
 TEST(Client, HandsOverDescriptorsAndCallsEachReplyOnce) {
   testing::TempHome home;
   ScriptedServer server(home);
