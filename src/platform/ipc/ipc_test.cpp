@@ -1,3 +1,4 @@
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -189,6 +190,25 @@ TEST(IpcServer, OversizeFrameClosesOnlyThatConnection) {
     std::lock_guard l(r.lock);
     return !r.payloads.empty() && r.payloads.back() == "still here";
   }));
+}
+
+TEST(IpcServer, PeerThatStopsReadingIsDisconnected) {
+  DispatchPool pool(2);
+  Logger log("test", "ipc");
+  LogCapture capture;
+  int pair[2];
+  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair), 0);
+  UniqueFd peer(pair[1]);
+  auto c = IpcConnection::make(pool, UniqueFd(pair[0]), {::getpid(), ::getuid(), ::getgid()}, "test", log, 1024);
+  Received r;
+  startRecording(c, r);
+  const std::string frame(1000, 'f');
+  for (int i = 0; i < 5000 && c->isValid(); ++i) {
+    c->send(frame);
+    if (i % 100 == 0) pool.drain();
+  }
+  EXPECT_TRUE(testing::waitFor([&] { return r.invalidations == 1; }));
+  EXPECT_TRUE(capture.contains("peer does not read"));
 }
 
 TEST(IpcServer, ReplacesStaleSocketFileButNotLiveListener) {

@@ -26,6 +26,8 @@ constexpr std::size_t kReadChunk = 64 * 1024;
 constexpr int kReadsPerWakeup = 16;
 // Descriptors a peer may leave unclaimed before it is taken for hostile.
 constexpr std::size_t kMaxPendingFds = 64;
+// Unsent bytes a connection may hold, in frames of the largest size.
+constexpr std::size_t kMaxOutboxFrames = 4;
 
 }  // namespace
 
@@ -46,6 +48,7 @@ struct IpcConnection::Impl {
   FrameDecoder decoder;
   std::size_t maxFrame;
   std::deque<Outgoing> outbox;
+  std::size_t outboxBytes = 0;
   bool writing = false;
   // Set once by start(); cleared on the queue after the invalidation handler ran, which breaks
   // any reference cycle through the handlers.
@@ -140,6 +143,15 @@ bool IpcConnection::send(std::string payload, std::vector<UniqueFd> fds) {
   auto self = shared_from_this();
   asio::post(impl_->strand, [self, bytes = encodeFrame(payload), fds = std::move(fds)]() mutable {
     if (self->closed_) return;
+    Impl& impl = *self->impl_;
+    // A peer that stops reading must not make us hold its replies for ever.
+    if (impl.outboxBytes + bytes.size() > kMaxOutboxFrames * impl.maxFrame) {
+      self->logger_.error("closing connection from pid {}: peer does not read, {} bytes waiting", self->peer_.pid,
+                          impl.outboxBytes);
+      Impl::close(self);
+      return;
+    }
+    impl.outboxBytes += bytes.size();
     self->impl_->outbox.push_back({std::move(bytes), std::move(fds), 0});
     if (!self->impl_->writing) Impl::flush(self);
   });
@@ -173,6 +185,7 @@ void IpcConnection::Impl::flush(const std::shared_ptr<IpcConnection>& self) {
       });
       return;
     }
+    impl.outboxBytes -= out.bytes.size();
     impl.outbox.pop_front();
   }
 }
@@ -185,6 +198,7 @@ void IpcConnection::Impl::close(const std::shared_ptr<IpcConnection>& self) {
     impl.socket.close(ignored);
   }
   impl.outbox.clear();
+  impl.outboxBytes = 0;
   // Moved out, so it runs once; it runs after every message already queued, and nothing more is
   // delivered afterwards.
   auto handler = std::move(impl.onInvalidated);

@@ -51,6 +51,7 @@ class IpcConnection : public std::enable_shared_from_this<IpcConnection> {
 
   // Queues one frame; `fds` (owned, closed once sent) ride with it. Returns false, closing the
   // descriptors, when the connection is already invalidated or the payload is over the limit.
+  // A peer that leaves more than four maximum frames unread is disconnected.
   bool send(std::string payload, std::vector<UniqueFd> fds = {});
 
   // Takes the `count` oldest received descriptors. Fewer are returned when fewer arrived.
