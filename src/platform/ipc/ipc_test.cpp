@@ -1,5 +1,6 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -209,6 +210,39 @@ TEST(IpcServer, PeerThatStopsReadingIsDisconnected) {
   }
   EXPECT_TRUE(testing::waitFor([&] { return r.invalidations == 1; }));
   EXPECT_TRUE(capture.contains("peer does not read"));
+}
+
+TEST(IpcServer, RefusesPeersOfAnotherUser) {
+  if (::geteuid() != 0) GTEST_SKIP() << "needs root to connect as another user";
+  testing::TempHome home;
+  DispatchPool pool(2);
+  Logger log("test", "ipc");
+  LogCapture capture;
+  const auto dir = home.runtime() / "open";
+  std::error_code ec;
+  auto listener = IpcListener::listen(pool, (dir / "socket").string(), log, &ec);
+  ASSERT_TRUE(listener);
+  // Let the other user reach the socket, so that only the credential check stands in the way.
+  std::filesystem::permissions(home.root(), std::filesystem::perms::all);
+  std::filesystem::permissions(home.runtime(), std::filesystem::perms::all);
+  std::filesystem::permissions(dir, std::filesystem::perms::all);
+  std::filesystem::permissions(dir / "socket", std::filesystem::perms::all);
+  std::atomic<int> accepted{0};
+  listener->resume([&](const std::shared_ptr<IpcConnection>&) { ++accepted; }, "test.connection");
+
+  const pid_t child = ::fork();
+  if (child == 0) {
+    if (::setgid(65534) != 0 || ::setuid(65534) != 0) _exit(2);
+    UniqueFd fd;
+    if (connectTo(listener->path(), &fd)) _exit(3);
+    char c;
+    _exit(::read(fd.get(), &c, 1) == 0 ? 0 : 4);  // closed on us without a word
+  }
+  int status = 0;
+  ::waitpid(child, &status, 0);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+  EXPECT_TRUE(testing::waitFor([&] { return capture.contains("of uid 65534"); }));
+  EXPECT_EQ(accepted, 0);
 }
 
 TEST(IpcServer, ReplacesStaleSocketFileButNotLiveListener) {
