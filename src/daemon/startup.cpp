@@ -17,6 +17,8 @@
 #include "platform/counters.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
+#include "platform/ipc/launch_events.h"
+#include "platform/ipc/server.h"
 #include "platform/notification_center.h"
 #include "platform/run_loop.h"
 #include "platform/transactions.h"
@@ -103,7 +105,36 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   if (auto ec = counters.load(countersFile)) log.error("cannot read counters {}", describe(countersFile, ec));
   TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.launch");
 
-  TavixService service(assembly);
+  platform::SerialQueue ipcEventQueue(pool, "com.norvel.tavixd.ipc_event");
+  platform::ipc::LaunchEventRegistry launchEvents(ipcEventQueue);
+  TavixService service(assembly, &launchEvents);
+
+  // Socket activation hands the listening socket over; otherwise we make our own.
+  auto& connectionLog = TavixLogForCategory(TavixLoggingCategoryConnection);
+  std::error_code listenError;
+  std::unique_ptr<platform::ipc::IpcListener> listener;
+  const auto activated = options.socketPath.empty() ? platform::ipc::socketActivationFds() : std::vector<int>{};
+  const std::string socketPath =
+      options.socketPath.empty() ? (paths.runtimeFolder(kTavixdDomain) / "socket").string() : options.socketPath;
+  if (!activated.empty()) {
+    listener = platform::ipc::IpcListener::adopt(pool, activated.front(), connectionLog, &listenError);
+  } else {
+    listener = platform::ipc::IpcListener::listen(pool, socketPath, connectionLog, &listenError);
+  }
+  if (!listener) {
+    log.fault("cannot listen on {}: {}", activated.empty() ? socketPath : "the activated socket",
+              listenError.message());
+    return 1;
+  }
+  listener->resume([&service](const auto& connection) { service.shouldAcceptNewConnection(connection); },
+                   "com.norvel.tavixd.connection");
+  log.info("listening on {}", activated.empty() ? socketPath : "the socket handed over by systemd");
+
+  auto& launchLog = TavixLogForCategory(TavixLoggingCategoryDefault);
+  launchEvents.setHandler("com.norvel.tavixd.urlsession",
+                          [&launchLog](const std::string& session) { launchLog.info("launch event for {}", session); });
+  launchEvents.setHandler("com.norvel.notifyd.matching",
+                          [&launchLog](const std::string& name) { launchLog.info("launch event for {}", name); });
 
   // The activities' work (the feedback flushers) plugs into these handlers.
   for (const auto& [name, interval] : {std::pair{kFlusherActivity, kFlusherIntervalSeconds},
@@ -134,11 +165,11 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
       if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
     });
     if (options.exitWhenIdle > 0) {
-      // Idle means: no open transaction (client connections will hold one too).
+      // Idle means: no open transaction and no client connected.
       auto idleSince = std::make_shared<platform::TimePoint>(clock.now());
       const double step = std::min(1.0, options.exitWhenIdle);
       idleCheck.start(platform::seconds(step), [&, idleSince] {
-        if (transactions.openCount() > 0) {
+        if (transactions.openCount() > 0 || !service.getClientConnections().empty()) {
           *idleSince = clock.now();
         } else if (clock.now() - *idleSince >= platform::seconds(options.exitWhenIdle)) {
           log.info("idle for {} s, exiting", options.exitWhenIdle);
@@ -151,6 +182,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   log.info("tavixd started (pid {}), caches in {}", getpid(), assembly.cachesFolder().string());
   runLoop.run();
 
+  listener.reset();  // no new clients while shutting down
   housekeeping.sync([&] {
     saveCounters.stop();
     idleCheck.stop();

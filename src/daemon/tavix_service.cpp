@@ -1,13 +1,89 @@
 #include "daemon/tavix_service.h"
 
+#include <algorithm>
+#include <cstring>
+
+#include <google/protobuf/stubs/logging.h>
+
 #include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "core/logging.h"
+#include "daemon/client_connection.h"
 #include "platform/defaults.h"
+#include "platform/ipc/server.h"
 
 namespace tavix {
 
-TavixService::TavixService(Assembly& assembly)
-    : assembly_(assembly), queue_(*assembly.dispatchPool, "com.norvel.tavix.serviceQueue") {
+namespace {
+platform::Logger& connectionLog() { return TavixLogForCategory(TavixLoggingCategoryConnection); }
+}  // namespace
+
+TavixService::TavixService(Assembly& assembly, platform::ipc::LaunchEventRegistry* launchEvents)
+    : assembly_(assembly),
+      launchEvents_(launchEvents),
+      queue_(*assembly.dispatchPool, "com.norvel.tavix.serviceQueue"),
+      self_(std::make_shared<TavixService*>(this)) {
   assembly_.sharedSession = assembly_.userDefaults->boolForKey("TVXSharedSession");
+  // A malformed message is logged once by the connection; protobuf's own parse complaints would
+  // let any peer write to our log at will.
+  google::protobuf::SetLogHandler(nullptr);
+}
+
+TavixService::~TavixService() {
+  self_.reset();
+  queue_.sync([] {});  // let a handler that already holds the service finish
+}
+
+std::optional<std::string> TavixService::clientIDForConnection(const platform::ipc::IpcConnection& connection) {
+  std::string path;
+  if (auto ec = platform::ipc::executablePath(connection.peer().pid, &path)) {
+    connectionLog().error("error getting path for pid [{}] {}", connection.peer().pid, ec.message());
+    return std::nullopt;
+  }
+  return platform::ipc::lastPathComponent(path);
+}
+
+bool TavixService::shouldAcceptNewConnection(const std::shared_ptr<platform::ipc::IpcConnection>& connection) {
+  const pid_t pid = connection->peer().pid;
+  const std::string clientID = clientIDForConnection(*connection).value_or("(null)");
+  connectionLog().notice("new connection from {} ({})", clientID, pid);
+
+  auto client = std::make_shared<ClientConnection>(assembly_, connection, launchEvents_);
+  client->start();
+
+  std::weak_ptr<TavixService*> weakService = self_;
+  std::weak_ptr<ClientConnection> weakClient = client;
+  queue_.async([this, client, pid] {
+    connections_.push_back(client);
+    const auto same = std::count_if(connections_.begin(), connections_.end(),
+                                    [pid](const auto& c) { return c->connection()->peer().pid == pid; });
+    // Only a warning: some clients open more than one connection, and each is served.
+    if (same >= 2) connectionLog().error("too many connections {} from pid {}", same, pid);
+  });
+
+  // The message handler holds the client weakly: the service's list keeps it alive until the
+  // invalidation handler has run.
+  connection->start(
+      [weakClient](std::string payload) {
+        if (auto c = weakClient.lock()) c->handleMessage(payload);
+      },
+      [weakService, weakClient, clientID, pid] {
+        auto service = weakService.lock();
+        auto c = weakClient.lock();
+        if (c) c->invalidated();
+        if (!service || !c) return;
+        connectionLog().notice("connection from {} ({}) invalidated", clientID, pid);
+        (*service)->connectionInvalidated(c);
+      });
+
+  TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.clientconnection");
+  return true;
+}
+
+void TavixService::connectionInvalidated(const std::shared_ptr<ClientConnection>& client) {
+  queue_.async([this, client] {
+    connections_.erase(std::remove(connections_.begin(), connections_.end(), client), connections_.end());
+  });
 }
 
 std::vector<std::shared_ptr<ClientConnection>> TavixService::getClientConnections() {

@@ -1,10 +1,13 @@
-// The IPC listener's delegate: completes the object graph at start and keeps the list of live
-// client connections.
+// The IPC listener's delegate: completes the object graph at start, accepts every client
+// connection and keeps the list of live ones.
 //
 // Owns the serial queue "com.norvel.tavix.serviceQueue"; `connections` is touched only there.
+// accept() is safe from any thread; connection handlers run on each connection's own queue.
 #pragma once
 
 #include <memory>
+#include <optional>
+#include <string>
 #include <vector>
 
 #include "platform/dispatch.h"
@@ -14,23 +17,43 @@ namespace tavix {
 class Assembly;
 class ClientConnection;
 
+namespace platform::ipc {
+class IpcConnection;
+class LaunchEventRegistry;
+}  // namespace platform::ipc
+
 class TavixService {
  public:
   // Completes the assembly: sets `sharedSession` from the "TVXSharedSession" default.
-  explicit TavixService(Assembly& assembly);
+  // `launchEvents` (may be null) receives the launch events that clients hand in; it must
+  // outlive the service.
+  explicit TavixService(Assembly& assembly, platform::ipc::LaunchEventRegistry* launchEvents = nullptr);
+  ~TavixService();
   TavixService(const TavixService&) = delete;
   TavixService& operator=(const TavixService&) = delete;
+
+  // The listener's delegate hook: every connection is accepted, bound to a new ClientConnection
+  // and started. A second connection from one process is logged as a warning and served.
+  bool shouldAcceptNewConnection(const std::shared_ptr<platform::ipc::IpcConnection>& connection);
 
   // A copy of the live connections, taken synchronously on the service queue; callable from any
   // other queue.
   std::vector<std::shared_ptr<ClientConnection>> getClientConnections();
 
+  // The last path component of the peer's executable; none (logged) when it cannot be read.
+  static std::optional<std::string> clientIDForConnection(const platform::ipc::IpcConnection& connection);
+
   platform::SerialQueue& queue() { return queue_; }
 
  private:
+  void connectionInvalidated(const std::shared_ptr<ClientConnection>& client);
+
   Assembly& assembly_;
+  platform::ipc::LaunchEventRegistry* launchEvents_;
   platform::SerialQueue queue_;
   std::vector<std::shared_ptr<ClientConnection>> connections_;
+  // Handlers hold this weakly, so that nothing runs into a destroyed service.
+  std::shared_ptr<TavixService*> self_;
 };
 
 }  // namespace tavix

@@ -1,0 +1,200 @@
+#include "daemon/client_connection.h"
+
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <atomic>
+
+#include "core/assembly.h"
+#include "platform/activity.h"
+#include "platform/ipc/frame.h"
+#include "platform/ipc/launch_events.h"
+#include "platform/ipc/server.h"
+#include "platform/log.h"
+#include "support/temp_home.h"
+#include "tavix_proto/ipc.pb.h"
+
+namespace tavix {
+namespace {
+
+namespace ipc = platform::ipc;
+
+// A ClientConnection on one end of a socket pair; the test plays the client on the other.
+struct Harness {
+  platform::DispatchPool pool{2};
+  platform::VirtualClock clock;
+  platform::TransactionTracker transactions;
+  platform::SerialQueue activityQueue{pool, "test.activities"};
+  platform::ActivityScheduler activities{clock, activityQueue, transactions};
+  platform::SerialQueue eventQueue{pool, "test.events"};
+  ipc::LaunchEventRegistry events{eventQueue};
+  platform::Logger log{"test", "connection"};
+  Assembly assembly;
+  ipc::UniqueFd client;
+  std::shared_ptr<ipc::IpcConnection> connection;
+  std::shared_ptr<ClientConnection> subject;
+  ipc::FrameDecoder decoder;
+
+  Harness() {
+    assembly.dispatchPool = &pool;
+    assembly.clock = &clock;
+    assembly.transactions = &transactions;
+    assembly.activityScheduler = &activities;
+    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
+    int fds[2];
+    EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+    client.reset(fds[1]);
+    connection = ipc::IpcConnection::make(pool, ipc::UniqueFd(fds[0]), {::getpid(), ::getuid(), ::getgid()},
+                                          "test.connection", log);
+    subject = std::make_shared<ClientConnection>(assembly, connection, &events);
+    subject->start();
+    std::weak_ptr<ClientConnection> weak = subject;
+    connection->start([weak](std::string p) { if (auto s = weak.lock()) s->handleMessage(p); },
+                      [weak] { if (auto s = weak.lock()) s->invalidated(); });
+  }
+  ~Harness() {
+    connection->invalidate();
+    pool.drain();
+  }
+
+  proto::Envelope call(proto::Envelope e, std::uint64_t id = 1) {
+    e.set_call_id(id);
+    auto frame = ipc::encodeFrame(e.SerializeAsString());
+    std::size_t sent = 0;
+    EXPECT_FALSE(ipc::sendWithFds(client.get(), frame, {}, true, &sent));
+    return receive();
+  }
+  proto::Envelope receive() {
+    proto::Envelope reply;
+    char buf[4096];
+    for (;;) {
+      if (auto p = decoder.next()) {
+        EXPECT_TRUE(reply.ParseFromString(*p));
+        return reply;
+      }
+      std::vector<int> fds;
+      std::size_t n = 0;
+      if (ipc::receiveWithFds(client.get(), buf, sizeof buf, true, &fds, &n) || n == 0) return reply;
+      decoder.append(buf, n);
+    }
+  }
+  void advance(double s) {
+    clock.advance(platform::seconds(s));
+    pool.drain();
+  }
+};
+
+proto::Envelope notify(const std::string& name, const std::string& stream = "") {
+  proto::Envelope e;
+  e.mutable_notify()->set_name(name);
+  e.mutable_notify()->set_stream(stream);
+  return e;
+}
+
+TEST(ClientConnection, SilenceEndsTheKeepAliveTransactionAndTheNextMessageOpensOne) {
+  Harness h;
+  EXPECT_EQ(h.transactions.openCount(), 1u);
+  h.advance(59);
+  h.call(notify("a"));
+  h.advance(59);
+  EXPECT_EQ(h.transactions.openCount(), 1u) << "each message re-arms the idle timer";
+  h.advance(2);
+  EXPECT_EQ(h.transactions.openCount(), 0u);
+  h.call(notify("b"));
+  EXPECT_EQ(h.transactions.openCount(), 1u);
+  h.client.reset();  // the client goes away: its transaction goes with it
+  EXPECT_TRUE(tavix::testing::waitFor([&] { return h.transactions.openCount() == 0; }));
+}
+
+TEST(ClientConnection, DeliversLaunchEventsAndRunsActivitiesOrSaysWhyNot) {
+  Harness h;
+  std::atomic<int> runs{0};
+  h.activities.checkIn("test.activity", platform::seconds(0), [&](const auto& a) {
+    if (a->state() == platform::ActivityState::Run) ++runs;
+  });
+  std::vector<std::string> seen;
+  h.events.setHandler("com.norvel.notifyd.matching", [&](const std::string& name) { seen.push_back(name); });
+
+  auto reply = h.call(notify("com.norvel.proactive.queries.clearData"), 5);
+  EXPECT_EQ(reply.call_id(), 5u);
+  EXPECT_TRUE(reply.notify_reply().delivered());
+  reply = h.call(notify("x", "no.such.stream"));
+  EXPECT_FALSE(reply.notify_reply().delivered());
+  EXPECT_EQ(reply.notify_reply().error().code(), 404);
+  h.pool.drain();
+  EXPECT_EQ(seen, std::vector<std::string>{"com.norvel.proactive.queries.clearData"});
+
+  proto::Envelope run;
+  run.mutable_run_activity()->set_name("test.activity");
+  EXPECT_FALSE(h.call(run).run_activity_reply().has_error());
+  h.pool.drain();
+  EXPECT_EQ(runs, 1);
+  run.mutable_run_activity()->set_name("test.missing");
+  reply = h.call(run);
+  EXPECT_EQ(reply.run_activity_reply().error().code(), 404);
+  EXPECT_EQ(reply.run_activity_reply().error().domain(), kTVXErrorDomain);
+}
+
+TEST(ClientConnection, RelaysResourceNotificationsThatNameAResource) {
+  Harness h;
+  auto& center = *h.assembly.notificationCenter;
+  center.post("TVXFileDownloadCompletedNotification", nullptr, {}, {});  // no identifier: nothing sent
+  center.post("TVXFileDownloadCompletedNotification", nullptr, {}, {{"identifier", platform::PropertyValue("hints")}});
+  center.post("TVXFileDeletedNotification", nullptr, {}, {{"identifier", platform::PropertyValue("old")}});
+  h.pool.drain();
+  std::vector<std::string> got;
+  for (int i = 0; i < 2; ++i) {
+    auto e = h.receive();
+    EXPECT_EQ(e.call_id(), 0u);
+    if (e.has_did_download_resource()) got.push_back("+" + e.did_download_resource().identifier());
+    if (e.has_did_delete_resource()) got.push_back("-" + e.did_delete_resource().identifier());
+  }
+  std::sort(got.begin(), got.end());
+  EXPECT_EQ(got, (std::vector<std::string>{"+hints", "-old"}));
+}
+
+TEST(ClientConnection, RequestsOfKnownKindsAreRefusedClearlyAndOfUnknownKindNotAnswered) {
+  Harness h;
+  proto::Envelope request;
+  request.mutable_request()->mutable_request()->set_query_id(9);
+  request.mutable_request()->mutable_request()->mutable_flight_search()->set_flight_query("NV 12");
+  auto reply = h.call(request, 3);
+  EXPECT_EQ(reply.call_id(), 3u);
+  EXPECT_EQ(reply.request_reply().query_id(), 9u);
+  EXPECT_FALSE(reply.request_reply().has_reply()) << "never a made-up reply";
+  EXPECT_EQ(reply.request_reply().error().code(), 500);
+  EXPECT_EQ(reply.request_reply().error().reason(), "not available");
+
+  request.mutable_request()->mutable_request()->clear_kind();
+  proto::Envelope unanswered = request;
+  unanswered.set_call_id(4);
+  auto frame = ipc::encodeFrame(unanswered.SerializeAsString());
+  std::size_t sent = 0;
+  ASSERT_FALSE(ipc::sendWithFds(h.client.get(), frame, {}, true, &sent));
+  EXPECT_EQ(h.call(notify("after"), 5).call_id(), 5u) << "the kind-less request got no reply";
+}
+
+TEST(ClientConnection, KeepsItsFirstIdentifierAndBuildsTheFullUserAgent) {
+  Harness h;
+  platform::LogCapture capture;
+  proto::Envelope configure;
+  configure.mutable_configure()->mutable_configuration()->set_identifier("first");
+  configure.mutable_configure()->mutable_configuration()->set_user_agent("client/2");
+  EXPECT_TRUE(h.call(configure).has_configure_reply());
+  configure.mutable_configure()->mutable_configuration()->set_identifier("second");
+  EXPECT_TRUE(h.call(configure).has_configure_reply());
+  EXPECT_TRUE(capture.contains("session identifier must match"));
+  h.connection->queue().sync([&] {
+    ASSERT_TRUE(h.subject->configuration());
+    EXPECT_EQ(h.subject->configuration()->identifier, "first");
+    const auto& ua = h.subject->userAgent();
+    EXPECT_EQ(ua.rfind(ClientConnection::nameVersion() + " (", 0), 0u) << ua;
+    EXPECT_EQ(ua.substr(ua.size() - 10), ") client/2") << ua;
+  });
+}
+
+}  // namespace
+}  // namespace tavix

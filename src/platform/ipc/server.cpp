@@ -1,0 +1,330 @@
+#include "platform/ipc/server.h"
+
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include <asio/bind_executor.hpp>
+#include <asio/post.hpp>
+#include <asio/posix/stream_descriptor.hpp>
+#include <asio/strand.hpp>
+#include <deque>
+
+#include "platform/asio_context.h"
+#include "platform/log.h"
+
+namespace tavix::platform::ipc {
+
+namespace {
+
+using Strand = asio::strand<asio::io_context::executor_type>;
+
+// One read takes at most this much, so a chatty peer cannot starve the others on the pool.
+constexpr std::size_t kReadChunk = 64 * 1024;
+constexpr int kReadsPerWakeup = 16;
+// Descriptors a peer may leave unclaimed before it is taken for hostile.
+constexpr std::size_t kMaxPendingFds = 64;
+// Unsent bytes a connection may hold, in frames of the largest size.
+constexpr std::size_t kMaxOutboxFrames = 4;
+
+}  // namespace
+
+// ---------------------------------------------------------------------------------------------
+
+struct IpcConnection::Impl {
+  Impl(DispatchPool& pool, int fd, std::size_t maxFrame)
+      : strand(asio::make_strand(asioContext(pool))), socket(strand, fd), decoder(maxFrame), maxFrame(maxFrame) {}
+
+  struct Outgoing {
+    std::string bytes;
+    std::vector<UniqueFd> fds;
+    std::size_t offset = 0;
+  };
+
+  Strand strand;
+  asio::posix::stream_descriptor socket;  // touched on `strand` only
+  FrameDecoder decoder;
+  std::size_t maxFrame;
+  std::deque<Outgoing> outbox;
+  std::size_t outboxBytes = 0;
+  bool writing = false;
+  // Set once by start(); cleared on the queue after the invalidation handler ran, which breaks
+  // any reference cycle through the handlers.
+  MessageHandler onMessage;
+  InvalidationHandler onInvalidated;
+
+  static void armRead(const std::shared_ptr<IpcConnection>& self);
+  static void onReadable(const std::shared_ptr<IpcConnection>& self);
+  static void flush(const std::shared_ptr<IpcConnection>& self);
+  static void close(const std::shared_ptr<IpcConnection>& self);
+};
+
+std::shared_ptr<IpcConnection> IpcConnection::make(DispatchPool& pool, UniqueFd fd, PeerCredentials peer,
+                                                   std::string queueLabel, Logger& logger,
+                                                   std::size_t maxFrameSize) {
+  std::shared_ptr<IpcConnection> c(new IpcConnection(pool, peer, std::move(queueLabel), logger));
+  c->impl_ = std::make_unique<Impl>(pool, fd.release(), maxFrameSize);
+  asio::error_code ignored;
+  c->impl_->socket.non_blocking(true, ignored);
+  return c;
+}
+
+IpcConnection::IpcConnection(DispatchPool& pool, PeerCredentials peer, std::string queueLabel, Logger& logger)
+    : peer_(peer), queue_(pool, std::move(queueLabel)), logger_(logger) {}
+
+IpcConnection::~IpcConnection() = default;
+
+void IpcConnection::start(MessageHandler onMessage, InvalidationHandler onInvalidated) {
+  auto self = shared_from_this();
+  asio::post(impl_->strand, [self, m = std::move(onMessage), i = std::move(onInvalidated)]() mutable {
+    self->impl_->onMessage = std::move(m);
+    self->impl_->onInvalidated = std::move(i);
+    if (self->closed_) {
+      Impl::close(self);  // already closed before start: still report it once
+      return;
+    }
+    Impl::armRead(self);
+  });
+}
+
+void IpcConnection::Impl::armRead(const std::shared_ptr<IpcConnection>& self) {
+  self->impl_->socket.async_wait(asio::posix::stream_descriptor::wait_read, [self](const asio::error_code& ec) {
+    if (ec || self->closed_) {
+      close(self);
+      return;
+    }
+    onReadable(self);
+  });
+}
+
+void IpcConnection::Impl::onReadable(const std::shared_ptr<IpcConnection>& self) {
+  Impl& impl = *self->impl_;
+  std::string buffer(kReadChunk, '\0');
+  for (int round = 0; round < kReadsPerWakeup; ++round) {
+    std::vector<int> fds;
+    std::size_t n = 0;
+    auto ec = receiveWithFds(impl.socket.native_handle(), buffer.data(), buffer.size(), false, &fds, &n);
+    if (!fds.empty()) {
+      std::lock_guard lock(self->fdLock_);
+      for (int fd : fds) self->receivedFds_.emplace_back(fd);
+      if (self->receivedFds_.size() > kMaxPendingFds) {
+        self->logger_.error("closing connection from pid {}: {} descriptors left unclaimed", self->peer_.pid,
+                            self->receivedFds_.size());
+        close(self);
+        return;
+      }
+    }
+    if (ec == std::errc::resource_unavailable_try_again || ec == std::errc::operation_would_block) break;
+    if (ec || n == 0) {  // an error, or the peer closed its end
+      close(self);
+      return;
+    }
+    impl.decoder.append(buffer.data(), n);
+    while (auto payload = impl.decoder.next()) {
+      self->queue_.async([self, p = std::move(*payload)]() mutable {
+        if (self->impl_->onMessage) self->impl_->onMessage(std::move(p));
+      });
+    }
+    if (impl.decoder.failed()) {
+      self->logger_.error("closing connection from pid {}: frame of {} bytes is over the limit of {}",
+                          self->peer_.pid, impl.decoder.rejectedLength(), impl.maxFrame);
+      close(self);
+      return;
+    }
+    if (n < buffer.size()) break;  // drained for now
+  }
+  armRead(self);
+}
+
+bool IpcConnection::send(std::string payload, std::vector<UniqueFd> fds) {
+  if (closed_ || payload.size() > impl_->maxFrame) return false;
+  auto self = shared_from_this();
+  asio::post(impl_->strand, [self, bytes = encodeFrame(payload), fds = std::move(fds)]() mutable {
+    if (self->closed_) return;
+    Impl& impl = *self->impl_;
+    // A peer that stops reading must not make us hold its replies for ever.
+    if (impl.outboxBytes + bytes.size() > kMaxOutboxFrames * impl.maxFrame) {
+      self->logger_.error("closing connection from pid {}: peer does not read, {} bytes waiting", self->peer_.pid,
+                          impl.outboxBytes);
+      Impl::close(self);
+      return;
+    }
+    impl.outboxBytes += bytes.size();
+    self->impl_->outbox.push_back({std::move(bytes), std::move(fds), 0});
+    if (!self->impl_->writing) Impl::flush(self);
+  });
+  return true;
+}
+
+void IpcConnection::Impl::flush(const std::shared_ptr<IpcConnection>& self) {
+  Impl& impl = *self->impl_;
+  while (!impl.outbox.empty()) {
+    auto& out = impl.outbox.front();
+    std::vector<int> raw;
+    for (auto& fd : out.fds) raw.push_back(fd.get());
+    std::size_t sent = 0;
+    auto ec = sendWithFds(impl.socket.native_handle(), std::string_view(out.bytes).substr(out.offset), raw, false,
+                          &sent);
+    if (ec) {
+      close(self);
+      return;
+    }
+    if (sent > 0) out.fds.clear();  // they went with the first byte
+    out.offset += sent;
+    if (out.offset < out.bytes.size()) {
+      impl.writing = true;
+      impl.socket.async_wait(asio::posix::stream_descriptor::wait_write, [self](const asio::error_code& ec) {
+        self->impl_->writing = false;
+        if (ec || self->closed_) {
+          close(self);
+          return;
+        }
+        flush(self);
+      });
+      return;
+    }
+    impl.outboxBytes -= out.bytes.size();
+    impl.outbox.pop_front();
+  }
+}
+
+void IpcConnection::Impl::close(const std::shared_ptr<IpcConnection>& self) {
+  Impl& impl = *self->impl_;
+  self->closed_ = true;
+  if (impl.socket.is_open()) {
+    asio::error_code ignored;
+    impl.socket.close(ignored);
+  }
+  impl.outbox.clear();
+  impl.outboxBytes = 0;
+  // Moved out, so it runs once; it runs after every message already queued, and nothing more is
+  // delivered afterwards.
+  auto handler = std::move(impl.onInvalidated);
+  impl.onInvalidated = nullptr;
+  if (!handler) return;
+  self->queue_.async([self, handler = std::move(handler)] {
+    self->impl_->onMessage = nullptr;
+    handler();
+    std::lock_guard lock(self->fdLock_);
+    self->receivedFds_.clear();
+  });
+}
+
+void IpcConnection::invalidate() {
+  auto self = shared_from_this();
+  closed_ = true;
+  asio::post(impl_->strand, [self] { Impl::close(self); });
+}
+
+std::vector<UniqueFd> IpcConnection::takeReceivedFds(std::size_t count) {
+  std::lock_guard lock(fdLock_);
+  count = std::min(count, receivedFds_.size());
+  std::vector<UniqueFd> out;
+  for (std::size_t i = 0; i < count; ++i) out.push_back(std::move(receivedFds_[i]));
+  receivedFds_.erase(receivedFds_.begin(), receivedFds_.begin() + static_cast<std::ptrdiff_t>(count));
+  return out;
+}
+
+// ---------------------------------------------------------------------------------------------
+
+struct IpcListener::Impl : std::enable_shared_from_this<IpcListener::Impl> {
+  Impl(DispatchPool& pool, int fd, Logger& logger)
+      : pool(pool), strand(asio::make_strand(asioContext(pool))), socket(strand, fd), logger(logger) {}
+
+  DispatchPool& pool;
+  Strand strand;
+  asio::posix::stream_descriptor socket;
+  Logger& logger;
+  std::mutex lock;  // guards `handler` and `stopped` against the destructor
+  AcceptHandler handler;
+  std::string label;
+  bool stopped = false;
+
+  void armAccept() {
+    auto self = shared_from_this();
+    socket.async_wait(asio::posix::stream_descriptor::wait_read, [self](const asio::error_code& ec) {
+      if (ec) return;  // closed by the destructor
+      self->acceptAll();
+      self->armAccept();
+    });
+  }
+
+  void acceptAll() {
+    const uid_t me = ::geteuid();
+    for (;;) {
+      UniqueFd fd(::accept4(socket.native_handle(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
+      if (!fd.valid()) {
+        if (errno == EINTR || errno == ECONNABORTED) continue;
+        if (errno != EAGAIN && errno != EWOULDBLOCK) logger.error("accept failed: {}", std::strerror(errno));
+        return;
+      }
+      PeerCredentials peer;
+      if (auto ec = peerCredentials(fd.get(), &peer)) {
+        logger.error("refusing connection: no peer credentials: {}", ec.message());
+        continue;
+      }
+      if (peer.uid != me) {
+        logger.error("refusing connection from pid {} of uid {}", peer.pid, peer.uid);
+        continue;
+      }
+      std::lock_guard guard(lock);
+      if (stopped) return;
+      auto connection =
+          IpcConnection::make(pool, std::move(fd), peer, label + "." + std::to_string(peer.pid), logger);
+      if (handler) handler(connection);
+    }
+  }
+};
+
+std::unique_ptr<IpcListener> IpcListener::listen(DispatchPool& pool, const std::string& path, Logger& logger,
+                                                 std::error_code* error) {
+  UniqueFd fd;
+  if (auto ec = listenAt(path, &fd)) {
+    *error = ec;
+    return nullptr;
+  }
+  return std::unique_ptr<IpcListener>(new IpcListener(pool, std::move(fd), path, logger));
+}
+
+std::unique_ptr<IpcListener> IpcListener::adopt(DispatchPool& pool, int adoptedFd, Logger& logger,
+                                                std::error_code* error) {
+  int type = 0;
+  socklen_t len = sizeof(type);
+  if (::getsockopt(adoptedFd, SOL_SOCKET, SO_TYPE, &type, &len) != 0 || type != SOCK_STREAM) {
+    *error = std::make_error_code(std::errc::not_a_socket);
+    return nullptr;
+  }
+  return std::unique_ptr<IpcListener>(new IpcListener(pool, UniqueFd(adoptedFd), "", logger));
+}
+
+IpcListener::IpcListener(DispatchPool& pool, UniqueFd fd, std::string path, Logger& logger)
+    : path_(std::move(path)), impl_(std::make_shared<Impl>(pool, fd.release(), logger)) {
+  asio::error_code ignored;
+  impl_->socket.non_blocking(true, ignored);
+}
+
+IpcListener::~IpcListener() {
+  {
+    std::lock_guard guard(impl_->lock);
+    impl_->stopped = true;
+    impl_->handler = nullptr;
+  }
+  asio::post(impl_->strand, [impl = impl_] {
+    asio::error_code ignored;
+    impl->socket.close(ignored);
+  });
+  if (!path_.empty()) ::unlink(path_.c_str());
+}
+
+void IpcListener::resume(AcceptHandler handler, std::string queueLabel) {
+  {
+    std::lock_guard guard(impl_->lock);
+    impl_->handler = std::move(handler);
+    impl_->label = std::move(queueLabel);
+  }
+  asio::post(impl_->strand, [impl = impl_] { impl->armAccept(); });
+}
+
+}  // namespace tavix::platform::ipc

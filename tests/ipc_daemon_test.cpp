@@ -1,0 +1,364 @@
+// Talks to the real tavixd over its real socket: libtavix, tavix_tool and raw frames.
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <fstream>
+#include <future>
+#include <sstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "support/temp_home.h"
+#include "tavix/client.h"
+
+namespace {
+
+using tavix::client::Client;
+
+struct Daemon {
+  pid_t pid = -1;
+  std::filesystem::path logFile;
+  std::string socket;
+
+  explicit Daemon(const tavix::testing::TempHome& home, const std::string& logName = "tavixd.log",
+                  std::vector<std::string> extra = {}) {
+    logFile = home.root() / logName;
+    socket = (home.runtime() / "com.norvel.tavixd" / "socket").string();
+    pid = fork();
+    if (pid == 0) {
+      home.exportEnvironment();
+      int fd = open(logFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+      dup2(fd, 2);
+      std::vector<std::string> args{TAVIXD_BINARY, "--log-level", "debug"};
+      args.insert(args.end(), extra.begin(), extra.end());
+      std::vector<char*> argv;
+      for (auto& a : args) argv.push_back(a.data());
+      argv.push_back(nullptr);
+      execv(TAVIXD_BINARY, argv.data());
+      _exit(127);
+    }
+    tavix::testing::waitFor([&] { return std::filesystem::exists(socket); });
+  }
+  ~Daemon() { stop(); }
+  int stop() {
+    if (pid <= 0) return -1;
+    kill(pid, SIGTERM);
+    int status = 0;
+    waitpid(pid, &status, 0);
+    pid = -1;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  }
+  bool alive() const { return pid > 0 && waitpid(pid, nullptr, WNOHANG) == 0; }
+  std::string log() const {
+    std::ifstream in(logFile);
+    std::stringstream s;
+    s << in.rdbuf();
+    return s.str();
+  }
+  bool waitForLog(const std::string& text, int ms = 5000) const {
+    return tavix::testing::waitFor([&] { return log().find(text) != std::string::npos; }, ms);
+  }
+};
+
+Client::Options options(const Daemon& d, std::string identifier = "tests", std::string userAgent = "tests/1") {
+  Client::Options o;
+  o.socketPath = d.socket;
+  o.configuration.set_identifier(std::move(identifier));
+  o.configuration.set_user_agent(std::move(userAgent));
+  o.timeoutMs = 5000;
+  return o;
+}
+
+int rawConnect(const std::string& path) {
+  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path.c_str());
+  if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
+    close(fd);
+    return -1;
+  }
+  timeval tv{5, 0};
+  setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
+  return fd;
+}
+
+void rawSend(int fd, const std::string& payload) {
+  const auto n = static_cast<std::uint32_t>(payload.size());
+  std::string frame{static_cast<char>(n >> 24), static_cast<char>(n >> 16), static_cast<char>(n >> 8),
+                    static_cast<char>(n)};
+  frame += payload;
+  ASSERT_EQ(send(fd, frame.data(), frame.size(), MSG_NOSIGNAL), static_cast<ssize_t>(frame.size()));
+}
+
+// The next frame's payload; "<eof>" when the daemon closed the connection, "<timeout>" when
+// nothing came within 5 s.
+std::string rawReceive(int fd) {
+  std::string bytes;
+  char buf[4096];
+  for (;;) {
+    if (bytes.size() >= 4) {
+      const auto* p = reinterpret_cast<const unsigned char*>(bytes.data());
+      const std::size_t n = (std::size_t{p[0]} << 24) | (p[1] << 16) | (p[2] << 8) | p[3];
+      if (bytes.size() >= 4 + n) return bytes.substr(4, n);
+    }
+    const ssize_t r = recv(fd, buf, sizeof buf, 0);
+    if (r == 0) return "<eof>";
+    if (r < 0) return "<timeout>";
+    bytes.append(buf, static_cast<std::size_t>(r));
+  }
+}
+
+std::string configureFrame(const std::string& identifier, const std::string& userAgent, std::uint64_t callId) {
+  tavix::proto::Envelope e;
+  e.set_call_id(callId);
+  e.mutable_configure()->mutable_configuration()->set_identifier(identifier);
+  e.mutable_configure()->mutable_configuration()->set_user_agent(userAgent);
+  return e.SerializeAsString();
+}
+
+// Runs tavix_tool with the test's environment; returns the exit status and fills `out` with stdout
+// and stderr together.
+int runTool(const std::string& args, std::string* out) {
+  const std::string command = std::string(TAVIX_TOOL_BINARY) + " " + args + " 2>&1";
+  FILE* p = popen(command.c_str(), "r");
+  out->clear();
+  char buf[512];
+  while (std::fgets(buf, sizeof buf, p)) *out += buf;
+  const int status = pclose(p);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+TEST(IpcDaemon, SecondConnectionFromOneProcessIsWarnedAboutAndServed) {
+  tavix::testing::TempHome home;
+  Daemon d(home);
+  const std::string me = std::to_string(getpid());
+  {
+    Client first(options(d));
+    Client second(options(d));
+    ASSERT_FALSE(first.connect());
+    ASSERT_FALSE(second.connect());
+    EXPECT_TRUE(d.waitForLog("new connection from ipc_integration_tests (" + me + ")")) << d.log();
+    EXPECT_TRUE(d.waitForLog("too many connections 2 from pid " + me)) << d.log();
+
+    // Both are served; kinds without a handler yet answer with a clear error, echoing the query id.
+    for (Client* c : {&first, &second}) {
+      tavix::proto::TVXRequest request;
+      request.set_query_id(42);
+      request.mutable_search();
+      std::promise<std::tuple<std::uint64_t, bool, std::optional<tavix::client::Error>>> done;
+      c->request(request, [&](std::uint64_t id, auto reply, auto error) { done.set_value({id, reply.has_value(), error}); });
+      auto future = done.get_future();
+      ASSERT_EQ(future.wait_for(std::chrono::seconds(5)), std::future_status::ready);
+      auto [id, hasReply, error] = future.get();
+      EXPECT_EQ(id, 42u);
+      EXPECT_FALSE(hasReply);
+      ASSERT_TRUE(error);
+      EXPECT_EQ(error->domain, "kTVXErrorDomain");
+      EXPECT_EQ(error->code, 500);
+      EXPECT_EQ(error->reason, "not available");
+    }
+  }
+  EXPECT_TRUE(d.waitForLog("connection from ipc_integration_tests (" + me + ") invalidated")) << d.log();
+  EXPECT_EQ(d.stop(), 0);
+  std::ifstream counters(home.cache() / "com.norvel.tavixd" / "counters.plist");
+  std::stringstream text;
+  text << counters.rdbuf();
+  EXPECT_NE(text.str().find("<key>com.norvel.tavixd.clientconnection</key>\n\t<integer>2</integer>"),
+            std::string::npos)
+      << text.str();
+}
+
+TEST(IpcDaemon, BadFramesAndVanishingClientsDoNotStopTheDaemon) {
+  tavix::testing::TempHome home;
+  Daemon d(home);
+
+  int fd = rawConnect(d.socket);
+  ASSERT_GE(fd, 0);
+  rawSend(fd, configureFrame("raw", "raw/1", 1));
+  EXPECT_NE(rawReceive(fd), "<eof>");
+  rawSend(fd, std::string("\xff\xff\xff\xff garbage", 12));  // not a protobuf message
+  EXPECT_TRUE(d.waitForLog("malformed message of 12 bytes")) << d.log();
+  // A notify call whose name is not UTF-8: refused with our one line, not protobuf's.
+  rawSend(fd, std::string("\xe2\x03\x03\x0a\x01\xff", 6));
+  EXPECT_TRUE(d.waitForLog("malformed message of 6 bytes")) << d.log();
+  EXPECT_EQ(d.log().find("libprotobuf"), std::string::npos) << d.log();
+  // A kind the daemon does not take from clients is answered, not ignored.
+  tavix::proto::Envelope unknown;
+  unknown.set_call_id(7);
+  unknown.mutable_did_delete_resource()->set_identifier("x");
+  rawSend(fd, unknown.SerializeAsString());
+  tavix::proto::Envelope reply;
+  ASSERT_TRUE(reply.ParseFromString(rawReceive(fd)));
+  EXPECT_EQ(reply.call_id(), 7u);
+  ASSERT_TRUE(reply.has_call_failed());
+  EXPECT_EQ(reply.call_failed().reason(), "unknown message");
+  // Over the limit: this connection ends, the daemon goes on.
+  const char oversize[] = {'\x01', '\x00', '\x00', '\x01'};
+  ASSERT_EQ(send(fd, oversize, 4, MSG_NOSIGNAL), 4);
+  EXPECT_EQ(rawReceive(fd), "<eof>");
+  close(fd);
+  EXPECT_TRUE(d.waitForLog("over the limit of 16777216")) << d.log();
+
+  // A client that calls and vanishes before the answer.
+  for (int i = 0; i < 20; ++i) {
+    int v = rawConnect(d.socket);
+    rawSend(v, configureFrame("gone", "gone/1", 1));
+    tavix::proto::Envelope call;
+    call.set_call_id(2);
+    call.mutable_request()->mutable_request()->mutable_lookup();
+    rawSend(v, call.SerializeAsString());
+    close(v);
+  }
+
+  Client client(options(d));
+  EXPECT_FALSE(client.notifySync("com.norvel.tests.still-alive")) << d.log();
+  EXPECT_TRUE(d.waitForLog("launch event for com.norvel.tests.still-alive")) << d.log();
+  EXPECT_TRUE(d.alive());
+}
+
+TEST(IpcDaemon, BadConfigurationGetsNoReplyAndAClosedConnection) {
+  tavix::testing::TempHome home;
+  Daemon d(home);
+  for (auto [identifier, userAgent, message] :
+       {std::tuple{"", "ua/1", "configuration requires identifier"}, std::tuple{"id", "", "configuration requires userAgent"}}) {
+    int fd = rawConnect(d.socket);
+    ASSERT_GE(fd, 0);
+    rawSend(fd, configureFrame(identifier, userAgent, 1));
+    EXPECT_EQ(rawReceive(fd), "<eof>") << message;
+    close(fd);
+    EXPECT_TRUE(d.waitForLog(message)) << d.log();
+  }
+  EXPECT_TRUE(d.waitForLog("invalid configuration, closing connection"));
+
+  Client refused(options(d, "tests", ""));
+  auto error = refused.connect();
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, tavix::client::kConnectionLost);
+  EXPECT_TRUE(d.alive());
+}
+
+TEST(IpcDaemon, ClientFailsCallsInFlightOnceAndReconnectsToTheNextDaemon) {
+  tavix::testing::TempHome home;
+  auto d = std::make_unique<Daemon>(home, "first.log");
+  Client client(options(*d));
+  ASSERT_FALSE(client.connect());
+
+  // Frozen, then killed, with a call in flight: the call fails once, with "connection lost".
+  kill(d->pid, SIGSTOP);
+  std::atomic<int> calls{0};
+  std::promise<std::optional<tavix::client::Error>> failed;
+  client.notify("never", [&](auto error) {
+    if (calls++ == 0) failed.set_value(error);
+  });
+  kill(d->pid, SIGKILL);
+  waitpid(d->pid, nullptr, 0);
+  d->pid = -1;
+  auto future = failed.get_future();
+  ASSERT_EQ(future.wait_for(std::chrono::seconds(5)), std::future_status::ready);
+  auto error = future.get();
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, tavix::client::kConnectionLost);
+  EXPECT_FALSE(client.isConnected());
+
+  Daemon next(home, "second.log");
+  ASSERT_TRUE(next.waitForLog("tavixd started")) << next.log();
+  EXPECT_FALSE(client.notifySync("again")) << next.log();
+  EXPECT_TRUE(next.waitForLog("client configuration {identifier: tests, userAgent: tests/1}")) << next.log();
+  EXPECT_TRUE(next.waitForLog("launch event for again")) << next.log();
+  EXPECT_EQ(calls, 1);
+}
+
+TEST(IpcDaemon, IdleExitComesOnceTheLastClientHasLeft) {
+  tavix::testing::TempHome home;
+  Daemon d(home, "idle.log", {"--exit-when-idle", "0.3"});
+  {
+    Client client(options(d));
+    ASSERT_FALSE(client.connect()) << d.log();
+    std::this_thread::sleep_for(std::chrono::milliseconds(1500));
+    EXPECT_TRUE(d.alive()) << d.log();
+  }
+  EXPECT_TRUE(tavix::testing::waitFor([&] { return !d.alive(); }, 5000)) << d.log();
+  d.pid = -1;
+  EXPECT_TRUE(d.waitForLog("exiting"));
+}
+
+TEST(IpcDaemon, ServesTheSocketHandedOverBySystemd) {
+  tavix::testing::TempHome home;
+  const std::string path = (home.runtime() / "activated.sock").string();
+  int listener = socket(AF_UNIX, SOCK_STREAM, 0);
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path.c_str());
+  ASSERT_EQ(bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+  ASSERT_EQ(listen(listener, 8), 0);
+  const auto logFile = home.root() / "activated.log";
+  const pid_t pid = fork();
+  if (pid == 0) {
+    home.exportEnvironment();
+    int log = open(logFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+    dup2(log, 2);
+    dup2(listener, 3);
+    setenv("LISTEN_FDS", "1", 1);
+    setenv("LISTEN_PID", std::to_string(getpid()).c_str(), 1);
+    execl(TAVIXD_BINARY, TAVIXD_BINARY, static_cast<char*>(nullptr));
+    _exit(127);
+  }
+  close(listener);
+  Client::Options o;
+  o.socketPath = path;
+  o.configuration.set_identifier("tests");
+  o.configuration.set_user_agent("tests/1");
+  Client client(o);
+  EXPECT_FALSE(client.notifySync("com.norvel.tests.activated"));
+  // The daemon made no socket of its own.
+  EXPECT_FALSE(std::filesystem::exists(home.runtime() / "com.norvel.tavixd" / "socket"));
+  kill(pid, SIGTERM);
+  int status = 0;
+  waitpid(pid, &status, 0);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+}
+
+TEST(IpcDaemon, ToolReadsDefaultsAndCountersWithTheDaemonStoppedAndRunsActivities) {
+  tavix::testing::TempHome home;
+  home.exportEnvironment();  // the tool runs in this environment
+  std::string out;
+  EXPECT_EQ(runTool("defaults write TVXFeedbackFlushDisabled --bool true", &out), 0) << out;
+  EXPECT_EQ(runTool("defaults write --domain com.norvel.other Greeting hello", &out), 0) << out;
+  EXPECT_EQ(runTool("defaults read TVXFeedbackFlushDisabled", &out), 0);
+  EXPECT_EQ(out, "true\n");
+  EXPECT_EQ(runTool("defaults read --domain com.norvel.other Greeting", &out), 0);
+  EXPECT_EQ(out, "hello\n");
+  EXPECT_EQ(runTool("defaults write Count --int twelve", &out), 2) << "a bad integer is refused";
+  EXPECT_EQ(runTool("defaults delete TVXFeedbackFlushDisabled", &out), 0) << out;
+  EXPECT_EQ(runTool("defaults read TVXFeedbackFlushDisabled", &out), 1);
+  EXPECT_EQ(runTool("notify anything", &out), 1) << "no daemon to talk to";
+  EXPECT_NE(out.find("tavix.client 1"), std::string::npos) << out;
+
+  {
+    Daemon d(home);
+    ASSERT_TRUE(d.waitForLog("tavixd started")) << d.log();
+    EXPECT_EQ(runTool("activity run com.norvel.tavixd.dp.flush", &out), 0) << out << d.log();
+    EXPECT_TRUE(d.waitForLog("activity com.norvel.tavixd.dp.flush delivered in state RUN")) << d.log();
+    EXPECT_EQ(runTool("activity run com.norvel.tavixd.nothing", &out), 1);
+    EXPECT_NE(out.find("no activity com.norvel.tavixd.nothing"), std::string::npos) << out;
+    EXPECT_EQ(runTool("--socket " + d.socket + " notify com.norvel.proactive.queries.clearData", &out), 0) << out;
+    EXPECT_TRUE(d.waitForLog("launch event for com.norvel.proactive.queries.clearData")) << d.log();
+    EXPECT_EQ(runTool("search hello", &out), 1);
+    EXPECT_NE(out.find("not available yet"), std::string::npos);
+    EXPECT_EQ(d.stop(), 0);
+  }
+  EXPECT_EQ(runTool("counters", &out), 0) << out;
+  EXPECT_NE(out.find("com.norvel.tavixd.launch = 1\n"), std::string::npos) << out;
+  EXPECT_NE(out.find("com.norvel.tavixd.clientconnection = 3\n"), std::string::npos) << out;
+}
+
+}  // namespace
