@@ -12,16 +12,10 @@
 #include <string_view>
 #include <vector>
 
+#include "core/requests.h"
 #include "platform/http/url_request.h"
 
 namespace tavix {
-
-// A query item; an item without a value is sent as its name alone ("?flag").
-struct TVXQueryItem {
-  std::string name;
-  std::optional<std::string> value;
-  bool operator==(const TVXQueryItem&) const = default;
-};
 
 class TavixURLRequestBuilder {
  public:
