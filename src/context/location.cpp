@@ -75,12 +75,14 @@ std::optional<std::string> DefaultsLocationManager::getDeviceCountryCode() const
   return nonEmptyString("TVXDeviceCountryCode");
 }
 
-std::optional<int> DefaultsRoutineManager::modeForLocation(const TVXLocation&) {
+bool DefaultsRoutineManager::modeForLocation(const TVXLocation&, std::optional<int>* mode) {
+  mode->reset();
   auto v = defaults_.objectForKey("TVXRoutineMode");
-  if (!v) return std::nullopt;
+  if (!v) return true;
   auto i = v->asInteger();
-  if (!i) return std::nullopt;
-  return static_cast<int>(*i);
+  if (!i) return false;
+  *mode = static_cast<int>(*i);
+  return true;
 }
 
 }  // namespace tavix

@@ -83,8 +83,8 @@ class LocationManager {
 class RoutineManager {
  public:
   virtual ~RoutineManager() = default;
-  // The mode at a location; empty when the service fails.
-  virtual std::optional<int> modeForLocation(const TVXLocation& location) = 0;
+  // The mode at a location, left empty when the service has none. False when the service fails.
+  virtual bool modeForLocation(const TVXLocation& location, std::optional<int>* mode) = 0;
 };
 
 // A LocationManager over defaults, read on every call:
@@ -123,11 +123,12 @@ class DefaultsLocationManager final : public LocationManager {
   platform::DispatchPool& pool_;
 };
 
-// A RoutineManager over the integer default "TVXRoutineMode"; empty when it is not set.
+// A RoutineManager over the integer default "TVXRoutineMode": no mode when it is not set, a
+// failure when it is set to something that is not an integer.
 class DefaultsRoutineManager final : public RoutineManager {
  public:
   explicit DefaultsRoutineManager(const platform::UserDefaults& defaults) : defaults_(defaults) {}
-  std::optional<int> modeForLocation(const TVXLocation& location) override;
+  bool modeForLocation(const TVXLocation& location, std::optional<int>* mode) override;
 
  private:
   const platform::UserDefaults& defaults_;

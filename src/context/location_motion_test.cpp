@@ -73,9 +73,14 @@ TEST(DefaultsLocationManager, DeliversTheConfiguredFixOrAFailure) {
   EXPECT_TRUE(gone.expired());
 
   DefaultsRoutineManager routine(defaults);
-  EXPECT_FALSE(routine.modeForLocation({}));
+  std::optional<int> mode = 5;
+  EXPECT_TRUE(routine.modeForLocation({}, &mode));
+  EXPECT_FALSE(mode);
   defaults.setObject("TVXRoutineMode", -1);
-  EXPECT_EQ(routine.modeForLocation({}), -1);
+  EXPECT_TRUE(routine.modeForLocation({}, &mode));
+  EXPECT_EQ(mode, -1);
+  defaults.setObject("TVXRoutineMode", "often");
+  EXPECT_FALSE(routine.modeForLocation({}, &mode));
 }
 
 TEST(MotionManager, MapsActivitiesInPrecedenceOrderAndStopDropsPendingDeliveries) {

@@ -100,7 +100,7 @@ TVXLocaleSettings TVXCurrentLocaleSettings(const platform::UserDefaults* default
 TVXLocaleContext TVXComputeLocaleContext(const TVXLocaleSettings& settings) {
   TVXLocaleContext context;
   icu::Locale locale(settings.locale.c_str());
-  context.localeIdentifier = locale.getBaseName();
+  context.localeIdentifier = locale.getName();  // keywords such as a chosen calendar included
   if (context.localeIdentifier.empty()) context.localeIdentifier = settings.locale;
   if (locale.getCountry()[0] != '\0') context.regionCode = locale.getCountry();
 

@@ -493,9 +493,9 @@ void TVXNetworkRequestFactory::Delegate::didUpdateLocations(const std::vector<TV
     Builder::setLocationIfAllowedByBag(*self, last);
     if (self->providers_.locationManager) self->providers_.locationManager->stopUpdatingLocation();
     if (auto& routine = self->providers_.routineManager) {
-      auto mode = routine->modeForLocation(last);
-      if (mode) {
-        self->context_->routineMode = *mode;
+      std::optional<int> mode;
+      if (routine->modeForLocation(last, &mode)) {
+        self->context_->routineMode = mode;
       } else {
         requestLog().error("Error getting mode from the routine service");
       }

@@ -16,7 +16,8 @@
 // Defaults read here: "TVXDebugParameters", "TVXAlwaysOnTophit", "TVXLookupDisabled",
 // "TVXManagedAccount" and "TVXDeviceRestricted" (booleans standing in for the account and
 // managed-configuration services), "TVXDiagnosticsSubmissionAllowed" (boolean: "du_enabled"),
-// and the locale keys of locale_context.h.
+// and the locale keys of locale_context.h. The device country code is the location manager's,
+// else the locale's region.
 #pragma once
 
 #include <cstdint>

@@ -36,7 +36,7 @@ class FakeLocationManager final : public LocationManager {
   int newsAuthorizationStatus() const override { return newsStatus; }
   bool locationServicesEnabled() const override { return true; }
   std::optional<std::string> mapsEnvironment() const override { return "prod"; }
-  std::optional<std::string> getMapsClientMetadata() const override { return std::nullopt; }
+  std::optional<std::string> getMapsClientMetadata() const override { return "bWV0YQ=="; }
   std::optional<std::string> getDeviceCountryCode() const override { return country; }
   std::optional<TVXMapsUserSession> getMapsUserSessionEntityAndReset(bool) override {
     return TVXMapsUserSession{"S1", 4, 2.5};
@@ -63,7 +63,10 @@ class FakeLocationManager final : public LocationManager {
 
 class FakeRoutine final : public RoutineManager {
  public:
-  std::optional<int> modeForLocation(const TVXLocation&) override { return mode.load(); }
+  bool modeForLocation(const TVXLocation&, std::optional<int>* out) override {
+    *out = mode.load();
+    return true;
+  }
   std::atomic<int> mode{2};
 };
 
@@ -180,6 +183,7 @@ TEST_F(RequestFactoryTest, SearchRequestCarriesTheContextInNameOrder) {
   EXPECT_EQ(h.get("X-Norvel-Subscriptions"), "subs");
   EXPECT_EQ(h.get("X-Norvel-GeoEnvironment"), "prod");
   EXPECT_EQ(h.get("X-Norvel-GeoSession"), "S1 4 2.500000");
+  EXPECT_EQ(h.get("X-Norvel-GeoMetadata"), "bWV0YQ==");
   EXPECT_EQ(h.get("X-Norvel-Whitelisted-App-Signature"), "sig");
   EXPECT_DOUBLE_EQ(built->timeoutInterval, 4);
 
@@ -310,6 +314,28 @@ TEST_F(RequestFactoryTest, NewsWithoutAuthorisationAndDeniedUsersSendUserno) {
   q = queryOf(factory->searchRequest(TVXSearchRequest{}, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
   EXPECT_EQ(q["geosrc"], "userno");
   EXPECT_EQ(q.count("latlng"), 0u);
+}
+
+TEST_F(RequestFactoryTest, FailuresAndAuthorisationChangesSetTheReason) {
+  location->status = TVXLocationAuthorizationNotDetermined;
+  make();
+  EXPECT_EQ(factory->geoLocationSource(), "userno");
+  TVXBag searchBag = bag(R"({"search_url":"https://s.example/"})");
+  factory->searchRequest(TVXSearchRequest{}, searchBag, "G");
+  EXPECT_EQ(location->starts.load(), 1);  // not determined is not a refusal: ask
+
+  std::shared_ptr<LocationManagerDelegate> delegate = location->delegate.lock();
+  ASSERT_TRUE(delegate);
+  delegate->didFailWithError("no fix");
+  factory->flushContextAccessQueue();
+  EXPECT_EQ(factory->geoLocationSource(), "error.fail");
+  EXPECT_EQ(queryOf(factory->searchRequest(TVXSearchRequest{}, searchBag, "G")->url)["geosrc"], "error.fail");
+
+  location->status = TVXLocationAuthorizationWhenInUse;
+  int starts = location->starts.load();
+  delegate->didChangeAuthorization(TVXLocationAuthorizationWhenInUse);
+  factory->flushContextAccessQueue();
+  EXPECT_EQ(location->starts.load(), starts + 1);
 }
 
 TEST_F(RequestFactoryTest, OtherKindsAndBagRequests) {
