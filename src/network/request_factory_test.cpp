@@ -383,6 +383,11 @@ TEST_F(RequestFactoryTest, OtherKindsAndBagRequests) {
   EXPECT_EQ(std::stod(q["timestamp"]), platform::toUnixSeconds(clock.now()));
   EXPECT_EQ(queryOf(factory->cardRequest(TVXCardRequest{}, kinds, "G")->url)["key"], "tapirowl3860");
 
+  factory->setInstalledDictionaries("en-oxford,fr-larousse");
+  EXPECT_EQ(queryOf(factory->lookupRequest(TVXLookupRequest{}, kinds, "G")->url)["dicts"], "en-oxford,fr-larousse");
+  defaults->setObject("TVXLookupDisabled", true);
+  EXPECT_EQ(queryOf(factory->lookupRequest(TVXLookupRequest{}, kinds, "G")->url)["dicts"], "off");
+
   auto upload = factory->flusherUploadRequest("https://u.example/fb", 30, "d1g");
   EXPECT_EQ(upload->method, "POST");
   EXPECT_EQ(upload->headers.get("Content-Encoding"), "deflate");
