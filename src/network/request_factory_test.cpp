@@ -231,6 +231,11 @@ TEST_F(RequestFactoryTest, MissingURLsBuildNothingAndLeaveLocationAlone) {
 }
 
 TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
+  std::vector<PropertyValue> proxies;
+  providers.proxySetCurrentConfiguration = [&](const Dictionary& configuration, const std::string& name) {
+    EXPECT_EQ(name, "tavixd");
+    proxies.emplace_back(configuration);
+  };
   make();
   center->post("TVXBagChangeNotification", nullptr,
                std::make_shared<const TVXBag>(bag(R"({"supported_geo_location_sources":["gps"]})")));
@@ -288,9 +293,13 @@ TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
   auto download = factory->fileDownloadRequest("https://r.example/f", "etag1", true);
   EXPECT_EQ(download->headers.get("X-Norvel-FuzzedLatLong"), "-33.900000,151.200000");
 
-  center->post("TVXBagChangeNotification", nullptr, std::make_shared<const TVXBag>(bag("{}")));
+  center->post("TVXBagChangeNotification", nullptr,
+               std::make_shared<const TVXBag>(bag(R"({"marvola_configuration":{"enabled":true}})")));
   factory->flushContextAccessQueue();
   EXPECT_EQ(factory->geoLocationSource(), "bagno.all");
+  ASSERT_EQ(proxies.size(), 2u);
+  EXPECT_EQ(platform::toJson(proxies[0]), R"({"appRule":{"enable":{"Enabled":false}}})");  // none in the bag: off
+  EXPECT_EQ(platform::toJson(proxies[1]), R"({"enabled":true})");
   EXPECT_FALSE(factory->lookupGeoLocationLatLng());
   EXPECT_GE(location->stops.load(), 1);
 }
