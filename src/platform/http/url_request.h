@@ -35,6 +35,8 @@ struct URLRequest {
   HeaderFields headers;
   std::string body;
   double timeoutInterval = 60;  // seconds without progress before the task fails
+  // Skip any cached response and go to the server (bag fetches, warm-ups, uploads).
+  bool reloadIgnoringLocalCacheData = false;
 };
 
 struct HTTPURLResponse {

@@ -1,0 +1,105 @@
+#include "bag/tvx_bag.h"
+
+#include <gtest/gtest.h>
+
+#include "platform/json_value.h"
+
+namespace tavix {
+namespace {
+
+platform::Dictionary bagFromJson(const char* text) {
+  auto v = platform::parseJson(text);
+  EXPECT_TRUE(v && v->dictionary()) << text;
+  return v && v->dictionary() ? *v->dictionary() : platform::Dictionary{};
+}
+
+TEST(TVXBag, EmptyBagAnswersTheDefaults) {
+  TVXBag bag(platform::Dictionary{}, "Seekara/1");
+  EXPECT_EQ(bag.clientName(), "seekara");
+  EXPECT_FALSE(bag.version());
+  EXPECT_TRUE(bag.isEnabled());
+  EXPECT_FALSE(bag.feedbackEnabled());
+  EXPECT_FALSE(bag.searchURL());
+  EXPECT_EQ(bag.searchRenderTimeout(), 2000);
+  EXPECT_DOUBLE_EQ(bag.timeoutIntervalForRequest(), 10);
+  EXPECT_TRUE(bag.supportedGeoLocationSources().empty());
+  EXPECT_EQ(bag.smartHistoryMaxRows(), 10000);
+  EXPECT_EQ(bag.smartHistoryTimeout(), 5);
+  EXPECT_DOUBLE_EQ(bag.brovaneLast1hour(), 10.0);
+  EXPECT_DOUBLE_EQ(bag.brovaneAll(), 0.001);
+  EXPECT_DOUBLE_EQ(bag.brovaneMostRecent(), 1.0);
+  EXPECT_EQ(bag.maximumSizeForFeedbackType("crash"), 0);
+  EXPECT_TRUE(bag.resources().empty());
+  EXPECT_FALSE(bag.subscriptionProviderDomainWhitelist());
+  EXPECT_FALSE(bag.marvolaConfiguration());
+  EXPECT_FALSE(bag.refreshDisabled());
+}
+
+TEST(TVXBag, ReadsEveryKindOfValueFromServerJson) {
+  TVXBag bag(bagFromJson(R"({"version": 12, "search_url": "https://s.example/search",
+      "min_query_length": 3.0, "request_timeout_s": 2.5, "brovane_last_1day": 4,
+      "supported_geo_location_sources": ["gps", 7, "wifi"], "custom_feedback_max_bytes": {"crash": 4096},
+      "marvola_configuration": {"proxy": "https://p.example", "enabled": true},
+      "subscription_domain_whitelist": ["a.example"], "__expiration": 1767240000.5,
+      "__bagurl": "https://bag.example/bag?locale=en_US", "__refresh_disabled": false})"),
+             "brovane/600");
+  EXPECT_EQ(bag.version(), "12");
+  EXPECT_EQ(bag.searchURL(), "https://s.example/search");
+  EXPECT_EQ(bag.minimumQueryLength(), 3);
+  EXPECT_DOUBLE_EQ(bag.timeoutIntervalForRequest(), 2.5);
+  EXPECT_DOUBLE_EQ(bag.brovaneLast1day(), 4.0);
+  EXPECT_EQ(bag.supportedGeoLocationSources(), (std::vector<std::string>{"gps", "wifi"}));
+  EXPECT_EQ(bag.maximumSizeForFeedbackType("crash"), 4096);
+  EXPECT_EQ(bag.maximumSizeForFeedbackType("other"), 0);
+  ASSERT_TRUE(bag.marvolaConfiguration());
+  EXPECT_EQ(*bag.marvolaConfiguration()->at("proxy").string(), "https://p.example");
+  EXPECT_EQ(bag.subscriptionProviderDomainWhitelist(), (std::vector<std::string>{"a.example"}));
+  EXPECT_DOUBLE_EQ(*bag.expiration(), 1767240000.5);
+  EXPECT_EQ(bag.bagURL(), "https://bag.example/bag?locale=en_US");
+  EXPECT_TRUE(bag.refreshDisabled());  // present counts, whatever its value
+
+  EXPECT_EQ(TVXBag(bagFromJson(R"({"version": "9"})"), "").version(), "9");
+  EXPECT_EQ(TVXBag(bagFromJson(R"({"supported_geo_location_sources": "all"})"), "").supportedGeoLocationSources().size(), 4u);
+}
+
+TEST(TVXBag, WrongTypeCountsAsAbsent) {
+  TVXBag bag(bagFromJson(R"({"enabled": "no", "search_url": 5, "min_query_length": 2.5,
+      "request_timeout_s": "3", "feedback_enabled": 1, "resources": [], "version": [1],
+      "supported_geo_location_sources": {"gps": true}, "custom_feedback_max_bytes": {"crash": "9"}})"),
+             "");
+  EXPECT_TRUE(bag.isEnabled());
+  EXPECT_FALSE(bag.searchURL());
+  EXPECT_EQ(bag.minimumQueryLength(), 0);
+  EXPECT_DOUBLE_EQ(bag.timeoutIntervalForRequest(), 10);
+  EXPECT_FALSE(bag.feedbackEnabled());
+  EXPECT_TRUE(bag.resources().empty());
+  EXPECT_FALSE(bag.version());
+  EXPECT_TRUE(bag.supportedGeoLocationSources().empty());
+  EXPECT_EQ(bag.maximumSizeForFeedbackType("crash"), 0);
+}
+
+TEST(TVXBag, ClientOverridesApplyOnlyToTheirClientAndNotToRawKeys) {
+  auto raw = std::make_shared<const platform::Dictionary>(bagFromJson(R"({"enabled": true,
+      "search_url": "https://all.example", "download_resources_list": ["dict", 3, "hints"],
+      "dict": "https://r.example/dict", "hints": 4,
+      "clients": {"news": {"enabled": false, "search_url": 1, "download_resources_list": []}}})"));
+  TVXBag news(raw, "News/1.0");
+  TVXBag brovaneNews(raw, "Brovane News/3");
+  TVXBag unknown(raw, "curl/8");
+
+  EXPECT_EQ(news.clientName(), "news");
+  EXPECT_FALSE(news.isEnabled());
+  EXPECT_FALSE(news.searchURL());  // the override wins even when it is of the wrong type
+  EXPECT_EQ(news.downloadResourcesList(), (std::vector<std::string>{"dict", "hints"}));
+  EXPECT_EQ(news.urlForResource("dict"), "https://r.example/dict");
+  EXPECT_FALSE(news.urlForResource("hints"));
+
+  EXPECT_EQ(brovaneNews.clientName(), "brovane");  // the earlier name in the table wins
+  EXPECT_TRUE(brovaneNews.isEnabled());
+  EXPECT_FALSE(unknown.clientName());
+  EXPECT_EQ(unknown.searchURL(), "https://all.example");
+  EXPECT_EQ(&news.rawBag(), &unknown.rawBag());  // one dictionary behind every view
+}
+
+}  // namespace
+}  // namespace tavix

@@ -1,0 +1,121 @@
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <future>
+#include <mutex>
+
+#include "context/location.h"
+#include "context/motion.h"
+#include "platform/clock.h"
+#include "platform/defaults.h"
+#include "platform/dispatch.h"
+#include "support/temp_home.h"
+
+namespace tavix {
+namespace {
+
+using platform::Dictionary;
+
+struct Recorder final : LocationManagerDelegate, MotionManagerDelegate {
+  void didUpdateLocations(const std::vector<TVXLocation>& l) override {
+    std::lock_guard<std::mutex> hold(lock);
+    locations.insert(locations.end(), l.begin(), l.end());
+  }
+  void didFailWithError(const std::string&) override { ++failures; }
+  void didChangeAuthorization(int) override {}
+  void didUpdateMotionActivity(const TVXMotionActivity& a) override {
+    std::lock_guard<std::mutex> hold(lock);
+    modes.push_back(transportationModeForActivity(a));
+  }
+  std::mutex lock;
+  std::vector<TVXLocation> locations;
+  std::vector<int> modes;
+  std::atomic<int> failures{0};
+};
+
+TEST(DefaultsLocationManager, DeliversTheConfiguredFixOrAFailure) {
+  testing::TempHome home;
+  platform::DispatchPool pool(1);
+  platform::VirtualClock clock;
+  platform::UserDefaults defaults(home.config(), "com.norvel.tavixd");
+  DefaultsLocationManager manager(defaults, clock, pool);
+  auto recorder = std::make_shared<Recorder>();
+
+  EXPECT_EQ(manager.authorizationStatus(), TVXLocationAuthorizationDenied);
+  manager.startUpdatingLocation(recorder);
+  pool.drain();
+  EXPECT_EQ(recorder->failures.load(), 1);
+
+  defaults.setObject("TVXFixedLocation", Dictionary{{"latitude", 48.5}, {"longitude", -2}, {"type", 1}});
+  EXPECT_EQ(manager.authorizationStatus(), TVXLocationAuthorizationWhenInUse);
+  EXPECT_EQ(manager.newsAuthorizationStatus(), TVXLocationAuthorizationWhenInUse);
+  defaults.setObject("TVXNewsLocationAuthorizationStatus", 2);
+  EXPECT_EQ(manager.newsAuthorizationStatus(), TVXLocationAuthorizationDenied);
+  manager.startUpdatingLocation(recorder);
+  pool.drain();
+  ASSERT_EQ(recorder->locations.size(), 1u);
+  EXPECT_DOUBLE_EQ(recorder->locations[0].latitude, 48.5);
+  EXPECT_DOUBLE_EQ(recorder->locations[0].longitude, -2);
+  EXPECT_DOUBLE_EQ(recorder->locations[0].horizontalAccuracy, 1000);
+  EXPECT_EQ(recorder->locations[0].type, 1);
+  EXPECT_EQ(recorder->locations[0].timestamp, clock.now());
+
+  defaults.setObject("TVXFixedLocation", Dictionary{{"latitude", 91}, {"longitude", 0}});
+  EXPECT_FALSE(manager.fixedLocation());  // out of range is no location
+
+  std::weak_ptr<Recorder> gone;
+  {
+    auto temporary = std::make_shared<Recorder>();
+    gone = temporary;
+    manager.startUpdatingLocation(temporary);
+  }
+  pool.drain();  // a delegate that went away hears nothing, and nothing breaks
+  EXPECT_TRUE(gone.expired());
+
+  DefaultsRoutineManager routine(defaults);
+  std::optional<int> mode = 5;
+  EXPECT_TRUE(routine.modeForLocation({}, &mode));
+  EXPECT_FALSE(mode);
+  defaults.setObject("TVXRoutineMode", -1);
+  EXPECT_TRUE(routine.modeForLocation({}, &mode));
+  EXPECT_EQ(mode, -1);
+  defaults.setObject("TVXRoutineMode", "often");
+  EXPECT_FALSE(routine.modeForLocation({}, &mode));
+}
+
+TEST(MotionManager, MapsActivitiesInPrecedenceOrderAndStopDropsPendingDeliveries) {
+  EXPECT_EQ(transportationModeForActivity({}), 1);
+  EXPECT_EQ(transportationModeForActivity({.stationary = true, .automotive = true}), 2);
+  EXPECT_EQ(transportationModeForActivity({.automotive = true, .walking = true}), 6);
+  EXPECT_EQ(transportationModeForActivity({.walking = true, .running = true}), 3);
+  EXPECT_EQ(transportationModeForActivity({.running = true, .cycling = true}), 4);
+  EXPECT_EQ(transportationModeForActivity({.cycling = true}), 5);
+
+  testing::TempHome home;
+  platform::DispatchPool pool(1);
+  platform::UserDefaults defaults(home.config(), "com.norvel.tavixd");
+  DefaultsMotionManager manager(defaults, pool);
+  auto recorder = std::make_shared<Recorder>();
+  manager.startUpdatingMotionActivity(recorder);
+  pool.drain();
+  EXPECT_TRUE(recorder->modes.empty());  // nothing configured
+
+  defaults.setObject("TVXMotionActivity", "cycling");
+  manager.startUpdatingMotionActivity(recorder);
+  pool.drain();
+  EXPECT_EQ(recorder->modes, std::vector<int>{5});
+
+  platform::SerialQueue hold(pool, "test.hold");
+  std::promise<void> release;
+  auto released = release.get_future().share();
+  // Keep the pool's one thread busy so the delivery is still pending when we stop.
+  hold.async([released] { released.wait(); });
+  manager.startUpdatingMotionActivity(recorder);
+  manager.stopUpdatingMotionActivity();
+  release.set_value();
+  pool.drain();
+  EXPECT_EQ(recorder->modes, std::vector<int>{5});
+}
+
+}  // namespace
+}  // namespace tavix

@@ -1,0 +1,83 @@
+// The requests that clients send: plain values. The IPC layer maps its wire records onto these;
+// the query paths and the request factory read them.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/property_value.h"
+
+namespace tavix {
+
+// A query item; an item without a value is sent as its name alone ("?flag").
+struct TVXQueryItem {
+  std::string name;
+  std::optional<std::string> value;
+  bool operator==(const TVXQueryItem&) const = default;
+};
+
+// The fields every kind carries.
+struct TVXRequest {
+  virtual ~TVXRequest() = default;
+
+  std::uint64_t queryId = 0;      // chosen by the client
+  std::string queryString;        // the user's input; empty for kinds without one
+  std::int64_t triggerEvent = 0;  // what caused the query (typing, explicit search...)
+  double scale = 0;               // display scale; 0 means "not set"
+  std::optional<std::string> keyboardInputMode;  // e.g. "en_US", "ja_JP-Kana"
+  std::vector<TVXQueryItem> queryItems;          // the client's own items, forced into the request
+  std::optional<platform::PropertyValue> topTopics;  // sent as JSON text
+  std::optional<std::string> l2ModelVersion;
+  std::optional<std::string> l3ModelVersion;
+  std::optional<std::string> bundleIdentifier;   // of the calling client
+  std::string uuid;                              // names the request in feedback
+  bool verboseReply = false;                     // the reply carries the HTTP request and response
+};
+
+// A suggestion the user engaged with, as the client saw it.
+struct TVXEngagedSuggestion {
+  std::string suggestion;
+  std::optional<std::string> fbr;  // server-opaque feedback blob: base64 of a JSON object
+};
+
+// A completion found on the device before the server is asked.
+struct TVXLocalSuggestion {
+  std::string completion;
+  // Where it came from: "se" search, "ss" browser search, "ut" typed URL, "co" completion
+  // history, "3d" third-party, "en" engaged.
+  std::string origin;
+  double score = 0;
+};
+
+struct TVXSearchRequest : TVXRequest {
+  std::optional<TVXEngagedSuggestion> engagedSuggestion;
+  std::vector<TVXLocalSuggestion> localSuggestions;
+};
+
+struct TVXZeroKeywordRequest : TVXRequest {};
+
+struct TVXMoreResultsRequest : TVXRequest {};
+
+struct TVXCardRequest : TVXRequest {};
+
+// Lookup selection types.
+enum TVXLookupSelectionType : int {
+  TVXLookupSelectionTypeDefault = 0,
+  TVXLookupSelectionTypeExplicit = 1,
+  TVXLookupSelectionTypeHint = 2,
+};
+
+struct TVXLookupRequest : TVXRequest {
+  std::optional<std::string> lookupHintDomain;
+  int lookupSelectionType = TVXLookupSelectionTypeDefault;
+  std::optional<std::string> lookupContext;  // the text around the selection
+};
+
+struct TVXFlightSearchRequest : TVXRequest {
+  std::string flightQuery;
+};
+
+}  // namespace tavix

@@ -1,0 +1,152 @@
+// TVXNetworkRequestFactory: builds every HTTP request the daemon sends (bag fetch and bag cache
+// identity, search, zero-keyword, more results, lookup, flight, card, warm-up, resource download,
+// feedback upload) from a snapshot of the device and user context: locale, languages, units, time
+// zone, country, store front, subscriptions, location, motion, routine, restrictions,
+// dictionaries, topics and debugging parameters.
+//
+// Threading: the snapshot lives on the serial queue "com.norvel.tavixd.contextaccess". Builders and
+// reads enter it synchronously (never call them from that queue); observers and setters update it
+// asynchronously; flushContextAccessQueue() waits for the updates queued so far.
+//
+// Observed: "TVXBagChangeNotification" on the assembly's notification centre (the notification's
+// object is the new bag, a std::shared_ptr<const TVXBag>, std::shared_ptr<TVXBag> or TVXBag) and
+// the defaults keys it reads. Posted: "TVXBagRefreshRequired" (sender: the factory, from a pool
+// thread) when the locale context or the device country code changes.
+//
+// Defaults read here: "TVXDebugParameters", "TVXAlwaysOnTophit", "TVXLookupDisabled",
+// "TVXManagedAccount" and "TVXDeviceRestricted" (booleans standing in for the account and
+// managed-configuration services), "TVXDiagnosticsSubmissionAllowed" (boolean: "du_enabled"),
+// and the locale keys of locale_context.h. The device country code is the location manager's,
+// else the locale's region.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "core/requests.h"
+#include "platform/http/url_request.h"
+#include "platform/property_value.h"
+
+namespace tavix {
+
+class Assembly;
+class DeviceInformation;
+class LocationManager;
+class MotionManager;
+class RoutineManager;
+class TVXBag;
+
+// Who knows the bag endpoint: the bag controller.
+class TVXBagURLSource {
+ public:
+  virtual ~TVXBagURLSource() = default;
+  virtual std::string bagFetchURLWithCountry(std::string_view countryCode) = 0;
+};
+
+// Bit 0 of a field mask: send no location with this request.
+inline constexpr std::uint64_t TVXFieldMaskNoLocation = 1;
+
+inline constexpr const char* TavixHTTPHeaderNameUserAgent = "User-Agent";
+inline constexpr const char* TavixHTTPHeaderNameUserGUID = "X-Norvel-UserGuid";
+inline constexpr const char* TavixHTTPHeaderNameLanguages = "X-Norvel-Languages";
+inline constexpr const char* TavixHTTPHeaderNameUIScale = "X-Norvel-UI-Scale";
+inline constexpr const char* TavixHTTPHeaderNameSubscriptions = "X-Norvel-Subscriptions";
+inline constexpr const char* TavixHTTPHeaderNameGeoEnvironment = "X-Norvel-GeoEnvironment";
+inline constexpr const char* TavixHTTPHeaderNameGeoMetadata = "X-Norvel-GeoMetadata";
+inline constexpr const char* TavixHTTPHeaderNameGeoSession = "X-Norvel-GeoSession";
+inline constexpr const char* TavixHTTPHeaderNameLatLong = "X-Norvel-FuzzedLatLong";
+inline constexpr const char* TavixHTTPHeaderNameTopTopics = "X-Norvel-TopTopics";
+inline constexpr const char* TavixHTTPHeaderNameAppWhitelistSignature = "X-Norvel-Whitelisted-App-Signature";
+inline constexpr const char* TavixHTTPHeaderNameDigest = "X-Norvel-Digest";
+
+// The collaborators the factory reads. Empty members are taken from the assembly (location and
+// motion managers) or made from its defaults (device information, routine); the rest stay absent,
+// and what they would feed is then not sent.
+struct TVXRequestFactoryProviders {
+  std::shared_ptr<LocationManager> locationManager;
+  std::shared_ptr<MotionManager> motionManager;
+  std::shared_ptr<RoutineManager> routineManager;
+  std::shared_ptr<const DeviceInformation> deviceInformation;
+  // The installed-app signature header value; absent or empty: no header.
+  std::function<std::optional<std::string>()> appWhitelistSignature;
+  // The network-service proxy: receives the bag's proxy configuration under the name "tavixd".
+  std::function<void(const platform::Dictionary& configuration, const std::string& name)> proxySetCurrentConfiguration;
+};
+
+class TVXNetworkRequestFactory : public std::enable_shared_from_this<TVXNetworkRequestFactory> {
+ public:
+  // The assembly's dispatch pool, clock, defaults and notification centre must be set and must
+  // outlive the factory.
+  static std::shared_ptr<TVXNetworkRequestFactory> create(Assembly& assembly, TVXRequestFactoryProviders providers = {});
+  ~TVXNetworkRequestFactory();
+  TVXNetworkRequestFactory(const TVXNetworkRequestFactory&) = delete;
+  TVXNetworkRequestFactory& operator=(const TVXNetworkRequestFactory&) = delete;
+
+  using Request = std::optional<platform::http::URLRequest>;
+
+  // Bag requests, on the URL `source` gives for the device country code. Empty when that URL
+  // does not parse.
+  Request bagFetchRequest(TVXBagURLSource& source, std::optional<std::string> userAgent,
+                          std::optional<std::string> version);
+  Request bagCacheRequest(TVXBagURLSource& source, std::optional<std::string> userAgent,
+                          std::optional<std::string> version);
+  Request warmRequest(std::string_view url);
+
+  // The search family: empty when the bag lacks the URL (location services are then left alone).
+  Request searchRequest(const TVXSearchRequest& request, const TVXBag& bag, const std::string& userGuid,
+                        std::uint64_t fieldMask = 0);
+  Request zeroKeywordRequest(const TVXZeroKeywordRequest& request, const TVXBag& bag, const std::string& userGuid,
+                             std::uint64_t fieldMask = 0);
+  Request moreResultsRequest(const TVXMoreResultsRequest& request, const TVXBag& bag, const std::string& userGuid,
+                             std::uint64_t fieldMask = 0);
+  Request lookupRequest(const TVXLookupRequest& request, const TVXBag& bag, const std::string& userGuid);
+  Request flightSearchRequest(const TVXFlightSearchRequest& request, const TVXBag& bag, const std::string& userGuid);
+  Request cardRequest(const TVXCardRequest& request, const TVXBag& bag, const std::string& userGuid);
+
+  Request fileDownloadRequest(std::string_view url, std::optional<std::string> version, bool includeLatLong);
+  Request flusherUploadRequest(std::string_view url, double timeout, std::string digest);
+
+  // Topic weights: JSON text, either {"sil": ..., "pv": ..., "all": {topic: weight}} or any other
+  // text, sent as it is. Asynchronous.
+  void setSilhouetteTopics(std::string json);
+  // A client performed a search: look-ups may now carry the exact location. Asynchronous.
+  void setPerformedSearch();
+  // From the subscription manager. Asynchronous.
+  void setStoreFrontIdentifier(std::optional<std::string> identifier);
+  void setSubscriptionInfo(std::optional<std::string> info);
+  // The installed dictionaries, as sent in "dicts". Asynchronous.
+  void setInstalledDictionaries(std::optional<std::string> dictionaries);
+
+  // Waits until every update queued so far has run. Not from the context queue.
+  void flushContextAccessQueue();
+
+  // The factory's own user agent (the daemon's name/version token as the client part).
+  const std::optional<std::string>& userAgent() const { return userAgent_; }
+
+  // Snapshot reads, synchronous.
+  std::optional<std::string> geoLocationLatLng();
+  std::optional<std::string> geoLocationSource();
+  std::optional<std::string> lookupGeoLocationLatLng();
+  std::optional<std::string> geoDeviceCountryCode();
+  std::vector<TVXQueryItem> debuggingQueryItems();
+
+ private:
+  struct Context;
+  class Delegate;
+  class Builder;
+
+  TVXNetworkRequestFactory(Assembly& assembly, TVXRequestFactoryProviders providers);
+  void start();
+
+  Assembly& assembly_;
+  TVXRequestFactoryProviders providers_;
+  std::optional<std::string> userAgent_;
+  std::unique_ptr<Context> context_;  // owns the queue and the fields on it
+};
+
+}  // namespace tavix

@@ -1,0 +1,444 @@
+#include "network/request_factory.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <map>
+
+#include "bag/tvx_bag.h"
+#include "context/location.h"
+#include "context/motion.h"
+#include "core/assembly.h"
+#include "network/url_request_builder.h"
+#include "platform/clock.h"
+#include "platform/defaults.h"
+#include "platform/dispatch.h"
+#include "platform/json_value.h"
+#include "platform/notification_center.h"
+#include "support/temp_home.h"
+
+namespace tavix {
+namespace {
+
+using platform::Dictionary;
+using platform::PropertyValue;
+
+// The location service has no Linux counterpart; this one is driven by the test.
+class FakeLocationManager final : public LocationManager {
+ public:
+  void startUpdatingLocation(std::weak_ptr<LocationManagerDelegate> d) override {
+    ++starts;
+    std::lock_guard<std::mutex> hold(lock);
+    delegate = d;
+  }
+  void stopUpdatingLocation() override { ++stops; }
+  int authorizationStatus() const override { return status; }
+  int newsAuthorizationStatus() const override { return newsStatus; }
+  bool locationServicesEnabled() const override { return true; }
+  std::optional<std::string> mapsEnvironment() const override { return "prod"; }
+  std::optional<std::string> getMapsClientMetadata() const override { return "bWV0YQ=="; }
+  std::optional<std::string> getDeviceCountryCode() const override { return country; }
+  std::optional<TVXMapsUserSession> getMapsUserSessionEntityAndReset(bool) override {
+    return TVXMapsUserSession{"S1", 4, 2.5};
+  }
+
+  void deliver(const TVXLocation& fix) {
+    std::shared_ptr<LocationManagerDelegate> d;
+    {
+      std::lock_guard<std::mutex> hold(lock);
+      d = delegate.lock();
+    }
+    ASSERT_TRUE(d) << "no one is listening";
+    d->didUpdateLocations({fix});
+  }
+
+  std::atomic<int> starts{0};
+  std::atomic<int> stops{0};
+  std::atomic<int> status{TVXLocationAuthorizationWhenInUse};
+  std::atomic<int> newsStatus{TVXLocationAuthorizationDenied};
+  std::optional<std::string> country = "FR";
+  std::mutex lock;
+  std::weak_ptr<LocationManagerDelegate> delegate;
+};
+
+class FakeRoutine final : public RoutineManager {
+ public:
+  bool modeForLocation(const TVXLocation&, std::optional<int>* out) override {
+    *out = mode.load();
+    return true;
+  }
+  std::atomic<int> mode{2};
+};
+
+std::map<std::string, std::string> queryOf(const std::string& url, std::vector<std::string>* names = nullptr) {
+  std::map<std::string, std::string> items;
+  auto q = url.find('?');
+  if (q == std::string::npos) return items;
+  std::string query = url.substr(q + 1);
+  std::size_t pos = 0;
+  while (pos <= query.size()) {
+    auto amp = query.find('&', pos);
+    std::string part = query.substr(pos, amp == std::string::npos ? std::string::npos : amp - pos);
+    auto eq = part.find('=');
+    std::string name = part.substr(0, eq);
+    items[name] = eq == std::string::npos ? "" : TVXPercentDecode(part.substr(eq + 1));
+    if (names) names->push_back(name);
+    if (amp == std::string::npos) break;
+    pos = amp + 1;
+  }
+  return items;
+}
+
+class RequestFactoryTest : public ::testing::Test {
+ protected:
+  RequestFactoryTest() {
+    defaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
+    defaults->setObject("TVXLocale", "fr_FR");
+    defaults->setObject("TVXPreferredLanguages", PropertyValue::Array{"fr-FR", "en-GB", "de", "it", "es"});
+    defaults->setObject("TVXTimeZone", "Europe/Paris");
+    assembly.dispatchPool = &pool;
+    assembly.clock = &clock;
+    assembly.userDefaults = defaults;
+    assembly.notificationCenter = center;
+    providers.locationManager = location;
+    providers.routineManager = routine;
+  }
+  ~RequestFactoryTest() override {
+    factory.reset();
+    pool.drain();
+  }
+
+  void make() { factory = TVXNetworkRequestFactory::create(assembly, providers); }
+
+  static TVXBag bag(const char* json, std::string agent = "Seekara/1 (test)") {
+    return TVXBag(*platform::parseJson(json)->dictionary(), std::move(agent));
+  }
+
+  testing::TempHome home;
+  platform::DispatchPool pool{2};
+  platform::VirtualClock clock;
+  std::shared_ptr<platform::UserDefaults> defaults;
+  std::shared_ptr<platform::NotificationCenter> center = std::make_shared<platform::NotificationCenter>();
+  Assembly assembly;
+  std::shared_ptr<FakeLocationManager> location = std::make_shared<FakeLocationManager>();
+  std::shared_ptr<FakeRoutine> routine = std::make_shared<FakeRoutine>();
+  TVXRequestFactoryProviders providers;
+  std::shared_ptr<TVXNetworkRequestFactory> factory;
+};
+
+TEST_F(RequestFactoryTest, SearchRequestCarriesTheContextInNameOrder) {
+  providers.appWhitelistSignature = [] { return std::optional<std::string>("sig"); };
+  make();
+  factory->setStoreFrontIdentifier("143442");
+  factory->setSubscriptionInfo("subs");
+  TVXSearchRequest request;
+  request.queryString = "a b+c";
+  request.triggerEvent = 23;
+  request.scale = 2;
+  request.keyboardInputMode = "fr_FR";
+  request.l2ModelVersion = "7";
+  request.queryItems = {{"locale", "xx_YY"}};
+  request.topTopics = PropertyValue(Dictionary{{"t", 1}});
+  request.localSuggestions = {{"a b, c", "se", 0.5}, {"ab", "en", 1}};
+
+  auto built = factory->searchRequest(request, bag(R"({"search_url":"https://s.example/search?fmt=1",
+                                                        "request_timeout_s": 4, "send_geo_environment_header": true})"),
+                                       "GUID-1");
+  ASSERT_TRUE(built);
+  std::vector<std::string> names;
+  auto q = queryOf(built->url, &names);
+  EXPECT_TRUE(std::is_sorted(names.begin(), names.end()));
+  EXPECT_NE(built->url.find("q=a%20b%2Bc&"), std::string::npos) << built->url;
+  EXPECT_EQ(q["key"], "tapirowl3860");
+  EXPECT_EQ(q["locale"], "xx_YY");  // the client's item wins
+  EXPECT_EQ(q["fmt"], "1");
+  EXPECT_EQ(q["qtype"], "explicit");
+  EXPECT_EQ(q.count("suggest_queries"), 0u);
+  EXPECT_EQ(q["card"], "1");
+  EXPECT_EQ(q["alwaysSendTophit"], "off");
+  EXPECT_EQ(q["cc"], "FR");
+  EXPECT_EQ(q["esl"], "fr-FR");
+  EXPECT_EQ(q["kb_ime"], "fr_FR");
+  EXPECT_EQ(q["calendar"], "gregorian");
+  EXPECT_EQ(q["time_zone"], "Europe/Paris");
+  EXPECT_EQ(q["units"], "SI");
+  EXPECT_EQ(q["temp"], "C");
+  EXPECT_EQ(q["24h"], "1");
+  EXPECT_EQ(q["l2"], "7");
+  EXPECT_EQ(q.count("l3"), 0u);
+  EXPECT_EQ(q["lcs"], R"(["a b, c","ab"])");
+  EXPECT_EQ(q["lco"], "se-0.50,en-1.00");
+  EXPECT_EQ(q["storefront"], "143442");
+  EXPECT_EQ(q["geosrc"], "slow");  // authorised, but the first request came before any fix
+  EXPECT_EQ(q.count("latlng"), 0u);
+  EXPECT_EQ(q.count("rm"), 0u);
+  EXPECT_EQ(q.count("mode"), 0u);
+
+  const auto& h = built->headers;
+  EXPECT_EQ(h.get("X-Norvel-Languages"), R"(["fr-FR","en-GB","de"])");
+  EXPECT_EQ(h.get("X-Norvel-UserGuid"), "GUID-1");
+  EXPECT_EQ(h.get("User-Agent"), "Seekara/1 (test)");
+  EXPECT_EQ(h.get("X-Norvel-UI-Scale"), "2.0");
+  EXPECT_EQ(h.get("X-Norvel-TopTopics"), R"({"t":1})");
+  EXPECT_EQ(h.get("X-Norvel-Subscriptions"), "subs");
+  EXPECT_EQ(h.get("X-Norvel-GeoEnvironment"), "prod");
+  EXPECT_EQ(h.get("X-Norvel-GeoSession"), "S1 4 2.500000");
+  EXPECT_EQ(h.get("X-Norvel-GeoMetadata"), "bWV0YQ==");
+  EXPECT_EQ(h.get("X-Norvel-Whitelisted-App-Signature"), "sig");
+  EXPECT_DOUBLE_EQ(built->timeoutInterval, 4);
+
+  request.triggerEvent = 21;
+  q = queryOf(factory->searchRequest(request, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
+  EXPECT_EQ(q["suggest_queries"], "withtop");
+  EXPECT_EQ(q.count("qtype"), 0u);
+  request.triggerEvent = 24;
+  q = queryOf(factory->searchRequest(request, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
+  EXPECT_EQ(q["qtype"], "suggest_with_results");
+}
+
+TEST_F(RequestFactoryTest, DebugParametersAreAllOrNothingAndForced) {
+  defaults->setObject("TVXDebugParameters", "key=dev&x=1");
+  make();
+  EXPECT_EQ(factory->debuggingQueryItems(), (std::vector<TVXQueryItem>{{"key", "dev"}, {"x", "1"}}));
+  TVXSearchRequest request;
+  request.queryString = "q";
+  auto q = queryOf(factory->searchRequest(request, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
+  EXPECT_EQ(q["key"], "dev");
+  EXPECT_EQ(q["x"], "1");
+
+  defaults->setObject("TVXDebugParameters", "");  // emptied: the old items stay
+  factory->flushContextAccessQueue();
+  EXPECT_EQ(factory->debuggingQueryItems().size(), 2u);
+  defaults->setObject("TVXDebugParameters", "a=1&b");
+  factory->flushContextAccessQueue();
+  EXPECT_TRUE(factory->debuggingQueryItems().empty());
+  defaults->setObject("TVXDebugParameters", "a=1=2");
+  factory->flushContextAccessQueue();
+  EXPECT_TRUE(factory->debuggingQueryItems().empty());
+}
+
+TEST_F(RequestFactoryTest, MissingURLsBuildNothingAndLeaveLocationAlone) {
+  make();
+  TVXBag empty = bag("{}");
+  EXPECT_FALSE(factory->searchRequest(TVXSearchRequest{}, empty, "G"));
+  EXPECT_FALSE(factory->zeroKeywordRequest(TVXZeroKeywordRequest{}, empty, "G"));
+  EXPECT_FALSE(factory->lookupRequest(TVXLookupRequest{}, empty, "G"));
+  EXPECT_FALSE(factory->moreResultsRequest(TVXMoreResultsRequest{}, empty, "G"));
+  EXPECT_FALSE(factory->cardRequest(TVXCardRequest{}, empty, "G"));
+  EXPECT_FALSE(factory->flightSearchRequest(TVXFlightSearchRequest{}, empty, "G"));
+  EXPECT_EQ(location->starts.load(), 0);
+  EXPECT_FALSE(factory->searchRequest(TVXSearchRequest{}, bag(R"({"search_url":"not a url"})"), "G"));
+}
+
+TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
+  std::vector<PropertyValue> proxies;
+  providers.proxySetCurrentConfiguration = [&](const Dictionary& configuration, const std::string& name) {
+    EXPECT_EQ(name, "tavixd");
+    proxies.emplace_back(configuration);
+  };
+  make();
+  center->post("TVXBagChangeNotification", nullptr,
+               std::make_shared<const TVXBag>(bag(R"({"supported_geo_location_sources":["gps"]})")));
+  factory->flushContextAccessQueue();
+  ASSERT_GE(location->starts.load(), 1);
+
+  TVXLocation wifi{48.85, 2.35, 65, 4, clock.now()};
+  location->deliver(wifi);
+  factory->flushContextAccessQueue();
+  EXPECT_EQ(factory->geoLocationSource(), "bagno.wifi");
+  EXPECT_FALSE(factory->geoLocationLatLng());
+
+  TVXLocation gps{-33.9, 151.2, 10, 1, clock.now()};
+  location->deliver(gps);
+  factory->flushContextAccessQueue();
+  EXPECT_EQ(factory->geoLocationLatLng(), "-33.900000,151.200000");
+  EXPECT_EQ(factory->geoLocationSource(), "gps,10.000000");
+  EXPECT_EQ(factory->lookupGeoLocationLatLng(), "-33.000000,151.000000");  // toward zero, not -34
+
+  TVXBag searchBag = bag(R"({"search_url":"https://s.example/","supported_geo_location_sources":["gps"]})");
+  TVXSearchRequest request;
+  routine->mode = 0;
+  location->deliver(gps);  // the routine mode is read with each fix
+  factory->flushContextAccessQueue();
+  int starts = location->starts.load();
+  clock.advance(platform::seconds(299));
+  auto q = queryOf(factory->searchRequest(request, searchBag, "G")->url);
+  EXPECT_EQ(location->starts.load(), starts);  // a fix 299 s old is still good
+  EXPECT_EQ(q["latlng"], "-33.900000,151.200000");
+  EXPECT_EQ(q["geosrc"], "gps,10.000000");
+  EXPECT_EQ(q["rm"], "2");
+  q = queryOf(factory->searchRequest(request, searchBag, "G", TVXFieldMaskNoLocation)->url);
+  EXPECT_EQ(q.count("latlng") + q.count("geosrc") + q.count("rm"), 0u);
+
+  clock.advance(platform::seconds(2));
+  factory->searchRequest(request, searchBag, "G");
+  EXPECT_EQ(location->starts.load(), starts + 1);  // 301 s: sample again
+
+  TVXLookupRequest lookup;
+  lookup.queryString = "東京";
+  lookup.lookupContext = "Tokyo tower";
+  lookup.lookupSelectionType = TVXLookupSelectionTypeHint;
+  lookup.bundleIdentifier = "org.example.reader";
+  auto built = factory->lookupRequest(lookup, searchBag, "G");
+  EXPECT_EQ(built->headers.get("X-Norvel-FuzzedLatLong"), "-33.000000,151.000000");
+  q = queryOf(built->url);
+  EXPECT_EQ(q.count("latlng"), 0u);
+  EXPECT_EQ(q["ltype"], "hint");
+  EXPECT_EQ(q["qlang"], "zh");
+  EXPECT_EQ(q.count("lctxlang"), 0u);  // Latin script names no language
+  EXPECT_EQ(q["context"], "org.example.reader");
+
+  factory->setPerformedSearch();
+  EXPECT_EQ(factory->lookupGeoLocationLatLng(), "-33.900000,151.200000");
+  auto download = factory->fileDownloadRequest("https://r.example/f", "etag1", true);
+  EXPECT_EQ(download->headers.get("X-Norvel-FuzzedLatLong"), "-33.900000,151.200000");
+
+  center->post("TVXBagChangeNotification", nullptr,
+               std::make_shared<const TVXBag>(bag(R"({"marvola_configuration":{"enabled":true}})")));
+  factory->flushContextAccessQueue();
+  EXPECT_EQ(factory->geoLocationSource(), "bagno.all");
+  ASSERT_EQ(proxies.size(), 2u);
+  EXPECT_EQ(platform::toJson(proxies[0]), R"({"appRule":{"enable":{"Enabled":false}}})");  // none in the bag: off
+  EXPECT_EQ(platform::toJson(proxies[1]), R"({"enabled":true})");
+  EXPECT_FALSE(factory->lookupGeoLocationLatLng());
+  EXPECT_GE(location->stops.load(), 1);
+}
+
+TEST_F(RequestFactoryTest, NewsWithoutAuthorisationAndDeniedUsersSendUserno) {
+  make();
+  center->post("TVXBagChangeNotification", nullptr,
+               std::make_shared<const TVXBag>(bag(R"({"supported_geo_location_sources":"all"})")));
+  factory->flushContextAccessQueue();
+  location->deliver({1.5, 2.5, 100, 6, clock.now()});
+  factory->flushContextAccessQueue();
+  EXPECT_EQ(factory->geoLocationSource(), "cell,100.000000");
+
+  auto q = queryOf(factory->searchRequest(TVXSearchRequest{}, bag(R"({"search_url":"https://s.example/"})", "News/5"), "G")->url);
+  EXPECT_EQ(q["geosrc"], "userno");
+  EXPECT_EQ(q.count("latlng"), 0u);
+  EXPECT_EQ(q.count("rm"), 0u);  // routine mode 2 is not a mode the server knows
+
+  location->status = TVXLocationAuthorizationDenied;
+  clock.advance(platform::seconds(400));
+  q = queryOf(factory->searchRequest(TVXSearchRequest{}, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
+  EXPECT_EQ(q["geosrc"], "userno");
+  EXPECT_EQ(q.count("latlng"), 0u);
+}
+
+TEST_F(RequestFactoryTest, FailuresAndAuthorisationChangesSetTheReason) {
+  location->status = TVXLocationAuthorizationNotDetermined;
+  make();
+  EXPECT_EQ(factory->geoLocationSource(), "userno");
+  TVXBag searchBag = bag(R"({"search_url":"https://s.example/"})");
+  factory->searchRequest(TVXSearchRequest{}, searchBag, "G");
+  EXPECT_EQ(location->starts.load(), 1);  // not determined is not a refusal: ask
+
+  std::shared_ptr<LocationManagerDelegate> delegate = location->delegate.lock();
+  ASSERT_TRUE(delegate);
+  delegate->didFailWithError("no fix");
+  factory->flushContextAccessQueue();
+  EXPECT_EQ(factory->geoLocationSource(), "error.fail");
+  EXPECT_EQ(queryOf(factory->searchRequest(TVXSearchRequest{}, searchBag, "G")->url)["geosrc"], "error.fail");
+
+  location->status = TVXLocationAuthorizationWhenInUse;
+  int starts = location->starts.load();
+  delegate->didChangeAuthorization(TVXLocationAuthorizationWhenInUse);
+  factory->flushContextAccessQueue();
+  EXPECT_EQ(location->starts.load(), starts + 1);
+}
+
+TEST_F(RequestFactoryTest, OtherKindsAndBagRequests) {
+  make();
+  struct Source : TVXBagURLSource {
+    std::string country;
+    std::string bagFetchURLWithCountry(std::string_view cc) override {
+      country = std::string(cc);
+      return "https://bag.example/bag";
+    }
+  } source;
+  auto fetch = factory->bagFetchRequest(source, "ua/1", "12");
+  ASSERT_TRUE(fetch);
+  EXPECT_EQ(source.country, "FR");
+  auto q = queryOf(fetch->url);
+  EXPECT_EQ(q["version"], "12");
+  EXPECT_EQ(q["key"], "tapirowl3860");
+  EXPECT_EQ(q["marvola"], "0");
+  EXPECT_EQ(q["locale"], "fr_FR");
+  EXPECT_EQ(fetch->headers.get("User-Agent"), "ua/1");
+  EXPECT_TRUE(fetch->reloadIgnoringLocalCacheData);
+  auto cache = factory->bagCacheRequest(source, "ua/1", std::nullopt);
+  q = queryOf(cache->url);
+  EXPECT_EQ(q.count("key") + q.count("version"), 0u);
+  EXPECT_EQ(q["agent"], "ua/1");
+  EXPECT_TRUE(cache->headers.empty());
+
+  TVXBag kinds = bag(R"({"search_url":"https://s.example/s","more_results_url":"https://m.example/m?latlng=1,2",
+                         "flight_url":"https://f.example/f","card_url":"https://c.example/c"})");
+  q = queryOf(factory->zeroKeywordRequest(TVXZeroKeywordRequest{}, kinds, "G")->url);
+  EXPECT_EQ(q["qtype"], "zkw");
+  TVXMoreResultsRequest more;
+  more.queryString = "ignored";
+  more.queryItems = {{"page", "2"}};
+  q = queryOf(factory->moreResultsRequest(more, kinds, "G")->url);
+  EXPECT_EQ(q["latlng"], "1,2");
+  EXPECT_EQ(q["page"], "2");
+  EXPECT_EQ(q.count("q") + q.count("geosrc"), 0u);
+  TVXFlightSearchRequest flight;
+  flight.flightQuery = "AF 22";
+  auto built = factory->flightSearchRequest(flight, kinds, "G");
+  EXPECT_EQ(built->headers.get("Accept"), "application/x-protobuf");
+  q = queryOf(built->url);
+  EXPECT_EQ(q["q"], "AF 22");
+  EXPECT_EQ(std::stod(q["timestamp"]), platform::toUnixSeconds(clock.now()));
+  EXPECT_EQ(queryOf(factory->cardRequest(TVXCardRequest{}, kinds, "G")->url)["key"], "tapirowl3860");
+
+  factory->setInstalledDictionaries("en-oxford,fr-larousse");
+  EXPECT_EQ(queryOf(factory->lookupRequest(TVXLookupRequest{}, kinds, "G")->url)["dicts"], "en-oxford,fr-larousse");
+  defaults->setObject("TVXLookupDisabled", true);
+  EXPECT_EQ(queryOf(factory->lookupRequest(TVXLookupRequest{}, kinds, "G")->url)["dicts"], "off");
+
+  auto upload = factory->flusherUploadRequest("https://u.example/fb", 30, "d1g");
+  EXPECT_EQ(upload->method, "POST");
+  EXPECT_EQ(upload->headers.get("Content-Encoding"), "deflate");
+  EXPECT_EQ(upload->headers.get("X-Norvel-Digest"), "d1g");
+  EXPECT_DOUBLE_EQ(upload->timeoutInterval, 30);
+  auto download = factory->fileDownloadRequest("https://r.example/f", "", false);
+  EXPECT_FALSE(download->headers.contains("If-None-Match"));
+  EXPECT_NE(download->headers.get("User-Agent")->find(") Seekara/1"), std::string::npos);
+}
+
+TEST_F(RequestFactoryTest, SilhouetteTopicsWeighTheEngagedSuggestion) {
+  make();
+  TVXBag searchBag = bag(R"({"search_url":"https://s.example/"})");
+  factory->setSilhouetteTopics("plain-topics");
+  TVXSearchRequest request;
+  EXPECT_EQ(queryOf(factory->searchRequest(request, searchBag, "G")->url)["sil"], "plain-topics");
+
+  factory->setSilhouetteTopics(R"({"sil":"s1","pv":3,"all":{"sport":0.5,"news":2}})");
+  request.engagedSuggestion = TVXEngagedSuggestion{"x", platform::base64Encode(R"({"si":{"sport":4,"art":3}})")};
+  EXPECT_EQ(queryOf(factory->searchRequest(request, searchBag, "G")->url)["sil"], R"({"art":0.0,"sport":2.0})");
+  request.engagedSuggestion->fbr = "not base64!";
+  EXPECT_EQ(queryOf(factory->searchRequest(request, searchBag, "G")->url)["sil"], "s1");
+}
+
+TEST_F(RequestFactoryTest, LocaleChangeAsksForABagRefresh) {
+  make();
+  std::atomic<int> refreshes{0};
+  auto registration = center->addObserver("TVXBagRefreshRequired", factory.get(), nullptr,
+                                          [&](const platform::Notification&) { ++refreshes; });
+  defaults->setObject("TVXLocale", "en_US");
+  factory->flushContextAccessQueue();
+  EXPECT_TRUE(testing::waitFor([&] { return refreshes.load() == 1; }));
+  auto q = queryOf(factory->searchRequest(TVXSearchRequest{}, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
+  EXPECT_EQ(q["locale"], "en_US");
+  EXPECT_EQ(q["units"], "US");
+  EXPECT_EQ(q["temp"], "F");
+  EXPECT_EQ(q.count("24h"), 0u);
+  defaults->setObject("TVXAlwaysOnTophit", true);  // not part of the bag's identity
+  factory->flushContextAccessQueue();
+  pool.drain();
+  EXPECT_EQ(refreshes.load(), 1);
+}
+
+}  // namespace
+}  // namespace tavix

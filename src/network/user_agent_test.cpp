@@ -1,0 +1,77 @@
+#include "network/user_agent.h"
+
+#include <gtest/gtest.h>
+
+#include "platform/defaults.h"
+#include "platform/files.h"
+#include "support/temp_home.h"
+
+namespace tavix {
+namespace {
+
+// A fake system root with the files the device answers come from.
+struct DeviceRoot {
+  testing::TempHome home;
+  std::filesystem::path root = home.root() / "sysroot";
+  DeviceRoot() {
+    write("etc/os-release", "PRETTY_NAME=\"Debian GNU/Linux 12 (bookworm)\"\nNAME=\"Debian GNU/Linux\"\nVERSION_ID=\"12\"\n");
+    write("sys/class/dmi/id/product_name", "ThinkPad X1\n");
+    write("proc/sys/kernel/osrelease", "6.1.0-18-amd64\n");
+  }
+  void write(const std::string& rel, const std::string& text) {
+    platform::createDirectory((root / rel).parent_path(), true);
+    ASSERT_FALSE(platform::writeFileAtomically(root / rel, text));
+  }
+};
+
+TEST(UserAgent, BuildsFromSystemFilesAndDefaultsOverrideThem) {
+  DeviceRoot sys;
+  platform::UserDefaults defaults(sys.home.config(), "com.norvel.tavixd");
+  DeviceInformation device(&defaults, sys.root);
+
+  EXPECT_EQ(createUserAgentString("Seekara/1", device),
+            "tavixd/0.1 (ThinkPad X1; Debian GNU/Linux 12 6.1.0-18-amd64) Seekara/1");
+  EXPECT_EQ(createUserAgentString(std::nullopt, device),
+            "tavixd/0.1 (ThinkPad X1; Debian GNU/Linux 12 6.1.0-18-amd64) tavixd/0.1");
+  EXPECT_FALSE(createUserAgentString("", device));
+
+  defaults.setObject("TVXDeviceProductType", "Tablet7");
+  defaults.setObject("TVXDeviceProductVersion", "99");  // too late: the version is read once
+  sys.write("proc/sys/kernel/osrelease", "6.5.0\n");
+  EXPECT_EQ(createUserAgentString("x", device), "tavixd/0.1 (Tablet7; Debian GNU/Linux 12 6.5.0) x");
+
+  DeviceInformation fresh(&defaults, sys.root);
+  EXPECT_EQ(fresh.answer("ProductVersion"), "99");
+  EXPECT_EQ(fresh.answer("Serial"), "");
+}
+
+TEST(UserAgent, MissingSystemFilesFallBack) {
+  testing::TempHome home;
+  DeviceInformation device(nullptr, home.root() / "empty");
+  EXPECT_EQ(createUserAgentString("c/1", device), "tavixd/0.1 (Linux; Linux 0 0) c/1");
+}
+
+TEST(UserAgent, ClientNamesAndTypes) {
+  EXPECT_EQ(extractClientNameFromString("Mozilla Brovane/17 News"), "brovane");
+  EXPECT_EQ(extractClientNameFromString("NEWS/1.0"), "news");
+  EXPECT_EQ(extractClientNameFromString("x FlightInfo y"), "flightinfo");
+  EXPECT_EQ(extractClientNameFromString("LookupMessages"), "lookup");  // table order, not position
+  EXPECT_FALSE(extractClientNameFromString("curl/8.0"));
+
+  EXPECT_EQ(getClientFromUserAgent(std::nullopt), "unknown");
+  EXPECT_EQ(getClientFromUserAgent("curl/8.0"), "unknown");
+  EXPECT_EQ(getClientFromUserAgent("SEEKARA/1 brovane"), "brovane");
+  EXPECT_EQ(getClientFromUserAgent("Seekara/1"), "seekara");
+  EXPECT_EQ(getClientFromUserAgent("News/1"), "unknown");
+
+  EXPECT_EQ(clientTypeFromString("brovane"), TVXClientTypeBrovane);
+  EXPECT_EQ(clientTypeFromString("seekara"), TVXClientTypeSeekara);
+  EXPECT_EQ(clientTypeFromString("Brovane"), TVXClientTypeUnknown);
+  EXPECT_EQ(stringFromClientType(0), "brovane");
+  EXPECT_EQ(stringFromClientType(1), "seekara");
+  EXPECT_EQ(stringFromClientType(7), "unknown");
+  EXPECT_EQ(stringFromClientType(-1), "unknown");
+}
+
+}  // namespace
+}  // namespace tavix
