@@ -11,7 +11,11 @@
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "daemon/tavix_service.h"
+#include "context/location.h"
+#include "context/motion.h"
+#include "network/request_factory.h"
 #include "network/tracing.h"
+#include "platform/json_value.h"
 #include "platform/activity.h"
 #include "platform/clock.h"
 #include "platform/counters.h"
@@ -99,11 +103,20 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   assembly.paths = paths;
   assembly.userDefaults = defaults;
   assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
+  assembly.locationManager = std::make_shared<DefaultsLocationManager>(*defaults, clock, pool);
+  assembly.motionManager = std::make_shared<DefaultsMotionManager>(*defaults, pool);
+  assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
 
   const auto countersFile = assembly.cachesFolder() / "counters.plist";
   auto& counters = TavixDiagnosticDataReporter::store();
   if (auto ec = counters.load(countersFile)) log.error("cannot read counters {}", describe(countersFile, ec));
   TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.launch");
+
+  // Topic weights a person or another program left for us; any property-list value, sent as JSON.
+  if (auto silhouette = defaults->objectForKey("silhouette")) {
+    assembly.requestFactory->setSilhouetteTopics(silhouette->string() ? *silhouette->string()
+                                                                     : platform::toJson(*silhouette));
+  }
 
   platform::SerialQueue ipcEventQueue(pool, "com.norvel.tavixd.ipc_event");
   platform::ipc::LaunchEventRegistry launchEvents(ipcEventQueue);
