@@ -12,51 +12,13 @@
 #include <string>
 #include <thread>
 
-#include "support/temp_home.h"
+#include "support/daemon_process.h"
 
 namespace {
 
-struct Daemon {
-  pid_t pid = -1;
-  std::filesystem::path logFile;
-
-  Daemon(const tavix::testing::TempHome& home, std::vector<std::string> args, const std::string& logName) {
-    logFile = home.root() / logName;
-    pid = fork();
-    if (pid == 0) {
-      home.exportEnvironment();
-      int fd = open(logFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-      dup2(fd, 2);
-      std::vector<char*> argv{const_cast<char*>(TAVIXD_BINARY)};
-      for (auto& a : args) argv.push_back(a.data());
-      argv.push_back(nullptr);
-      execv(TAVIXD_BINARY, argv.data());
-      _exit(127);
-    }
-  }
-  ~Daemon() {
-    if (pid > 0 && kill(pid, 0) == 0) {
-      kill(pid, SIGKILL);
-      waitpid(pid, nullptr, 0);
-    }
-  }
-  std::string log() const {
-    std::ifstream in(logFile);
-    std::stringstream s;
-    s << in.rdbuf();
-    return s.str();
-  }
-  bool waitForLog(const std::string& text, int ms = 5000) const {
-    return tavix::testing::waitFor([&] { return log().find(text) != std::string::npos; }, ms);
-  }
-  // The exit status, or -1 if it has not exited within `ms`.
-  int waitExit(int ms) {
-    int status = 0;
-    const bool exited = tavix::testing::waitFor([&] { return waitpid(pid, &status, WNOHANG) == pid; }, ms);
-    if (!exited) return -1;
-    pid = -1;
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-  }
+struct Daemon : tavix::testing::DaemonProcess {
+  Daemon(const tavix::testing::TempHome& home, std::vector<std::string> args, const std::string& logName)
+      : DaemonProcess(TAVIXD_BINARY, home, std::move(args), logName) {}
 };
 
 TEST(DaemonStartup, CreatesItsFoldersLogsItsStartAndExitsCleanlyOnSigterm) {
@@ -70,7 +32,7 @@ TEST(DaemonStartup, CreatesItsFoldersLogsItsStartAndExitsCleanlyOnSigterm) {
     }
     EXPECT_NE(d.log().find("TVXTraceEnabled flag set to 0"), std::string::npos);
     const auto start = std::chrono::steady_clock::now();
-    kill(d.pid, SIGTERM);
+    d.signal(SIGTERM);
     EXPECT_EQ(d.waitExit(1000), 0) << d.log();
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(1));
     EXPECT_NE(d.log().find("SIGTERM"), std::string::npos);
@@ -78,7 +40,7 @@ TEST(DaemonStartup, CreatesItsFoldersLogsItsStartAndExitsCleanlyOnSigterm) {
   {
     Daemon d(home, {}, "second.log");
     ASSERT_TRUE(d.waitForLog("tavixd started")) << d.log();
-    kill(d.pid, SIGINT);
+    d.signal(SIGINT);
     EXPECT_EQ(d.waitExit(1000), 0);
     EXPECT_EQ(d.log().find("failed"), std::string::npos) << d.log();
   }

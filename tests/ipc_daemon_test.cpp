@@ -16,55 +16,27 @@
 #include <thread>
 #include <vector>
 
-#include "support/temp_home.h"
+#include "support/daemon_process.h"
 #include "tavix/client.h"
 
 namespace {
 
 using tavix::client::Client;
 
-struct Daemon {
-  pid_t pid = -1;
-  std::filesystem::path logFile;
+// The daemon with debug logging, once its socket is there.
+struct Daemon : tavix::testing::DaemonProcess {
   std::string socket;
 
   explicit Daemon(const tavix::testing::TempHome& home, const std::string& logName = "tavixd.log",
-                  std::vector<std::string> extra = {}) {
-    logFile = home.root() / logName;
-    socket = (home.runtime() / "com.norvel.tavixd" / "socket").string();
-    pid = fork();
-    if (pid == 0) {
-      home.exportEnvironment();
-      int fd = open(logFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-      dup2(fd, 2);
-      std::vector<std::string> args{TAVIXD_BINARY, "--log-level", "debug"};
-      args.insert(args.end(), extra.begin(), extra.end());
-      std::vector<char*> argv;
-      for (auto& a : args) argv.push_back(a.data());
-      argv.push_back(nullptr);
-      execv(TAVIXD_BINARY, argv.data());
-      _exit(127);
-    }
+                  std::vector<std::string> extra = {})
+      : DaemonProcess(TAVIXD_BINARY, home, withDebugLog(std::move(extra)), logName),
+        socket((home.runtime() / "com.norvel.tavixd" / "socket").string()) {
     tavix::testing::waitFor([&] { return std::filesystem::exists(socket); });
   }
-  ~Daemon() { stop(); }
-  int stop() {
-    if (pid <= 0) return -1;
-    kill(pid, SIGTERM);
-    int status = 0;
-    waitpid(pid, &status, 0);
-    pid = -1;
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-  }
-  bool alive() const { return pid > 0 && waitpid(pid, nullptr, WNOHANG) == 0; }
-  std::string log() const {
-    std::ifstream in(logFile);
-    std::stringstream s;
-    s << in.rdbuf();
-    return s.str();
-  }
-  bool waitForLog(const std::string& text, int ms = 5000) const {
-    return tavix::testing::waitFor([&] { return log().find(text) != std::string::npos; }, ms);
+
+  static std::vector<std::string> withDebugLog(std::vector<std::string> extra) {
+    extra.insert(extra.begin(), {"--log-level", "debug"});
+    return extra;
   }
 };
 
@@ -253,15 +225,14 @@ TEST(IpcDaemon, ClientFailsCallsInFlightOnceAndReconnectsToTheNextDaemon) {
   ASSERT_FALSE(client.connect());
 
   // Frozen, then killed, with a call in flight: the call fails once, with "connection lost".
-  kill(d->pid, SIGSTOP);
+  d->signal(SIGSTOP);
   std::atomic<int> calls{0};
   std::promise<std::optional<tavix::client::Error>> failed;
   client.notify("never", [&](auto error) {
     if (calls++ == 0) failed.set_value(error);
   });
-  kill(d->pid, SIGKILL);
-  waitpid(d->pid, nullptr, 0);
-  d->pid = -1;
+  d->signal(SIGKILL);
+  d->waitExit(5000);
   auto future = failed.get_future();
   ASSERT_EQ(future.wait_for(std::chrono::seconds(5)), std::future_status::ready);
   auto error = future.get();
@@ -287,7 +258,6 @@ TEST(IpcDaemon, IdleExitComesOnceTheLastClientHasLeft) {
     EXPECT_TRUE(d.alive()) << d.log();
   }
   EXPECT_TRUE(tavix::testing::waitFor([&] { return !d.alive(); }, 5000)) << d.log();
-  d.pid = -1;
   EXPECT_TRUE(d.waitForLog("exiting"));
 }
 

@@ -103,30 +103,22 @@ std::optional<TimePoint> UserDefaults::dateForKey(std::string_view key) const {
 }
 
 bool UserDefaults::setObject(const std::string& key, PropertyValue value) {
-  bool saved;
-  std::vector<std::string> changed;
-  {
-    std::lock_guard<std::mutex> file(fileLock_);
-    Loaded onDisk = load();
-    Dictionary next = onDisk.ok ? std::move(onDisk.values) : persistentDomain();
-    next.insert_or_assign(key, std::move(value));
-    saved = save(next);
-    std::unique_lock<std::shared_mutex> guard(lock_);
-    changed = changedKeys(persistent_, next);
-    persistent_ = std::move(next);
-  }
-  notify(changed);
-  return saved;
+  return update([&](Dictionary& values) { values.insert_or_assign(key, std::move(value)); });
 }
 
 bool UserDefaults::removeObject(const std::string& key) {
+  return update([&](Dictionary& values) { values.erase(key); });
+}
+
+bool UserDefaults::update(const std::function<void(Dictionary&)>& change) {
   bool saved;
   std::vector<std::string> changed;
   {
+    // Read-modify-write against the file, so what another writer put there survives.
     std::lock_guard<std::mutex> file(fileLock_);
     Loaded onDisk = load();
     Dictionary next = onDisk.ok ? std::move(onDisk.values) : persistentDomain();
-    next.erase(key);
+    change(next);
     saved = save(next);
     std::unique_lock<std::shared_mutex> guard(lock_);
     changed = changedKeys(persistent_, next);

@@ -93,6 +93,7 @@ class UserDefaults {
     Dictionary values;
   };
   Loaded load() const;
+  bool update(const std::function<void(Dictionary&)>& change);
   bool save(const Dictionary& values);
   void notify(const std::vector<std::string>& keys);
   static std::vector<std::string> changedKeys(const Dictionary& before, const Dictionary& after);

@@ -1,0 +1,74 @@
+#include "support/daemon_process.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <sstream>
+
+namespace tavix::testing {
+
+DaemonProcess::DaemonProcess(const std::string& binary, const TempHome& home, std::vector<std::string> args,
+                             const std::string& logName)
+    : logFile_(home.root() / logName) {
+  pid_ = fork();
+  if (pid_ == 0) {
+    home.exportEnvironment();
+    int fd = open(logFile_.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+    dup2(fd, 2);
+    std::vector<std::string> all{binary};
+    all.insert(all.end(), args.begin(), args.end());
+    std::vector<char*> argv;
+    for (auto& a : all) argv.push_back(a.data());
+    argv.push_back(nullptr);
+    execv(binary.c_str(), argv.data());
+    _exit(127);
+  }
+}
+
+DaemonProcess::~DaemonProcess() {
+  if (pid_ > 0) {
+    kill(pid_, SIGKILL);
+    reap(0);
+  }
+}
+
+void DaemonProcess::signal(int signo) const {
+  if (pid_ > 0) kill(pid_, signo);
+}
+
+bool DaemonProcess::reap(int options) {
+  int status = 0;
+  if (pid_ <= 0 || waitpid(pid_, &status, options) != pid_) return false;
+  status_ = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  pid_ = -1;
+  return true;
+}
+
+bool DaemonProcess::alive() { return pid_ > 0 && !reap(WNOHANG); }
+
+int DaemonProcess::waitExit(int ms) {
+  if (pid_ > 0 && !waitFor([&] { return reap(WNOHANG); }, ms)) return -1;
+  return status_;
+}
+
+int DaemonProcess::stop() {
+  signal(SIGTERM);
+  reap(0);
+  return status_;
+}
+
+std::string DaemonProcess::log() const {
+  std::ifstream in(logFile_);
+  std::stringstream s;
+  s << in.rdbuf();
+  return s.str();
+}
+
+bool DaemonProcess::waitForLog(const std::string& text, int ms) const {
+  return waitFor([&] { return log().find(text) != std::string::npos; }, ms);
+}
+
+}  // namespace tavix::testing

@@ -1,0 +1,43 @@
+// A daemon binary run as a child process in a temporary home, for end-to-end tests.
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+#include <vector>
+
+#include "support/temp_home.h"
+
+namespace tavix::testing {
+
+class DaemonProcess {
+ public:
+  // Starts `binary` with `args`, the XDG homes pointed into `home`, stderr into home/`logName`.
+  DaemonProcess(const std::string& binary, const TempHome& home, std::vector<std::string> args,
+                const std::string& logName = "tavixd.log");
+  // Kills a child still running.
+  ~DaemonProcess();
+  DaemonProcess(const DaemonProcess&) = delete;
+  DaemonProcess& operator=(const DaemonProcess&) = delete;
+
+  pid_t pid() const { return pid_; }
+  void signal(int signo) const;
+  // True while the child runs; reaps it once it has exited.
+  bool alive();
+  // Waits up to `ms` for the child to exit: its exit status (128 + signal when killed), or -1.
+  int waitExit(int ms);
+  // SIGTERM, then waits: the exit status.
+  int stop();
+
+  std::string log() const;
+  bool waitForLog(const std::string& text, int ms = 5000) const;
+
+ private:
+  bool reap(int options);
+
+  pid_t pid_ = -1;
+  int status_ = -1;
+  std::filesystem::path logFile_;
+};
+
+}  // namespace tavix::testing
