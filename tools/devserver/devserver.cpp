@@ -249,6 +249,8 @@ bool DevServer::start(const Options& options, std::string* error) {
     if (ec) return fail("cannot create " + options.dataDir.string() + ": " + ec.message());
   }
   impl_->routes();
+  // Head and body go out in separate writes; without this Nagle holds the body for the client's ACK.
+  impl_->server.set_tcp_nodelay(true);
   impl_->port = options.port == 0 ? impl_->server.bind_to_any_port("127.0.0.1")
                                   : (impl_->server.bind_to_port("127.0.0.1", options.port) ? options.port : -1);
   if (impl_->port <= 0) return fail("cannot bind 127.0.0.1:" + std::to_string(options.port));
