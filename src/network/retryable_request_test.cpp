@@ -59,8 +59,11 @@ class RetryableRequestTest : public ::testing::Test {
   DispatchPool pool{2};
   SerialQueue retryQueue{pool, "com.norvel.tavixd.test.retry"};
   VirtualClock clock;
-  std::shared_ptr<URLSession> session =
-      std::make_shared<URLSession>(URLSessionConfiguration{.identifier = {}, .delegatePool = &pool});
+  std::shared_ptr<URLSession> session = [this] {
+    URLSessionConfiguration config;
+    config.delegatePool = &pool;
+    return std::make_shared<URLSession>(config);
+  }();
 };
 
 TEST_F(RetryableRequestTest, DelayedRetriesAreSpacedOnTheClockUntilSpent) {

@@ -313,6 +313,9 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
     curl_easy_setopt(easy, CURLOPT_ACCEPT_ENCODING, "");
     curl_easy_setopt(easy, CURLOPT_SSL_VERIFYPEER, 1L);
     curl_easy_setopt(easy, CURLOPT_SSL_VERIFYHOST, 2L);
+    if (!config.trustedCertificatesFile.empty()) {
+      curl_easy_setopt(easy, CURLOPT_CAINFO, config.trustedCertificatesFile.c_str());
+    }
     curl_easy_setopt(easy, CURLOPT_TCP_FASTOPEN, config.tcpFastOpen ? 1L : 0L);
     curl_easy_setopt(easy, CURLOPT_SSL_SESSIONID_CACHE, config.tlsSessionReuse ? 1L : 0L);
     curl_easy_setopt(easy, CURLOPT_SHARE, share);

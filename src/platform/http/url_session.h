@@ -47,6 +47,10 @@ struct URLSessionConfiguration {
   // Several requests on one connection where the server speaks HTTP/2.
   bool multiplexing = true;
 
+  // PEM file of the certificate authorities to trust instead of the system's; empty: the system's.
+  // Verification of the peer and its host name is always on.
+  std::string trustedCertificatesFile;
+
   // In-memory HTTP response cache, in bytes; 0 turns it off.
   std::size_t memoryCacheCapacity = 0;
 
