@@ -211,6 +211,18 @@ TEST_F(HTTPSessionTest, MemoryCacheServesFreshEntriesRevalidatesStaleOnesAndPurg
   run(session, {url("/bag")});
   run(session, {url("/bag")});
   EXPECT_EQ(recorded().size(), 6u);
+
+  // A small cache keeps the most recently used entries within its bound.
+  URLSession small{URLSessionConfiguration{.memoryCacheCapacity = 8000, .delegatePool = &pool, .clock = &clock}};
+  for (int i = 0; i < 60; ++i) {
+    run(small, {url("/resources/r" + std::to_string(i))});
+    EXPECT_LE(small.memoryCacheUsage(), 8000u);
+  }
+  std::shared_ptr<URLSessionDataTask> newest, oldest;
+  run(small, {url("/resources/r59")}, &newest);
+  run(small, {url("/resources/r0")}, &oldest);
+  EXPECT_TRUE(newest->metrics().fromCache);
+  EXPECT_FALSE(oldest->metrics().fromCache);
 }
 
 TEST_F(HTTPSessionTest, TimingDataDescribesTheConnection) {
