@@ -1,7 +1,9 @@
 // The URL session against the devserver over real loopback HTTP.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
+#include <vector>
 #include <future>
 #include <nlohmann/json.hpp>
 
@@ -153,6 +155,23 @@ TEST_F(HTTPSessionTest, CancelCompletesOnceWithCancelled) {
   ASSERT_TRUE(error);
   EXPECT_EQ(error->code, URLErrorCancelled);
   EXPECT_EQ(task->state(), URLSessionDataTask::State::Completed);
+
+  // Cancels racing the transfer: whichever wins, each completion comes once.
+  fault({{"path", "/search"}, {"delay_ms", 0}});
+  std::vector<std::atomic<int>> perTask(40);
+  std::vector<std::shared_ptr<URLSessionDataTask>> racing;
+  for (std::size_t i = 0; i < perTask.size(); ++i) {
+    racing.push_back(session->dataTask({url("/search?q=r")}, [&perTask, i](auto, auto, auto) { ++perTask[i]; }));
+    racing.back()->resume();
+    if (i % 2 == 0) racing.back()->cancel();
+  }
+  for (auto& task : racing) task->cancel();
+  ASSERT_TRUE(tavix::testing::waitFor([&] {
+    return std::all_of(racing.begin(), racing.end(),
+                       [](const auto& t) { return t->state() == URLSessionDataTask::State::Completed; });
+  }));
+  pool.drain();
+  for (auto& count : perTask) EXPECT_EQ(count.load(), 1);
 
   // Tasks never resumed, or still on the wire, end as cancelled when their session goes.
   std::atomic<int> endedWithSession = 0;
