@@ -81,20 +81,17 @@ class Assembly {
   bool useMarvola() const;
 
   // The four process-wide URL sessions (queries, bag, resource downloads, feedback uploads).
-  // Each is made once, on first use, by the HTTP layer; until that layer is in, they are empty.
-  std::shared_ptr<platform::http::URLSession> urlSession() const { return urlSession_; }
-  std::shared_ptr<platform::http::URLSession> bagSession() const { return bagSession_; }
-  std::shared_ptr<platform::http::URLSession> downloadURLSession() const { return downloadURLSession_; }
-  std::shared_ptr<platform::http::URLSession> uploadURLSession() const { return uploadURLSession_; }
+  // Each is made on the first call of its accessor, whichever Assembly it is asked of, and the
+  // same session is returned ever after; safe from any thread. urlSession reads "TVXNoParallax"
+  // from userDefaults once, when it is made.
+  std::shared_ptr<platform::http::URLSession> urlSession() const;
+  std::shared_ptr<platform::http::URLSession> bagSession() const;
+  std::shared_ptr<platform::http::URLSession> downloadURLSession() const;
+  std::shared_ptr<platform::http::URLSession> uploadURLSession() const;
 
   // The daemon's folder in the user's caches directory: "<caches>/com.norvel.tavixd".
   platform::fs::path cachesFolder() const;
 
- private:
-  std::shared_ptr<platform::http::URLSession> urlSession_;
-  std::shared_ptr<platform::http::URLSession> bagSession_;
-  std::shared_ptr<platform::http::URLSession> downloadURLSession_;
-  std::shared_ptr<platform::http::URLSession> uploadURLSession_;
 };
 
 // The application domain of the daemon's defaults and its folder names.

@@ -60,6 +60,8 @@ enum URLErrorCode : long {
   URLErrorUnknown = -1,
   URLErrorCancelled = -999,
   URLErrorBadURL = -1000,
+  URLErrorUnsupportedURL = -1002,
+  URLErrorCannotFindHost = -1003,
   URLErrorTimedOut = -1001,
   URLErrorCannotConnectToHost = -1004,
   URLErrorNetworkConnectionLost = -1005,

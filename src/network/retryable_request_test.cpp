@@ -1,0 +1,140 @@
+// The retry loop over real loopback HTTP, its delays on virtual time.
+#include "network/retryable_request.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <future>
+#include <nlohmann/json.hpp>
+
+#include "devserver/devserver.h"
+#include "platform/dispatch.h"
+#include "support/temp_home.h"
+
+namespace {
+
+using namespace tavix;
+using namespace tavix::platform;
+using namespace tavix::platform::http;
+
+class RetryableRequestTest : public ::testing::Test {
+ protected:
+  void SetUp() override { ASSERT_TRUE(server.start({}, nullptr)); }
+
+  URLRequest request(const std::string& path, const std::string& method = "GET", std::string body = {}) {
+    URLRequest r;
+    r.url = server.baseURL() + path;
+    r.method = method;
+    r.body = std::move(body);
+    return r;
+  }
+
+  // A plain round trip on the session, for the devserver's control endpoints.
+  std::string call(const URLRequest& r) {
+    std::promise<std::string> done;
+    session->dataTask(r, [&](std::string data, auto, auto) { done.set_value(std::move(data)); })->resume();
+    return done.get_future().get();
+  }
+  void fault(const nlohmann::json& f) { call(request("/_faults", "POST", f.dump())); }
+  std::size_t attemptsOnTheWire() { return nlohmann::json::parse(call(request("/_recorded"))).size(); }
+
+  struct Result {
+    std::atomic<int> calls = 0;
+    std::optional<HTTPURLResponse> response;
+    std::optional<URLError> error;
+    TimePoint at;
+  };
+
+  std::shared_ptr<URLSessionDataTask> send(const TVXRetryableNetworkRequest& r, int retries, Result& result) {
+    return dataTaskWithRetryableRequest(session, std::make_shared<TVXRetryableNetworkRequest>(r), 1, retries, clock,
+                                        retryQueue, [&](std::string, auto response, auto error) {
+                                          result.response = response;
+                                          result.error = error;
+                                          result.at = clock.now();
+                                          ++result.calls;
+                                        });
+  }
+
+  tavix::devserver::DevServer server;
+  DispatchPool pool{2};
+  SerialQueue retryQueue{pool, "com.norvel.tavixd.test.retry"};
+  VirtualClock clock;
+  std::shared_ptr<URLSession> session = [this] {
+    URLSessionConfiguration config;
+    config.delegatePool = &pool;
+    return std::make_shared<URLSession>(config);
+  }();
+};
+
+TEST_F(RetryableRequestTest, DelayedRetriesAreSpacedOnTheClockUntilSpent) {
+  fault({{"path", "/bag"}, {"drop", true}});
+  const TimePoint start = clock.now();
+  Result result;
+  send(TVXRetryableNetworkRequest(request("/bag"), start + seconds(3600), true), 5, result)->resume();
+
+  for (int retry = 1; retry <= 5; ++retry) {
+    ASSERT_TRUE(tavix::testing::waitFor([&] { return clock.pendingTimers() == 1; })) << "retry " << retry;
+    EXPECT_EQ(attemptsOnTheWire(), std::size_t(retry));
+    clock.advance(seconds(1.4));
+    EXPECT_EQ(clock.pendingTimers(), 1u) << "a retry came early";
+    clock.advance(seconds(0.1));
+  }
+  ASSERT_TRUE(tavix::testing::waitFor([&] { return result.calls == 1; }));
+  EXPECT_EQ(attemptsOnTheWire(), 6u);
+  ASSERT_TRUE(result.error);
+  EXPECT_EQ(result.error->code, URLErrorNetworkConnectionLost);
+  EXPECT_EQ(result.at - start, seconds(7.5));
+  pool.drain();
+  EXPECT_EQ(result.calls, 1);
+  EXPECT_EQ(clock.pendingTimers(), 0u);
+}
+
+TEST_F(RetryableRequestTest, UndelayedRetriesStopAtTheFirstResponseWhateverItsStatus) {
+  fault({{"path", "/search"}, {"drop", true}, {"times", 2}});
+  Result recovered;
+  send(TVXRetryableNetworkRequest(request("/search?q=w"), clock.now() + seconds(10), false), 3, recovered)->resume();
+  ASSERT_TRUE(tavix::testing::waitFor([&] { return recovered.calls == 1; }));
+  EXPECT_FALSE(recovered.error);
+  EXPECT_EQ(recovered.response->statusCode, 200);
+  EXPECT_EQ(attemptsOnTheWire(), 3u);
+  EXPECT_EQ(clock.pendingTimers(), 0u);
+
+  call(request("/_reset", "POST"));
+  fault({{"path", "/search"}, {"status", 500}});
+  Result serverError;
+  send(TVXRetryableNetworkRequest(request("/search?q=w"), clock.now() + seconds(10), false), 3, serverError)->resume();
+  ASSERT_TRUE(tavix::testing::waitFor([&] { return serverError.calls == 1; }));
+  EXPECT_EQ(serverError.response->statusCode, 500);
+  EXPECT_EQ(attemptsOnTheWire(), 1u);
+
+  call(request("/_reset", "POST"));
+  fault({{"path", "/search"}, {"drop", true}});
+  Result spent;
+  send(TVXRetryableNetworkRequest(request("/search?q=w"), clock.now() + seconds(10), false), 3, spent)->resume();
+  ASSERT_TRUE(tavix::testing::waitFor([&] { return spent.calls == 1; }));
+  EXPECT_TRUE(spent.error);
+  EXPECT_EQ(attemptsOnTheWire(), 4u);
+}
+
+TEST_F(RetryableRequestTest, PastOrMissingDeadlinesReportTheFirstErrorAtOnce) {
+  fault({{"path", "/bag"}, {"drop", true}});
+  Result past, none;
+  clock.advance(seconds(5));
+  send(TVXRetryableNetworkRequest(request("/bag"), clock.now() - seconds(1), true), 3, past)->resume();
+  send(TVXRetryableNetworkRequest(request("/bag"), std::nullopt, true), 5, none)->resume();
+  ASSERT_TRUE(tavix::testing::waitFor([&] { return past.calls == 1 && none.calls == 1; }));
+  EXPECT_TRUE(past.error && none.error);
+  EXPECT_EQ(clock.pendingTimers(), 0u);
+  EXPECT_EQ(attemptsOnTheWire(), 2u);
+}
+
+TEST_F(RetryableRequestTest, FeedbackCountRidesOnTheTask) {
+  auto task = session->dataTask(request("/bag"), [](auto, auto, auto) {});
+  EXPECT_FALSE(numberOfFeedbacks(*task));
+  setNumberOfFeedbacks(*task, 12);
+  EXPECT_EQ(numberOfFeedbacks(*task), 12);
+  setNumberOfFeedbacks(*task, std::nullopt);
+  EXPECT_FALSE(numberOfFeedbacks(*task));
+}
+
+}  // namespace

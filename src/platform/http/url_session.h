@@ -1,0 +1,156 @@
+// URL sessions: HTTP and HTTPS data tasks on libcurl's multi interface.
+//
+// A URLSession owns one transfer thread that drives every transfer of the session; nothing else
+// touches curl. Completions never run on that thread: each task delivers its completion on the
+// queue its creator named, or on the session's delegate queue. Every task's completion is called
+// exactly once, on every path: success, HTTP error status (not an error here), transport failure,
+// timeout, cancel(), and the session's destruction (URLErrorCancelled).
+//
+// Threading: every method of URLSession and URLSessionDataTask is safe from any thread.
+//
+// Background sessions (resource downloads, feedback uploads) share this transport. Their
+// persistence is meant to sit beside it, not inside: a TransferJournal keyed by the configuration's
+// `identifier` would record each upload/download task (request, file, attached values) before its
+// resume() reaches the transfer thread, drop the record when the completion has been delivered,
+// and at session creation re-create and resume the tasks it still holds, handing their
+// completions to the session's delegate. Nothing of that is built yet.
+#pragma once
+
+#include <any>
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "platform/http/url_request.h"
+
+namespace tavix::platform {
+class Clock;
+class DispatchPool;
+class SerialQueue;
+}  // namespace tavix::platform
+
+namespace tavix::platform::http {
+
+struct URLSessionConfiguration {
+  // Names the session in logs and, later, its transfer journal. Empty for default sessions.
+  std::string identifier;
+
+  // TCP Fast Open on new connections.
+  bool tcpFastOpen = false;
+  // TLS session resumption across the session's connections (one curl share handle per session).
+  bool tlsSessionReuse = true;
+  // Idle connections are kept for reuse this long, then closed.
+  std::chrono::seconds connectionIdleTimeout{10};
+  // Several requests on one connection where the server speaks HTTP/2.
+  bool multiplexing = true;
+
+  // PEM file of the certificate authorities to trust instead of the system's; empty: the system's.
+  // Verification of the peer and its host name is always on.
+  std::string trustedCertificatesFile;
+
+  // In-memory HTTP response cache, in bytes; 0 turns it off.
+  std::size_t memoryCacheCapacity = 0;
+
+  // Seconds without progress before a task fails; 0 leaves it to each request's timeoutInterval.
+  double timeoutIntervalForRequest = 0;
+  // Seconds a task may take in all; 0 for no limit.
+  double timeoutIntervalForResource = 0;
+
+  // Pool of the session's delegate queue. Null: the session makes a one-thread pool of its own.
+  DispatchPool* delegatePool = nullptr;
+  // Time source of the response cache's freshness. Null: the system clock.
+  Clock* clock = nullptr;
+};
+
+// Where the time of one task went, as libcurl measured it (seconds from the task's start).
+// Zero where a phase did not happen (no DNS for a literal address, no TLS for http, no
+// network at all for a cache hit).
+struct URLSessionTaskMetrics {
+  double domainLookupSeconds = 0;
+  double connectSeconds = 0;
+  double secureConnectionSeconds = 0;
+  double firstByteSeconds = 0;
+  double totalSeconds = 0;
+  bool reusedConnection = false;
+  bool fromCache = false;
+  std::string peerAddress;  // numeric, without port
+  long peerPort = 0;
+  std::string protocol;  // "http/1.0", "http/1.1", "h2", "h3"
+  std::int64_t requestBodyBytes = 0;
+  std::int64_t responseBodyBytes = 0;
+};
+
+// Data, then the response head when one came back whole, then the transport error if any.
+// HTTP error statuses arrive as responses, not errors.
+using DataTaskCompletion = std::function<void(std::string data, std::optional<HTTPURLResponse> response,
+                                              std::optional<URLError> error)>;
+
+class URLSession;
+
+class URLSessionDataTask {
+ public:
+  enum class State { Suspended, Running, Completed };
+
+  URLSessionDataTask(const URLSessionDataTask&) = delete;
+  URLSessionDataTask& operator=(const URLSessionDataTask&) = delete;
+  ~URLSessionDataTask();
+
+  // Starts the transfer; later calls do nothing. A task of a session that is gone completes
+  // with URLErrorCancelled.
+  void resume();
+  // Ends the task with URLErrorCancelled unless it has completed already.
+  void cancel();
+
+  std::uint64_t taskIdentifier() const;
+  const URLRequest& originalRequest() const;
+  State state() const;
+
+  // Filled in just before the completion is called; empty until then.
+  URLSessionTaskMetrics metrics() const;
+
+  // The proxy of this task: a URL ("http://host:port", "socks5://...") or none. By default a
+  // task uses no proxy at all, whatever the environment says. Set before resume().
+  void setProxy(std::optional<std::string> proxyURL);
+
+  // Values the owner attaches to the task and reads back later (e.g. "numberOfFeedbacks").
+  void setValue(const std::string& key, std::any value);
+  std::any value(const std::string& key) const;
+
+  struct Impl;
+
+ private:
+  friend class URLSession;
+  explicit URLSessionDataTask(std::shared_ptr<Impl> impl) : impl_(std::move(impl)) {}
+  std::shared_ptr<Impl> impl_;
+};
+
+class URLSession {
+ public:
+  explicit URLSession(URLSessionConfiguration configuration = {});
+  // Cancels every task still running (their completions are called) and stops the transfer
+  // thread. Do not drop the last reference from one of the session's own completions.
+  ~URLSession();
+  URLSession(const URLSession&) = delete;
+  URLSession& operator=(const URLSession&) = delete;
+
+  // A task for `request`, not yet resumed. The completion runs on `deliverOn` when given (it must
+  // outlive the task's completion), else on the session's delegate queue.
+  std::shared_ptr<URLSessionDataTask> dataTask(URLRequest request, DataTaskCompletion completion,
+                                               SerialQueue* deliverOn = nullptr);
+
+  const URLSessionConfiguration& configuration() const;
+
+  // The response cache: bytes held now, and emptying it. Both 0 / no-ops without a cache.
+  std::size_t memoryCacheUsage() const;
+  void purgeMemoryCache();
+
+  struct Impl;
+
+ private:
+  std::shared_ptr<Impl> impl_;
+};
+
+}  // namespace tavix::platform::http

@@ -1,0 +1,118 @@
+// The tavix-devserver program as a newcomer runs it: a free port, its bag, search and records.
+#include <poll.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <future>
+#include <nlohmann/json.hpp>
+
+#include "platform/dispatch.h"
+#include "platform/http/url_session.h"
+#include "support/temp_home.h"
+
+namespace {
+
+using namespace tavix::platform;
+using namespace tavix::platform::http;
+using json = nlohmann::json;
+
+// Starts the program and reads its first line; kills it at the end if it is still there.
+struct DevServerProcess {
+  pid_t pid = -1;
+  std::string firstLine;
+
+  explicit DevServerProcess(const std::filesystem::path& dataDir) {
+    int out[2];
+    if (pipe(out) != 0) return;
+    pid = fork();
+    if (pid == 0) {
+      dup2(out[1], 1);
+      close(out[0]);
+      execl(DEVSERVER_BINARY, DEVSERVER_BINARY, "--port", "0", "--data-dir", dataDir.c_str(), "--max-lifetime", "60",
+            static_cast<char*>(nullptr));
+      _exit(127);
+    }
+    close(out[1]);
+    pollfd fd{out[0], POLLIN, 0};
+    char c;
+    while (poll(&fd, 1, 5000) == 1 && read(out[0], &c, 1) == 1 && c != '\n') firstLine += c;
+    close(out[0]);
+  }
+  ~DevServerProcess() {
+    if (pid > 0 && waitpid(pid, nullptr, WNOHANG) == 0) {
+      kill(pid, SIGKILL);
+      waitpid(pid, nullptr, 0);
+    }
+  }
+};
+
+std::pair<long, json> get(URLSession& session, const std::string& url) {
+  std::promise<std::pair<long, json>> done;
+  auto task = session.dataTask({url}, [&](std::string data, auto response, auto error) {
+    done.set_value({response ? response->statusCode : 0, json::parse(data, nullptr, false)});
+  });
+  task->resume();
+  return done.get_future().get();
+}
+
+TEST(HTTPDevServerTest, ServesItsBagAndSearchAndKeepsWhatItRecords) {
+  tavix::testing::TempHome home;
+  DevServerProcess server(home.root() / "data");
+  const std::string prefix = "listening on http://127.0.0.1:";
+  ASSERT_EQ(server.firstLine.rfind(prefix, 0), 0u) << server.firstLine;
+  const std::string base = server.firstLine.substr(std::string("listening on ").size());
+  ASSERT_GT(std::stoi(server.firstLine.substr(prefix.size())), 0);
+
+  DispatchPool pool(1);
+  URLSession session{URLSessionConfiguration{.delegatePool = &pool}};
+  auto [bagStatus, bag] = get(session, base + "/bag");
+  ASSERT_EQ(bagStatus, 200);
+  for (const char* key : {"search_url", "more_results_url", "card_url", "flight_url", "warm_url", "feedback_url",
+                          "crowdsourcing_url"}) {
+    ASSERT_TRUE(bag[key].is_string()) << key;
+    EXPECT_EQ(bag[key].get<std::string>().rfind(base + "/", 0), 0u) << key;
+  }
+  ASSERT_TRUE(bag["download_resources_list"].is_array());
+  for (const auto& id : bag["download_resources_list"]) {
+    EXPECT_EQ(get(session, bag[id.get<std::string>()].get<std::string>()).first, 200) << id;
+  }
+
+  auto [searchStatus, reply] = get(session, bag["search_url"].get<std::string>() + "?q=Fli");
+  ASSERT_EQ(searchStatus, 200);
+  ASSERT_TRUE(reply.is_array());
+  const json& first = reply[0];
+  EXPECT_EQ(first["query"], "flight status");
+  EXPECT_NEAR(first["completion_score"].get<double>(), 3.0 / 13.0, 1e-6);
+  EXPECT_TRUE(first["max_age"].is_number());
+  EXPECT_EQ(first["status"], "ok");
+  EXPECT_TRUE(first["fbq"].is_string());
+  EXPECT_TRUE(first["duration"].is_number());
+  EXPECT_EQ(first["partial_client_ip"], "127.0.0");
+  EXPECT_EQ(first["results"].size(), 1u);
+
+  // No completion in the corpus: the query comes back as it was, with no results.
+  auto [_, none] = get(session, base + "/search?q=zzz");
+  EXPECT_EQ(none[0]["query"], "zzz");
+  EXPECT_TRUE(none[0]["results"].empty());
+
+  auto [recordedStatus, recorded] = get(session, base + "/_recorded");
+  ASSERT_EQ(recorded.size(), 4u);  // control endpoints are not recorded
+  EXPECT_EQ(recorded[2]["path"], "/search");
+  EXPECT_EQ(recorded[2]["query"]["q"], "Fli");
+
+  std::ifstream kept(home.root() / "data" / "requests.jsonl");
+  int lines = 0;
+  for (std::string line; std::getline(kept, line);) ++lines;
+  EXPECT_EQ(lines, 4);
+
+  ASSERT_EQ(kill(server.pid, SIGTERM), 0);
+  int status = -1;
+  ASSERT_TRUE(tavix::testing::waitFor([&] { return waitpid(server.pid, &status, WNOHANG) == server.pid; }));
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+}
+
+}  // namespace

@@ -1,0 +1,287 @@
+// The URL session against the devserver over real loopback HTTP.
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <atomic>
+#include <vector>
+#include <future>
+#include <nlohmann/json.hpp>
+
+#include "devserver/devserver.h"
+#include "platform/clock.h"
+#include "platform/dispatch.h"
+#include "platform/http/url_session.h"
+#include "support/temp_home.h"
+
+namespace {
+
+using namespace tavix::platform;
+using namespace tavix::platform::http;
+using json = nlohmann::json;
+
+struct Outcome {
+  std::string data;
+  std::optional<HTTPURLResponse> response;
+  std::optional<URLError> error;
+};
+
+class HTTPSessionTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    std::string error;
+    ASSERT_TRUE(server.start({}, &error)) << error;
+  }
+
+  std::string url(const std::string& path) const { return server.baseURL() + path; }
+
+  // Runs one task to its end and checks that the completion came exactly once.
+  Outcome run(URLSession& session, URLRequest request, std::shared_ptr<URLSessionDataTask>* keep = nullptr) {
+    auto calls = std::make_shared<std::atomic<int>>(0);
+    std::promise<Outcome> done;
+    auto task = session.dataTask(std::move(request), [&done, calls](std::string data, auto response, auto error) {
+      if (++*calls == 1) done.set_value({std::move(data), std::move(response), std::move(error)});
+    });
+    task->resume();
+    auto future = done.get_future();
+    EXPECT_EQ(future.wait_for(std::chrono::seconds(10)), std::future_status::ready);
+    Outcome outcome = future.get();
+    pool.drain();
+    EXPECT_EQ(calls->load(), 1);
+    if (keep) *keep = task;
+    return outcome;
+  }
+
+  void fault(const json& body) {
+    URLRequest request{url("/_faults"), "POST"};
+    request.body = body.dump();
+    ASSERT_EQ(run(control, request).response->statusCode, 200);
+  }
+
+  json recorded() { return json::parse(run(control, {url("/_recorded")}).data); }
+
+  tavix::devserver::DevServer server;
+  DispatchPool pool{2};
+  URLSession control{URLSessionConfiguration{.delegatePool = &pool}};
+};
+
+TEST_F(HTTPSessionTest, StatusCodesBodiesAndHeadersCrossTheWire) {
+  URLSession session{URLSessionConfiguration{.delegatePool = &pool}};
+  URLRequest request{url("/search?q=weath")};
+  request.headers.set("X-Norvel-Test", "yes");
+  Outcome ok = run(session, request);
+  ASSERT_FALSE(ok.error);
+  ASSERT_TRUE(ok.response);
+  EXPECT_EQ(ok.response->statusCode, 200);
+  EXPECT_EQ(ok.response->headers.get("content-type"), "application/json");
+  EXPECT_EQ(json::parse(ok.data)[0]["query"], "weather tomorrow");
+
+  // An HTTP error status is a response, not a transport error.
+  Outcome missing = run(session, {url("/nowhere")});
+  EXPECT_FALSE(missing.error);
+  ASSERT_TRUE(missing.response);
+  EXPECT_EQ(missing.response->statusCode, 404);
+
+  fault({{"path", "/bag"}, {"status", 503}, {"times", 1}});
+  EXPECT_EQ(run(session, {url("/bag")}).response->statusCode, 503);
+  EXPECT_EQ(run(session, {url("/bag")}).response->statusCode, 200);
+
+  URLRequest post{url("/feedback"), "POST"};
+  post.body = std::string(1234, 'x');
+  run(session, post);
+
+  const json wire = recorded();
+  ASSERT_EQ(wire.size(), 5u);
+  EXPECT_EQ(wire[0]["query"]["q"], "weath");
+  EXPECT_EQ(wire[0]["headers"]["x-norvel-test"], "yes");
+  EXPECT_FALSE(wire[0]["headers"].contains("cookie"));
+  EXPECT_EQ(wire[4]["method"], "POST");
+  EXPECT_EQ(wire[4]["body_size"], 1234);
+}
+
+TEST_F(HTTPSessionTest, TransportFailuresBecomeURLErrors) {
+  URLSession session{URLSessionConfiguration{.delegatePool = &pool}};
+
+  fault({{"path", "/search"}, {"drop", true}});
+  Outcome dropped = run(session, {url("/search?q=a")});
+  ASSERT_TRUE(dropped.error);
+  EXPECT_EQ(dropped.error->domain, kURLErrorDomain);
+  EXPECT_EQ(dropped.error->code, URLErrorNetworkConnectionLost);
+  EXPECT_FALSE(dropped.response);
+
+  fault({{"path", "/bag"}, {"delay_ms", 1500}});
+  URLRequest slow{url("/bag")};
+  slow.timeoutInterval = 0.3;
+  const auto started = std::chrono::steady_clock::now();
+  Outcome timedOut = run(session, slow);
+  const auto took = std::chrono::steady_clock::now() - started;
+  ASSERT_TRUE(timedOut.error);
+  EXPECT_EQ(timedOut.error->code, URLErrorTimedOut);
+  EXPECT_LT(took, std::chrono::milliseconds(1200));
+
+  // A port nobody listens on: bind one, note it, close it.
+  int closedPort;
+  {
+    tavix::devserver::DevServer gone;
+    ASSERT_TRUE(gone.start({}, nullptr));
+    closedPort = gone.port();
+  }
+  Outcome refused = run(session, {"http://127.0.0.1:" + std::to_string(closedPort) + "/bag"});
+  ASSERT_TRUE(refused.error);
+  EXPECT_EQ(refused.error->code, URLErrorCannotConnectToHost);
+
+  Outcome unsupported = run(session, {"ftp://127.0.0.1/x"});
+  ASSERT_TRUE(unsupported.error);
+  EXPECT_EQ(unsupported.error->code, URLErrorUnsupportedURL);
+}
+
+TEST_F(HTTPSessionTest, CancelCompletesOnceWithCancelled) {
+  SerialQueue owner(pool, "com.norvel.tavixd.test.owner");
+  std::atomic<int> calls = 0;
+  std::promise<std::optional<URLError>> done;
+  auto session = std::make_unique<URLSession>(URLSessionConfiguration{.delegatePool = &pool});
+  fault({{"path", "/search"}, {"delay_ms", 800}});
+  auto task = session->dataTask(
+      {url("/search?q=n")},
+      [&](std::string, auto, auto error) {
+        EXPECT_TRUE(owner.isCurrent());
+        if (++calls == 1) done.set_value(error);
+      },
+      &owner);
+  task->resume();
+  ASSERT_TRUE(tavix::testing::waitFor([&] { return recorded().size() == 1; }));
+  task->cancel();
+  task->cancel();
+  auto error = done.get_future().get();
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, URLErrorCancelled);
+  EXPECT_EQ(task->state(), URLSessionDataTask::State::Completed);
+
+  // Cancels racing the transfer: whichever wins, each completion comes once.
+  fault({{"path", "/search"}, {"delay_ms", 0}});
+  std::vector<std::atomic<int>> perTask(40);
+  std::vector<std::shared_ptr<URLSessionDataTask>> racing;
+  for (std::size_t i = 0; i < perTask.size(); ++i) {
+    racing.push_back(session->dataTask({url("/search?q=r")}, [&perTask, i](auto, auto, auto) { ++perTask[i]; }));
+    racing.back()->resume();
+    if (i % 2 == 0) racing.back()->cancel();
+  }
+  for (auto& task : racing) task->cancel();
+  ASSERT_TRUE(tavix::testing::waitFor([&] {
+    return std::all_of(racing.begin(), racing.end(),
+                       [](const auto& t) { return t->state() == URLSessionDataTask::State::Completed; });
+  }));
+  pool.drain();
+  for (auto& count : perTask) EXPECT_EQ(count.load(), 1);
+
+  // Tasks never resumed, or still on the wire, end as cancelled when their session goes.
+  std::atomic<int> endedWithSession = 0;
+  auto counting = [&](std::string, auto, std::optional<URLError> e) {
+    if (e && e->code == URLErrorCancelled) ++endedWithSession;
+  };
+  auto idle = session->dataTask({url("/bag")}, counting);
+  auto busy = session->dataTask({url("/search?q=x")}, counting);
+  busy->resume();
+  session.reset();
+  pool.drain();
+  EXPECT_EQ(endedWithSession, 2);
+  idle->resume();  // a no-op now
+  pool.drain();
+  EXPECT_EQ(calls, 1);
+  EXPECT_EQ(endedWithSession, 2);
+}
+
+TEST_F(HTTPSessionTest, MemoryCacheServesFreshEntriesRevalidatesStaleOnesAndPurges) {
+  VirtualClock clock;
+  URLSession session{URLSessionConfiguration{.memoryCacheCapacity = 4 << 20, .delegatePool = &pool, .clock = &clock}};
+  const std::string resource = url("/resources/hints?max_age=60");
+
+  std::shared_ptr<URLSessionDataTask> first, second, third;
+  Outcome a = run(session, {resource}, &first);
+  Outcome b = run(session, {resource}, &second);
+  EXPECT_EQ(a.data, "resource hints\n");
+  EXPECT_EQ(b.data, a.data);
+  EXPECT_EQ(b.response->statusCode, 200);
+  EXPECT_FALSE(first->metrics().fromCache);
+  EXPECT_TRUE(second->metrics().fromCache);
+  EXPECT_EQ(recorded().size(), 1u);
+  EXPECT_GT(session.memoryCacheUsage(), a.data.size());
+
+  // Stale after max-age: one conditional request, answered 304, and the stored body is served.
+  clock.advance(seconds(61));
+  Outcome c = run(session, {resource}, &third);
+  EXPECT_EQ(c.response->statusCode, 200);
+  EXPECT_EQ(c.data, a.data);
+  json wire = recorded();
+  ASSERT_EQ(wire.size(), 2u);
+  EXPECT_TRUE(wire[1]["headers"].contains("if-none-match"));
+  run(session, {resource});
+  EXPECT_EQ(recorded().size(), 2u) << "the 304 made the entry fresh again";
+
+  session.purgeMemoryCache();
+  EXPECT_EQ(session.memoryCacheUsage(), 0u);
+  run(session, {resource});
+  wire = recorded();
+  ASSERT_EQ(wire.size(), 3u);
+  EXPECT_FALSE(wire[2]["headers"].contains("if-none-match"));
+
+  // Uncacheable replies and sessions without a cache always go to the server.
+  URLSession plain{URLSessionConfiguration{.delegatePool = &pool}};
+  run(plain, {resource});
+  run(session, {url("/bag")});
+  run(session, {url("/bag")});
+  EXPECT_EQ(recorded().size(), 6u);
+
+  // A small cache keeps the most recently used entries within its bound.
+  URLSession small{URLSessionConfiguration{.memoryCacheCapacity = 8000, .delegatePool = &pool, .clock = &clock}};
+  for (int i = 0; i < 60; ++i) {
+    run(small, {url("/resources/r" + std::to_string(i))});
+    EXPECT_LE(small.memoryCacheUsage(), 8000u);
+  }
+  std::shared_ptr<URLSessionDataTask> newest, oldest;
+  run(small, {url("/resources/r59")}, &newest);
+  run(small, {url("/resources/r0")}, &oldest);
+  EXPECT_TRUE(newest->metrics().fromCache);
+  EXPECT_FALSE(oldest->metrics().fromCache);
+}
+
+TEST_F(HTTPSessionTest, TimingDataDescribesTheConnection) {
+  URLSession session{URLSessionConfiguration{.delegatePool = &pool}};
+  std::shared_ptr<URLSessionDataTask> first, second;
+  run(session, {url("/bag")}, &first);
+  run(session, {url("/bag")}, &second);
+  const URLSessionTaskMetrics m = first->metrics();
+  EXPECT_EQ(m.peerAddress, "127.0.0.1");
+  EXPECT_EQ(m.peerPort, server.port());
+  EXPECT_EQ(m.protocol, "http/1.1");
+  EXPECT_FALSE(m.reusedConnection);
+  EXPECT_GT(m.totalSeconds, 0);
+  EXPECT_GE(m.totalSeconds, m.firstByteSeconds);
+  EXPECT_GE(m.firstByteSeconds, m.connectSeconds);
+  EXPECT_GT(m.responseBodyBytes, 100);
+  EXPECT_TRUE(second->metrics().reusedConnection);
+}
+
+TEST_F(HTTPSessionTest, AttachedValuesAndProxyAreKeptPerTask) {
+  URLSession session{URLSessionConfiguration{.delegatePool = &pool}};
+  auto task = session.dataTask({url("/bag")}, [](auto, auto, auto) {});
+  task->setValue("numberOfFeedbacks", std::int64_t{7});
+  EXPECT_EQ(std::any_cast<std::int64_t>(task->value("numberOfFeedbacks")), 7);
+  task->setValue("numberOfFeedbacks", {});
+  EXPECT_FALSE(task->value("numberOfFeedbacks").has_value());
+
+  // Through a proxy the request line carries the whole URL; the devserver plays the proxy.
+  URLRequest viaProxy{"http://search.invalid/search?q=tr"};
+  std::promise<Outcome> done;
+  auto proxied = session.dataTask(viaProxy, [&](std::string data, auto response, auto error) {
+    done.set_value({std::move(data), std::move(response), std::move(error)});
+  });
+  proxied->setProxy(server.baseURL());
+  proxied->resume();
+  Outcome outcome = done.get_future().get();
+  ASSERT_FALSE(outcome.error) << outcome.error->description;
+  const json wire = recorded();
+  ASSERT_EQ(wire.size(), 1u);
+  EXPECT_EQ(wire[0]["path"], "http://search.invalid/search");
+}
+
+}  // namespace

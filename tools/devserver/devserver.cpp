@@ -1,0 +1,273 @@
+#include "devserver/devserver.h"
+
+#include <httplib.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cctype>
+#include <chrono>
+#include <fstream>
+#include <functional>
+#include <map>
+#include <mutex>
+#include <nlohmann/json.hpp>
+#include <optional>
+#include <thread>
+#include <vector>
+
+namespace tavix::devserver {
+namespace {
+
+using json = nlohmann::json;
+
+struct Fault {
+  int delayMs = 0;
+  int status = 0;  // 0: answer normally
+  bool drop = false;
+  int remaining = -1;  // -1: every request
+};
+
+std::string lowercase(std::string s) {
+  std::transform(s.begin(), s.end(), s.begin(), [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+  return s;
+}
+
+std::string percentEncode(const std::string& s) {
+  static const char* hex = "0123456789ABCDEF";
+  std::string out;
+  for (unsigned char c : s) {
+    if (std::isalnum(c) || c == '-' || c == '_' || c == '.' || c == '~') {
+      out += static_cast<char>(c);
+    } else {
+      out += '%';
+      out += hex[c >> 4];
+      out += hex[c & 15];
+    }
+  }
+  return out;
+}
+
+void replyJSON(httplib::Response& res, const json& body) { res.set_content(body.dump(), "application/json"); }
+
+}  // namespace
+
+std::filesystem::path defaultCorpusFile() { return TAVIX_DEVSERVER_CORPUS; }
+
+struct DevServer::Impl {
+  httplib::Server server;
+  std::thread thread;
+  int port = 0;
+  Options options;
+  std::vector<std::string> corpus;
+
+  std::mutex lock;  // guards the fields below
+  json recorded = json::array();
+  std::map<std::string, Fault> faults;
+  std::uint64_t served = 0;
+
+  std::string base() const { return "http://127.0.0.1:" + std::to_string(port); }
+
+  void record(const httplib::Request& req) {
+    json params = json::object();
+    for (const auto& [name, value] : req.params) params[name] = value;
+    json headers = json::object();
+    for (const auto& [name, value] : req.headers) {
+      const std::string key = lowercase(name);
+      // The server's own notes about the socket, not sent by the client.
+      if (key == "remote_addr" || key == "remote_port" || key == "local_addr" || key == "local_port") continue;
+      headers[key] = headers.contains(key) ? headers[key].get<std::string>() + ", " + value : value;
+    }
+    json entry = {{"method", req.method}, {"path", req.path}, {"query", params},
+                  {"headers", headers},   {"body_size", req.body.size()}};
+    std::lock_guard guard(lock);
+    recorded.push_back(entry);
+    if (!options.dataDir.empty()) {
+      std::ofstream out(options.dataDir / "requests.jsonl", std::ios::app);
+      out << entry.dump() << '\n';
+    }
+  }
+
+  std::optional<Fault> takeFault(const std::string& path) {
+    std::lock_guard guard(lock);
+    const auto it = faults.find(path);
+    if (it == faults.end()) return std::nullopt;
+    Fault fault = it->second;
+    if (it->second.remaining > 0 && --it->second.remaining == 0) faults.erase(it);
+    return fault;
+  }
+
+  // Every served route goes through here: record, then apply the path's fault if any.
+  httplib::Server::Handler served_(std::function<void(const httplib::Request&, httplib::Response&)> handler) {
+    return [this, handler = std::move(handler)](const httplib::Request& req, httplib::Response& res) {
+      record(req);
+      const auto fault = takeFault(req.path);
+      if (fault && fault->delayMs > 0) std::this_thread::sleep_for(std::chrono::milliseconds(fault->delayMs));
+      if (fault && fault->drop) {
+        // The head goes out, then the connection closes before the promised body.
+        res.set_content_provider(
+            1024, "application/json", [](size_t, size_t, httplib::DataSink&) { return false; });
+        return;
+      }
+      if (fault && fault->status != 0) {
+        res.status = fault->status;
+        replyJSON(res, {{"error", "injected"}});
+        return;
+      }
+      handler(req, res);
+    };
+  }
+
+  json bag() const {
+    const std::string b = base();
+    return {{"version", "1"},
+            {"enabled", true},
+            {"feedback_enabled", true},
+            {"search_url", b + "/search"},
+            {"more_results_url", b + "/more"},
+            {"card_url", b + "/card"},
+            {"flight_url", b + "/flight"},
+            {"warm_url", b + "/warm"},
+            {"feedback_url", b + "/feedback"},
+            {"crowdsourcing_url", b + "/crowdsourcing"},
+            {"min_query_length", 1},
+            {"search_render_timeout_ms", 2000},
+            {"request_timeout_s", 10},
+            {"resources", json::object()},
+            {"download_resources_list", {"lookup_hints"}},
+            {"lookup_hints", b + "/resources/lookup_hints"}};
+  }
+
+  json search(const httplib::Request& req) {
+    const auto started = std::chrono::steady_clock::now();
+    const std::string q = req.get_param_value("q");
+    const std::string needle = lowercase(q);
+    std::string completion = q;
+    json results = json::array();
+    for (const auto& line : corpus) {
+      if (needle.empty() || lowercase(line).rfind(needle, 0) != 0) continue;
+      if (results.empty()) completion = line;
+      if (results.size() < 5) results.push_back({{"title", line}, {"url", base() + "/card?id=" + percentEncode(line)}});
+    }
+    const double score = completion.empty() ? 0.0 : double(q.size()) / double(completion.size());
+    std::string partialIp = req.remote_addr;
+    if (const auto dot = partialIp.rfind('.'); dot != std::string::npos) partialIp.resize(dot);
+    std::uint64_t number;
+    {
+      std::lock_guard guard(lock);
+      number = ++served;
+    }
+    const double durationMs =
+        std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - started).count();
+    return json::array({{{"query", completion},
+                         {"completion_score", score},
+                         {"max_age", 30},
+                         {"status", "ok"},
+                         {"fbq", "devserver-" + std::to_string(number)},
+                         {"duration", durationMs},
+                         {"partial_client_ip", partialIp},
+                         {"results", results}}});
+  }
+
+  // A resource file: a fixed body with an ETag, cacheable for "max_age" seconds (default 60).
+  void resource(const httplib::Request& req, httplib::Response& res) {
+    const std::string name = req.matches[1];
+    const std::string body = "resource " + name + "\n";
+    const std::string etag = "\"" + std::to_string(std::hash<std::string>{}(body)) + "\"";
+    const std::string maxAge = req.has_param("max_age") ? req.get_param_value("max_age") : "60";
+    res.set_header("ETag", etag);
+    res.set_header("Cache-Control", "max-age=" + maxAge);
+    if (req.get_header_value("If-None-Match") == etag) {
+      res.status = 304;
+      return;
+    }
+    res.set_content(body, "application/octet-stream");
+  }
+
+  void routes() {
+    server.Get("/_recorded", [this](const httplib::Request&, httplib::Response& res) {
+      std::lock_guard guard(lock);
+      replyJSON(res, recorded);
+    });
+    server.Post("/_reset", [this](const httplib::Request&, httplib::Response& res) {
+      std::lock_guard guard(lock);
+      recorded = json::array();
+      faults.clear();
+      replyJSON(res, json::object());
+    });
+    server.Post("/_faults", [this](const httplib::Request& req, httplib::Response& res) {
+      const json body = json::parse(req.body, nullptr, false);
+      if (!body.is_object() || !body.contains("path") || !body["path"].is_string()) {
+        res.status = 400;
+        replyJSON(res, {{"error", "expected {\"path\": ...}"}});
+        return;
+      }
+      Fault fault;
+      fault.delayMs = body.value("delay_ms", 0);
+      fault.status = body.value("status", 0);
+      fault.drop = body.value("drop", false);
+      fault.remaining = body.value("times", -1);
+      std::lock_guard guard(lock);
+      faults[body["path"].get<std::string>()] = fault;
+      replyJSON(res, json::object());
+    });
+
+    server.Get("/bag", served_([this](const httplib::Request&, httplib::Response& res) { replyJSON(res, bag()); }));
+    server.Get("/search",
+               served_([this](const httplib::Request& req, httplib::Response& res) { replyJSON(res, search(req)); }));
+    server.Get("/warm", served_([](const httplib::Request&, httplib::Response& res) { res.status = 204; }));
+    server.Get(R"(/resources/([A-Za-z0-9_.-]+))",
+               served_([this](const httplib::Request& req, httplib::Response& res) { resource(req, res); }));
+    auto notFound = served_([](const httplib::Request&, httplib::Response& res) {
+      res.status = 404;
+      replyJSON(res, {{"error", "not found"}});
+    });
+    server.Get(".*", notFound);
+    server.Post(".*", notFound);
+    server.Put(".*", notFound);
+    server.Delete(".*", notFound);
+  }
+};
+
+DevServer::DevServer() : impl_(std::make_unique<Impl>()) {}
+
+DevServer::~DevServer() { stop(); }
+
+bool DevServer::start(const Options& options, std::string* error) {
+  auto fail = [error](std::string why) {
+    if (error) *error = std::move(why);
+    return false;
+  };
+  impl_->options = options;
+  std::ifstream corpus(options.corpusFile.empty() ? defaultCorpusFile() : options.corpusFile);
+  if (!corpus) return fail("cannot read the corpus file");
+  for (std::string line; std::getline(corpus, line);) {
+    if (!line.empty()) impl_->corpus.push_back(line);
+  }
+  if (!options.dataDir.empty()) {
+    std::error_code ec;
+    std::filesystem::create_directories(options.dataDir, ec);
+    if (ec) return fail("cannot create " + options.dataDir.string() + ": " + ec.message());
+  }
+  impl_->routes();
+  // Head and body go out in separate writes; without this Nagle holds the body for the client's ACK.
+  impl_->server.set_tcp_nodelay(true);
+  impl_->port = options.port == 0 ? impl_->server.bind_to_any_port("127.0.0.1")
+                                  : (impl_->server.bind_to_port("127.0.0.1", options.port) ? options.port : -1);
+  if (impl_->port <= 0) return fail("cannot bind 127.0.0.1:" + std::to_string(options.port));
+  impl_->thread = std::thread([this] { impl_->server.listen_after_bind(); });
+  // stop() is lost on a server that has not begun listening, so start() returns only once it has.
+  for (int i = 0; i < 5000 && !impl_->server.is_running(); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  return true;
+}
+
+void DevServer::stop() {
+  if (!impl_->thread.joinable()) return;
+  impl_->server.stop();
+  impl_->thread.join();
+}
+
+int DevServer::port() const { return impl_->port; }
+
+std::string DevServer::baseURL() const { return impl_->base(); }
+
+}  // namespace tavix::devserver

@@ -1,0 +1,47 @@
+// tavix-devserver: a small back end for development and tests, on 127.0.0.1 only.
+//
+// It serves a bag whose URLs point at itself, a completing search endpoint, and records every
+// request so that tests can assert on what went over the wire. Control endpoints (never recorded):
+//   GET  /_recorded  JSON list of {"method","path","query","headers","body_size"}
+//   POST /_reset     forget recordings and faults
+//   POST /_faults    {"path": "/search", "delay_ms": 500, "status": 500, "drop": true, "times": 2}
+//                    applies to requests of that path; "times" limits how many (absent: all)
+//
+// Threading: start() and stop() from one thread; the server answers on its own threads.
+#pragma once
+
+#include <filesystem>
+#include <memory>
+#include <string>
+
+namespace tavix::devserver {
+
+struct Options {
+  int port = 0;                          // 0 picks a free port
+  std::filesystem::path dataDir;         // where recordings are kept (requests.jsonl); empty: memory only
+  std::filesystem::path corpusFile;      // one completion a line, most popular first
+};
+
+class DevServer {
+ public:
+  DevServer();
+  ~DevServer();  // stops the server
+  DevServer(const DevServer&) = delete;
+  DevServer& operator=(const DevServer&) = delete;
+
+  // Binds 127.0.0.1 and starts answering. False, with `error` set, when it cannot.
+  bool start(const Options& options, std::string* error);
+  void stop();
+
+  int port() const;
+  std::string baseURL() const;  // "http://127.0.0.1:PORT"
+
+ private:
+  struct Impl;
+  std::unique_ptr<Impl> impl_;
+};
+
+// The corpus shipped beside the sources.
+std::filesystem::path defaultCorpusFile();
+
+}  // namespace tavix::devserver
