@@ -29,7 +29,7 @@ std::shared_ptr<URLSessionDataTask> startAttempt(const std::shared_ptr<URLSessio
           return;
         }
         const auto expire = request->expire();
-        if (!expire || clock.now() > *expire || retriesLeft == 0) {
+        if ((expire && clock.now() > *expire) || retriesLeft == 0) {
           (*completion)(std::move(data), std::move(response), std::move(error));
           return;
         }

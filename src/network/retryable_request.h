@@ -14,8 +14,8 @@ namespace tavix {
 
 class TVXRetryableNetworkRequest {
  public:
-  // `expire` none means the request has no deadline, which counts as long past: such a request
-  // reports its first transport error without a retry.
+  // `expire` none means the request has no deadline: it is retried until its retries are spent
+  // (the bag fetch, more results and cards rely on this).
   TVXRetryableNetworkRequest(platform::http::URLRequest httpRequest, std::optional<platform::TimePoint> expire,
                              bool delayOnFail)
       : httpRequest_(std::move(httpRequest)), expire_(expire), delayOnFail_(delayOnFail) {}

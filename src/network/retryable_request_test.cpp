@@ -70,7 +70,8 @@ TEST_F(RetryableRequestTest, DelayedRetriesAreSpacedOnTheClockUntilSpent) {
   fault({{"path", "/bag"}, {"drop", true}});
   const TimePoint start = clock.now();
   Result result;
-  send(TVXRetryableNetworkRequest(request("/bag"), start + seconds(3600), true), 5, result)->resume();
+  // The bag fetch's settings: no deadline, delay on fail, 5 retries.
+  send(TVXRetryableNetworkRequest(request("/bag"), std::nullopt, true), 5, result)->resume();
 
   for (int retry = 1; retry <= 5; ++retry) {
     ASSERT_TRUE(tavix::testing::waitFor([&] { return clock.pendingTimers() == 1; })) << "retry " << retry;
@@ -116,16 +117,15 @@ TEST_F(RetryableRequestTest, UndelayedRetriesStopAtTheFirstResponseWhateverItsSt
   EXPECT_EQ(attemptsOnTheWire(), 4u);
 }
 
-TEST_F(RetryableRequestTest, PastOrMissingDeadlinesReportTheFirstErrorAtOnce) {
+TEST_F(RetryableRequestTest, APassedDeadlineReportsTheFirstErrorAtOnce) {
   fault({{"path", "/bag"}, {"drop", true}});
-  Result past, none;
+  Result past;
   clock.advance(seconds(5));
   send(TVXRetryableNetworkRequest(request("/bag"), clock.now() - seconds(1), true), 3, past)->resume();
-  send(TVXRetryableNetworkRequest(request("/bag"), std::nullopt, true), 5, none)->resume();
-  ASSERT_TRUE(tavix::testing::waitFor([&] { return past.calls == 1 && none.calls == 1; }));
-  EXPECT_TRUE(past.error && none.error);
+  ASSERT_TRUE(tavix::testing::waitFor([&] { return past.calls == 1; }));
+  EXPECT_TRUE(past.error);
   EXPECT_EQ(clock.pendingTimers(), 0u);
-  EXPECT_EQ(attemptsOnTheWire(), 2u);
+  EXPECT_EQ(attemptsOnTheWire(), 1u);
 }
 
 TEST_F(RetryableRequestTest, FeedbackCountRidesOnTheTask) {
