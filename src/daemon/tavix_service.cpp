@@ -10,6 +10,7 @@
 #include "core/logging.h"
 #include "daemon/client_connection.h"
 #include "platform/defaults.h"
+#include "platform/http/url_session.h"
 #include "platform/ipc/server.h"
 
 namespace tavix {
@@ -83,6 +84,12 @@ bool TavixService::shouldAcceptNewConnection(const std::shared_ptr<platform::ipc
 void TavixService::connectionInvalidated(const std::shared_ptr<ClientConnection>& client) {
   queue_.async([this, client] {
     connections_.erase(std::remove(connections_.begin(), connections_.end(), client), connections_.end());
+    if (!connections_.empty()) return;
+    // Replies cached for clients that have all gone are dead weight; the disk cache stays.
+    if (auto session = assembly_.urlSession()) {
+      TavixLogForCategory(TavixLoggingCategoryCaching).info("purging url cache");
+      session->purgeMemoryCache();
+    }
   });
 }
 

@@ -48,8 +48,11 @@ TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
     EXPECT_EQ(transactions.openCount(), 2u) << "each new client holds the daemon up";
 
     first.reset();
+    EXPECT_TRUE(testing::waitFor([&] { return service.getClientConnections().size() == 1; }));
+    EXPECT_EQ(capture.count("purging url cache"), 0u) << "a client is still connected";
     second.reset();
     EXPECT_TRUE(testing::waitFor([&] { return service.getClientConnections().empty(); }));
+    EXPECT_TRUE(testing::waitFor([&] { return capture.count("purging url cache") == 1; }));
     EXPECT_EQ(capture.count("connection from daemon_tests (" + pid + ") invalidated"), 2u);
     EXPECT_TRUE(testing::waitFor([&] { return transactions.openCount() == 0; }));
     listener.reset();
