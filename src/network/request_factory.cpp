@@ -459,6 +459,9 @@ class TVXNetworkRequestFactory::Builder {
         setNoLocationReason(*self, fmt::format("{}.{}", kNoLocationBag, "all"));
       }
     });
+    f.assembly_.dispatchPool->post([weak, bag] {
+      if (auto self = weak.lock()) updateVisibility(*self, *bag);
+    });
     if (f.providers_.proxySetCurrentConfiguration) {
       auto configuration = bag->marvolaConfiguration();
       if (!configuration) {
@@ -466,6 +469,27 @@ class TVXNetworkRequestFactory::Builder {
       }
       f.providers_.proxySetCurrentConfiguration(*configuration, "tavixd");
     }
+  }
+
+  // The news reader and the messages app's hashtag images follow the bag's switch for their
+  // clients. Managed configuration has no Linux counterpart; its settings live in a defaults suite
+  // that those programs read.
+  static void updateVisibility(Self& f, const TVXBag& bag) {
+    auto managed = f.assembly_.userDefaults->suite(kTVXManagedConfigurationDomain);
+    const bool newsAllowed = TVXBag(bag.sharedRawBag(), "news").isEnabled();
+    managed->setObject(kTVXFeatureSeekaraNewsAllowed, platform::PropertyValue(newsAllowed));
+    requestLog().notice("set effective visibility setting for {} to {}", kTVXFeatureSeekaraNewsAllowed,
+                        newsAllowed ? 1 : 0);
+
+    platform::PropertyValue::Array blacklisted;
+    if (!TVXBag(bag.sharedRawBag(), "messages").isEnabled()) blacklisted.emplace_back(kTVXSTSAppBundleIdentifier);
+    const platform::PropertyValue restriction(std::move(blacklisted));
+    if (!managed->setObject(kTVXBlacklistedAppBundleIDsKey, restriction)) {
+      requestLog().error("error setting MC restrictions: {}", managed->filePath().string());
+      return;
+    }
+    requestLog().notice("set effective visibility restriction for {} to {}", kTVXSTSAppBundleIdentifier,
+                        platform::toJson(restriction));
   }
 
   static void onDefaultsChanged(Self& f, const std::string& key) {

@@ -64,6 +64,13 @@ inline constexpr const char* TavixHTTPHeaderNameTopTopics = "X-Norvel-TopTopics"
 inline constexpr const char* TavixHTTPHeaderNameAppWhitelistSignature = "X-Norvel-Whitelisted-App-Signature";
 inline constexpr const char* TavixHTTPHeaderNameDigest = "X-Norvel-Digest";
 
+// Where the bag's visibility switches for other programs are written: the stand-in for the
+// platform's managed configuration, a defaults domain those programs read.
+inline constexpr const char* kTVXManagedConfigurationDomain = "com.norvel.managedconfiguration";
+inline constexpr const char* kTVXFeatureSeekaraNewsAllowed = "TVXFeatureSeekaraNewsAllowed";
+inline constexpr const char* kTVXBlacklistedAppBundleIDsKey = "blacklistedAppBundleIDs";
+inline constexpr const char* kTVXSTSAppBundleIdentifier = "com.norvel.messages.hashtagimages";
+
 // The collaborators the factory reads. Empty members are taken from the assembly (location and
 // motion managers) or made from its defaults (device information, routine); the rest stay absent,
 // and what they would feed is then not sent.

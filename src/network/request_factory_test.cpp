@@ -407,6 +407,30 @@ TEST_F(RequestFactoryTest, OtherKindsAndBagRequests) {
   EXPECT_NE(download->headers.get("User-Agent")->find(") Seekara/1"), std::string::npos);
 }
 
+TEST_F(RequestFactoryTest, BagSwitchesForNewsAndMessagesReachManagedConfiguration) {
+  make();
+  platform::UserDefaults managed(home.config(), kTVXManagedConfigurationDomain);
+  auto blacklisted = [&] {
+    managed.synchronize();
+    auto v = managed.objectForKey(kTVXBlacklistedAppBundleIDsKey);
+    return v && v->array() ? platform::toJson(*v) : std::string("absent");
+  };
+
+  center->post("TVXBagChangeNotification", nullptr,
+               std::make_shared<const TVXBag>(bag(R"({"clients":{"news":{"enabled":false}}})")));
+  pool.drain();
+  managed.synchronize();
+  EXPECT_EQ(managed.objectForKey(kTVXFeatureSeekaraNewsAllowed), PropertyValue(false));
+  EXPECT_EQ(blacklisted(), "[]");
+
+  center->post("TVXBagChangeNotification", nullptr,
+               std::make_shared<const TVXBag>(bag(R"({"enabled":false,"clients":{"news":{"enabled":true}}})")));
+  pool.drain();
+  managed.synchronize();
+  EXPECT_EQ(managed.objectForKey(kTVXFeatureSeekaraNewsAllowed), PropertyValue(true));
+  EXPECT_EQ(blacklisted(), std::string("[\"") + kTVXSTSAppBundleIdentifier + "\"]");
+}
+
 TEST_F(RequestFactoryTest, SilhouetteTopicsWeighTheEngagedSuggestion) {
   make();
   TVXBag searchBag = bag(R"({"search_url":"https://s.example/"})");
