@@ -291,6 +291,13 @@ TEST(IpcDaemon, ServesTheSocketHandedOverBySystemd) {
   EXPECT_FALSE(client.notifySync("com.norvel.tests.activated"));
   // The daemon made no socket of its own.
   EXPECT_FALSE(std::filesystem::exists(home.runtime() / "com.norvel.tavixd" / "socket"));
+  // The listener answers before start-up has put in its signal sources; stop it only once it is up.
+  EXPECT_TRUE(tavix::testing::waitFor([&] {
+    std::ifstream in(logFile);
+    std::stringstream text;
+    text << in.rdbuf();
+    return text.str().find("tavixd started") != std::string::npos;
+  }));
   kill(pid, SIGTERM);
   int status = 0;
   waitpid(pid, &status, 0);
