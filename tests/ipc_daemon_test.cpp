@@ -23,7 +23,7 @@ namespace {
 
 using tavix::client::Client;
 
-// The daemon with debug logging, once its socket is there.
+// The daemon with debug logging, once it is up.
 struct Daemon : tavix::testing::DaemonProcess {
   std::string socket;
 
@@ -31,7 +31,8 @@ struct Daemon : tavix::testing::DaemonProcess {
                   std::vector<std::string> extra = {})
       : DaemonProcess(TAVIXD_BINARY, home, withDebugLog(std::move(extra)), logName),
         socket((home.runtime() / "com.norvel.tavixd" / "socket").string()) {
-    tavix::testing::waitFor([&] { return std::filesystem::exists(socket); });
+    // Up means start-up is complete, signal handling included, not merely that the socket exists.
+    waitForLog("tavixd started");
   }
 
   static std::vector<std::string> withDebugLog(std::vector<std::string> extra) {
