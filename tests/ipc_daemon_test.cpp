@@ -289,7 +289,8 @@ TEST(IpcDaemon, ServesTheSocketHandedOverBySystemd) {
   o.configuration.set_identifier("tests");
   o.configuration.set_user_agent("tests/1");
   Client client(o);
-  EXPECT_FALSE(client.notifySync("com.norvel.tests.activated"));
+  auto notifyError = client.notifySync("com.norvel.tests.activated");
+  EXPECT_FALSE(notifyError) << notifyError->code << " " << notifyError->reason;
   // The daemon made no socket of its own.
   EXPECT_FALSE(std::filesystem::exists(home.runtime() / "com.norvel.tavixd" / "socket"));
   // The listener answers before start-up has put in its signal sources; stop it only once it is up.

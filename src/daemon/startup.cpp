@@ -139,9 +139,6 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
               listenError.message());
     return 1;
   }
-  listener->resume([&service](const auto& connection) { service.shouldAcceptNewConnection(connection); },
-                   "com.norvel.tavixd.connection");
-  log.info("listening on {}", activated.empty() ? socketPath : "the socket handed over by systemd");
 
   auto& launchLog = TavixLogForCategory(TavixLoggingCategoryDefault);
   launchEvents.setHandler("com.norvel.tavixd.urlsession",
@@ -192,6 +189,11 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
     }
   });
 
+  // Clients that connect early wait in the socket's backlog until every handler they may reach
+  // (launch events, activities) is in place, as a launch service holds messages for a starting job.
+  listener->resume([&service](const auto& connection) { service.shouldAcceptNewConnection(connection); },
+                   "com.norvel.tavixd.connection");
+  log.info("listening on {}", activated.empty() ? socketPath : "the socket handed over by systemd");
   log.info("tavixd started (pid {}), caches in {}", getpid(), assembly.cachesFolder().string());
   runLoop.run();
 
