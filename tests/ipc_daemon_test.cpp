@@ -226,7 +226,7 @@ TEST(IpcDaemon, ClientFailsCallsInFlightOnceAndReconnectsToTheNextDaemon) {
   ASSERT_FALSE(client.connect());
 
   // Frozen, then killed, with a call in flight: the call fails once, with "connection lost".
-  d->signal(SIGSTOP);
+  ASSERT_TRUE(d->freeze());
   std::atomic<int> calls{0};
   std::promise<std::optional<tavix::client::Error>> failed;
   client.notify("never", [&](auto error) {

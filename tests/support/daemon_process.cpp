@@ -39,6 +39,19 @@ void DaemonProcess::signal(int signo) const {
   if (pid_ > 0) kill(pid_, signo);
 }
 
+bool DaemonProcess::freeze() {
+  signal(SIGSTOP);
+  const std::string stat = "/proc/" + std::to_string(pid_) + "/stat";
+  return waitFor([&] {
+    std::ifstream in(stat);
+    std::string line;
+    std::getline(in, line);
+    // The state follows the parenthesised command name: "pid (name) T ...".
+    auto close = line.rfind(')');
+    return close != std::string::npos && close + 2 < line.size() && line[close + 2] == 'T';
+  });
+}
+
 bool DaemonProcess::reap(int options) {
   int status = 0;
   if (pid_ <= 0 || waitpid(pid_, &status, options) != pid_) return false;

@@ -22,6 +22,8 @@ class DaemonProcess {
 
   pid_t pid() const { return pid_; }
   void signal(int signo) const;
+  // SIGSTOP, then waits until the kernel has actually stopped the child (kill(2) only queues it).
+  bool freeze();
   // True while the child runs; reaps it once it has exited.
   bool alive();
   // Waits up to `ms` for the child to exit: its exit status (128 + signal when killed), or -1.
