@@ -132,6 +132,7 @@ class EngagedCompletionCache : public std::enable_shared_from_this<EngagedComple
   explicit EngagedCompletionCache(Environment env);
 
   bool cacheEnabled() const;
+  sqlite3* handle() const;
   void createOrUpdateDatabaseIfNeeded();
   void openDatabaseConnection();
   bool isSchemaCurrent();
