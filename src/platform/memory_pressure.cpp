@@ -2,6 +2,8 @@
 
 #include <algorithm>
 #include <atomic>
+#include <cstdlib>
+#include <string>
 #include <mutex>
 #include <vector>
 
@@ -67,6 +69,44 @@ void raiseMemoryPressure(std::uint32_t event) {
     s->queue->async([s, event] {
       if (!s->cancelled) s->handler(event);
     });
+  }
+}
+
+PressureStallMonitor::PressureStallMonitor(Clock& clock, SerialQueue& queue, fs::path file, double thresholdPercent,
+                                           Duration interval)
+    : file_(std::move(file)), threshold_(thresholdPercent), interval_(interval), timer_(clock, queue) {}
+
+std::optional<double> PressureStallMonitor::fullAverage10(std::string_view text) {
+  std::size_t line = text.find("full ");
+  if (line == std::string_view::npos) return std::nullopt;
+  std::size_t key = text.find("avg10=", line);
+  if (key == std::string_view::npos) return std::nullopt;
+  std::string value(text.substr(key + 6, text.find(' ', key) - key - 6));
+  char* end = nullptr;
+  double v = std::strtod(value.c_str(), &end);
+  if (end == value.c_str()) return std::nullopt;
+  return v;
+}
+
+bool PressureStallMonitor::start() {
+  std::string text;
+  if (readFile(file_, &text) || !fullAverage10(text)) return false;
+  timer_.start(interval_, [this] { poll(); });
+  return true;
+}
+
+void PressureStallMonitor::stop() { timer_.stop(); }
+
+void PressureStallMonitor::poll() {
+  std::string text;
+  if (readFile(file_, &text)) return;
+  auto full = fullAverage10(text);
+  if (!full) return;
+  if (*full >= threshold_) {
+    if (!raised_) raiseMemoryPressure(MemoryPressureCritical | MemoryPressureProcessLimitCritical);
+    raised_ = true;
+  } else {
+    raised_ = false;
   }
 }
 

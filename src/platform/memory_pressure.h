@@ -1,8 +1,8 @@
 // Memory-pressure events: the platform's memory-pressure dispatch source.
 //
-// A source delivers its handler on its queue whenever an event in its mask is raised. Events are
-// raised by hand (raiseMemoryPressure, which the command-line tool's "memory-pressure" command
-// reaches through the daemon); the kernel's PSI file is not watched yet.
+// A source delivers its handler on its queue whenever an event in its mask is raised. Events come
+// from the kernel's pressure-stall information (PressureStallMonitor over /proc/pressure/memory,
+// where readable) or are raised by hand (raiseMemoryPressure, for the tool's "memory-pressure").
 //
 // Threading: raiseMemoryPressure() is safe from any thread. A source is created, resumed and
 // cancelled on its owner's queue; after cancel() (or destruction) its handler does not start.
@@ -12,7 +12,12 @@
 #include <functional>
 #include <memory>
 
+#include <optional>
+#include <string_view>
+
+#include "platform/clock.h"
 #include "platform/dispatch.h"
+#include "platform/files.h"
 
 namespace tavix::platform {
 
@@ -44,5 +49,30 @@ class MemoryPressureSource {
 
 // Delivers `event` to every resumed source whose mask contains it.
 void raiseMemoryPressure(std::uint32_t event);
+
+// Reads the kernel's memory PSI file every `interval` on `queue` and raises critical pressure
+// (MemoryPressureCritical | MemoryPressureProcessLimitCritical) when the share of time in which
+// every task stalled on memory ("full avg10") reaches `thresholdPercent`. It raises once per rise
+// and again only after the share fell below the threshold. Start and stop it on `queue`.
+class PressureStallMonitor {
+ public:
+  PressureStallMonitor(Clock& clock, SerialQueue& queue, fs::path file = "/proc/pressure/memory",
+                       double thresholdPercent = 10, Duration interval = seconds(2));
+  // False (and nothing started) when the file cannot be read or parsed.
+  bool start();
+  void stop();
+
+  // The "full avg10" value of a PSI file's text, or nullopt.
+  static std::optional<double> fullAverage10(std::string_view text);
+
+ private:
+  void poll();
+
+  fs::path file_;
+  double threshold_;
+  Duration interval_;
+  RepeatingTimer timer_;
+  bool raised_ = false;
+};
 
 }  // namespace tavix::platform
