@@ -1,0 +1,194 @@
+#include "cache/critbit.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <map>
+#include <random>
+#include <string>
+#include <vector>
+
+namespace tavix {
+namespace {
+
+struct Item : RefCounted {
+  explicit Item(int v, int* destroyed = nullptr) : value(v), destroyed(destroyed) {}
+  ~Item() override {
+    if (destroyed) ++*destroyed;
+  }
+  int value;
+  int* destroyed;
+};
+
+std::vector<std::string> keysWithPrefix(CritbitTree& tree, const std::string& prefix) {
+  std::vector<std::string> keys;
+  tree.keysMatchingPrefix(prefix, [&](std::string_view key, bool*) { keys.emplace_back(key); });
+  return keys;
+}
+
+int countCalls(const char*, void* arg) {
+  ++*static_cast<int*>(arg);
+  return 1;
+}
+
+TEST(CritbitRecord, ResultCodesOfInsertContainsAndDelete) {
+  critbit_tree tree;
+  int a = 0, b = 0;
+  EXPECT_EQ(critbit_contains(&tree, "x", nullptr), 0);
+  EXPECT_EQ(critbit_delete(&tree, "x"), 0);
+  EXPECT_EQ(critbit_insert(&tree, "ab", &a, 1), 2);
+  EXPECT_EQ(critbit_insert(&tree, "abc", &a, 1), 2);
+  EXPECT_EQ(critbit_insert(&tree, "ab", &a, 1), 0);  // same value
+  EXPECT_EQ(critbit_insert(&tree, "ab", &b, 0), 1);  // different value, not replaced
+  void* out = nullptr;
+  ASSERT_EQ(critbit_contains(&tree, "ab", &out), 1);
+  EXPECT_EQ(out, &a);
+  EXPECT_EQ(critbit_insert(&tree, "ab", &b, 1), 1);
+  ASSERT_EQ(critbit_contains(&tree, "ab", &out), 1);
+  EXPECT_EQ(out, &b);
+  EXPECT_EQ(tree.count, 2u);
+  EXPECT_EQ(critbit_contains(&tree, "a", nullptr), 0);
+  EXPECT_EQ(critbit_contains(&tree, "abcd", nullptr), 0);
+
+  EXPECT_EQ(critbit_delete(&tree, "ab"), 1);
+  EXPECT_EQ(critbit_delete(&tree, "ab"), 0);
+  EXPECT_EQ(critbit_contains(&tree, "abc", nullptr), 1);
+  EXPECT_EQ(tree.count, 1u);
+  EXPECT_EQ(critbit_delete(&tree, "abc"), 1);
+  EXPECT_EQ(tree.root, 0u);
+  EXPECT_EQ(tree.count, 0u);
+  EXPECT_EQ(critbit_insert(&tree, "again", &a, 1), 2);
+  EXPECT_EQ(critbit_contains(&tree, "again", nullptr), 1);
+  critbit_clear(&tree);
+  EXPECT_EQ(tree.root, 0u);
+}
+
+TEST(CritbitRecord, NodesAreTaggedAndCriticalBitsMasked) {
+  critbit_tree tree;
+  int v = 0;
+  critbit_insert(&tree, "a", &v, 1);  // 0x61
+  EXPECT_EQ(tree.root & 1, 0u);       // a lone leaf
+  critbit_insert(&tree, "c", &v, 1);  // 0x63: differs from 0x61 in bit 0x02
+  ASSERT_EQ(tree.root & 1, 1u);
+  auto* node = reinterpret_cast<critbit_internal_node*>(tree.root - 1);
+  EXPECT_EQ(node->byte, 0u);
+  EXPECT_EQ(node->otherbits, 0xFD);
+  critbit_clear(&tree);
+}
+
+TEST(CritbitRecord, PrefixEnumerationResultCodes) {
+  critbit_tree tree;
+  int v = 0;
+  for (const char* k : {"", "a", "ab", "abc", "b"}) critbit_insert(&tree, k, &v, 1);
+  int calls = 0;
+  EXPECT_EQ(critbit_allprefixed(&tree, "ab", countCalls, &calls), 1);
+  EXPECT_EQ(calls, 2);
+  calls = 0;
+  EXPECT_EQ(critbit_allprefixed(&tree, "abcdef", countCalls, &calls), 1);
+  EXPECT_EQ(critbit_allprefixed(&tree, "zz", countCalls, &calls), 1);
+  EXPECT_EQ(calls, 0);
+  EXPECT_EQ(critbit_allprefixed(&tree, nullptr, countCalls, &calls), 1);
+  EXPECT_EQ(critbit_allprefixed(&tree, "", [](const char*, void*) { return 0; }, nullptr), 0);
+  EXPECT_EQ(critbit_allprefixed(&tree, "", [](const char*, void*) { return 7; }, nullptr), -1);
+  critbit_clear(&tree);
+}
+
+TEST(CritbitTree, HoldsExactlyOneReferencePerStoredValue) {
+  int destroyed = 0;
+  {
+    CritbitTree tree;
+    Ref<Item> first = makeRef<Item>(1, &destroyed);
+    tree.setObject(first, "key");
+    EXPECT_EQ(first->refCount(), 2u);
+    tree.setObject(first, "key");  // the same object again: nothing changes
+    EXPECT_EQ(first->refCount(), 2u);
+    EXPECT_EQ(tree.count(), 1u);
+
+    Ref<Item> second = makeRef<Item>(2, &destroyed);
+    tree.setObject(second, "key");
+    EXPECT_EQ(first->refCount(), 1u);  // released once by the replace
+    EXPECT_EQ(second->refCount(), 2u);
+    EXPECT_EQ(tree.count(), 1u);
+
+    Ref<RefCounted> fetched = tree.objectForKey("key");
+    EXPECT_EQ(fetched.get(), second.get());
+    EXPECT_EQ(second->refCount(), 3u);
+    EXPECT_EQ(tree.objectForKey("nope"), nullptr);
+
+    tree.setObject(makeRef<Item>(3, &destroyed), "other");
+    tree.setObject(makeRef<Item>(4, &destroyed), "gone");
+    tree.removeObjectForKey("gone");
+    EXPECT_EQ(destroyed, 1);
+    EXPECT_EQ(tree.count(), 2u);
+  }
+  // The tree's tear-down released "other"; the locals released the rest.
+  EXPECT_EQ(destroyed, 4);
+}
+
+TEST(CritbitTree, EnumeratesPrefixedKeysInAscendingByteOrder) {
+  CritbitTree tree;
+  const std::vector<std::string> keys = {"", "ab", "abc", "abd", "b", "\xC3\xA9t\xC3\xA9", "zz", "a"};
+  for (const auto& k : keys) tree.setObject(makeRef<Item>(0), k);
+  EXPECT_EQ(tree.count(), keys.size());
+
+  std::vector<std::string> all = keysWithPrefix(tree, "");
+  std::vector<std::string> sorted = keys;
+  std::sort(sorted.begin(), sorted.end());  // std::string compares as unsigned chars
+  EXPECT_EQ(all, sorted);
+  EXPECT_EQ(all.front(), "");
+  EXPECT_EQ(all.back(), "\xC3\xA9t\xC3\xA9");  // bytes above 0x7F after ASCII
+
+  EXPECT_EQ(keysWithPrefix(tree, "ab"), (std::vector<std::string>{"ab", "abc", "abd"}));
+  EXPECT_TRUE(keysWithPrefix(tree, "abcde").empty());
+  EXPECT_TRUE(keysWithPrefix(tree, "c").empty());
+
+  std::vector<std::string> first;
+  tree.keysMatchingPrefix("", [&](std::string_view key, bool* stop) {
+    first.emplace_back(key);
+    *stop = true;
+  });
+  EXPECT_EQ(first, std::vector<std::string>{""});
+
+  tree.removeObjectForKey("ab");
+  EXPECT_EQ(keysWithPrefix(tree, "ab"), (std::vector<std::string>{"abc", "abd"}));
+  tree.removeAllObjects();
+  EXPECT_EQ(tree.count(), 0u);
+  EXPECT_TRUE(keysWithPrefix(tree, "").empty());
+}
+
+// Random inserts and deletes against std::map: catches splice and delete faults that hand-picked
+// keys miss.
+TEST(CritbitTree, AgreesWithStdMapUnderRandomChurn) {
+  std::mt19937 rng(42);
+  std::uniform_int_distribution<int> len(0, 6);
+  std::uniform_int_distribution<int> ch(0, 5);
+  const char alphabet[] = {'a', 'b', 'c', '\x7F', '\x80', '\xFF'};
+  CritbitTree tree;
+  std::map<std::string, int> model;
+  for (int i = 0; i < 4000; ++i) {
+    std::string key;
+    for (int n = len(rng); n > 0; --n) key.push_back(alphabet[ch(rng)]);
+    if (rng() % 3 == 0) {
+      tree.removeObjectForKey(key);
+      model.erase(key);
+    } else {
+      tree.setObject(makeRef<Item>(i), key);
+      model[key] = i;
+    }
+  }
+  ASSERT_EQ(tree.count(), model.size());
+  for (const auto& [key, value] : model) {
+    Ref<RefCounted> got = tree.objectForKey(key);
+    ASSERT_TRUE(got) << key;
+    EXPECT_EQ(static_cast<Item*>(got.get())->value, value);
+  }
+  for (const std::string prefix : {"", "a", "ab", "\x80", "\xFF\xFF", "cab"}) {
+    std::vector<std::string> expected;
+    for (auto it = model.lower_bound(prefix); it != model.end() && it->first.compare(0, prefix.size(), prefix) == 0; ++it)
+      expected.push_back(it->first);
+    EXPECT_EQ(keysWithPrefix(tree, prefix), expected) << prefix;
+  }
+}
+
+}  // namespace
+}  // namespace tavix

@@ -1,0 +1,676 @@
+#include "cache/engaged_completion_cache.h"
+
+#include <sqlite3.h>
+#include <unicode/brkiter.h>
+#include <unicode/locid.h>
+#include <unicode/normalizer2.h>
+#include <unicode/translit.h>
+#include <unicode/unistr.h>
+
+#include <chrono>
+#include <condition_variable>
+#include <cstdio>
+#include <cstdlib>
+
+#include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "core/logging.h"
+#include "platform/defaults.h"
+#include "platform/log.h"
+
+namespace tavix {
+namespace {
+
+// This store writes to the default log rather than to one of the daemon's categories.
+platform::Logger& eccLog() {
+  static platform::Logger logger(kTavixLogSubsystem, "default");
+  return logger;
+}
+
+constexpr const char* kDatabaseDirName = "EngagedCompletions";
+constexpr const char* kDatabaseFileName = "Cache.db";
+// Read-write, create, full mutex. Linux has no file-protection classes to add.
+constexpr int kOpenFlags = 0x10006;
+constexpr std::int64_t kMaxAgeSeconds = 2592000;  // 30 days
+constexpr const char* kRangeEnd = "\xEF\xBF\xAE";  // U+FFEE: sorts after any text that follows a prefix
+constexpr const char* kEntriesCounterKey = "com.norvel.tavixd.brovane.localCompletionIndex.entries";
+constexpr const char* kSizeCounterKey = "com.norvel.tavixd.brovane.localCompletionIndex.size";
+
+constexpr const char* kSelectFormat =
+    "SELECT completion, origin, SUM(CASE WHEN engagement_date > ? THEN %f WHEN engagement_date > ? then %f WHEN  "
+    "engagement_date > ? THEN %f WHEN engagement_date > ? THEN %f WHEN engagement_date > ? THEN %f ELSE 0 END) + (%f "
+    "* MAX(engagement_date) / ?) AS score FROM completion_cache_engagement WHERE (input between %s and %s OR "
+    "transformed between %s and %s) AND client == ? GROUP BY completion ORDER BY score DESC LIMIT %lu";
+
+constexpr const char* kFeatureCountFormat =
+    "SELECT F, count(*) from (SELECT completion, CASE WHEN engagement_date > ? THEN 'h' WHEN engagement_date > ? "
+    "then 'd' WHEN  engagement_date > ? THEN 'w' WHEN engagement_date > ? THEN 'm' WHEN engagement_date > ? THEN 'y' "
+    "END AS F FROM completion_cache_engagement WHERE (input between %s and %s OR transformed between %s and %s) AND "
+    "client == ?) group by F LIMIT 1";
+
+constexpr std::int64_t kBuckets[] = {3600, 86400, 604800, 2592000, 31536000};
+
+// Turns each "%q" of an already formatted statement into a positional parameter.
+std::string positional(const char* sql) {
+  char* out = sqlite3_mprintf(sql, "?", "?", "?", "?", "?", "?");
+  if (!out) return {};
+  std::string result(out);
+  sqlite3_free(out);
+  return result;
+}
+
+// Far enough back for any stored date, near enough to fit the clock's nanosecond range.
+platform::TimePoint distantPast() { return platform::fromUnixSeconds(-3.0e9); }
+
+std::int64_t wholeSeconds(platform::TimePoint t) { return static_cast<std::int64_t>(platform::toUnixSeconds(t)); }
+
+std::string dateText(platform::TimePoint t) { return std::to_string(wholeSeconds(t)); }
+
+bool isCorruption(int rc) { return rc == SQLITE_IOERR || rc == SQLITE_CORRUPT || rc == SQLITE_NOTADB; }
+
+// UTF-16 code-unit classes.
+bool isKanji(char16_t u) { return (u >= 0x2E80 && u <= 0x2EFF) || (u >= 0x2F00 && u <= 0x2FDF) || (u >= 0x4E00 && u <= 0x9FAF); }
+bool isKatakana(char16_t u) { return (u >= 0x30A0 && u <= 0x30FF && u != 0x30FB) || (u >= 0xFF66 && u <= 0xFF9F); }
+bool isHiragana(char16_t u) { return u >= 0x3040 && u <= 0x309F; }
+
+template <typename Pred>
+bool anyUnit(const std::string& text, Pred pred) {
+  icu::UnicodeString s = icu::UnicodeString::fromUTF8(text);
+  for (int32_t i = 0; i < s.length(); ++i) {
+    if (pred(s.charAt(i))) return true;
+  }
+  return false;
+}
+
+// ICU transliterators are costly to build and not safe to share unguarded: one of each, locked.
+struct Transform {
+  explicit Transform(const char* id) {
+    UErrorCode status = U_ZERO_ERROR;
+    translit.reset(icu::Transliterator::createInstance(id, UTRANS_FORWARD, status));
+    if (U_FAILURE(status)) translit.reset();
+  }
+  void apply(icu::UnicodeString& s) {
+    if (!translit) return;
+    std::lock_guard<std::mutex> guard(lock);
+    translit->transliterate(s);
+  }
+  std::mutex lock;
+  std::unique_ptr<icu::Transliterator> translit;
+};
+
+Transform& stripDiacritics() {
+  static Transform t("NFD; [:Nonspacing Mark:] Remove; NFC");
+  return t;
+}
+
+Transform& latinToHiragana() {
+  static Transform t("Any-Latin; Latin-Hiragana");
+  return t;
+}
+
+std::string toUTF8(const icu::UnicodeString& s) {
+  std::string out;
+  s.toUTF8String(out);
+  return out;
+}
+
+// A statement that finalises itself.
+struct Statement {
+  sqlite3_stmt* stmt = nullptr;
+  ~Statement() { sqlite3_finalize(stmt); }
+};
+
+}  // namespace
+
+// Text helpers
+
+bool EngagedCompletionCache::containsJapanese(const std::string& text) {
+  return anyUnit(text, [](char16_t u) { return isKanji(u) || isKatakana(u) || isHiragana(u); });
+}
+
+bool EngagedCompletionCache::containsKanjiOrKatakana(const std::string& text) {
+  return anyUnit(text, [](char16_t u) { return isKanji(u) || isKatakana(u); });
+}
+
+std::string EngagedCompletionCache::kanize(const std::string& text) {
+  icu::UnicodeString s = icu::UnicodeString::fromUTF8(text);
+  UErrorCode status = U_ZERO_ERROR;
+  std::unique_ptr<icu::BreakIterator> words(icu::BreakIterator::createWordInstance(icu::Locale::getDefault(), status));
+  if (U_FAILURE(status) || !words) return {};
+  words->setText(s);
+  icu::UnicodeString reading;
+  for (int32_t start = words->first(), end = words->next(); end != icu::BreakIterator::DONE;
+       start = end, end = words->next()) {
+    icu::UnicodeString token(s, start, end - start);
+    if (!anyUnit(toUTF8(token), isKanji)) latinToHiragana().apply(token);
+    reading += token;
+  }
+  return toUTF8(reading);
+}
+
+std::string EngagedCompletionCache::normalizeString(const std::string& text) {
+  if (containsJapanese(text)) return text;
+  icu::UnicodeString s = icu::UnicodeString::fromUTF8(text);
+  s.toLower(icu::Locale::getRoot());
+  stripDiacritics().apply(s);
+  UErrorCode status = U_ZERO_ERROR;
+  const icu::Normalizer2* nfkd = icu::Normalizer2::getNFKDInstance(status);
+  if (U_FAILURE(status)) return {};
+  icu::UnicodeString decomposed = nfkd->normalize(s, status);
+  if (U_FAILURE(status)) return {};
+  return toUTF8(decomposed);
+}
+
+std::int64_t EngagedCompletionCache::significantValueFromString(const std::string& digits) {
+  std::string kept = digits;
+  for (std::size_t i = 2; i < kept.size(); ++i) kept[i] = '0';
+  return std::strtoll(kept.c_str(), nullptr, 10);
+}
+
+// Life cycle
+
+std::shared_ptr<EngagedCompletionCache> EngagedCompletionCache::create(Environment env) {
+  std::shared_ptr<EngagedCompletionCache> cache(new EngagedCompletionCache(std::move(env)));
+  cache->warmup();
+  return cache;
+}
+
+std::shared_ptr<EngagedCompletionCache> EngagedCompletionCache::sharedInstance(const Assembly& assembly) {
+  static std::once_flag once;
+  static std::shared_ptr<EngagedCompletionCache> instance;
+  std::call_once(once, [&] {
+    instance = create(Environment{assembly.cachesFolder(), assembly.clock, assembly.dispatchPool,
+                                  assembly.userDefaults.get()});
+  });
+  return instance;
+}
+
+EngagedCompletionCache::EngagedCompletionCache(Environment env)
+    : env_(std::move(env)),
+      databaseDirPath_((env_.storagePath / kDatabaseDirName).string()),
+      databasePath_((env_.storagePath / kDatabaseDirName / kDatabaseFileName).string()),
+      updateQueue_(*env_.pool, "com.norvel.tavixd.eccupdateq") {
+  createOrUpdateDatabaseIfNeeded();
+}
+
+EngagedCompletionCache::~EngagedCompletionCache() { closeDBConnection(); }
+
+void EngagedCompletionCache::warmup() {
+  // Loads the transform machinery before the first real search needs it.
+  env_.pool->post([] { normalizeString("warmup"); });
+}
+
+bool EngagedCompletionCache::cacheEnabled() const {
+  return !(env_.defaults && env_.defaults->boolForKey("TVXDisableLocalCompletions"));
+}
+
+sqlite3* EngagedCompletionCache::handle() const {
+  std::lock_guard<std::mutex> guard(dbLock_);
+  return completionsDB_;
+}
+
+void EngagedCompletionCache::closeDBConnection() {
+  std::lock_guard<std::mutex> guard(dbLock_);
+  if (completionsDB_) sqlite3_close_v2(completionsDB_);
+  completionsDB_ = nullptr;
+}
+
+// Schema upkeep
+
+void EngagedCompletionCache::createOrUpdateDatabaseIfNeeded() {
+  std::error_code ec;
+  if (platform::fs::exists(databasePath_, ec)) {
+    openDatabaseConnection();
+    if (!isSchemaCurrent()) setDBSchema();
+    return;
+  }
+  if (!platform::fs::is_directory(databaseDirPath_, ec)) {
+    if (platform::createDirectory(databaseDirPath_, true)) {
+      eccLog().error("Failed to create database dir: {}", databaseDirPath_);
+      return;
+    }
+  }
+  openDatabaseConnection();
+  setDBSchema();
+}
+
+void EngagedCompletionCache::openDatabaseConnection() {
+  std::lock_guard<std::mutex> guard(dbLock_);
+  if (completionsDB_) {
+    eccLog().notice("Closing existing Completions database connection");
+    sqlite3_close_v2(completionsDB_);
+    completionsDB_ = nullptr;
+  }
+  sqlite3* db = nullptr;
+  int rc = sqlite3_open_v2(databasePath_.c_str(), &db, kOpenFlags, nullptr);
+  if (rc == SQLITE_OK) {
+    eccLog().notice("Completions database opened: {}", databasePath_);
+    completionsDB_ = db;
+    return;
+  }
+  if (rc == SQLITE_CORRUPT) {
+    // Keep the handle; the schema is rebuilt right away by the caller's schema check.
+    completionsDB_ = db;
+    schemaVersion_ = 0;
+    return;
+  }
+  eccLog().error("Failed to open completions database: {} error={} cause={}", databasePath_, rc,
+                 db ? sqlite3_errmsg(db) : sqlite3_errstr(rc));
+  sqlite3_close_v2(db);
+}
+
+bool EngagedCompletionCache::isSchemaCurrent() {
+  if (schemaVersion_ == kSchemaVersion) return true;
+  sqlite3* db = completionsDB_;
+  if (!db) return false;
+  char** table = nullptr;
+  int rows = 0, columns = 0;
+  int rc = sqlite3_get_table(db, "SELECT schema_version from completion_cache_schema_version", &table, &rows,
+                             &columns, nullptr);
+  if (rc == SQLITE_OK) {
+    bool current = false;
+    if ((rows == 1 || columns == 1) && rows >= 1 && table[columns]) {
+      schemaVersion_ = static_cast<int>(std::strtol(table[columns], nullptr, 10));
+      current = schemaVersion_ == kSchemaVersion;
+    }
+    sqlite3_free_table(table);
+    return current;
+  }
+  sqlite3_free_table(table);
+  if (rc == SQLITE_BUSY) return true;
+  eccLog().error("Engaged completion cache schema version read failed");
+  // A file that is not a database (or one damaged beyond reading its own schema) cannot be
+  // rebuilt in place: start over with an empty file.
+  if (isCorruption(rc)) {
+    deleteDatabase();
+    openDatabaseConnection();
+  }
+  return false;
+}
+
+bool EngagedCompletionCache::execSQLStatement(const std::string& sql) {
+  char* message = nullptr;
+  int rc = sqlite3_exec(completionsDB_, sql.c_str(), nullptr, nullptr, &message);
+  if (rc != SQLITE_OK) {
+    eccLog().error("_execSQLStatement failed - SQL:{} error-code: {} error-message: {}", sql, rc,
+                   message ? message : "");
+  }
+  sqlite3_free(message);
+  return rc == SQLITE_OK;
+}
+
+void EngagedCompletionCache::setDBSchema() {
+  if (!completionsDB_) return;
+  struct Step {
+    const char* sql;
+    const char* failure;
+  };
+  static constexpr Step steps[] = {
+      {"PRAGMA auto_vacuum = 2;", "Error _setDBSchema pragma auto_vacum"},
+      {"DROP table IF EXISTS completion_cache_schema_version;", "Error _setDBSchema drop schema table"},
+      {"CREATE table completion_cache_schema_version(schema_version INT);", "Error _setDBSchema create schema table"},
+      {"DROP table IF EXISTS completion_cache_engagement;", "Error _setDBSchema drop completion_cache_engagement table"},
+      {"CREATE TABLE IF NOT EXISTS completion_cache_engagement(completion TEXT, input TEXT, engagement_date INT, "
+       "origin TEXT, client INT, transformed TEXT);",
+       "Error _setDBSchema create completion_cache_engagement table"},
+      {"CREATE INDEX transformed_index ON completion_cache_engagement(transformed);",
+       "Error _setDBSchema table completion_cache_engagement create index (transformed)"},
+      {"CREATE INDEX input_index ON completion_cache_engagement(input);",
+       "Error _setDBSchema table completion_cache_engagement create index (input)"},
+  };
+  for (const Step& step : steps) {
+    if (!execSQLStatement(step.sql)) eccLog().error("{}", step.failure);
+  }
+  char* insert = sqlite3_mprintf("INSERT INTO completion_cache_schema_version VALUES (%d)", kSchemaVersion);
+  if (!insert) {
+    eccLog().error("Error _setDBSchema alloc schema version string");
+    return;
+  }
+  if (!execSQLStatement(insert)) eccLog().error("Error _setDBSchema insert schema version string");
+  sqlite3_free(insert);
+}
+
+void EngagedCompletionCache::deleteDatabase() {
+  closeDBConnection();
+  std::error_code ec;
+  for (const char* suffix : {"", "-journal", "-wal", "-shm"}) platform::fs::remove(databasePath_ + suffix, ec);
+  schemaVersion_ = 0;
+}
+
+void EngagedCompletionCache::rebuildCorruptDatabase() {
+  // The rows are lost either way; a fresh file is the only rebuild that works whatever the damage.
+  deleteDatabase();
+  createOrUpdateDatabaseIfNeeded();
+}
+
+// Parameters
+
+void EngagedCompletionCache::updateParameters(const EngagedCompletionParameters& p) {
+  updateQueue_.sync([&] {
+    {
+      std::lock_guard<std::mutex> guard(parametersLock_);
+      parameters_ = p;
+    }
+    eccLog().debug(
+        "EngagedCompletionCache updateParameters: (1h {:f}) (1d {:f}) (7d {:f}) (1m {:f}) (all {:f}) (recent {:f}) "
+        "(t {:f})",
+        p.last1hour, p.last1day, p.last1week, p.last1month, p.all, p.mostRecent, p.minThresholdToSend);
+  });
+}
+
+EngagedCompletionParameters EngagedCompletionCache::parameters() const {
+  std::lock_guard<std::mutex> guard(parametersLock_);
+  return parameters_;
+}
+
+// Adding
+
+std::int64_t EngagedCompletionCache::countRows(const std::string& sql, bool* ok) {
+  Statement s;
+  *ok = false;
+  sqlite3* db = handle();
+  if (!db || sqlite3_prepare_v2(db, sql.c_str(), -1, &s.stmt, nullptr) != SQLITE_OK) return 0;
+  if (sqlite3_step(s.stmt) != SQLITE_ROW) return 0;
+  *ok = true;
+  return sqlite3_column_int64(s.stmt, 0);
+}
+
+std::int64_t EngagedCompletionCache::rowCountForClient(unsigned long client) {
+  bool ok = false;
+  std::int64_t n =
+      countRows("SELECT Count(*) FROM completion_cache_engagement WHERE client == " + std::to_string(client) + ";", &ok);
+  return ok ? n : -1;
+}
+
+void EngagedCompletionCache::deleteOldestEngagements(unsigned long limit, unsigned long client) {
+  std::string sql = "SELECT engagement_date FROM completion_cache_engagement WHERE client == " + std::to_string(client) +
+                    " ORDER BY engagement_date DESC LIMIT 1 OFFSET " + std::to_string(limit) + " ;";
+  Statement s;
+  if (sqlite3_prepare_v2(handle(), sql.c_str(), -1, &s.stmt, nullptr) != SQLITE_OK ||
+      sqlite3_step(s.stmt) != SQLITE_ROW) {
+    // With exactly `limit` rows there is no such row: the client holds limit + 1 until next time.
+    eccLog().error("Failed to get engagement_date of max row item");
+    return;
+  }
+  auto date = platform::fromUnixSeconds(static_cast<double>(sqlite3_column_int64(s.stmt, 0)));
+  clearCompletionsFromDate(distantPast(), date, client);
+}
+
+void EngagedCompletionCache::addCompletion(const std::string& completion, const std::string& input, int origin,
+                                           unsigned long client, unsigned long maxRows) {
+  if (!cacheEnabled() || completion.empty() || !handle()) return;
+
+  const platform::TimePoint now = env_.clock->now();
+  clearAllClientCompletionsFromDate(distantPast(), now - platform::seconds(kMaxAgeSeconds));
+
+  const unsigned long limit = maxRows == 0 ? kDefaultMaxRows : maxRows;
+  std::int64_t rows = rowCountForClient(client);
+  eccLog().debug("Number of completion in cache: {}", rows);
+  if (rows >= 0 && static_cast<unsigned long>(rows) >= limit) deleteOldestEngagements(limit, client);
+
+  char* sql = sqlite3_mprintf(
+      "INSERT INTO completion_cache_engagement (completion, input, engagement_date, origin, client, transformed) "
+      "VALUES (%q, %q, %q, %q, %q, %q)",
+      "?", "?", "?", "?", "?", "?");
+  Statement s;
+  int rc = sqlite3_prepare_v2(handle(), sql, -1, &s.stmt, nullptr);
+  if (rc != SQLITE_OK) {
+    eccLog().error("_prepareInsertStatement failed - SQL:{} code: {}", sql, rc);
+    sqlite3_free(sql);
+    if (isCorruption(rc)) {
+      eccLog().error("Corrupt db error while adding completion {}, rebuilding schema", completion);
+      rebuildCorruptDatabase();
+    }
+    return;
+  }
+  sqlite3_free(sql);
+
+  const std::string transformed = normalizeString(completion);
+  if (transformed.empty()) return;
+  eccLog().debug("Adding completion: {} input: {} transformed: {}", completion, input, transformed);
+
+  const char* originText = (origin == 1 || origin == 3) ? "se" : origin == 2 ? "3d" : "";
+  sqlite3_bind_text(s.stmt, 1, completion.c_str(), -1, SQLITE_TRANSIENT);
+  sqlite3_bind_text(s.stmt, 2, input.c_str(), -1, SQLITE_TRANSIENT);
+  sqlite3_bind_int(s.stmt, 3, static_cast<std::int32_t>(wholeSeconds(now)));
+  sqlite3_bind_text(s.stmt, 4, originText, -1, SQLITE_STATIC);
+  sqlite3_bind_int64(s.stmt, 5, static_cast<sqlite3_int64>(client));
+  sqlite3_bind_text(s.stmt, 6, transformed.c_str(), -1, SQLITE_TRANSIENT);
+  rc = sqlite3_step(s.stmt);
+  if (rc != SQLITE_DONE) {
+    if (isCorruption(rc)) {
+      eccLog().error("Corrupt db error while adding completion {}, rebuilding schema", completion);
+      sqlite3_finalize(s.stmt);
+      s.stmt = nullptr;
+      rebuildCorruptDatabase();
+    } else {
+      eccLog().error("Failed to add completion: {}", completion);
+    }
+  } else {
+    eccLog().debug("Completion added: {} input {}", completion, input);
+  }
+  sqlite3_finalize(s.stmt);
+  s.stmt = nullptr;
+  performCounterLogging();
+}
+
+// Searching
+
+std::vector<TVXSearchSuggestion> EngagedCompletionCache::runSearch(const std::string& input, unsigned long client,
+                                                                   unsigned long count) {
+  std::vector<TVXSearchSuggestion> found;
+  const auto started = std::chrono::steady_clock::now();
+  const EngagedCompletionParameters p = parameters();
+  char formatted[1024];
+  std::snprintf(formatted, sizeof formatted, kSelectFormat, p.last1hour, p.last1day, p.last1week, p.last1month, p.all,
+                p.mostRecent, "%q", "%q", "%q", "%q", count);
+  const std::string sql = positional(formatted);
+  sqlite3* db = handle();
+  if (!db) return found;
+  Statement s;
+  int rc = sqlite3_prepare_v2(db, sql.c_str(), -1, &s.stmt, nullptr);
+  if (rc != SQLITE_OK) {
+    eccLog().error("_prepareSelectStatement failed - SQL:{} code: {}", sql, rc);
+    return found;
+  }
+  const std::int64_t now = wholeSeconds(env_.clock->now());
+  for (int i = 0; i < 5; ++i) sqlite3_bind_int(s.stmt, i + 1, static_cast<std::int32_t>(now - kBuckets[i]));
+  sqlite3_bind_int(s.stmt, 6, static_cast<std::int32_t>(now));
+  const std::string normalized = normalizeString(input);
+  if (normalized.empty()) return found;
+  sqlite3_bind_text(s.stmt, 7, input.c_str(), -1, SQLITE_TRANSIENT);
+  sqlite3_bind_text(s.stmt, 8, (input + kRangeEnd).c_str(), -1, SQLITE_TRANSIENT);
+  sqlite3_bind_text(s.stmt, 9, normalized.c_str(), -1, SQLITE_TRANSIENT);
+  sqlite3_bind_text(s.stmt, 10, (normalized + kRangeEnd).c_str(), -1, SQLITE_TRANSIENT);
+  sqlite3_bind_int64(s.stmt, 11, static_cast<sqlite3_int64>(client));
+  while (sqlite3_step(s.stmt) == SQLITE_ROW) {
+    TVXSearchSuggestion suggestion;
+    const auto* text = reinterpret_cast<const char*>(sqlite3_column_text(s.stmt, 0));
+    const auto* origin = reinterpret_cast<const char*>(sqlite3_column_text(s.stmt, 1));
+    suggestion.suggestion = text ? text : "";
+    const std::string originText = origin ? origin : "";
+    suggestion.type = originText == "se" ? 1 : originText == "3d" ? 8 : 0;
+    suggestion.score = sqlite3_column_double(s.stmt, 2);
+    suggestion.query = input;
+    auto elapsed =
+        std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - started).count();
+    eccLog().debug("Match found input {}, completion {}, score {:f} duration {}", input, suggestion.suggestion,
+                   suggestion.score, elapsed);
+    found.push_back(std::move(suggestion));
+  }
+  return found;
+}
+
+std::optional<std::vector<TVXSearchSuggestion>> EngagedCompletionCache::completionsForInput(const std::string& input,
+                                                                                           unsigned long client,
+                                                                                           unsigned long count,
+                                                                                           unsigned long timeoutMs) {
+  if (!cacheEnabled() || !handle()) return std::nullopt;
+
+  // Shared with the search block, which may finish after we stopped waiting for it.
+  struct Wait {
+    std::mutex lock;
+    std::condition_variable done;
+    bool finished = false;
+    std::vector<TVXSearchSuggestion> results;
+  };
+  auto wait = std::make_shared<Wait>();
+  std::weak_ptr<EngagedCompletionCache> weak = weak_from_this();
+  env_.pool->post([weak, wait, input, client, count] {
+    std::vector<TVXSearchSuggestion> results;
+    if (auto self = weak.lock()) results = self->runSearch(input, client, count);
+    std::lock_guard<std::mutex> guard(wait->lock);
+    wait->results = std::move(results);
+    wait->finished = true;
+    wait->done.notify_all();
+  });
+
+  std::unique_lock<std::mutex> guard(wait->lock);
+  if (!wait->done.wait_for(guard, std::chrono::milliseconds(timeoutMs), [&] { return wait->finished; })) {
+    eccLog().debug("EngagedCompletionCache search timed out for input {} timeout value {}", input, timeoutMs);
+    return std::nullopt;
+  }
+  const double threshold = parameters().minThresholdToSend;
+  std::vector<TVXSearchSuggestion> results;
+  for (auto& s : wait->results) {
+    if (s.score >= threshold) results.push_back(s);
+  }
+  return results;
+}
+
+std::optional<TVXSearchSuggestion> EngagedCompletionCache::completionForInput(const std::string& input,
+                                                                             unsigned long client) {
+  auto results = completionsForInput(input, client, 1);
+  if (!results || results->empty()) return std::nullopt;
+  return results->front();
+}
+
+void EngagedCompletionCache::featureCountsForInput(const std::string& input, unsigned long client,
+                                                   std::function<void(std::map<std::string, std::int64_t>)> completion) {
+  if (!cacheEnabled() || !handle()) return;
+  std::weak_ptr<EngagedCompletionCache> weak = weak_from_this();
+  env_.pool->post([weak, input, client, completion = std::move(completion)] {
+    auto self = weak.lock();
+    if (!self) return;
+    std::map<std::string, std::int64_t> counts;
+    sqlite3* db = self->handle();
+    Statement s;
+    const std::string sql = positional(kFeatureCountFormat);
+    if (db && sqlite3_prepare_v2(db, sql.c_str(), -1, &s.stmt, nullptr) == SQLITE_OK) {
+      const std::int64_t now = wholeSeconds(self->env_.clock->now());
+      for (int i = 0; i < 5; ++i) sqlite3_bind_int(s.stmt, i + 1, static_cast<std::int32_t>(now - kBuckets[i]));
+      const std::string normalized = normalizeString(input);
+      sqlite3_bind_text(s.stmt, 6, input.c_str(), -1, SQLITE_TRANSIENT);
+      sqlite3_bind_text(s.stmt, 7, (input + kRangeEnd).c_str(), -1, SQLITE_TRANSIENT);
+      sqlite3_bind_text(s.stmt, 8, normalized.c_str(), -1, SQLITE_TRANSIENT);
+      sqlite3_bind_text(s.stmt, 9, (normalized + kRangeEnd).c_str(), -1, SQLITE_TRANSIENT);
+      sqlite3_bind_int64(s.stmt, 10, static_cast<sqlite3_int64>(client));
+      while (sqlite3_step(s.stmt) == SQLITE_ROW) {
+        const auto* letter = reinterpret_cast<const char*>(sqlite3_column_text(s.stmt, 0));
+        counts[letter ? letter : ""] = sqlite3_column_int64(s.stmt, 1);
+      }
+    }
+    if (completion) completion(std::move(counts));
+  });
+}
+
+// Clearing
+
+namespace {
+
+bool runToDone(sqlite3* db, const std::string& sql) {
+  Statement s;
+  if (!db || sqlite3_prepare_v2(db, sql.c_str(), -1, &s.stmt, nullptr) != SQLITE_OK) return false;
+  return sqlite3_step(s.stmt) == SQLITE_DONE;
+}
+
+void widenIfEqual(platform::TimePoint& from, platform::TimePoint& to) {
+  if (from == to) {
+    from -= platform::seconds(5);
+    to += platform::seconds(5);
+  }
+}
+
+}  // namespace
+
+void EngagedCompletionCache::clearCompletionsFromDate(platform::TimePoint from, platform::TimePoint to,
+                                                      unsigned long client) {
+  sqlite3* db = handle();
+  if (!db) return;
+  widenIfEqual(from, to);
+  const std::string sql = "DELETE FROM completion_cache_engagement WHERE engagement_date >= " + dateText(from) +
+                          " AND engagement_date <= " + dateText(to) + " AND client == " + std::to_string(client) + ";";
+  if (runToDone(db, sql)) {
+    eccLog().debug("Cleared completions fromDate:{} toDate:{}", dateText(from), dateText(to));
+  } else {
+    eccLog().error("Failed to clear all completions");
+  }
+}
+
+void EngagedCompletionCache::clearAllClientCompletionsFromDate(platform::TimePoint from, platform::TimePoint to) {
+  sqlite3* db = handle();
+  if (!db) return;
+  widenIfEqual(from, to);
+  const std::string sql = "DELETE FROM completion_cache_engagement WHERE engagement_date >= " + dateText(from) +
+                          " AND engagement_date <= " + dateText(to) + ";";
+  if (runToDone(db, sql)) {
+    eccLog().debug("Cleared completions fromDate:{} toDate:{} for all clients", dateText(from), dateText(to));
+  } else {
+    eccLog().error("Failed to clearcompletions fromDate:{} toDate:{} for all clients", dateText(from), dateText(to));
+  }
+}
+
+void EngagedCompletionCache::clearAllCompletionsForClient(unsigned long client) {
+  sqlite3* db = handle();
+  if (!db) return;
+  if (runToDone(db,
+                "DELETE FROM completion_cache_engagement WHERE client == " + std::to_string(client) + ";")) {
+    eccLog().notice("Cleared completions for client {}", client);
+  } else {
+    eccLog().error("Failed to clear completions for client {}", client);
+  }
+}
+
+void EngagedCompletionCache::clearAllCompletions() {
+  sqlite3* db = handle();
+  if (!db) return;
+  if (runToDone(db, "DELETE FROM completion_cache_engagement;")) {
+    eccLog().notice("Cleared all completions");
+  } else {
+    eccLog().error("Failed to clear all completions");
+  }
+}
+
+void EngagedCompletionCache::seekaraDidClearSuggestions() {
+  eccLog().notice("suggestions cleared notification received from Seekara, clearing EngagedCompletionCache");
+  clearAllCompletions();
+}
+
+// Statistics
+
+void EngagedCompletionCache::performCounterLogging() {
+  if (!handle()) return;
+  bool ok = false;
+  std::int64_t entries = countRows("SELECT Count(*) FROM completion_cache_engagement;", &ok);
+  if (!ok) {
+    eccLog().error("Failed to get number of entries in engaged completion cache");
+    entries = 0;
+  }
+  eccLog().debug("Number of completion in cache: {}", entries);
+  if (entries >= 1) {
+    std::int64_t value = significantValueFromString(std::to_string(entries));
+    TavixDiagnosticDataReporter::setValue(value, kEntriesCounterKey);
+    eccLog().debug("Counter logging {}: {}", kEntriesCounterKey, value);
+  }
+  std::error_code ec;
+  auto size = platform::fs::file_size(databasePath_, ec);
+  if (ec) {
+    eccLog().error("Failed retrieving engaged completion cache db file size");
+    return;
+  }
+  std::int64_t value = significantValueFromString(std::to_string(size));
+  TavixDiagnosticDataReporter::setValue(value, kSizeCounterKey);
+  eccLog().debug("Counter logging {}: {}", kSizeCounterKey, value);
+}
+
+}  // namespace tavix

@@ -1,0 +1,281 @@
+#include "cache/engaged_completion_cache.h"
+
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+
+#include <fstream>
+#include <future>
+#include <set>
+
+#include "core/diagnostics.h"
+#include "platform/counters.h"
+#include "platform/defaults.h"
+#include "platform/log.h"
+#include "support/temp_home.h"
+
+namespace tavix {
+namespace {
+
+using platform::seconds;
+
+class EngagedCompletionCacheTest : public ::testing::Test {
+ protected:
+  EngagedCompletionCacheTest()
+      : pool_(2), defaults_(home_.config(), "com.norvel.tavixd") {}
+
+  std::shared_ptr<EngagedCompletionCache> open() {
+    return EngagedCompletionCache::create({home_.cache() / "com.norvel.tavixd", &clock_, &pool_, &defaults_});
+  }
+
+  // Every completion found for `input`, in result order. Generous time-out: these tests are
+  // about what is found, not how fast.
+  std::vector<TVXSearchSuggestion> find(EngagedCompletionCache& cache, const std::string& input,
+                                        unsigned long client = 0) {
+    auto results = cache.completionsForInput(input, client, 10, 2000);
+    return results ? *results : std::vector<TVXSearchSuggestion>{};
+  }
+
+  std::vector<std::string> names(const std::vector<TVXSearchSuggestion>& found) {
+    std::vector<std::string> out;
+    for (const auto& s : found) out.push_back(s.suggestion);
+    return out;
+  }
+
+  testing::TempHome home_;
+  platform::DispatchPool pool_;
+  platform::VirtualClock clock_;
+  platform::UserDefaults defaults_;
+};
+
+// Reads sqlite_master of a database file through a second connection.
+std::set<std::string> schemaObjects(const std::string& path) {
+  std::set<std::string> objects;
+  sqlite3* db = nullptr;
+  sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READONLY, nullptr);
+  sqlite3_stmt* s = nullptr;
+  if (sqlite3_prepare_v2(db, "SELECT type, name FROM sqlite_master ORDER BY name", -1, &s, nullptr) == SQLITE_OK) {
+    while (sqlite3_step(s) == SQLITE_ROW)
+      objects.insert(std::string(reinterpret_cast<const char*>(sqlite3_column_text(s, 0))) + " " +
+                     reinterpret_cast<const char*>(sqlite3_column_text(s, 1)));
+  }
+  sqlite3_finalize(s);
+  sqlite3_close(db);
+  return objects;
+}
+
+TEST_F(EngagedCompletionCacheTest, CreatesTheVersionedSchemaInTheCachesFolder) {
+  auto cache = open();
+  const std::string expected = (home_.cache() / "com.norvel.tavixd/EngagedCompletions/Cache.db").string();
+  EXPECT_EQ(cache->databasePath(), expected);
+  EXPECT_EQ(schemaObjects(expected),
+            (std::set<std::string>{"index input_index", "index transformed_index",
+                                   "table completion_cache_engagement", "table completion_cache_schema_version"}));
+  cache->addCompletion("kept", "ke");
+  cache.reset();
+
+  // Reopening a current schema keeps the rows.
+  cache = open();
+  EXPECT_EQ(cache->rowCountForClient(0), 1);
+}
+
+TEST_F(EngagedCompletionCacheTest, FindsCompletionsByTypedInputOrNormalisedCompletion) {
+  auto cache = open();
+  cache->addCompletion("Café Rouge", "Cafe", 1);
+  cache->addCompletion("camera", "cam", 2);
+  cache->addCompletion("carrot", "car", 0, 1);  // another client
+  cache->addCompletion("東京タワー", "とうきょう");
+
+  // "cafe r" matches neither stored input, only the transformed completion "cafe rouge".
+  auto found = find(*cache, "cafe r");
+  ASSERT_EQ(names(found), std::vector<std::string>{"Café Rouge"});
+  EXPECT_EQ(found[0].type, 1);
+  EXPECT_EQ(found[0].query, "cafe r");
+  EXPECT_EQ(find(*cache, "CAFÉ")[0].suggestion, "Café Rouge");
+
+  found = find(*cache, "ca");
+  const std::vector<std::string> foundNames = names(found);
+  std::set<std::string> got(foundNames.begin(), foundNames.end());
+  EXPECT_EQ(got, (std::set<std::string>{"Café Rouge", "camera"}));
+  EXPECT_EQ(find(*cache, "cam")[0].type, 8);
+  EXPECT_EQ(names(find(*cache, "car", 1)), std::vector<std::string>{"carrot"});
+  EXPECT_TRUE(find(*cache, "x").empty());
+
+  // Japanese text is matched as it stands, through the stored input or the completion.
+  EXPECT_EQ(names(find(*cache, "とう")), std::vector<std::string>{"東京タワー"});
+  EXPECT_EQ(names(find(*cache, "東京")), std::vector<std::string>{"東京タワー"});
+}
+
+TEST_F(EngagedCompletionCacheTest, ScoresByRecencyBucketsAndDropsBelowThreshold) {
+  auto cache = open();
+  cache->addCompletion("twice", "tw");
+  cache->addCompletion("twice", "tw");
+  clock_.advance(seconds(2 * 86400));
+  cache->addCompletion("twin", "tw");
+  clock_.advance(seconds(60));
+
+  auto found = find(*cache, "tw");
+  ASSERT_EQ(found.size(), 2u);
+  EXPECT_EQ(found[0].suggestion, "twin");
+  // One engagement in the last hour: 10, plus the recency term just under 1.
+  EXPECT_GT(found[0].score, 10.99);
+  EXPECT_LT(found[0].score, 11.0);
+  // Two engagements two days ago fall in the week bucket: 0.1 each.
+  EXPECT_GT(found[1].score, 1.19);
+  EXPECT_LT(found[1].score, 1.2);
+
+  cache->addCompletion("twice", "tw");
+  cache->addCompletion("twice", "tw");
+  clock_.advance(seconds(60));
+  found = find(*cache, "tw");
+  EXPECT_EQ(found[0].suggestion, "twice");
+  EXPECT_GT(found[0].score, 20.99 + 0.2);  // 20 for the hour, 0.2 for the week, recency
+  EXPECT_LT(found[0].score, 21.2);
+
+  EngagedCompletionParameters p;
+  p.minThresholdToSend = 15;
+  cache->updateParameters(p);
+  EXPECT_EQ(names(find(*cache, "tw")), std::vector<std::string>{"twice"});
+
+  p.last1hour = 0;
+  cache->updateParameters(p);
+  EXPECT_TRUE(find(*cache, "tw").empty());
+}
+
+TEST_F(EngagedCompletionCacheTest, AgesOutOldRowsAndTrimsEachClientToItsLimit) {
+  auto cache = open();
+  cache->addCompletion("old", "o", 0, 2);
+  clock_.advance(seconds(40 * 86400));
+  cache->addCompletion("new", "n", 0, 1);  // any client's add ages out every client's rows
+  EXPECT_EQ(cache->rowCountForClient(2), 0);
+  EXPECT_EQ(cache->rowCountForClient(1), 1);
+
+  for (int i = 0; i < 3; ++i) {
+    cache->addCompletion("row" + std::to_string(i), "r", 0, 5, 3);
+    clock_.advance(seconds(10));
+  }
+  cache->addCompletion("row3", "r", 0, 5, 3);  // exactly three: no fourth-newest row to cut at
+  EXPECT_EQ(cache->rowCountForClient(5), 4);
+  clock_.advance(seconds(10));
+  cache->addCompletion("row4", "r", 0, 5, 3);  // cuts at the fourth-newest, the oldest row
+  EXPECT_EQ(cache->rowCountForClient(5), 4);
+  std::set<std::string> left;
+  for (const auto& s : find(*cache, "r", 5)) left.insert(s.suggestion);
+  EXPECT_EQ(left, (std::set<std::string>{"row1", "row2", "row3", "row4"}));
+  EXPECT_EQ(cache->rowCountForClient(1), 1);
+}
+
+TEST_F(EngagedCompletionCacheTest, ClearsByDateClientOrEverything) {
+  auto cache = open();
+  const auto t0 = clock_.now();
+  cache->addCompletion("a", "a", 0, 1);
+  clock_.advance(seconds(4));
+  cache->addCompletion("b", "b", 0, 1);
+  clock_.advance(seconds(100));
+  cache->addCompletion("c", "c", 0, 1);
+  cache->addCompletion("d", "d", 0, 2);
+
+  cache->clearCompletionsFromDate(t0, t0, 1);  // widened to 5 s either side: a and b
+  EXPECT_EQ(cache->rowCountForClient(1), 1);
+  EXPECT_EQ(cache->rowCountForClient(2), 1);
+
+  cache->clearAllCompletionsForClient(1);
+  EXPECT_EQ(cache->rowCountForClient(1), 0);
+  EXPECT_EQ(cache->rowCountForClient(2), 1);
+
+  cache->addCompletion("e", "e", 0, 3);
+  cache->clearAllClientCompletionsFromDate(clock_.now() - seconds(1), clock_.now() + seconds(1));
+  EXPECT_EQ(cache->rowCountForClient(2), 0);
+  EXPECT_EQ(cache->rowCountForClient(3), 0);
+
+  cache->addCompletion("f", "f", 0, 3);
+  cache->seekaraDidClearSuggestions();
+  EXPECT_EQ(cache->rowCountForClient(3), 0);
+}
+
+TEST_F(EngagedCompletionCacheTest, DisabledByDefaultsStoresAndFindsNothing) {
+  auto cache = open();
+  cache->addCompletion("before", "be");
+  defaults_.setObject("TVXDisableLocalCompletions", true);
+  cache->addCompletion("during", "du");
+  EXPECT_FALSE(cache->completionsForInput("be", 0, 5, 2000));
+  defaults_.setObject("TVXDisableLocalCompletions", false);
+  EXPECT_EQ(cache->rowCountForClient(0), 1);
+  EXPECT_EQ(names(find(*cache, "be")), std::vector<std::string>{"before"});
+}
+
+TEST(EngagedCompletionCacheTimeout, SearchThatOutlivesItsTimeoutReturnsNothing) {
+  testing::TempHome home;
+  platform::DispatchPool pool(1);
+  platform::VirtualClock clock;
+  auto cache = EngagedCompletionCache::create({home.cache(), &clock, &pool, nullptr});
+  cache->addCompletion("late", "la");
+
+  // Occupy the pool's only thread so the search block cannot start in time.
+  std::promise<void> release;
+  std::shared_future<void> gate = release.get_future().share();
+  pool.post([gate] { gate.wait(); });
+  platform::LogCapture log;
+  EXPECT_FALSE(cache->completionsForInput("la", 0, 5, 20));
+  EXPECT_TRUE(log.contains("EngagedCompletionCache search timed out for input la timeout value 20"));
+  release.set_value();
+  pool.drain();  // the late block runs to its end; its results go nowhere
+
+  auto found = cache->completionsForInput("la", 0, 5, 2000);
+  ASSERT_TRUE(found);
+  EXPECT_EQ(found->size(), 1u);
+}
+
+TEST_F(EngagedCompletionCacheTest, RebuildsACorruptDatabaseAndGoesOn) {
+  const auto dir = home_.cache() / "com.norvel.tavixd/EngagedCompletions";
+  platform::createDirectory(dir, true);
+  { std::ofstream(dir / "Cache.db") << std::string(8192, 'x'); }
+
+  auto cache = open();
+  cache->addCompletion("fresh", "fr");
+  EXPECT_EQ(names(find(*cache, "fr")), std::vector<std::string>{"fresh"});
+
+  // Damage the file under the open handle: the next add notices, rebuilds and the one after works.
+  { std::ofstream(dir / "Cache.db", std::ios::binary | std::ios::trunc) << std::string(8192, '\x5a'); }
+  platform::LogCapture log;
+  cache->addCompletion("after", "af");
+  EXPECT_TRUE(log.contains("rebuilding schema"));
+  cache->addCompletion("after", "af");
+  EXPECT_EQ(names(find(*cache, "af")), std::vector<std::string>{"after"});
+  EXPECT_EQ(schemaObjects(cache->databasePath()).size(), 4u);
+}
+
+TEST_F(EngagedCompletionCacheTest, CountsRecentEngagementsAndReportsRoundedStatistics) {
+  auto cache = open();
+  for (int i = 0; i < 123; ++i) cache->addCompletion("stat" + std::to_string(i), "st");
+  EXPECT_EQ(TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.brovane.localCompletionIndex.entries"), 120);
+  EXPECT_GT(TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.brovane.localCompletionIndex.size"), 0);
+
+  std::promise<std::map<std::string, std::int64_t>> counts;
+  cache->featureCountsForInput("st", 0, [&](std::map<std::string, std::int64_t> m) { counts.set_value(m); });
+  EXPECT_EQ(counts.get_future().get(), (std::map<std::string, std::int64_t>{{"h", 123}}));
+}
+
+TEST(EngagedCompletionText, NormalisesDetectsJapaneseAndRoundsSignificantDigits) {
+  EXPECT_EQ(EngagedCompletionCache::normalizeString("Crème BRÛLÉE"), "creme brulee");
+  EXPECT_EQ(EngagedCompletionCache::normalizeString("ﬁ①"), "fi1");  // compatibility forms
+  EXPECT_EQ(EngagedCompletionCache::normalizeString("Tōkyō タワー"), "Tōkyō タワー");
+
+  EXPECT_FALSE(EngagedCompletionCache::containsJapanese(""));
+  EXPECT_FALSE(EngagedCompletionCache::containsJapanese("café"));
+  EXPECT_TRUE(EngagedCompletionCache::containsJapanese("ひらがな"));
+  EXPECT_FALSE(EngagedCompletionCache::containsKanjiOrKatakana("ひらがな"));
+  EXPECT_TRUE(EngagedCompletionCache::containsKanjiOrKatakana("漢"));
+  EXPECT_TRUE(EngagedCompletionCache::containsKanjiOrKatakana("ｶ"));   // half-width katakana
+  EXPECT_FALSE(EngagedCompletionCache::containsKanjiOrKatakana("・"));  // the middle dot is excluded
+
+  EXPECT_EQ(EngagedCompletionCache::kanize("カメラ"), "かめら");
+  EXPECT_EQ(EngagedCompletionCache::kanize("sushi"), "すし");
+
+  EXPECT_EQ(EngagedCompletionCache::significantValueFromString("12345"), 12000);
+  EXPECT_EQ(EngagedCompletionCache::significantValueFromString("987"), 980);
+  EXPECT_EQ(EngagedCompletionCache::significantValueFromString("7"), 7);
+  EXPECT_EQ(EngagedCompletionCache::significantValueFromString(""), 0);
+}
+
+}  // namespace
+}  // namespace tavix

@@ -1,0 +1,75 @@
+#include "platform/memory_pressure.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+
+#include "support/temp_home.h"
+
+namespace tavix::platform {
+namespace {
+
+TEST(MemoryPressure, SourcesHearOnlyTheirMaskUntilCancelled) {
+  DispatchPool pool(2);
+  SerialQueue queue(pool, "test.pressure");
+  std::atomic<int> heard{0};
+  MemoryPressureSource source(MemoryPressureProcessLimitCritical, queue, [&](std::uint32_t) { ++heard; });
+  raiseMemoryPressure(MemoryPressureProcessLimitCritical);  // not resumed yet
+  source.resume();
+  raiseMemoryPressure(MemoryPressureWarn);
+  raiseMemoryPressure(MemoryPressureProcessLimitCritical);
+  queue.sync([] {});
+  EXPECT_EQ(heard, 1);
+  source.cancel();
+  raiseMemoryPressure(MemoryPressureProcessLimitCritical);
+  queue.sync([] {});
+  EXPECT_EQ(heard, 1);
+}
+
+TEST(MemoryPressure, StallMonitorRaisesOncePerRiseAboveThreshold) {
+  EXPECT_EQ(PressureStallMonitor::fullAverage10("some avg10=1.00 avg60=0.00 avg300=0.00 total=0\n"
+                                                "full avg10=12.50 avg60=0.00 avg300=0.00 total=0\n"),
+            12.5);
+  EXPECT_FALSE(PressureStallMonitor::fullAverage10("some avg10=1.00 avg60=0.00\n"));
+
+  testing::TempHome home;
+  const fs::path file = home.root() / "memory";
+  auto setFull = [&](const char* avg10) {
+    writeFileAtomically(file, std::string("some avg10=0.00 avg60=0.00 avg300=0.00 total=0\nfull avg10=") + avg10 +
+                                  " avg60=0.00 avg300=0.00 total=0\n");
+  };
+  DispatchPool pool(2);
+  SerialQueue queue(pool, "test.psi");
+  VirtualClock clock;
+  std::atomic<int> heard{0};
+  MemoryPressureSource source(MemoryPressureProcessLimitCritical, queue, [&](std::uint32_t) { ++heard; });
+  source.resume();
+
+  PressureStallMonitor missing(clock, queue, home.root() / "absent");
+  EXPECT_FALSE(missing.start());
+
+  setFull("0.00");
+  PressureStallMonitor monitor(clock, queue, file, 10, seconds(2));
+  bool started = false;
+  queue.sync([&] { started = monitor.start(); });
+  ASSERT_TRUE(started);
+  auto tick = [&] {
+    clock.advance(seconds(2));
+    queue.sync([] {});
+  };
+  tick();
+  EXPECT_EQ(heard, 0);
+  setFull("12.00");
+  tick();
+  tick();  // still high: no second event
+  EXPECT_EQ(heard, 1);
+  setFull("3.00");
+  tick();
+  setFull("10.00");
+  tick();
+  EXPECT_EQ(heard, 2);
+  queue.sync([&] { monitor.stop(); });
+}
+
+}  // namespace
+}  // namespace tavix::platform
