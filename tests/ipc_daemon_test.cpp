@@ -16,6 +16,9 @@
 #include <thread>
 #include <vector>
 
+#include "cache/engaged_completion_cache.h"
+#include "platform/clock.h"
+#include "platform/dispatch.h"
 #include "support/daemon_process.h"
 #include "tavix/client.h"
 
@@ -338,6 +341,35 @@ TEST(IpcDaemon, ToolReadsDefaultsAndCountersWithTheDaemonStoppedAndRunsActivitie
   EXPECT_EQ(runTool("counters", &out), 0) << out;
   EXPECT_NE(out.find("com.norvel.tavixd.launch = 1\n"), std::string::npos) << out;
   EXPECT_NE(out.find("com.norvel.tavixd.clientconnection = 3\n"), std::string::npos) << out;
+}
+
+}  // namespace
+
+namespace {
+
+TEST(IpcDaemon, ClearDataLaunchEventForgetsTheSystemSearchCompletionsOnly) {
+  tavix::testing::TempHome home;
+  const auto folder = home.cache() / "com.norvel.tavixd";
+  {
+    tavix::platform::DispatchPool pool(2);
+    tavix::platform::SystemClock clock(pool);
+    auto cache = tavix::EngagedCompletionCache::create({folder, &clock, &pool, nullptr});
+    cache->addCompletion("camera", "cam", 0, 1);
+    cache->addCompletion("cafe rouge", "caf", 0, 2);
+    cache->addCompletion("calendar", "cal", 0, 2);
+    ASSERT_EQ(cache->rowCountForClient(2), 2);
+    cache->closeDBConnection();
+  }
+  Daemon d(home);
+  Client client(options(d));
+  ASSERT_FALSE(client.notifySync("com.norvel.proactive.queries.clearData")) << d.log();
+  EXPECT_EQ(d.stop(), 0) << d.log();
+
+  tavix::platform::DispatchPool pool(2);
+  tavix::platform::SystemClock clock(pool);
+  auto cache = tavix::EngagedCompletionCache::create({folder, &clock, &pool, nullptr});
+  EXPECT_EQ(cache->rowCountForClient(2), 0);
+  EXPECT_EQ(cache->rowCountForClient(1), 1);
 }
 
 }  // namespace

@@ -11,11 +11,13 @@
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "daemon/tavix_service.h"
+#include "cache/engaged_completion_cache.h"
 #include "context/location.h"
 #include "context/motion.h"
 #include "network/request_factory.h"
 #include "network/tracing.h"
 #include "platform/json_value.h"
+#include "platform/memory_pressure.h"
 #include "platform/activity.h"
 #include "platform/clock.h"
 #include "platform/counters.h"
@@ -143,8 +145,13 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   auto& launchLog = TavixLogForCategory(TavixLoggingCategoryDefault);
   launchEvents.setHandler("com.norvel.tavixd.urlsession",
                           [&launchLog](const std::string& session) { launchLog.info("launch event for {}", session); });
-  launchEvents.setHandler("com.norvel.notifyd.matching",
-                          [&launchLog](const std::string& name) { launchLog.info("launch event for {}", name); });
+  launchEvents.setHandler("com.norvel.notifyd.matching", [&launchLog, &assembly](const std::string& name) {
+    launchLog.info("launch event for {}", name);
+    // The system search asks for its completion history to be forgotten.
+    if (name == "com.norvel.proactive.queries.clearData") {
+      EngagedCompletionCache::sharedInstance(assembly)->clearAllCompletionsForClient(2);
+    }
+  });
 
   // The activities' work (the feedback flushers) plugs into these handlers.
   for (const auto& [name, interval] : {std::pair{kFlusherActivity, kFlusherIntervalSeconds},
@@ -169,7 +176,9 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   platform::SerialQueue housekeeping(pool, "com.norvel.tavixd.housekeeping");
   platform::RepeatingTimer saveCounters(clock, housekeeping);
   platform::RepeatingTimer idleCheck(clock, housekeeping);
+  platform::PressureStallMonitor memoryPressure(clock, housekeeping);
   housekeeping.sync([&] {
+    if (!memoryPressure.start()) log.info("no memory pressure information; caches shrink only when told");
     saveCounters.start(platform::seconds(kCounterSaveIntervalSeconds), [&] {
       if (!counters.dirty()) return;
       if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
@@ -201,6 +210,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   housekeeping.sync([&] {
     saveCounters.stop();
     idleCheck.stop();
+    memoryPressure.stop();
   });
   pool.drain();  // let queued work finish while everything it may touch is still alive
   if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
