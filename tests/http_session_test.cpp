@@ -178,6 +178,8 @@ TEST_F(HTTPSessionTest, CancelCompletesOnceWithCancelled) {
   auto counting = [&](std::string, auto, std::optional<URLError> e) {
     if (e && e->code == URLErrorCancelled) ++endedWithSession;
   };
+  // A slow reply keeps the busy task on the wire until its session goes, however loaded the machine.
+  fault({{"path", "/search"}, {"delay_ms", 500}});
   auto idle = session->dataTask({url("/bag")}, counting);
   auto busy = session->dataTask({url("/search?q=x")}, counting);
   busy->resume();
