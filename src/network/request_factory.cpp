@@ -123,6 +123,7 @@ struct TVXNetworkRequestFactory::Context {
   std::shared_ptr<Delegate> delegate;
   platform::UserDefaults::Subscription defaultsSubscription;
   platform::NotificationCenter::Registration bagRegistration;
+  platform::NotificationCenter::Registration guidRegistration;
 };
 
 // Hears the location and motion services and hops onto the context queue.
@@ -587,6 +588,7 @@ TVXNetworkRequestFactory::TVXNetworkRequestFactory(Assembly& assembly, TVXReques
 TVXNetworkRequestFactory::~TVXNetworkRequestFactory() {
   // Stop hearing the world before the snapshot goes.
   context_->bagRegistration.reset();
+  context_->guidRegistration.reset();
   context_->defaultsSubscription.reset();
 }
 
@@ -612,6 +614,16 @@ void TVXNetworkRequestFactory::start() {
         auto self = weak.lock();
         auto bag = bagFromNotification(n);
         if (self && bag) Builder::didGetBag(*self, std::move(bag));
+      });
+  // A new user identifier starts a new maps user session, so "X-Norvel-GeoSession" follows it.
+  context_->guidRegistration = assembly_.notificationCenter->addObserver(
+      "TVXUserGUIDChangeNotification", nullptr, nullptr, [weak](const platform::Notification&) {
+        auto self = weak.lock();
+        if (!self || !self->providers_.locationManager) return;
+        self->context_->queue.async([weak] {
+          auto inner = weak.lock();
+          if (inner && inner->providers_.locationManager) inner->providers_.locationManager->getMapsUserSessionEntityAndReset(true);
+        });
       });
 }
 

@@ -38,7 +38,8 @@ class FakeLocationManager final : public LocationManager {
   std::optional<std::string> mapsEnvironment() const override { return "prod"; }
   std::optional<std::string> getMapsClientMetadata() const override { return "bWV0YQ=="; }
   std::optional<std::string> getDeviceCountryCode() const override { return country; }
-  std::optional<TVXMapsUserSession> getMapsUserSessionEntityAndReset(bool) override {
+  std::optional<TVXMapsUserSession> getMapsUserSessionEntityAndReset(bool reset) override {
+    if (reset) ++sessionResets;
     return TVXMapsUserSession{"S1", 4, 2.5};
   }
 
@@ -54,6 +55,7 @@ class FakeLocationManager final : public LocationManager {
 
   std::atomic<int> starts{0};
   std::atomic<int> stops{0};
+  std::atomic<int> sessionResets{0};
   std::atomic<int> status{TVXLocationAuthorizationWhenInUse};
   std::atomic<int> newsStatus{TVXLocationAuthorizationDenied};
   std::optional<std::string> country = "FR";
@@ -429,6 +431,16 @@ TEST_F(RequestFactoryTest, BagSwitchesForNewsAndMessagesReachManagedConfiguratio
   managed.synchronize();
   EXPECT_EQ(managed.objectForKey(kTVXFeatureSeekaraNewsAllowed), PropertyValue(true));
   EXPECT_EQ(blacklisted(), std::string("[\"") + kTVXSTSAppBundleIdentifier + "\"]");
+}
+
+TEST_F(RequestFactoryTest, ANewUserIdentifierStartsANewMapsSession) {
+  make();
+  auto search = factory->searchRequest(TVXSearchRequest{}, bag(R"({"search_url":"https://s.example/search"})"), "G");
+  ASSERT_TRUE(search);
+  EXPECT_EQ(location->sessionResets.load(), 0) << "building a request reads the session without a reset";
+  center->post("TVXUserGUIDChangeNotification");
+  factory->flushContextAccessQueue();
+  EXPECT_EQ(location->sessionResets.load(), 1);
 }
 
 TEST_F(RequestFactoryTest, SilhouetteTopicsWeighTheEngagedSuggestion) {
