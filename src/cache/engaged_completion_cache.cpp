@@ -1,5 +1,7 @@
 #include "cache/engaged_completion_cache.h"
 
+#include <sys/stat.h>
+
 #include <sqlite3.h>
 #include <unicode/brkiter.h>
 #include <unicode/locid.h>
@@ -244,6 +246,8 @@ void EngagedCompletionCache::openDatabaseConnection() {
   sqlite3* db = nullptr;
   int rc = sqlite3_open_v2(databasePath_.c_str(), &db, kOpenFlags, nullptr);
   if (rc == SQLITE_OK) {
+    // What the user engaged with is private: the file is the user's alone, whatever the umask.
+    ::chmod(databasePath_.c_str(), 0600);
     eccLog().notice("Completions database opened: {}", databasePath_);
     completionsDB_ = db;
     return;

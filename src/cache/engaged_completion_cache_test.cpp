@@ -1,5 +1,7 @@
 #include "cache/engaged_completion_cache.h"
 
+#include <sys/stat.h>
+
 #include <gtest/gtest.h>
 #include <sqlite3.h>
 
@@ -70,6 +72,9 @@ TEST_F(EngagedCompletionCacheTest, CreatesTheVersionedSchemaInTheCachesFolder) {
   EXPECT_EQ(schemaObjects(expected),
             (std::set<std::string>{"index input_index", "index transformed_index",
                                    "table completion_cache_engagement", "table completion_cache_schema_version"}));
+  struct stat st {};
+  ASSERT_EQ(::stat(expected.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
   cache->addCompletion("kept", "ke");
   cache.reset();
 
