@@ -390,13 +390,13 @@ void TavixPersistentStorage::deleteSessionWithFileContainer(std::shared_ptr<File
 }
 
 std::string TavixPersistentStorage::version() {
-  std::string v;
-  queue_.sync([&] { v = version_; });
-  return v;
+  std::lock_guard guard(versionLock_);
+  return version_;
 }
 
 void TavixPersistentStorage::setVersion(std::string version) {
-  queue_.async([this, version = std::move(version)] { version_ = version; });
+  std::lock_guard guard(versionLock_);
+  version_ = std::move(version);
 }
 
 }  // namespace tavix

@@ -14,6 +14,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -101,7 +102,7 @@ class TavixPersistentStorage {
   // Asynchronously unlists the container, closes it and deletes its file.
   void deleteSessionWithFileContainer(std::shared_ptr<FileContainer> container);
 
-  // The version new and scanned containers must carry (default: tavixdUserAgent()).
+  // The version new and scanned containers must carry (default: tavixdUserAgent()). Any thread.
   std::string version();
   void setVersion(std::string version);
   platform::SerialQueue& queue() { return queue_; }
@@ -118,7 +119,10 @@ class TavixPersistentStorage {
   platform::SerialQueue queue_;
   platform::fs::path cachesUrl_;
   std::vector<std::shared_ptr<FileContainer>> fileContainers_;  // on queue_ (and the scan)
-  std::string version_;                                         // on queue_
+  // A lock rather than the queue: new files are made from other queues, and a synchronous hop
+  // from a pool thread onto a busy pool could starve it.
+  std::mutex versionLock_;
+  std::string version_;
   std::uint64_t maxFileSize_;
   std::int64_t maxFileAge_;
   std::atomic<std::int32_t> handleId_{0};
