@@ -116,6 +116,24 @@ TEST(ClientSessionManager, IdleOrSentinelPastTheSoftLimitEndsTheSession) {
   EXPECT_NE(sessions[1].user_guid_string(), sessions[0].user_guid_string());  // the idle close rolled it
 }
 
+TEST(ClientSessionManager, NewUserGuidClosesTheSessionAtOnce) {
+  ManagerFixture f;
+  f.send(39, 0);
+  f.send(39, 10);
+  f.guid->reset();
+  f.send(39, 20);
+  EXPECT_EQ(f.manager->currentState(), 0u);
+  auto sessions = f.closed();
+  ASSERT_EQ(sessions.size(), 1u);
+  EXPECT_EQ(endReason(sessions[0]), 5);
+  EXPECT_EQ(sessions[0].feedbacks_size(), 3);
+  f.manager->flushSession();
+  sessions = f.closed();
+  ASSERT_EQ(sessions.size(), 2u);
+  EXPECT_EQ(sessions[1].feedbacks(0).payload().cache_hit().input(), "t=20");
+  EXPECT_EQ(sessions[1].previous_session_end_reason(), 5);
+}
+
 TEST(ClientSessionManager, LimitsOverridesAndFlushes) {
   {
     ManagerFixture f(false, 900);
