@@ -131,4 +131,10 @@ std::string stringFromClientType(int type) {
   return "unknown";
 }
 
+const std::string& tavixdUserAgent() {
+  static const std::string agent =
+      createUserAgentString(std::nullopt, DeviceInformation(nullptr)).value_or(kTVXTavixdNameVersion);
+  return agent;
+}
+
 }  // namespace tavix

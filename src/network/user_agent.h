@@ -52,6 +52,10 @@ class DeviceInformation {
 std::optional<std::string> createUserAgentString(std::optional<std::string_view> clientAgent,
                                                  const DeviceInformation& device);
 
+// The daemon's own user agent (its token as the client part, no default overrides), made once.
+// Session files carry it as their version and the daemon's own feedback is filed under it.
+const std::string& tavixdUserAgent();
+
 // The first known client name that the lower-cased string contains, tried in the order
 // brovane, seekara, vocly, lookup, messages, news, suggestions, flightinfo, tavixd; else empty.
 std::optional<std::string> extractClientNameFromString(std::string_view userAgent);

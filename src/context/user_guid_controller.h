@@ -1,0 +1,52 @@
+// The short-lived user identifier carried by requests and feedback: a random UUID that lives for
+// 900 seconds, is never written to disk, and is replaced when it expires or when the feedback
+// side asks for a reset. Every replacement posts "TVXUserGUIDChangeNotification".
+//
+// Owns the serial queue "com.norvel.tavix.guid", which guards the identifier and its expiry.
+// currentUserGUID() hops onto it synchronously (so never call it from that queue); reset() hops
+// asynchronously. The change notification is posted from a separate pool block after the roll,
+// so an observer may call currentUserGUID() from its callback.
+#pragma once
+
+#include <string>
+
+#include "platform/clock.h"
+#include "platform/dispatch.h"
+
+namespace tavix {
+
+class Assembly;
+
+inline constexpr const char* kTVXUserGUIDChangeNotification = "TVXUserGUIDChangeNotification";
+inline constexpr double kTavixUserGUIDLifetimeSeconds = 900;
+
+// A fresh random (version 4) UUID in its upper-case textual form.
+std::string makeRandomUUIDString();
+// True for the 36-character textual UUID form (either case).
+bool isValidUUIDString(const std::string& text);
+
+class TavixUserGUIDController {
+ public:
+  // Needs assembly.dispatchPool and assembly.clock; the notification centre may be absent (then
+  // nothing is posted). Creation posts nothing.
+  explicit TavixUserGUIDController(Assembly& assembly);
+  TavixUserGUIDController(const TavixUserGUIDController&) = delete;
+  TavixUserGUIDController& operator=(const TavixUserGUIDController&) = delete;
+  ~TavixUserGUIDController();
+
+  // The current identifier (upper-case UUID string); rolls it first when it has expired.
+  std::string currentUserGUID();
+
+  // Replaces the identifier; returns at once.
+  void reset();
+
+ private:
+  void rollGUID();  // on queue_
+
+  Assembly& assembly_;
+  platform::SerialQueue queue_;
+  std::string lastKnownUserGUID_;
+  platform::TimePoint lastKnownUserGUIDExpirationDate_;
+};
+
+}  // namespace tavix

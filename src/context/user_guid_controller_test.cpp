@@ -1,0 +1,85 @@
+#include "context/user_guid_controller.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+
+#include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "platform/counters.h"
+#include "platform/notification_center.h"
+
+namespace tavix {
+namespace {
+
+struct GuidFixture {
+  platform::DispatchPool pool{2};
+  platform::VirtualClock clock;
+  Assembly assembly;
+  std::atomic<int> posts{0};
+  platform::NotificationCenter::Registration registration;
+  GuidFixture() {
+    assembly.dispatchPool = &pool;
+    assembly.clock = &clock;
+    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
+    registration = assembly.notificationCenter->addObserver(kTVXUserGUIDChangeNotification, nullptr, nullptr,
+                                                            [this](const platform::Notification&) { ++posts; });
+  }
+};
+
+TEST(TavixUserGUIDController, IdentifierLivesExactly900Seconds) {
+  GuidFixture f;
+  const auto counterBefore = TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.userguid");
+  TavixUserGUIDController controller(f.assembly);
+  const std::string first = controller.currentUserGUID();
+  EXPECT_TRUE(isValidUUIDString(first));
+  EXPECT_EQ(first.find_first_of("abcdef"), std::string::npos);
+  f.clock.advance(platform::seconds(899));
+  EXPECT_EQ(controller.currentUserGUID(), first);
+  f.pool.drain();
+  EXPECT_EQ(f.posts, 0);  // creation and plain reads post nothing
+  f.clock.advance(platform::seconds(1));
+  const std::string second = controller.currentUserGUID();
+  EXPECT_NE(second, first);
+  EXPECT_EQ(controller.currentUserGUID(), second);
+  f.pool.drain();
+  EXPECT_EQ(f.posts, 1);
+  EXPECT_EQ(TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.userguid"), counterBefore + 1);
+}
+
+TEST(TavixUserGUIDController, EachResetRollsAndAnnounces) {
+  GuidFixture f;
+  TavixUserGUIDController controller(f.assembly);
+  const std::string first = controller.currentUserGUID();
+  controller.reset();
+  const std::string second = controller.currentUserGUID();
+  controller.reset();
+  const std::string third = controller.currentUserGUID();
+  EXPECT_NE(first, second);
+  EXPECT_NE(second, third);
+  f.pool.drain();
+  EXPECT_EQ(f.posts, 2);
+  // A reset restarts the lifetime.
+  f.clock.advance(platform::seconds(899));
+  EXPECT_EQ(controller.currentUserGUID(), third);
+}
+
+TEST(TavixUserGUIDController, ObserverMayReadTheNewIdentifier) {
+  platform::DispatchPool pool{2};
+  platform::VirtualClock clock;
+  Assembly assembly;
+  assembly.dispatchPool = &pool;
+  assembly.clock = &clock;
+  assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
+  TavixUserGUIDController controller(assembly);
+  std::string seen;
+  auto reg = assembly.notificationCenter->addObserver(kTVXUserGUIDChangeNotification, nullptr, nullptr,
+                                                      [&](const platform::Notification&) { seen = controller.currentUserGUID(); });
+  controller.reset();
+  pool.drain();
+  EXPECT_EQ(seen, controller.currentUserGUID());
+  EXPECT_FALSE(isValidUUIDString("not-a-uuid"));
+}
+
+}  // namespace
+}  // namespace tavix

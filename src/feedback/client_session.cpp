@@ -1,0 +1,225 @@
+#include "feedback/client_session.h"
+
+#include <algorithm>
+#include <array>
+#include <cctype>
+#include <ctime>
+
+#include "context/user_guid_controller.h"
+#include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "core/logging.h"
+#include "feedback/feedback_json.h"
+#include "feedback/persistent_storage.h"
+#include "feedback/session_processing_helper.h"
+#include "feedback/vocabulary.h"
+#include "network/user_agent.h"
+#include "platform/clock.h"
+#include "platform/defaults.h"
+
+namespace tavix {
+
+namespace {
+
+platform::Logger& sessionLog() { return TavixLogForCategory(TavixLoggingCategorySession); }
+
+std::string lower(std::string_view text) {
+  std::string out(text);
+  std::transform(out.begin(), out.end(), out.begin(), [](unsigned char c) { return std::tolower(c); });
+  return out;
+}
+
+bool sameLocalDay(platform::TimePoint a, platform::TimePoint b) {
+  const std::time_t ta = static_cast<std::time_t>(platform::toUnixSeconds(a));
+  const std::time_t tb = static_cast<std::time_t>(platform::toUnixSeconds(b));
+  std::tm da{}, db{};
+  localtime_r(&ta, &da);
+  localtime_r(&tb, &db);
+  return da.tm_year == db.tm_year && da.tm_yday == db.tm_yday;
+}
+
+}  // namespace
+
+std::optional<std::string> firstUseKeyForAgent(std::string_view agent) {
+  static constexpr std::array<const char*, 6> kClients = {"brovane", "seekara", "lookup", "messages", "news", "vocly"};
+  const std::string l = lower(agent);
+  for (const char* name : kClients) {
+    if (l.find(name) != std::string::npos) return std::string("TavixFirstUseOfTheDay_") + name;
+  }
+  return std::nullopt;
+}
+
+ClientSession::ClientSession(Assembly& assembly)
+    : assembly_(assembly), sessionQueue_(*assembly.dispatchPool, "com.norvel.tavixd.clientSessionQueue") {
+  backingStore_.set_session_start(platform::toUnixSeconds(assembly.clock->now()));
+  backingStore_.set_version(tavixdUserAgent());
+}
+
+std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackRef first, int previousSessionEndReason) {
+  auto session = std::make_shared<ClientSession>(assembly);
+  auto& store = session->backingStore_;
+  if (first && !first->user_agent().empty()) store.set_agent(first->user_agent());
+  if (first && !first->user_guid().empty()) store.set_user_guid_string(first->user_guid());
+  store.set_previous_session_end_reason(static_cast<proto::SessionEndReason::Value>(previousSessionEndReason));
+  // Suggestion sessions are sent without their base time.
+  if (first && feedbackType(*first) == kFeedbackTypeSuggestionEngagement) store.set_remove_timestamps(true);
+
+  if (auto key = firstUseKeyForAgent(store.agent())) {
+    const auto date = assembly.userDefaults->dateForKey(*key);
+    if (date) {
+      store.set_first_use_date(platform::toUnixSeconds(*date));
+    } else {
+      TavixLogForCategory(TavixLoggingCategoryFeedbackErrors)
+          .error("Found something other than a date in defaults for key {}.", *key);
+      assembly.userDefaults->removeObject(*key);
+    }
+  }
+  if (!store.agent().empty()) {
+    const auto name = extractClientNameFromString(store.agent());
+    TavixDiagnosticDataReporter::addValue(1, createCounterKey(name.value_or("(null)"), "sessions"));
+    const platform::TimePoint now = assembly.clock->now();
+    if (!store.has_first_use_date() || !sameLocalDay(platform::fromUnixSeconds(store.first_use_date()), now)) {
+      session->recordFirstUse(now);
+    }
+  }
+  // The download manager supplies resource versions; until it is in the graph there are none.
+  store.clear_resource_versions();
+
+  if (assembly.persistentStorage) {
+    auto handle = assembly.persistentStorage->createFileContainerForWriting();
+    std::atomic_store(&session->storageHandle_, handle);
+    if (handle) handle->writeSessionHeader(store);
+  }
+  if (first) session->addFeedback(first);
+  return session;
+}
+
+std::shared_ptr<ClientSession> ClientSession::fromRecord(Assembly& assembly, proto::CTClientSession record) {
+  auto session = std::make_shared<ClientSession>(assembly);
+  session->backingStore_ = std::move(record);
+  return session;
+}
+
+void ClientSession::recordFirstUse(platform::TimePoint time) {
+  const auto key = firstUseKeyForAgent(backingStore_.agent());
+  if (!key) {
+    TavixLogForCategory(TavixLoggingCategoryFeedback).debug("user default key not found for agent: {}", backingStore_.agent());
+    return;
+  }
+  backingStore_.set_first_use_date(platform::toUnixSeconds(time));
+  backingStore_.set_first_use_of_the_day(true);
+  assembly_.userDefaults->setObject(*key, platform::PropertyValue(platform::Date{time}));
+  assembly_.userDefaults->synchronize();
+  if (auto name = extractClientNameFromString(*key)) {
+    TavixDiagnosticDataReporter::addValue(1, createCounterKey(*name, "dailyactiveusers"));
+  }
+}
+
+void ClientSession::addFeedback(const FeedbackRef& feedback) {
+  if (!feedback) {
+    sessionLog().debug("attempted to add a nil feedback");
+    return;
+  }
+  auto handle = storageHandle();
+  if (handle) handle->writeFeedback(*feedback);
+  if (backingStore_.has_user_guid_string() && feedback->user_guid() != backingStore_.user_guid_string()) {
+    proto::CTErrorFeedback error;
+    error.set_domain("kTVXErrorDomain");
+    error.set_code(500);
+    error.set_reason("different guid in session");
+    auto wrapped = makeTavixFeedbackWithCodable(error, 0, "", feedback->user_agent());
+    if (handle) handle->writeFeedback(*wrapped);
+  }
+}
+
+void ClientSession::sessionComplete() {
+  sessionQueue_.sync([&] {
+    auto handle = storageHandle();
+    if (!handle || !assembly_.persistentStorage) {
+      sessionLog().fault("Storage Handle nil major error");
+      return;
+    }
+    assembly_.persistentStorage->closeSessionWithFileContainer(handle);
+  });
+}
+
+std::vector<FeedbackRef> ClientSession::getSessionFeedbacks() {
+  std::vector<FeedbackRef> events;
+  sessionQueue_.sync([&] {
+    for (const auto& f : backingStore_.feedbacks()) events.push_back(std::make_shared<proto::CTTavixFeedback>(f));
+    sortByTimeStamp(events);
+  });
+  return events;
+}
+
+std::vector<std::string> ClientSession::privacyFilteredFeedbacksWithRelativeTimestamp(
+    const std::vector<FeedbackRef>& events) {
+  SessionProcessingHelper helper;
+  std::uint64_t base = 0;
+  std::vector<std::string> out;
+  for (const auto& event : events) {
+    google::protobuf::Message* codable = mutableFeedbackCodable(event->mutable_payload());
+    const std::uint64_t stamp = codableTimestamp(codable);
+    if (base == 0) base = stamp;
+    event->set_rel_timestamp(stamp >= base ? hostTicksToMilliseconds(stamp - base) : 0);
+    helper.process(codable);
+    std::string dictionary = feedbackDictionary(*event);
+    if (dictionary.empty()) {
+      sessionLog().error("nil feedback dictionary for type : {}", feedbackType(*event));
+      continue;
+    }
+    out.push_back(std::move(dictionary));
+  }
+  const auto results = helper.missingResults();
+  if (!results.empty()) {
+    proto::CTSessionMissingResultsFeedback missing;
+    for (const auto& r : results) *missing.add_results() = r;
+    auto wrapped = makeTavixFeedbackWithCodable(missing, 0, userGuid(), agent());
+    out.insert(out.begin(), feedbackDictionary(*wrapped));
+  }
+  const auto suggestions = helper.missingSuggestions();
+  if (!suggestions.empty()) {
+    proto::CTSessionMissingSuggestionsFeedback missing;
+    for (const auto& s : suggestions) *missing.add_suggestions() = s;
+    auto wrapped = makeTavixFeedbackWithCodable(missing, 0, userGuid(), agent());
+    out.insert(out.begin(), feedbackDictionary(*wrapped));
+  }
+  return out;
+}
+
+std::string ClientSession::getFeedbacksToSend() {
+  // Brovane sessions would pass through the CBA filter here; it is not part of this build yet.
+  const std::vector<std::string> filtered = privacyFilteredFeedbacksWithRelativeTimestamp(getSessionFeedbacks());
+  nlohmann::json fb = nlohmann::json::array();
+  for (const auto& text : filtered) fb.push_back(nlohmann::json::parse(text, nullptr, false));
+  nlohmann::json versions = nlohmann::json::object();
+  for (const auto& [name, version] : backingStore_.resource_versions()) versions[name] = version;
+  const std::int64_t baseTime =
+      backingStore_.remove_timestamps() ? 0 : static_cast<std::int64_t>(backingStore_.session_start());
+  nlohmann::json record = {
+      {ClientSessionFeedbackKey, fb},
+      {ClientSessionAgentKey, agent()},
+      {ClientSessionUserGuidKey, userGuid()},
+      {ClientSessionResourceVersionsKey, versions},
+      {ClientSessionFirstUse, firstUseOfTheDay()},
+      {ClientSessionBaseTime, baseTime},
+      {ClientSessionPreviousEndReason, sessionEndReasonName(previousSessionEndReason())},
+  };
+  return record.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+}
+
+std::string ClientSession::agent() const { return backingStore_.agent(); }
+
+std::string ClientSession::userGuid() const {
+  const std::string& text = backingStore_.user_guid_string();
+  if (!isValidUUIDString(text)) return {};
+  std::string upper = text;
+  std::transform(upper.begin(), upper.end(), upper.begin(), [](unsigned char c) { return std::toupper(c); });
+  return upper;
+}
+
+bool ClientSession::firstUseOfTheDay() const { return backingStore_.first_use_of_the_day(); }
+
+int ClientSession::previousSessionEndReason() const { return backingStore_.previous_session_end_reason(); }
+
+}  // namespace tavix

@@ -1,0 +1,74 @@
+// One feedback session of one client: a header (who, first use of the day, resource versions,
+// why the previous session ended) and its events, appended to the session's file as they come.
+// When sent, it yields the upload record: events oldest first, relative time stamps, session-local
+// identifiers, objects missing in full at the head, wrapped in seven keys.
+//
+// Threading: owns the serial queue "com.norvel.tavixd.clientSessionQueue". addFeedback() runs on
+// the caller's queue (the session manager's) and relies on the file container for ordering;
+// sessionComplete() and getSessionFeedbacks() hop onto the session queue synchronously.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "feedback/tavix_feedback.h"
+#include "platform/clock.h"
+#include "platform/dispatch.h"
+
+namespace tavix {
+
+class Assembly;
+class FileContainer;
+
+// "TavixFirstUseOfTheDay_<client>" for the first of brovane, seekara, lookup, messages, news,
+// vocly that the lower-cased agent contains; none otherwise.
+std::optional<std::string> firstUseKeyForAgent(std::string_view agent);
+
+class ClientSession {
+ public:
+  // A bare session: sessionStart = now, version = the daemon's user agent. Used for read-back.
+  explicit ClientSession(Assembly& assembly);
+  ClientSession(const ClientSession&) = delete;
+  ClientSession& operator=(const ClientSession&) = delete;
+
+  // Opens a session: header from the first event, first-use bookkeeping, a new session file
+  // with the header written, then the first event (when given) added.
+  static std::shared_ptr<ClientSession> open(Assembly& assembly, FeedbackRef first, int previousSessionEndReason = 1);
+  // A session read back from a file.
+  static std::shared_ptr<ClientSession> fromRecord(Assembly& assembly, proto::CTClientSession record);
+
+  // Appends to the session file; an event whose GUID differs from the session's is followed by
+  // a "different guid in session" error event (code 500).
+  void addFeedback(const FeedbackRef& feedback);
+  // Hands the file to persistent storage as a waiting session.
+  void sessionComplete();
+
+  // The record's events, oldest first.
+  std::vector<FeedbackRef> getSessionFeedbacks();
+  // The upload record as JSON text: "fb", "agent", "user_guid", "resource_versions",
+  // "first_use", "base_time", "previous_session_end_reason".
+  std::string getFeedbacksToSend();
+  // The dictionary forms (JSON texts) after privacy filtering of `events`, missing suggestions and
+  // missing results first.
+  std::vector<std::string> privacyFilteredFeedbacksWithRelativeTimestamp(const std::vector<FeedbackRef>& events);
+
+  std::string agent() const;
+  std::string userGuid() const;  // empty unless the stored string is a valid UUID
+  bool firstUseOfTheDay() const;
+  int previousSessionEndReason() const;
+  const proto::CTClientSession& backingStore() const { return backingStore_; }
+  std::shared_ptr<FileContainer> storageHandle() const { return std::atomic_load(&storageHandle_); }
+
+ private:
+  void recordFirstUse(platform::TimePoint time);
+
+  Assembly& assembly_;
+  proto::CTClientSession backingStore_;
+  std::shared_ptr<FileContainer> storageHandle_;
+  platform::SerialQueue sessionQueue_;
+};
+
+}  // namespace tavix

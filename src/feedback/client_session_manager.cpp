@@ -1,0 +1,294 @@
+#include "feedback/client_session_manager.h"
+
+#include "context/user_guid_controller.h"
+#include "core/assembly.h"
+#include "core/logging.h"
+#include "network/user_agent.h"
+#include "feedback/vocabulary.h"
+#include "platform/defaults.h"
+#include "platform/notification_center.h"
+#include "platform/transactions.h"
+
+namespace tavix {
+
+namespace {
+
+platform::Logger& log() { return TavixLogForCategory(TavixLoggingCategorySession); }
+
+// The user GUID lives 900 s; a session must end before it rotates.
+constexpr std::int64_t kGuidExpiration = 900;
+constexpr std::int64_t kDefaultSoftLimit = 600;
+constexpr std::int64_t kDefaultIdleTime = 180;
+
+}  // namespace
+
+// ---- ClientSessionShared --------------------------------------------------------------------
+
+ClientSessionShared::ClientSessionShared(Assembly& assembly, FeedbackRef first, int previousSessionEndReason)
+    : assembly_(assembly),
+      previousSessionEndReason_(previousSessionEndReason),
+      queue_(*assembly.dispatchPool, "com.norvel.tavixd.clientSessionSharedQueue") {
+  if (first && !first->user_guid().empty()) userGuid_ = first->user_guid();
+  const std::string agent = first ? first->user_agent() : std::string();
+  sessionMap_[agent] = ClientSession::open(assembly, first, previousSessionEndReason);
+}
+
+void ClientSessionShared::addFeedback(const FeedbackRef& feedback) {
+  queue_.async([this, feedback] {
+    if (!feedback || feedback->user_agent().empty()) return;
+    auto it = sessionMap_.find(feedback->user_agent());
+    if (it != sessionMap_.end()) {
+      it->second->addFeedback(feedback);
+    } else {
+      sessionMap_[feedback->user_agent()] = ClientSession::open(assembly_, feedback, previousSessionEndReason_);
+    }
+  });
+}
+
+void ClientSessionShared::enumerateSessionsUsingBlock(const std::function<void(ClientSession&)>& block) {
+  if (!block) return;
+  queue_.sync([&] {
+    for (auto& [agent, session] : sessionMap_) block(*session);
+  });
+}
+
+// ---- ClientSessionManager -------------------------------------------------------------------
+
+ClientSessionManager::ClientSessionManager(Assembly& assembly, std::shared_ptr<TavixUserGUIDController> guidController,
+                                           std::string identifier)
+    : assembly_(assembly),
+      guidController_(std::move(guidController)),
+      identifier_(std::move(identifier)),
+      sessionQueue_(*assembly.dispatchPool, "com.norvel.tavixd.clientSessionManagerQueue") {
+  const std::int64_t soft = assembly.userDefaults->integerForKey("TVXSessionSoftLimitOverride");
+  if (soft < 1) {
+    log().error("Soft limit override value must be greater than 0 : {} defaulting to {}", soft, kDefaultSoftLimit);
+    softLimitTime_ = kDefaultSoftLimit;
+  } else if (soft >= kGuidExpiration) {
+    log().error("Soft limit override value must be less than guid expiration {} : {} defaulting to {}",
+                kGuidExpiration, soft, kDefaultSoftLimit);
+    softLimitTime_ = kDefaultSoftLimit;
+  } else {
+    softLimitTime_ = soft;
+  }
+  const std::int64_t idle = assembly.userDefaults->integerForKey("TVXSessionIdleTimeOverride");
+  if (idle < 1) {
+    log().error("Idle limit override value must be greater than 0 : {} defaulting to {}", idle, kDefaultIdleTime);
+    idleTime_ = kDefaultIdleTime;
+  } else {
+    idleTime_ = idle;
+  }
+  maxTime_ = kGuidExpiration - softLimitTime_;
+  if (assembly.sharedSession) {
+    log().info("Tavix is using shared session for all clients {}", identifier_);
+  } else {
+    log().info("Tavix is using individual session for clients {}", identifier_);
+  }
+  log().debug("Idle Time {} Soft Limit Time {} Max Time {}", idleTime_, softLimitTime_, maxTime_);
+}
+
+ClientSessionManager::~ClientSessionManager() {
+  for (auto& timer : timers_) timer.cancel();
+}
+
+void ClientSessionManager::addTavixFeedback(FeedbackRef feedback) {
+  if (!feedback) return;
+  auto transaction = std::make_shared<platform::TransactionTracker::Transaction>();
+  if (assembly_.transactions) *transaction = assembly_.transactions->begin("addFeedback");
+  // The feedbackEnabled check of the client's bag belongs here once the bag controller exists.
+  sessionQueue_.async([self = shared_from_this(), feedback, transaction] {
+    const platform::TimePoint now = self->assembly_.clock->now();
+    feedback->set_user_guid(self->guidController_ ? self->guidController_->currentUserGUID() : std::string());
+    if (self->currentState_ != kNoSession && self->sessionGuid() != feedback->user_guid()) {
+      self->updateState(kGuidChanged, feedback);
+    } else if (self->currentState_ != kActive && self->currentState_ != kNoSession) {
+      const int type = feedbackType(*feedback);
+      if (type == kFeedbackTypeVisibleResults || type == kFeedbackTypeCardEngagement) {
+        self->updateState(kSentinelFeedback, feedback);
+      } else if (self->expirationTime_ <= now) {
+        self->updateState(kIdleAfterSoftLimit, feedback);
+      } else {
+        self->updateState(kFeedbackAdded, feedback);
+      }
+    } else {
+      self->updateState(kFeedbackAdded, feedback);
+    }
+    self->expirationTime_ = now + platform::seconds(static_cast<double>(self->idleTime_));
+  });
+}
+
+void ClientSessionManager::flushSession(std::function<void()> done) {
+  sessionQueue_.async([self = shared_from_this(), done = std::move(done)] {
+    self->updateState(kExternalRequest, nullptr, done);
+  });
+}
+
+void ClientSessionManager::flushSessionInvalidationWithAgent(const std::string& agent,
+                                                             std::function<void(bool)> callback) {
+  if (assembly_.sharedSession) {
+    addTavixFeedback(makeTavixFeedbackWithCodable(proto::CTConnectionInvalidatedFeedback(), 0, "", agent));
+    if (callback) callback(false);
+    return;
+  }
+  flushSession([callback = std::move(callback)] {
+    if (callback) callback(true);
+  });
+}
+
+void ClientSessionManager::reportErrorAsTavixdFeedback(int code, const std::string& domain, const std::string& reason,
+                                                       Assembly& assembly) {
+  if (!assembly.clientSessionManager) return;
+  proto::CTErrorFeedback error;
+  error.set_code(code);
+  error.set_domain(domain);
+  error.set_reason(reason);
+  const std::string guid = assembly.guidController ? assembly.guidController->currentUserGUID() : std::string();
+  assembly.clientSessionManager->addTavixFeedback(makeTavixFeedbackWithCodable(error, 0, guid, tavixdUserAgent()));
+}
+
+unsigned ClientSessionManager::currentState() {
+  unsigned state = 0;
+  sessionQueue_.sync([&] { state = currentState_; });
+  return state;
+}
+
+bool ClientSessionManager::hasSession() {
+  bool open = false;
+  sessionQueue_.sync([&] { open = single_ || shared_; });
+  return open;
+}
+
+std::string ClientSessionManager::sessionGuid() const {
+  if (shared_) return shared_->userGuid();
+  return single_ ? single_->userGuid() : std::string();
+}
+
+void ClientSessionManager::updateState(unsigned event, const FeedbackRef& feedback, std::function<void()> callback) {
+  sessionQueue_.assertCurrent("ClientSessionManager::updateState");
+  auto addToSession = [this](const FeedbackRef& f) {
+    if (shared_) shared_->addFeedback(f);
+    if (single_) single_->addFeedback(f);
+  };
+  switch (event) {
+    case kFeedbackAdded:
+      if (currentState_ == kActive || currentState_ == kSoftLimitReached) {
+        addToSession(feedback);
+      } else if (currentState_ == kNoSession) {
+        setNewSession(feedback);
+        currentState_ = kActive;
+      } else {
+        log().debug("Avoided adding feedback in state {}", currentState_);
+      }
+      break;
+    case kSoftLimitReachedEvent:
+      if (currentState_ == kActive) currentState_ = kSoftLimitReached;
+      break;
+    case kMaxTimerExpired:
+      if (currentState_ == kSoftLimitReached) {
+        flushSessionWithReason(4, [this] { log().notice("session flushed because max timer expired {}", identifier_); });
+        currentState_ = kNoSession;
+      }
+      break;
+    case kExternalRequest:
+      if (currentState_ <= kNoSession) {
+        flushSessionWithReason(2, std::move(callback));
+        currentState_ = kNoSession;
+        return;
+      }
+      break;
+    case kIdleAfterSoftLimit:
+      if (currentState_ == kSoftLimitReached) {
+        flushSessionWithReason(3);
+        log().notice("session flushed because soft limit reached and idle time was beyond {} {}", idleTime_, identifier_);
+        if (guidController_) {
+          guidController_->reset();
+          feedback->set_user_guid(guidController_->currentUserGUID());
+        }
+        setNewSession(feedback);
+        currentState_ = kActive;
+      }
+      break;
+    case kGuidChanged:
+      if (currentState_ == kActive || currentState_ == kSoftLimitReached) {
+        flushSessionWithReason(5);
+        log().notice("session flushed because guid changed {}", identifier_);
+        setNewSession(feedback);
+        currentState_ = kActive;
+      }
+      break;
+    case kSentinelFeedback:
+      if (currentState_ == kSoftLimitReached) {
+        addToSession(feedback);
+        flushSessionWithReason(7);
+        log().notice("session flushed because soft limit reached and sentinel feedback received");
+        if (guidController_) guidController_->reset();
+        currentState_ = kNoSession;
+      }
+      break;
+    default:
+      log().debug("External event received {}", event);
+      break;
+  }
+  if (callback) callback();
+}
+
+void ClientSessionManager::setNewSession(const FeedbackRef& feedback) {
+  ++sessionCounter_;
+  if (assembly_.sharedSession) {
+    shared_ = std::make_shared<ClientSessionShared>(assembly_, feedback, flushReason_);
+  } else {
+    single_ = ClientSession::open(assembly_, feedback, flushReason_);
+  }
+  log().notice("new session id {} {}", sessionCounter_, identifier_);
+  // Fixed at 600 s whatever the soft-limit override: the override only moves maxTime.
+  std::weak_ptr<ClientSessionManager> weak = weak_from_this();
+  const std::uint64_t expected = sessionCounter_;
+  timers_.push_back(assembly_.clock->after(platform::seconds(600), sessionQueue_, [weak, expected] {
+    auto self = weak.lock();
+    if (!self) return;
+    log().notice("soft limit reached expected {} current {} {}", expected, self->sessionCounter_, self->identifier_);
+    if (expected == self->sessionCounter_) self->onSoftLimitReached();
+  }));
+}
+
+void ClientSessionManager::onSoftLimitReached() {
+  if (!single_ && !shared_) return;
+  updateState(kSoftLimitReachedEvent, nullptr);
+  log().notice("soft limit reached, maxtimer session id {} {}", sessionCounter_, identifier_);
+  if (auto center = assembly_.notificationCenter) {
+    sessionQueue_.async([center] { center->post(kTVXSessionSoftLimitNotification); });
+  }
+  std::weak_ptr<ClientSessionManager> weak = weak_from_this();
+  const std::uint64_t expected = sessionCounter_;
+  timers_.push_back(assembly_.clock->after(platform::seconds(static_cast<double>(maxTime_)), sessionQueue_,
+                                           [weak, expected] {
+    auto self = weak.lock();
+    if (!self) return;
+    log().notice("max timer expired expected {} current {}", expected, self->sessionCounter_);
+    if (expected == self->sessionCounter_ && (self->single_ || self->shared_)) {
+      self->updateState(kMaxTimerExpired, nullptr);
+    }
+    if (auto center = self->assembly_.notificationCenter) center->post(kTVXSessionMaxLimitNotification);
+  }));
+}
+
+void ClientSessionManager::flushSessionWithReason(int reason, std::function<void()> callback) {
+  if (single_ || shared_) {
+    flushReason_ = reason;
+    auto close = [reason](ClientSession& session) {
+      if (reason != 0) {
+        proto::CTSessionEndFeedback end;
+        end.set_reason(static_cast<proto::SessionEndReason::Value>(reason));
+        session.addFeedback(makeTavixFeedbackWithCodable(end, 0, session.userGuid(), session.agent()));
+      }
+      session.sessionComplete();
+    };
+    if (shared_) shared_->enumerateSessionsUsingBlock(close);
+    if (single_) close(*single_);
+    single_.reset();
+    shared_.reset();
+  }
+  if (callback) callback();
+}
+
+}  // namespace tavix

@@ -1,0 +1,114 @@
+// Decides when feedback sessions begin and end. Every feedback event passes through
+// addTavixFeedback(): it is stamped with the current user GUID and joins the open session, opens
+// a new one, or closes the old one first. Sessions end at the maximum time after the soft limit
+// (reason 4), when idle past the soft limit (3), on a sentinel event past the soft limit (7), on
+// a GUID change (5) or on request (2); closed sessions go to persistent storage.
+//
+// Threading: owns the serial queue "com.norvel.tavixd.clientSessionManagerQueue"; the state
+// machine, its timers and closing run only there. Public calls hop onto it asynchronously,
+// except the synchronous readers. Must be owned by a shared_ptr (timers hold it weakly).
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <string>
+
+#include "feedback/client_session.h"
+#include "platform/clock.h"
+#include "platform/dispatch.h"
+
+namespace tavix {
+
+class TavixUserGUIDController;
+
+inline constexpr const char* kTVXSessionSoftLimitNotification = "TVXSessionSoftLimitNotification";
+inline constexpr const char* kTVXSessionMaxLimitNotification = "TVXSessionMaxLimitNotification";
+
+// One session per client user agent, opened and closed together (shared sessions).
+// Owns the queue "com.norvel.tavixd.clientSessionSharedQueue", always entered after the
+// manager's queue, never the reverse.
+class ClientSessionShared {
+ public:
+  ClientSessionShared(Assembly& assembly, FeedbackRef first, int previousSessionEndReason = 1);
+  // Asynchronous. Events without a user agent are dropped.
+  void addFeedback(const FeedbackRef& feedback);
+  // Synchronous; the block sees each member session.
+  void enumerateSessionsUsingBlock(const std::function<void(ClientSession&)>& block);
+  const std::string& userGuid() const { return userGuid_; }
+
+ private:
+  Assembly& assembly_;
+  std::string userGuid_;
+  int previousSessionEndReason_;
+  std::map<std::string, std::shared_ptr<ClientSession>> sessionMap_;
+  platform::SerialQueue queue_;
+};
+
+class ClientSessionManager : public std::enable_shared_from_this<ClientSessionManager> {
+ public:
+  enum State : unsigned { kActive = 0, kSoftLimitReached = 1, kNoSession = 2 };
+  enum Event : unsigned {
+    kFeedbackAdded = 0,
+    kSoftLimitReachedEvent = 1,
+    kMaxTimerExpired = 2,
+    kExternalRequest = 3,
+    kIdleAfterSoftLimit = 4,
+    kGuidChanged = 5,
+    kSentinelFeedback = 6,
+  };
+
+  // Reads "TVXSessionSoftLimitOverride" and "TVXSessionIdleTimeOverride" once.
+  ClientSessionManager(Assembly& assembly, std::shared_ptr<TavixUserGUIDController> guidController,
+                       std::string identifier);
+  ~ClientSessionManager();
+  ClientSessionManager(const ClientSessionManager&) = delete;
+  ClientSessionManager& operator=(const ClientSessionManager&) = delete;
+
+  // Asynchronous; the whole path holds the "addFeedback" transaction.
+  void addTavixFeedback(FeedbackRef feedback);
+  // Asynchronous: closes the open session with reason 2, then calls `done` (also with none open).
+  void flushSession(std::function<void()> done = {});
+  // A client's connection went away: with shared sessions a connection-invalidated event is added
+  // and `callback(false)` runs at once; otherwise the session is flushed, then `callback(true)`.
+  void flushSessionInvalidationWithAgent(const std::string& agent, std::function<void(bool)> callback);
+
+  // Wraps an error as daemon feedback (query id 0, current GUID, tavixdUserAgent()) and adds it
+  // through the assembly's manager.
+  static void reportErrorAsTavixdFeedback(int code, const std::string& domain, const std::string& reason,
+                                          Assembly& assembly);
+
+  // Synchronous readers (not from the manager's queue).
+  unsigned currentState();
+  bool hasSession();
+  std::int64_t softLimitTime() const { return softLimitTime_; }
+  std::int64_t idleTime() const { return idleTime_; }
+  std::int64_t maxTime() const { return maxTime_; }
+  const std::string& identifier() const { return identifier_; }
+  platform::SerialQueue& sessionQueue() { return sessionQueue_; }
+
+ private:
+  void updateState(unsigned event, const FeedbackRef& feedback, std::function<void()> callback = {});
+  void setNewSession(const FeedbackRef& feedback);
+  void onSoftLimitReached();
+  void flushSessionWithReason(int reason, std::function<void()> callback = {});
+  std::string sessionGuid() const;
+
+  Assembly& assembly_;
+  std::shared_ptr<TavixUserGUIDController> guidController_;
+  std::string identifier_;
+  std::shared_ptr<ClientSession> single_;         // open session (individual mode)
+  std::shared_ptr<ClientSessionShared> shared_;   // open session (shared mode)
+  unsigned currentState_ = kNoSession;
+  std::uint64_t sessionCounter_ = 0;
+  int flushReason_ = 0;
+  std::int64_t softLimitTime_ = 600;
+  std::int64_t idleTime_ = 180;
+  std::int64_t maxTime_ = 300;
+  platform::TimePoint expirationTime_{};
+  std::vector<platform::TimerHandle> timers_;
+  platform::SerialQueue sessionQueue_;
+};
+
+}  // namespace tavix

@@ -1,0 +1,182 @@
+#include "feedback/client_session_manager.h"
+
+#include <gtest/gtest.h>
+
+#include "context/user_guid_controller.h"
+#include "core/assembly.h"
+#include "feedback/persistent_storage.h"
+#include "platform/defaults.h"
+#include "platform/notification_center.h"
+#include "support/temp_home.h"
+
+namespace tavix {
+namespace {
+
+struct ManagerFixture {
+  testing::TempHome home;
+  platform::DispatchPool pool{4};
+  platform::VirtualClock clock;
+  Assembly assembly;
+  std::shared_ptr<TavixUserGUIDController> guid;
+  std::shared_ptr<ClientSessionManager> manager;
+
+  explicit ManagerFixture(bool shared = false, std::int64_t softLimit = 600) {
+    assembly.dispatchPool = &pool;
+    assembly.clock = &clock;
+    assembly.sharedSession = shared;
+    assembly.paths.cacheHome = home.cache();
+    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
+    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
+    assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
+                                             {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})},
+                                             {"TVXSessionSoftLimitOverride", platform::PropertyValue(softLimit)},
+                                             {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
+    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+    guid = std::make_shared<TavixUserGUIDController>(assembly);
+    manager = std::make_shared<ClientSessionManager>(assembly, guid, "tavix");
+  }
+  ~ManagerFixture() { pool.drain(); }
+
+  void send(int type, double atSeconds, const std::string& agent = "seekara/1") {
+    const double now = platform::toUnixSeconds(clock.now()) - 1767225600;
+    if (atSeconds > now) clock.advance(platform::seconds(atSeconds - now));
+    proto::CTFeedbackPayload payload;
+    payload.set_type(type);
+    payload.mutable_cache_hit()->set_timestamp(static_cast<std::uint64_t>(atSeconds * 1e9));
+    payload.mutable_cache_hit()->set_input("t=" + std::to_string(static_cast<int>(atSeconds)));
+    manager->addTavixFeedback(makeTavixFeedback(payload, 1, "", agent));
+    manager->currentState();  // wait for the event to be handled
+  }
+  void advanceTo(double atSeconds) {
+    const double now = platform::toUnixSeconds(clock.now()) - 1767225600;
+    clock.advance(platform::seconds(atSeconds - now));
+  }
+  // The closed sessions, each as its events' (type, input) pairs.
+  std::vector<proto::CTClientSession> closed() {
+    pool.drain();
+    std::vector<proto::CTClientSession> out;
+    for (auto& handle : assembly.persistentStorage->getAvailableSessionHandles()) {
+      if (auto record = handle->readRecord()) out.push_back(*record);
+    }
+    std::sort(out.begin(), out.end(), [](auto& a, auto& b) { return a.session_start() < b.session_start(); });
+    return out;
+  }
+};
+
+int endReason(const proto::CTClientSession& s) {
+  const auto& last = s.feedbacks(s.feedbacks_size() - 1).payload();
+  return last.has_session_end() ? last.session_end().reason() : -1;
+}
+
+TEST(ClientSessionManager, SteadyFeedbackRunsToTheMaxTimeAndClosesWithReason4) {
+  ManagerFixture f;
+  int softLimitPosts = 0;
+  auto reg = f.assembly.notificationCenter->addObserver(kTVXSessionSoftLimitNotification, nullptr, nullptr,
+                                                        [&](const platform::Notification&) { ++softLimitPosts; });
+  for (int t = 0; t <= 850; t += 170) {
+    f.send(39, t);
+    EXPECT_EQ(f.manager->currentState(), t < 600 ? 0u : 1u) << "at " << t;
+  }
+  f.advanceTo(899);
+  EXPECT_TRUE(f.manager->hasSession());
+  f.advanceTo(900);
+  EXPECT_EQ(f.manager->currentState(), 2u);
+  f.pool.drain();
+  EXPECT_EQ(softLimitPosts, 1);
+  auto sessions = f.closed();
+  ASSERT_EQ(sessions.size(), 1u);
+  EXPECT_EQ(sessions[0].feedbacks_size(), 7);  // six events and the session end
+  EXPECT_EQ(endReason(sessions[0]), 4);
+}
+
+TEST(ClientSessionManager, IdleOrSentinelPastTheSoftLimitEndsTheSession) {
+  ManagerFixture f;
+  f.send(39, 0);
+  f.send(39, 500);
+  f.advanceTo(600);
+  EXPECT_EQ(f.manager->currentState(), 1u);
+  f.send(39, 681);  // 181 s after the last event: idle
+  EXPECT_EQ(f.manager->currentState(), 0u);
+  auto sessions = f.closed();
+  ASSERT_EQ(sessions.size(), 1u);
+  EXPECT_EQ(endReason(sessions[0]), 3);
+  EXPECT_EQ(sessions[0].feedbacks_size(), 3);
+
+  // The idle event opened the next session; past its soft limit a visible-results event is its last.
+  f.advanceTo(681 + 600);
+  EXPECT_EQ(f.manager->currentState(), 1u);
+  f.send(8, 681 + 610);
+  EXPECT_EQ(f.manager->currentState(), 2u);
+  sessions = f.closed();
+  ASSERT_EQ(sessions.size(), 2u);
+  EXPECT_EQ(sessions[1].feedbacks(0).payload().cache_hit().input(), "t=681");
+  EXPECT_EQ(sessions[1].previous_session_end_reason(), 3);
+  EXPECT_EQ(endReason(sessions[1]), 7);
+  EXPECT_EQ(sessions[1].feedbacks(1).payload().type(), 8);
+  EXPECT_NE(sessions[1].user_guid_string(), sessions[0].user_guid_string());  // the idle close rolled it
+}
+
+TEST(ClientSessionManager, NewUserGuidClosesTheSessionAtOnce) {
+  ManagerFixture f;
+  f.send(39, 0);
+  f.send(39, 10);
+  f.guid->reset();
+  f.send(39, 20);
+  EXPECT_EQ(f.manager->currentState(), 0u);
+  auto sessions = f.closed();
+  ASSERT_EQ(sessions.size(), 1u);
+  EXPECT_EQ(endReason(sessions[0]), 5);
+  EXPECT_EQ(sessions[0].feedbacks_size(), 3);
+  f.manager->flushSession();
+  sessions = f.closed();
+  ASSERT_EQ(sessions.size(), 2u);
+  EXPECT_EQ(sessions[1].feedbacks(0).payload().cache_hit().input(), "t=20");
+  EXPECT_EQ(sessions[1].previous_session_end_reason(), 5);
+}
+
+TEST(ClientSessionManager, LimitsOverridesAndFlushes) {
+  {
+    ManagerFixture f(false, 900);
+    EXPECT_EQ(f.manager->softLimitTime(), 600);
+    EXPECT_EQ(f.manager->maxTime(), 300);
+  }
+  ManagerFixture f(false, 899);
+  EXPECT_EQ(f.manager->maxTime(), 1);
+  bool called = false;
+  f.manager->flushSession([&] { called = true; });
+  EXPECT_EQ(f.manager->currentState(), 2u);
+  EXPECT_TRUE(called);  // even with no session open
+
+  f.send(39, 0);
+  f.advanceTo(599);
+  EXPECT_EQ(f.manager->currentState(), 0u);  // the soft-limit timer does not follow the override
+  f.advanceTo(600);
+  EXPECT_EQ(f.manager->currentState(), 1u);
+  f.advanceTo(601);
+  EXPECT_EQ(f.manager->currentState(), 2u);
+  auto sessions = f.closed();
+  ASSERT_EQ(sessions.size(), 1u);
+  EXPECT_EQ(endReason(sessions[0]), 4);
+}
+
+TEST(ClientSessionManager, SharedSessionKeepsOneMemberPerClientAndClosesThemTogether) {
+  ManagerFixture f(true);
+  f.send(39, 0, "seekara/1");
+  f.send(39, 10, "brovane/2");
+  f.send(39, 20, "seekara/1");
+  bool invalidated = true;
+  f.manager->flushSessionInvalidationWithAgent("brovane/2", [&](bool flushed) { invalidated = flushed; });
+  EXPECT_FALSE(invalidated);
+  f.manager->flushSession();
+  EXPECT_EQ(f.manager->currentState(), 2u);
+  auto sessions = f.closed();
+  ASSERT_EQ(sessions.size(), 2u);
+  for (const auto& s : sessions) {
+    EXPECT_EQ(endReason(s), 2);
+    ASSERT_EQ(s.feedbacks_size(), 3);
+    if (s.agent() == "brovane/2") EXPECT_TRUE(s.feedbacks(1).payload().has_connection_invalidated());
+  }
+}
+
+}  // namespace
+}  // namespace tavix

@@ -1,0 +1,117 @@
+#include "feedback/client_session.h"
+
+#include <gtest/gtest.h>
+
+#include <nlohmann/json.hpp>
+
+#include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "feedback/persistent_storage.h"
+#include "platform/counters.h"
+#include "platform/defaults.h"
+#include "platform/log.h"
+#include "support/temp_home.h"
+
+namespace tavix {
+namespace {
+
+constexpr const char* kGuid = "0C9E0C3F-7B1B-4E42-A7B2-0E2A8C1F3D11";
+
+struct SessionFixture {
+  testing::TempHome home;
+  platform::DispatchPool pool{2};
+  platform::VirtualClock clock;
+  Assembly assembly;
+  SessionFixture() {
+    assembly.dispatchPool = &pool;
+    assembly.clock = &clock;
+    assembly.paths.cacheHome = home.cache();
+    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
+    assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
+                                             {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})}});
+    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+  }
+  proto::CTClientSession readBack(ClientSession& session) {
+    session.sessionComplete();
+    auto handles = assembly.persistentStorage->getAvailableSessionHandles();
+    EXPECT_FALSE(handles.empty());
+    return handles.back()->readRecord().value_or(proto::CTClientSession());
+  }
+};
+
+FeedbackRef engagement(const std::string& id, std::uint64_t ms, const std::string& guid = kGuid,
+                       const std::string& agent = "Brovane/17") {
+  proto::CTResultEngagementFeedback e;
+  e.set_timestamp(ms * 1000000);
+  e.mutable_result()->set_id(id);
+  return makeTavixFeedbackWithCodable(e, 5, guid, agent);
+}
+
+TEST(ClientSession, FirstUseOfTheDayAndCountersFollowTheClient) {
+  SessionFixture f;
+  platform::LogCapture logs;
+  const auto sessionsBefore = TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.brovane.sessions");
+  const auto dailyBefore = TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.brovane.dailyactiveusers");
+  auto first = ClientSession::open(f.assembly, engagement("a", 1));
+  EXPECT_TRUE(first->firstUseOfTheDay());
+  EXPECT_TRUE(logs.contains("Found something other than a date in defaults for key TavixFirstUseOfTheDay_brovane."));
+  EXPECT_TRUE(f.assembly.userDefaults->dateForKey("TavixFirstUseOfTheDay_brovane").has_value());
+
+  f.clock.advance(platform::seconds(60));
+  auto second = ClientSession::open(f.assembly, engagement("b", 2));
+  EXPECT_FALSE(second->firstUseOfTheDay());
+  EXPECT_EQ(TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.brovane.sessions"), sessionsBefore + 2);
+  EXPECT_EQ(TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.brovane.dailyactiveusers"), dailyBefore + 1);
+
+  f.clock.advance(platform::seconds(86400));
+  EXPECT_TRUE(ClientSession::open(f.assembly, engagement("c", 3))->firstUseOfTheDay());
+
+  const auto nullBefore = TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.(null).sessions");
+  auto other = ClientSession::open(f.assembly, engagement("d", 4, kGuid, "SomethingElse/1"));
+  EXPECT_FALSE(other->firstUseOfTheDay());
+  EXPECT_EQ(TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.(null).sessions"), nullBefore + 1);
+}
+
+TEST(ClientSession, EventsReachTheFileAndAForeignGuidIsFlagged) {
+  SessionFixture f;
+  auto session = ClientSession::open(f.assembly, engagement("a", 1), 3);
+  session->addFeedback(engagement("b", 2, "11111111-2222-4333-8444-555555555555"));
+  session->addFeedback(nullptr);
+  auto record = f.readBack(*session);
+  ASSERT_EQ(record.feedbacks_size(), 3);
+  EXPECT_EQ(record.feedbacks(1).payload().result_engagement().result().id(), "b");
+  EXPECT_EQ(record.feedbacks(2).payload().error().code(), 500);
+  EXPECT_EQ(record.feedbacks(2).payload().error().reason(), "different guid in session");
+  EXPECT_EQ(record.agent(), "Brovane/17");
+  EXPECT_EQ(record.previous_session_end_reason(), 3);
+}
+
+TEST(ClientSession, UploadRecordIsPrivacyFilteredWithMissingObjectsFirst) {
+  SessionFixture f;
+  proto::CTSuggestionEngagementFeedback suggestion;
+  suggestion.set_timestamp(5000000);
+  suggestion.mutable_suggestion()->set_id("server-suggestion-42");
+  auto session = ClientSession::open(f.assembly, makeTavixFeedbackWithCodable(suggestion, 1, kGuid, "seekara/3"), 2);
+  session->addFeedback(engagement("device-result-7", 1005, kGuid, "seekara/3"));
+  auto back = ClientSession::fromRecord(f.assembly, f.readBack(*session));
+
+  auto upload = nlohmann::json::parse(back->getFeedbacksToSend());
+  EXPECT_EQ(upload.size(), 7u);
+  EXPECT_EQ(upload["agent"], "seekara/3");
+  EXPECT_EQ(upload["user_guid"], kGuid);
+  EXPECT_EQ(upload["base_time"], 0);  // a session opened by a suggestion engagement
+  EXPECT_EQ(upload["previous_session_end_reason"], "external_request");
+  EXPECT_EQ(upload["resource_versions"], nlohmann::json::object());
+  const auto& fb = upload["fb"];
+  ASSERT_EQ(fb.size(), 4u);
+  EXPECT_EQ(fb[0]["type"], "session_missing_suggestions");
+  EXPECT_EQ(fb[0]["suggestions"][0]["id"], "1");
+  EXPECT_EQ(fb[1]["type"], "session_missing_results");
+  EXPECT_EQ(fb[1]["results"][0]["id"], "2");
+  EXPECT_EQ(fb[2]["timestamp"], 0);
+  EXPECT_EQ(fb[3]["timestamp"], 1000);
+  EXPECT_EQ(upload.dump().find("device-result-7"), std::string::npos);
+}
+
+}  // namespace
+}  // namespace tavix

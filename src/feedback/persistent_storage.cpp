@@ -1,0 +1,402 @@
+#include "feedback/persistent_storage.h"
+
+#include <fcntl.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <google/protobuf/io/coded_stream.h>
+#include <google/protobuf/wire_format_lite.h>
+
+#include <cerrno>
+#include <charconv>
+#include <cstring>
+
+#include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "core/logging.h"
+#include "network/user_agent.h"
+#include "platform/clock.h"
+#include "platform/defaults.h"
+#include "platform/transactions.h"
+#include "tavix_proto/feedback_session.pb.h"
+
+namespace tavix {
+
+namespace fs = platform::fs;
+using google::protobuf::internal::WireFormatLite;
+
+namespace {
+
+constexpr const char* kSessionPrefix = "session.";
+constexpr int kFeedbacksFieldNumber = 100;
+
+platform::Logger& log() { return TavixLogForCategory(TavixLoggingCategoryFeedbackStorage); }
+
+std::string errnoText(int error) { return std::strerror(error); }
+
+// A read-only private mapping of a whole file; unmapped when it goes.
+class MappedFile {
+ public:
+  explicit MappedFile(int fd, std::size_t size) : size_(size) {
+    if (size_ == 0) return;
+    void* p = ::mmap(nullptr, size_, PROT_READ, MAP_PRIVATE, fd, 0);
+    if (p == MAP_FAILED) {
+      error_ = errno;
+    } else {
+      data_ = static_cast<const char*>(p);
+    }
+  }
+  ~MappedFile() {
+    if (data_) ::munmap(const_cast<char*>(data_), size_);
+  }
+  MappedFile(const MappedFile&) = delete;
+  MappedFile& operator=(const MappedFile&) = delete;
+  const char* data() const { return data_; }
+  std::size_t size() const { return size_; }
+  int error() const { return error_; }
+
+ private:
+  const char* data_ = nullptr;
+  std::size_t size_;
+  int error_ = 0;
+};
+
+// The ends of the complete top-level fields of `data`, in order; stops at the first field that
+// is cut off or malformed.
+std::vector<std::size_t> completeFieldEnds(const char* data, std::size_t size) {
+  std::vector<std::size_t> ends;
+  google::protobuf::io::CodedInputStream in(reinterpret_cast<const std::uint8_t*>(data), static_cast<int>(size));
+  in.SetTotalBytesLimit(static_cast<int>(size));
+  while (true) {
+    const std::uint32_t tag = in.ReadTag();
+    if (tag == 0) break;
+    if (!WireFormatLite::SkipField(&in, tag)) break;
+    ends.push_back(static_cast<std::size_t>(in.CurrentPosition()));
+  }
+  return ends;
+}
+
+std::string encodeFeedbackField(const proto::CTTavixFeedback& feedback) {
+  std::string body = feedback.SerializeAsString();
+  std::string out;
+  out.reserve(body.size() + 8);
+  std::uint32_t tag = WireFormatLite::MakeTag(kFeedbacksFieldNumber, WireFormatLite::WIRETYPE_LENGTH_DELIMITED);
+  while (tag >= 0x80) {
+    out.push_back(static_cast<char>((tag & 0x7F) | 0x80));
+    tag >>= 7;
+  }
+  out.push_back(static_cast<char>(tag));
+  std::uint64_t length = body.size();
+  while (length >= 0x80) {
+    out.push_back(static_cast<char>((length & 0x7F) | 0x80));
+    length >>= 7;
+  }
+  out.push_back(static_cast<char>(length));
+  out += body;
+  return out;
+}
+
+// The creation time of a file. Linux keeps a birth time only on some file systems, so the
+// earlier of birth and modification time stands in for it.
+std::optional<platform::TimePoint> creationDate(const fs::path& path, std::string* error) {
+  struct statx sx {};
+  if (::statx(AT_FDCWD, path.c_str(), 0, STATX_BTIME | STATX_MTIME, &sx) != 0) {
+    *error = errnoText(errno);
+    return std::nullopt;
+  }
+  double seconds = static_cast<double>(sx.stx_mtime.tv_sec) + sx.stx_mtime.tv_nsec / 1e9;
+  if (sx.stx_mask & STATX_BTIME) {
+    const double birth = static_cast<double>(sx.stx_btime.tv_sec) + sx.stx_btime.tv_nsec / 1e9;
+    if (birth < seconds) seconds = birth;
+  }
+  return platform::fromUnixSeconds(seconds);
+}
+
+}  // namespace
+
+// ---- FileContainer --------------------------------------------------------------------------
+
+FileContainer::FileContainer(fs::path fileUrl, std::string version, platform::SerialQueue& queue,
+                             std::uint64_t maxFileSize, platform::TransactionTracker* transactions)
+    : fileUrl_(std::move(fileUrl)),
+      version_(std::move(version)),
+      queue_(queue),
+      maxFileSize_(maxFileSize),
+      transactions_(transactions) {}
+
+FileContainer::FileContainer(int fd, fs::path fileUrl, std::string version, platform::SerialQueue& queue,
+                             std::uint64_t maxFileSize, platform::TransactionTracker* transactions)
+    : FileContainer(std::move(fileUrl), std::move(version), queue, maxFileSize, transactions) {
+  fd_ = fd;
+}
+
+FileContainer::~FileContainer() {
+  // Async blocks hold the container, so by now nothing else can touch the handle.
+  if (fd_ >= 0) ::close(fd_);
+}
+
+void FileContainer::writeSessionHeader(const proto::CTClientSession& header) {
+  std::string data = header.SerializeAsString();
+  queue_.async([self = shared_from_this(), data = std::move(data)] {
+    if (self->fd_ < 0 || !self->appendData(data)) {
+      log().error("Could not write session to file.");
+      self->closeNow();
+    }
+  });
+}
+
+void FileContainer::writeFeedback(const proto::CTTavixFeedback& feedback, std::function<void()> done) {
+  std::string data = encodeFeedbackField(feedback);
+  queue_.async([self = shared_from_this(), data = std::move(data), done = std::move(done)] {
+    if (self->fd_ < 0) return;
+    self->appendData(data);
+    if (done) done();
+  });
+}
+
+bool FileContainer::appendData(const std::string& data) {
+  queue_.assertCurrent("FileContainer::appendData");
+  platform::TransactionTracker::Transaction transaction;
+  if (transactions_) transaction = transactions_->begin("archiveObject");
+  const off_t offset = ::lseek(fd_, 0, SEEK_END);
+  if (offset < 0) {
+    log().error("{}", errnoText(errno));
+    return false;
+  }
+  if (static_cast<std::uint64_t>(offset) + data.size() >= maxFileSize_) {
+    TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.filesizeexceeded");
+    log().error("bytes written ({}) + feedback ({}) exceeds max session size ({})", static_cast<std::uint64_t>(offset),
+                data.size(), maxFileSize_);
+    closeNow();
+    return false;
+  }
+  std::size_t written = 0;
+  while (written < data.size()) {
+    const ssize_t n = ::write(fd_, data.data() + written, data.size() - written);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      log().error("{}", errnoText(errno));
+      return false;
+    }
+    written += static_cast<std::size_t>(n);
+  }
+  return true;
+}
+
+void FileContainer::close() {
+  queue_.async([self = shared_from_this()] {
+    log().debug("close file url {}", self->fileUrl_.string());
+    self->closeNow();
+  });
+}
+
+void FileContainer::closeNow() {
+  if (fd_ >= 0) ::close(fd_);
+  fd_ = -1;
+}
+
+bool FileContainer::isOpen() {
+  bool open = false;
+  queue_.sync([&] { open = fd_ >= 0; });
+  return open;
+}
+
+std::optional<proto::CTClientSession> FileContainer::readRecord() {
+  std::optional<proto::CTClientSession> result;
+  queue_.sync([&] {
+    log().debug("reading file url {}", fileUrl_.string());
+    if (fd_ >= 0) {
+      log().fault("file is already open closing it {}", fileUrl_.string());
+      closeNow();
+    }
+    if (fileUrl_.empty()) {
+      log().error("No file url available");
+      return;
+    }
+    struct stat st {};
+    if (::stat(fileUrl_.c_str(), &st) != 0) {
+      log().error("Attribute fetch error {}", errnoText(errno));
+      return;
+    }
+    if (static_cast<std::uint64_t>(st.st_size) > maxFileSize_) {
+      TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.filetoolarge");
+      log().error("Session too big to process");
+      return;
+    }
+    fd_ = ::open(fileUrl_.c_str(), O_RDONLY | O_CLOEXEC);
+    if (fd_ < 0) {
+      log().error("Could not open file for reading {}", errnoText(errno));
+      return;
+    }
+    result = unarchiveObject();
+    closeNow();
+  });
+  return result;
+}
+
+std::optional<proto::CTClientSession> FileContainer::unarchiveObject() {
+  struct stat st {};
+  if (::fstat(fd_, &st) != 0) {
+    log().error("mmap: {}", errnoText(errno));
+    return std::nullopt;
+  }
+  MappedFile map(fd_, static_cast<std::size_t>(st.st_size));
+  if (map.error()) {
+    log().error("mmap: {}", errnoText(map.error()));
+    return std::nullopt;
+  }
+  log().debug("unarchive {}", fileUrl_.string());
+  if (map.size() == 0) {
+    log().error("found empty session file");
+    return std::nullopt;
+  }
+  proto::CTClientSession session;
+  if (!session.ParseFromArray(map.data(), static_cast<int>(map.size()))) {
+    // Keep the longest run of whole fields that parses: an append cut off by a crash (or a
+    // damaged last record) costs only that record.
+    const std::vector<std::size_t> ends = completeFieldEnds(map.data(), map.size());
+    std::size_t lo = 0, hi = ends.size();  // prefixes of ends[0..k) for k in [lo, hi]
+    bool found = false;
+    proto::CTClientSession best;
+    while (lo < hi) {
+      const std::size_t mid = (lo + hi + 1) / 2;
+      proto::CTClientSession candidate;
+      if (candidate.ParseFromArray(map.data(), static_cast<int>(ends[mid - 1]))) {
+        lo = mid;
+        best = std::move(candidate);
+        found = true;
+      } else {
+        hi = mid - 1;
+      }
+    }
+    if (!found || best.feedbacks_size() == 0) {
+      log().error("File contents did not deserialize into a _CTClientSession.");
+      return std::nullopt;
+    }
+    session = std::move(best);
+  }
+  if (session.version() != version_) {
+    log().error("Discarding feedback because of version mismatch. File version {} not equal to current version {}.",
+                session.version(), version_);
+    return std::nullopt;
+  }
+  return session;
+}
+
+// ---- TavixPersistentStorage -----------------------------------------------------------------
+
+TavixPersistentStorage::TavixPersistentStorage(Assembly& assembly)
+    : assembly_(assembly),
+      queue_(*assembly.dispatchPool, "com.norvel.tavixd.persistentStorageQueue"),
+      cachesUrl_(assembly.cachesFolder()),
+      version_(tavixdUserAgent()),
+      maxFileSize_(static_cast<std::uint64_t>(assembly.userDefaults->integerForKey("TVXSessionSizeLimit"))),
+      maxFileAge_(assembly.userDefaults->integerForKey("TVXSessionMaxAge")) {
+  scanDirectory();
+}
+
+TavixPersistentStorage::~TavixPersistentStorage() {
+  queue_.sync([] {});  // let queued appends and deletions finish
+}
+
+void TavixPersistentStorage::scanDirectory() {
+  if (cachesUrl_.empty()) {
+    log().error("error scanning cache directory, could not get path");
+    return;
+  }
+  std::error_code ec;
+  fs::directory_iterator it(cachesUrl_, ec);
+  if (ec) {
+    if (ec != std::errc::no_such_file_or_directory) log().error("error scanning cache directory {}", ec.message());
+    return;
+  }
+  const platform::TimePoint now = assembly_.clock->now();
+  std::int64_t largest = -1;
+  for (const auto& entry : it) {
+    const fs::path url = entry.path();
+    const std::string name = url.filename().string();
+    if (name.empty() || name[0] == '.' || name.rfind(kSessionPrefix, 0) != 0) continue;
+    bool listed = false;
+    for (const auto& container : fileContainers_) listed = listed || container->fileUrl() == url;
+    if (listed) continue;
+    std::string error;
+    const auto created = creationDate(url, &error);
+    if (!created) {
+      log().error("Attribute fetch error {}", error);
+      continue;
+    }
+    if (now - *created > platform::seconds(static_cast<double>(maxFileAge_))) {
+      TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.filetooold");
+      if (!fs::remove(url, ec)) log().error("file removing error {}", ec.message());
+      continue;
+    }
+    const std::string digits = name.substr(std::strlen(kSessionPrefix));
+    std::int64_t number = 0;
+    const auto parsed = std::from_chars(digits.data(), digits.data() + digits.size(), number);
+    const bool numeric = !digits.empty() && parsed.ec == std::errc() && parsed.ptr == digits.data() + digits.size();
+    fileContainers_.push_back(std::make_shared<FileContainer>(
+        url, version_.empty() ? tavixdUserAgent() : version_, queue_, maxFileSize_, assembly_.transactions));
+    if (numeric && number > largest && number < INT32_MAX) largest = number;
+  }
+  if (largest >= 0) {
+    std::int32_t current = handleId_.load();
+    if (largest >= current) handleId_.compare_exchange_strong(current, static_cast<std::int32_t>(largest + 1));
+  }
+}
+
+std::shared_ptr<FileContainer> TavixPersistentStorage::createFileContainerForWriting() {
+  const std::int32_t number = handleId_.fetch_add(1);
+  const fs::path url = cachesUrl_ / (kSessionPrefix + std::to_string(number));
+  (void)platform::createDirectory(cachesUrl_, /*intermediates=*/false);
+  int fd = ::open(url.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600);
+  if (fd < 0) {
+    log().error("Could not get a file url");
+    return nullptr;
+  }
+  ::fchmod(fd, 0600);  // the umask must not widen or narrow it
+  log().debug("new file url {}", url.string());
+  return std::make_shared<FileContainer>(fd, url, version(), queue_, maxFileSize_, assembly_.transactions);
+}
+
+void TavixPersistentStorage::closeSessionWithFileContainer(std::shared_ptr<FileContainer> container) {
+  if (!container) return;
+  queue_.async([this, container] {
+    fileContainers_.push_back(container);
+    log().debug("close file url {}", container->fileUrl().string());
+    container->closeNow();
+  });
+}
+
+std::vector<std::shared_ptr<FileContainer>> TavixPersistentStorage::getAvailableSessionHandles() {
+  std::vector<std::shared_ptr<FileContainer>> copy;
+  queue_.sync([&] { copy = fileContainers_; });
+  return copy;
+}
+
+void TavixPersistentStorage::deleteSessionWithFileContainer(std::shared_ptr<FileContainer> container) {
+  if (!container) return;
+  queue_.async([this, container] {
+    std::erase(fileContainers_, container);
+    container->closeNow();
+    if (container->fileUrl().empty()) {
+      log().fault("Handle {} does not have a File URL", static_cast<const void*>(container.get()));
+      return;
+    }
+    log().debug("delete file url {}", container->fileUrl().string());
+    std::error_code ec;
+    if (!fs::remove(container->fileUrl(), ec)) log().error("File {} delete failed", container->fileUrl().string());
+  });
+}
+
+std::string TavixPersistentStorage::version() {
+  std::lock_guard guard(versionLock_);
+  return version_;
+}
+
+void TavixPersistentStorage::setVersion(std::string version) {
+  std::lock_guard guard(versionLock_);
+  version_ = std::move(version);
+}
+
+}  // namespace tavix

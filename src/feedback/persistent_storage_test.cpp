@@ -1,0 +1,194 @@
+#include "feedback/persistent_storage.h"
+
+#include <gtest/gtest.h>
+#include <fcntl.h>
+#include <sys/stat.h>
+
+#include <fstream>
+
+#include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "feedback/tavix_feedback.h"
+#include "network/user_agent.h"
+#include "platform/counters.h"
+#include "platform/defaults.h"
+#include "platform/transactions.h"
+#include "support/temp_home.h"
+#include "tavix_proto/feedback_session.pb.h"
+
+namespace tavix {
+namespace {
+
+namespace fs = std::filesystem;
+
+std::int64_t counter(const char* key) { return TavixDiagnosticDataReporter::store().value(key); }
+
+struct StorageFixture {
+  testing::TempHome home;
+  platform::DispatchPool pool{2};
+  platform::VirtualClock clock;
+  platform::TransactionTracker transactions;
+  Assembly assembly;
+
+  explicit StorageFixture(std::int64_t sizeLimit = 2097152) {
+    assembly.dispatchPool = &pool;
+    assembly.clock = &clock;
+    assembly.transactions = &transactions;
+    assembly.paths.cacheHome = home.cache();
+    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
+    assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(sizeLimit)},
+                                             {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})}});
+  }
+  fs::path folder() const { return assembly.cachesFolder(); }
+  void touch(const std::string& name, double ageSeconds = 0) {
+    fs::create_directories(folder());
+    std::ofstream(folder() / name) << "x";
+    const double when = platform::toUnixSeconds(clock.now()) - ageSeconds;
+    struct timespec times[2];
+    times[0].tv_sec = times[1].tv_sec = static_cast<time_t>(when);
+    times[0].tv_nsec = times[1].tv_nsec = 0;
+    ::utimensat(AT_FDCWD, (folder() / name).c_str(), times, 0);
+  }
+};
+
+proto::CTClientSession header(const std::string& version) {
+  proto::CTClientSession session;
+  session.set_session_start(1767225600.5);
+  session.set_version(version);
+  session.set_agent("seekara/1.0");
+  session.set_user_guid_string("0C9E0C3F-7B1B-4E42-A7B2-0E2A8C1F3D11");
+  return session;
+}
+
+FeedbackRef event(int n) {
+  proto::CTCacheHitFeedback hit;
+  hit.set_timestamp(static_cast<std::uint64_t>(n) * 1000000);
+  hit.set_input("query " + std::to_string(n));
+  return makeTavixFeedbackWithCodable(hit, n, "", "seekara/1.0");
+}
+
+std::size_t encodedSize(const proto::CTTavixFeedback& f) { return f.ByteSizeLong() + 3; }  // tag 2 + length 1
+
+TEST(TavixPersistentStorage, ScanListsSessionsAndNumbersNewFilesAfterTheLargest) {
+  StorageFixture f;
+  f.touch("session.7");
+  f.touch("session.12");
+  f.touch("session.notanumber");
+  f.touch(".session.40");
+  f.touch("other.40");
+  TavixPersistentStorage storage(f.assembly);
+  EXPECT_EQ(storage.getAvailableSessionHandles().size(), 3u);
+  auto container = storage.createFileContainerForWriting();
+  ASSERT_NE(container, nullptr);
+  EXPECT_EQ(container->fileUrl().filename(), "session.13");
+  struct stat st {};
+  ASSERT_EQ(::stat(container->fileUrl().c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  EXPECT_EQ(storage.createFileContainerForWriting()->fileUrl().filename(), "session.14");
+  EXPECT_EQ(storage.version(), tavixdUserAgent());
+}
+
+TEST(TavixPersistentStorage, FilesPastTheAgeLimitAreDeletedAtStart) {
+  StorageFixture f;
+  f.touch("session.3", 172801);
+  f.touch("session.4", 172799);
+  const auto before = counter("com.norvel.tavixd.filetooold");
+  TavixPersistentStorage storage(f.assembly);
+  EXPECT_FALSE(fs::exists(f.folder() / "session.3"));
+  EXPECT_TRUE(fs::exists(f.folder() / "session.4"));
+  EXPECT_EQ(counter("com.norvel.tavixd.filetooold"), before + 1);
+  ASSERT_EQ(storage.getAvailableSessionHandles().size(), 1u);
+  EXPECT_EQ(storage.nextHandleId(), 5);
+}
+
+TEST(TavixPersistentStorage, SessionWrittenEventByEventReadsBackAndDeletes) {
+  StorageFixture f;
+  TavixPersistentStorage storage(f.assembly);
+  auto container = storage.createFileContainerForWriting();
+  container->writeSessionHeader(header(storage.version()));
+  for (int i = 1; i <= 3; ++i) container->writeFeedback(*event(i));
+  storage.closeSessionWithFileContainer(container);
+  ASSERT_EQ(storage.getAvailableSessionHandles().size(), 1u);
+  EXPECT_FALSE(container->isOpen());
+  container->writeFeedback(*event(4), [] { ADD_FAILURE() << "a closed file takes no events"; });
+
+  auto session = container->readRecord();
+  ASSERT_TRUE(session.has_value());
+  EXPECT_EQ(session->agent(), "seekara/1.0");
+  ASSERT_EQ(session->feedbacks_size(), 3);
+  EXPECT_EQ(session->feedbacks(2).payload().cache_hit().input(), "query 3");
+
+  // A daemon of another version discards the file.
+  FileContainer foreign(container->fileUrl(), "tavixd/9.9", storage.queue(), storage.maxFileSize());
+  EXPECT_FALSE(foreign.readRecord().has_value());
+
+  storage.deleteSessionWithFileContainer(container);
+  EXPECT_TRUE(storage.getAvailableSessionHandles().empty());
+  EXPECT_FALSE(fs::exists(container->fileUrl()));
+  EXPECT_FALSE(container->readRecord().has_value());
+}
+
+TEST(FileContainer, CutOffOrEmptyFilesKeepOnlyWhatIsWhole) {
+  StorageFixture f;
+  TavixPersistentStorage storage(f.assembly);
+  auto container = storage.createFileContainerForWriting();
+  const auto head = header(storage.version());
+  container->writeSessionHeader(head);
+  for (int i = 1; i <= 3; ++i) container->writeFeedback(*event(i));
+  container->close();
+  ASSERT_FALSE(container->isOpen());  // also waits for the queued appends
+  const fs::path url = container->fileUrl();
+  const auto full = fs::file_size(url);
+
+  fs::resize_file(url, full - 4);  // last event cut off mid-record
+  auto session = container->readRecord();
+  ASSERT_TRUE(session.has_value());
+  EXPECT_EQ(session->feedbacks_size(), 2);
+
+  fs::resize_file(url, head.ByteSizeLong() + 2);  // first event cut off: nothing to send
+  EXPECT_FALSE(container->readRecord().has_value());
+
+  fs::resize_file(url, 0);
+  EXPECT_FALSE(container->readRecord().has_value());
+}
+
+TEST(FileContainer, SizeLimitRefusesReachingItButReadsAFileOfExactlyIt) {
+  const auto head = header(tavixdUserAgent());
+  const auto one = event(1);
+  const std::uint64_t limit = head.ByteSizeLong() + encodedSize(*one);
+
+  {
+    StorageFixture f(static_cast<std::int64_t>(limit));
+    TavixPersistentStorage storage(f.assembly);
+    auto container = storage.createFileContainerForWriting();
+    const auto before = counter("com.norvel.tavixd.filesizeexceeded");
+    container->writeSessionHeader(head);
+    bool done = false;
+    container->writeFeedback(*one, [&] { done = true; });
+    EXPECT_FALSE(container->isOpen());
+    EXPECT_TRUE(done);  // told even though refused
+    EXPECT_EQ(counter("com.norvel.tavixd.filesizeexceeded"), before + 1);
+    EXPECT_EQ(fs::file_size(container->fileUrl()), head.ByteSizeLong());
+  }
+  {
+    StorageFixture f(static_cast<std::int64_t>(limit + 1));
+    TavixPersistentStorage storage(f.assembly);
+    auto container = storage.createFileContainerForWriting();
+    container->writeSessionHeader(head);
+    container->writeFeedback(*one);
+    container->close();
+    ASSERT_FALSE(container->isOpen());
+    ASSERT_EQ(fs::file_size(container->fileUrl()), limit);
+    FileContainer atLimit(container->fileUrl(), storage.version(), storage.queue(), limit);
+    auto session = atLimit.readRecord();
+    ASSERT_TRUE(session.has_value());
+    EXPECT_EQ(session->feedbacks_size(), 1);
+    const auto before = counter("com.norvel.tavixd.filetoolarge");
+    FileContainer belowIt(container->fileUrl(), storage.version(), storage.queue(), limit - 1);
+    EXPECT_FALSE(belowIt.readRecord().has_value());
+    EXPECT_EQ(counter("com.norvel.tavixd.filetoolarge"), before + 1);
+  }
+}
+
+}  // namespace
+}  // namespace tavix
