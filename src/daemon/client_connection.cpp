@@ -1,16 +1,13 @@
 #include "daemon/client_connection.h"
 
-#include <sys/utsname.h>
-
-#include <fstream>
-
 #include "core/assembly.h"
 #include "core/logging.h"
-#include "tavix_proto/ipc.pb.h"
+#include "network/user_agent.h"
 #include "platform/activity.h"
-#include "platform/notification_center.h"
 #include "platform/ipc/launch_events.h"
 #include "platform/ipc/server.h"
+#include "platform/notification_center.h"
+#include "tavix_proto/ipc.pb.h"
 
 namespace tavix {
 
@@ -27,42 +24,7 @@ void setError(proto::TVXError* error, std::int64_t code, const std::string& reas
   error->set_reason(reason);
 }
 
-std::string firstLine(const char* file) {
-  std::ifstream in(file);
-  std::string line;
-  std::getline(in, line);
-  return line;
-}
-
-std::string osRelease(const std::string& key) {
-  std::ifstream in("/etc/os-release");
-  std::string line;
-  while (std::getline(in, line)) {
-    if (line.rfind(key + "=", 0) != 0) continue;
-    std::string value = line.substr(key.size() + 1);
-    if (value.size() >= 2 && value.front() == '"' && value.back() == '"') value = value.substr(1, value.size() - 2);
-    return value;
-  }
-  return {};
-}
-
-// "<product type>; <product name> <OS version> <build>", read once per process.
-const std::string& deviceString() {
-  static const std::string device = [] {
-    utsname u{};
-    ::uname(&u);
-    std::string type = firstLine("/sys/class/dmi/id/product_name");
-    if (type.empty()) type = u.machine;
-    std::string name = osRelease("NAME");
-    if (name.empty()) name = u.sysname;
-    return type + "; " + name + " " + osRelease("VERSION_ID") + " " + u.release;
-  }();
-  return device;
-}
-
 }  // namespace
-
-std::string ClientConnection::nameVersion() { return "tavixd/0.1.0"; }
 
 ClientConnection::ClientConnection(Assembly& assembly, std::shared_ptr<platform::ipc::IpcConnection> connection,
                                    platform::ipc::LaunchEventRegistry* launchEvents)
@@ -240,7 +202,8 @@ void ClientConnection::configure(std::uint64_t callId, const proto::Envelope& in
     sessionLog().fault("configuration requires userAgent");
   } else {
     configuration_ = Configuration{config.identifier(), config.user_agent()};
-    userAgent_ = nameVersion() + " (" + deviceString() + ") " + config.user_agent();
+    userAgent_ = createUserAgentString(config.user_agent(), DeviceInformation(assembly_.userDefaults.get()))
+                     .value_or(config.user_agent());
   }
   if (!configuration_) {
     // No reply at all: the client learns of it by the closed connection.

@@ -67,9 +67,6 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   const std::optional<Configuration>& configuration() const { return configuration_; }
   const std::string& userAgent() const { return userAgent_; }
 
-  // "tavixd/<version>": the daemon's name and version, first part of every full user agent.
-  static std::string nameVersion();
-
  private:
   void openOrExtendTransaction();
   void closeTransaction();

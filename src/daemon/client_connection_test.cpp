@@ -1,4 +1,5 @@
 #include "daemon/client_connection.h"
+#include "network/user_agent.h"
 
 #include <sys/socket.h>
 #include <unistd.h>
@@ -191,7 +192,7 @@ TEST(ClientConnection, KeepsItsFirstIdentifierAndBuildsTheFullUserAgent) {
     ASSERT_TRUE(h.subject->configuration());
     EXPECT_EQ(h.subject->configuration()->identifier, "first");
     const auto& ua = h.subject->userAgent();
-    EXPECT_EQ(ua.rfind(ClientConnection::nameVersion() + " (", 0), 0u) << ua;
+    EXPECT_EQ(ua.rfind(std::string(kTVXTavixdNameVersion) + " (", 0), 0u) << ua;
     EXPECT_EQ(ua.substr(ua.size() - 10), ") client/2") << ua;
   });
 }

@@ -11,6 +11,7 @@
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "daemon/tavix_service.h"
+#include "feedback/persistent_storage.h"
 #include "cache/engaged_completion_cache.h"
 #include "context/location.h"
 #include "context/motion.h"
@@ -108,6 +109,8 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   assembly.locationManager = std::make_shared<DefaultsLocationManager>(*defaults, clock, pool);
   assembly.motionManager = std::make_shared<DefaultsMotionManager>(*defaults, pool);
   assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+
+  assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
 
   const auto countersFile = assembly.cachesFolder() / "counters.plist";
   auto& counters = TavixDiagnosticDataReporter::store();

@@ -5,10 +5,12 @@
 
 #include <google/protobuf/stubs/logging.h>
 
+#include "context/user_guid_controller.h"
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "daemon/client_connection.h"
+#include "feedback/client_session_manager.h"
 #include "platform/defaults.h"
 #include "platform/http/url_session.h"
 #include "platform/ipc/server.h"
@@ -25,6 +27,9 @@ TavixService::TavixService(Assembly& assembly, platform::ipc::LaunchEventRegistr
       queue_(*assembly.dispatchPool, "com.norvel.tavix.serviceQueue"),
       self_(std::make_shared<TavixService*>(this)) {
   assembly_.sharedSession = assembly_.userDefaults->boolForKey("TVXSharedSession");
+  assembly_.guidController = std::make_shared<TavixUserGUIDController>(assembly_);
+  assembly_.clientSessionManager =
+      std::make_shared<ClientSessionManager>(assembly_, assembly_.guidController, "tavix");
   // A malformed message is logged once by the connection; protobuf's own parse complaints would
   // let any peer write to our log at will.
   google::protobuf::SetLogHandler(nullptr);
@@ -83,12 +88,24 @@ bool TavixService::shouldAcceptNewConnection(const std::shared_ptr<platform::ipc
 
 void TavixService::connectionInvalidated(const std::shared_ptr<ClientConnection>& client) {
   queue_.async([this, client] {
-    connections_.erase(std::remove(connections_.begin(), connections_.end(), client), connections_.end());
-    if (!connections_.empty()) return;
-    // Replies cached for clients that have all gone are dead weight; the disk cache stays.
-    if (auto session = assembly_.urlSession()) {
-      TavixLogForCategory(TavixLoggingCategoryCaching).info("purging url cache");
-      session->purgeMemoryCache();
+    auto removeAndPurge = [this, client](bool flushed) {
+      TavixLogForCategory(TavixLoggingCategorySession)
+          .info("session {} on invalidation", flushed ? "flushed" : "not flushed");
+      queue_.async([this, client] {
+        connections_.erase(std::remove(connections_.begin(), connections_.end(), client), connections_.end());
+        if (!connections_.empty()) return;
+        // Replies cached for clients that have all gone are dead weight; the disk cache stays.
+        if (auto session = assembly_.urlSession()) {
+          TavixLogForCategory(TavixLoggingCategoryCaching).info("purging url cache");
+          session->purgeMemoryCache();
+        }
+      });
+    };
+    // A connection that never said who it is has no session to close.
+    if (assembly_.clientSessionManager && !client->userAgent().empty()) {
+      assembly_.clientSessionManager->flushSessionInvalidationWithAgent(client->userAgent(), removeAndPurge);
+    } else {
+      removeAndPurge(false);
     }
   });
 }
