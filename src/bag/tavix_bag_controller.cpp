@@ -142,6 +142,41 @@ TVXBagError bagError(std::string reason) { return {kErrorDomain, kBagFetchErrorC
 
 }  // namespace
 
+// The assembly's clock while the controller lives; afterwards pauses are dropped and pending ones
+// cancelled, so that a retry loop still on the wire ends quietly instead of reaching a queue, a
+// pool or a clock that shutdown has taken away.
+class TavixBagController::RetryClock final : public platform::Clock {
+ public:
+  explicit RetryClock(platform::Clock& inner) : inner_(inner), last_(inner.now()) {}
+
+  platform::TimePoint now() const override {
+    std::lock_guard hold(lock_);
+    if (!off_) last_ = inner_.now();
+    return last_;
+  }
+  platform::TimerHandle after(platform::Duration delay, platform::SerialQueue& queue, platform::Task task) override {
+    std::lock_guard hold(lock_);
+    if (off_) return {};
+    std::erase_if(pending_, [](const platform::TimerHandle& h) { return h.isCancelled(); });
+    auto handle = inner_.after(delay, queue, std::move(task));
+    pending_.push_back(handle);
+    return handle;
+  }
+  void shutdown() {
+    std::lock_guard hold(lock_);
+    off_ = true;
+    for (auto& handle : pending_) handle.cancel();
+    pending_.clear();
+  }
+
+ private:
+  platform::Clock& inner_;
+  mutable std::mutex lock_;
+  mutable platform::TimePoint last_;
+  bool off_ = false;
+  std::vector<platform::TimerHandle> pending_;
+};
+
 int compareNumericStrings(std::string_view a, std::string_view b) {
   std::size_t i = 0, j = 0;
   while (i < a.size() && j < b.size()) {
@@ -180,12 +215,16 @@ std::shared_ptr<TavixBagController> TavixBagController::create(Assembly& assembl
 TavixBagController::TavixBagController(Assembly& assembly)
     : assembly_(assembly),
       inMemoryBagCacheAccessQueue_(*assembly.dispatchPool, "com.norvel.tavixd.bagcontroller.cacheaccess"),
-      retryQueue_(std::make_shared<platform::SerialQueue>(*assembly.dispatchPool, "com.norvel.tavixd.bagcontroller.retry")) {
+      retryQueue_(*assembly.dispatchPool, "com.norvel.tavixd.bagcontroller.retry"),
+      retryClock_(std::make_shared<RetryClock>(*assembly.clock)) {
   DeviceInformation device(assembly.userDefaults.get());
   userAgent_ = createUserAgentString(std::nullopt, device);
 }
 
-TavixBagController::~TavixBagController() { refreshRegistration_.reset(); }
+TavixBagController::~TavixBagController() {
+  refreshRegistration_.reset();
+  invalidate();
+}
 
 void TavixBagController::start() {
   if (auto dictionary = diskCachedBagDictionary()) {
@@ -294,21 +333,34 @@ void TavixBagController::handleRefreshNotification() {
   if (bag && isRefreshRequiredForCachedBag(bag->rawBag())) fetchBagStateWithVersion(std::nullopt);
 }
 
+void TavixBagController::invalidate() {
+  std::lock_guard hold(completionLock_);
+  invalidated_.store(true);
+  retryClock_->shutdown();
+  fetchTransaction_.reset();
+}
+
 bool TavixBagController::fetchBagStateWithVersion(std::optional<std::string> version, Completion completion) {
-  if (fetchInProgress_.exchange(true)) return false;
+  if (invalidated_.load() || fetchInProgress_.exchange(true)) return false;
   runFetch(std::move(version), std::move(completion));
   return true;
 }
 
 void TavixBagController::runFetch(std::optional<std::string> version, Completion completion) {
-  auto transaction = std::make_shared<platform::TransactionTracker::Transaction>();
-  if (assembly_.transactions) *transaction = assembly_.transactions->begin("bagFetch");
+  if (assembly_.transactions) {
+    std::lock_guard hold(completionLock_);
+    fetchTransaction_ = std::make_unique<platform::TransactionTracker::Transaction>(assembly_.transactions->begin("bagFetch"));
+  }
 
   auto request = assembly_.requestFactory->bagFetchRequest(*this, userAgent_, version);
   if (!request) {
     // Only a URL that does not parse gets here; the endpoint logic falls back before that.
     bagLog().error("Error fetching bag: {}", "no request for the bag URL");
     TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.bag.fetchesfailed");
+    {
+      std::lock_guard hold(completionLock_);
+      fetchTransaction_.reset();
+    }
     if (completion) completion(nullptr, bagError("no request"));
     fetchInProgress_.store(false);
     return;
@@ -318,10 +370,10 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
 
   auto retryable = std::make_shared<const TVXRetryableNetworkRequest>(*request, std::nullopt, true);
   std::weak_ptr<TavixBagController> weak = weak_from_this();
-  auto retryQueue = retryQueue_;
+  auto retryClock = retryClock_;
   auto task = dataTaskWithRetryableRequest(
-      assembly_.bagSession(), retryable, 1, kFetchRetries, *assembly_.clock, *retryQueue,
-      [weak, retryQueue, transaction, completion = std::move(completion)](
+      assembly_.bagSession(), retryable, 1, kFetchRetries, *retryClock, retryQueue_,
+      [weak, retryClock, completion = std::move(completion)](
           std::string data, std::optional<platform::http::HTTPURLResponse> response,
           std::optional<platform::http::URLError> error) {
         bagLog().debug("resp: {}", describeResponse(response));
@@ -330,6 +382,8 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
           bagLog().error("Error fetching bag, bag fetch task completed after BagFetchController was cleaned up");
           return;
         }
+        std::unique_lock hold(self->completionLock_);
+        if (self->invalidated_.load()) return;
         std::shared_ptr<const TVXBag> bag;
         std::optional<TVXBagError> outcome;
         if (error) {
@@ -355,9 +409,11 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
         }
         TavixDiagnosticDataReporter::addValue(
             1, outcome ? "com.norvel.tavixd.bag.fetchesfailed" : "com.norvel.tavixd.bag.fetches");
+        self->fetchTransaction_.reset();
+        hold.unlock();
+        // The caller may start the next fetch from here; it merges until the flag is down.
         if (completion) completion(outcome ? nullptr : bag, outcome);
         self->fetchInProgress_.store(false);
-        transaction->reset();
       });
   task->resume();
 }

@@ -14,6 +14,7 @@
 #include <atomic>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -24,6 +25,7 @@
 #include "platform/files.h"
 #include "platform/notification_center.h"
 #include "platform/property_value.h"
+#include "platform/transactions.h"
 
 namespace tavix {
 
@@ -91,6 +93,10 @@ class TavixBagController final : public TVXBagURLSource,
   // Whether a cached raw bag should be fetched again.
   bool isRefreshRequiredForCachedBag(const platform::Dictionary& rawBag);
 
+  // From now on no fetch starts and a fetch still in flight completes without touching the
+  // assembly: for shutdown, before the assembly's services go. Waits for a completion running now.
+  void invalidate();
+
   std::shared_ptr<const TVXBag> inMemoryBag();
   void setInMemoryBag(std::shared_ptr<const TVXBag> bag);
 
@@ -110,11 +116,20 @@ class TavixBagController final : public TVXBagURLSource,
 
   Assembly& assembly_;
   platform::ReaderWriterQueue inMemoryBagCacheAccessQueue_;
-  // Pauses between retries of a fetch run here; shared so that a retry loop keeps it alive.
-  std::shared_ptr<platform::SerialQueue> retryQueue_;
+  class RetryClock;
+  // Pauses between retries of a fetch run here, timed by the retry clock. A retry loop may
+  // outlive the controller (the bag session is process-wide); once the controller is invalidated
+  // or gone the clock drops every pause, so the loop ends without touching the queue.
+  platform::SerialQueue retryQueue_;
+  std::shared_ptr<RetryClock> retryClock_;
   std::optional<std::string> userAgent_;
   std::shared_ptr<const TVXBag> inMemoryBag_;  // guarded by inMemoryBagCacheAccessQueue_
   std::atomic<bool> fetchInProgress_{false};
+  // Held by a fetch's completion while it runs, so that invalidate() can wait for it.
+  std::mutex completionLock_;
+  std::atomic<bool> invalidated_{false};
+  // The running fetch's keep-alive; guarded by completionLock_.
+  std::unique_ptr<platform::TransactionTracker::Transaction> fetchTransaction_;
   platform::NotificationCenter::Registration refreshRegistration_;
 };
 

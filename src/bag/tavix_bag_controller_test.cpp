@@ -4,8 +4,10 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <future>
 #include <mutex>
+#include <thread>
 #include <nlohmann/json.hpp>
 
 #include "bag/tvx_bag.h"
@@ -285,6 +287,27 @@ TEST_F(BagControllerTest, TriggersDuringAFetchMergeIntoItAndTransportFailuresAre
   EXPECT_FALSE(done.get_future().get());
   EXPECT_EQ(bagRequests().size(), 3u);
   EXPECT_EQ(postedCount(), 2u);
+
+  // Shutdown: a fetch on the wire ends quietly and no new one starts.
+  fault({{"path", "/bag"}, {"delay_ms", 200}, {"times", 1}});
+  std::atomic<bool> called = false;
+  ASSERT_TRUE(controller->fetchBagStateWithVersion(std::nullopt, [&](auto, auto) { called = true; }));
+  controller->invalidate();
+  ASSERT_TRUE(waitFor([&] { return bagRequests().size() == 4u; }));
+  EXPECT_FALSE(controller->fetchBagStateWithVersion(std::nullopt));
+  std::this_thread::sleep_for(std::chrono::milliseconds(400));
+  EXPECT_FALSE(called);
+  EXPECT_EQ(postedCount(), 2u);
+
+  // A controller that goes while its fetch waits to retry takes the retries with it.
+  controller = TavixBagController::create(assembly);
+  fault({{"path", "/bag"}, {"drop", true}});
+  ASSERT_TRUE(controller->fetchBagStateWithVersion(std::nullopt));
+  ASSERT_TRUE(waitFor([&] { return clock.pendingTimers() == 1; }));
+  controller.reset();
+  clock.advance(platform::seconds(60));
+  settle();
+  EXPECT_EQ(bagRequests().size(), 5u);
 }
 
 TEST_F(BagControllerTest, ForcedFetchComparesVersionsNumerically) {

@@ -205,6 +205,8 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
     idleCheck.stop();
   });
   pool.drain();  // let queued work finish while everything it may touch is still alive
+  // A bag fetch may still be on the wire; its completion must not reach the services going next.
+  assembly.bagController->invalidate();
   if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
   log.info("tavixd stopped");
   return 0;
