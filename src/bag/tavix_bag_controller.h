@@ -52,7 +52,7 @@ struct TVXBagError {
   std::string reason;
 };
 
-// NSNumericSearch-style ordering: runs of digits compare by value, everything else byte by byte.
+// Version ordering: runs of digits compare by value ("9" < "12"), everything else byte by byte.
 // Negative, zero or positive.
 int compareNumericStrings(std::string_view a, std::string_view b);
 
