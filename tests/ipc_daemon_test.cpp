@@ -23,7 +23,7 @@ namespace {
 
 using tavix::client::Client;
 
-// The daemon with debug logging, once its socket is there.
+// The daemon with debug logging, once it listens.
 struct Daemon : tavix::testing::DaemonProcess {
   std::string socket;
 
@@ -31,7 +31,8 @@ struct Daemon : tavix::testing::DaemonProcess {
                   std::vector<std::string> extra = {})
       : DaemonProcess(TAVIXD_BINARY, home, withDebugLog(std::move(extra)), logName),
         socket((home.runtime() / "com.norvel.tavixd" / "socket").string()) {
-    tavix::testing::waitFor([&] { return std::filesystem::exists(socket); });
+    // The socket file appears at bind(), a moment before listen(): wait for the daemon to say so.
+    waitForLog("listening on");
   }
 
   static std::vector<std::string> withDebugLog(std::vector<std::string> extra) {
@@ -290,6 +291,13 @@ TEST(IpcDaemon, ServesTheSocketHandedOverBySystemd) {
   o.configuration.set_identifier("tests");
   o.configuration.set_user_agent("tests/1");
   Client client(o);
+  // Launch-event handlers come after the listener: a notify sent sooner finds none.
+  EXPECT_TRUE(tavix::testing::waitFor([&] {
+    std::ifstream in(logFile);
+    std::stringstream text;
+    text << in.rdbuf();
+    return text.str().find("tavixd started") != std::string::npos;
+  }));
   EXPECT_FALSE(client.notifySync("com.norvel.tests.activated"));
   // The daemon made no socket of its own.
   EXPECT_FALSE(std::filesystem::exists(home.runtime() / "com.norvel.tavixd" / "socket"));

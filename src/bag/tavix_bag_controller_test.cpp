@@ -84,7 +84,10 @@ class BagControllerTest : public ::testing::Test {
   std::optional<TVXBagError> fetch(std::optional<std::string> version = std::nullopt) {
     std::promise<std::optional<TVXBagError>> done;
     EXPECT_TRUE(controller->fetchBagStateWithVersion(version, [&](auto, auto error) { done.set_value(error); }));
-    return done.get_future().get();
+    auto error = done.get_future().get();
+    // The flag comes down just after the completion.
+    EXPECT_TRUE(waitFor([&] { return !controller->fetchInProgress(); }));
+    return error;
   }
   // Lets queued triggers run; a fetch they started is still in flight afterwards.
   void settle() { pool.drain(); }
@@ -285,6 +288,7 @@ TEST_F(BagControllerTest, TriggersDuringAFetchMergeIntoItAndTransportFailuresAre
   EXPECT_TRUE(controller->fetchInProgress());
   clock.advance(platform::seconds(1.5));
   EXPECT_FALSE(done.get_future().get());
+  waitForIdle();
   EXPECT_EQ(bagRequests().size(), 3u);
   EXPECT_EQ(postedCount(), 2u);
 
