@@ -6,6 +6,7 @@
 #include <atomic>
 #include <csignal>
 
+#include "bag/tavix_bag_controller.h"
 #include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
@@ -116,6 +117,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   auto& counters = TavixDiagnosticDataReporter::store();
   if (auto ec = counters.load(countersFile)) log.error("cannot read counters {}", describe(countersFile, ec));
   TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.launch");
+  assembly.bagController = TavixBagController::create(assembly);
 
   // Topic weights a person or another program left for us; any property-list value, sent as JSON.
   if (auto silhouette = defaults->objectForKey("silhouette")) {
@@ -165,6 +167,8 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
     });
   }
 
+  // Warm the bag: a valid disk bag is already in memory; otherwise this starts the first fetch.
+  pool.post([bagController = assembly.bagController] { bagController->currentBag(); });
   pool.post([center = assembly.notificationCenter] { center->post("TVXStartup"); });
 
   platform::SignalSource sigint(pool, SIGINT, [&] {
@@ -216,6 +220,8 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
     memoryPressure.stop();
   });
   pool.drain();  // let queued work finish while everything it may touch is still alive
+  // A bag fetch may still be on the wire; its completion must not reach the services going next.
+  assembly.bagController->invalidate();
   if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
   log.info("tavixd stopped");
   return 0;

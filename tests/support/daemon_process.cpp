@@ -5,14 +5,26 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <fstream>
 #include <sstream>
 
 namespace tavix::testing {
 
+void keepBagFetchesLocal(const TempHome& home) {
+  const auto folder = home.config() / "com.norvel.tavixd";
+  const auto file = folder / "com.norvel.tavixd.plist";
+  if (std::filesystem::exists(file)) return;
+  std::filesystem::create_directories(folder);
+  std::ofstream out(file);
+  out << "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\">\n<dict>\n"
+         "\t<key>TVXBagURL</key>\n\t<string>http://127.0.0.1:9/bag</string>\n</dict>\n</plist>\n";
+}
+
 DaemonProcess::DaemonProcess(const std::string& binary, const TempHome& home, std::vector<std::string> args,
                              const std::string& logName)
     : logFile_(home.root() / logName) {
+  keepBagFetchesLocal(home);
   pid_ = fork();
   if (pid_ == 0) {
     home.exportEnvironment();

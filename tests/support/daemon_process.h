@@ -10,6 +10,11 @@
 
 namespace tavix::testing {
 
+// A daemon under test fetches its bag from this machine only: unless the test wrote defaults of
+// its own, this points the bag URL at a loopback port where nothing listens, so each fetch fails
+// at once (and holds the daemon for its retries, about 8 s). DaemonProcess does it by itself.
+void keepBagFetchesLocal(const TempHome& home);
+
 class DaemonProcess {
  public:
   // Starts `binary` with `args`, the XDG homes pointed into `home`, stderr into home/`logName`.

@@ -25,6 +25,7 @@ struct Fault {
   int status = 0;  // 0: answer normally
   bool drop = false;
   int remaining = -1;  // -1: every request
+  std::optional<std::string> body;  // served as it stands instead of the route's answer
 };
 
 std::string lowercase(std::string s) {
@@ -106,6 +107,11 @@ struct DevServer::Impl {
         // The head goes out, then the connection closes before the promised body.
         res.set_content_provider(
             1024, "application/json", [](size_t, size_t, httplib::DataSink&) { return false; });
+        return;
+      }
+      if (fault && fault->body) {
+        res.status = fault->status != 0 ? fault->status : 200;
+        res.set_content(*fault->body, "application/json");
         return;
       }
       if (fault && fault->status != 0) {
@@ -206,6 +212,7 @@ struct DevServer::Impl {
       fault.status = body.value("status", 0);
       fault.drop = body.value("drop", false);
       fault.remaining = body.value("times", -1);
+      if (body.contains("body") && body["body"].is_string()) fault.body = body["body"].get<std::string>();
       std::lock_guard guard(lock);
       faults[body["path"].get<std::string>()] = fault;
       replyJSON(res, json::object());

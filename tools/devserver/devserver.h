@@ -5,7 +5,8 @@
 //   GET  /_recorded  JSON list of {"method","path","query","headers","body_size"}
 //   POST /_reset     forget recordings and faults
 //   POST /_faults    {"path": "/search", "delay_ms": 500, "status": 500, "drop": true, "times": 2}
-//                    applies to requests of that path; "times" limits how many (absent: all)
+//                    applies to requests of that path; "times" limits how many (absent: all);
+//                    "body": "[1]" answers that text (with "status", default 200) instead
 //
 // Threading: start() and stop() from one thread; the server answers on its own threads.
 #pragma once

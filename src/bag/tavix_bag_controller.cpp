@@ -1,0 +1,509 @@
+#include "bag/tavix_bag_controller.h"
+
+#include <arpa/inet.h>
+
+#include <cctype>
+#include <cmath>
+
+#include <fmt/core.h>
+
+#include "bag/tvx_bag.h"
+#include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "core/logging.h"
+#include "network/retryable_request.h"
+#include "network/url_request_builder.h"
+#include "network/user_agent.h"
+#include "platform/clock.h"
+#include "platform/defaults.h"
+#include "platform/json_value.h"
+#include "platform/transactions.h"
+
+namespace tavix {
+
+using platform::Dictionary;
+using platform::PropertyValue;
+
+namespace {
+
+constexpr const char* kBagURLDefaultsKey = "TVXBagURL";
+constexpr const char* kErrorDomain = "kTVXErrorDomain";
+constexpr const char* kExpirationKey = "__expiration";
+constexpr const char* kBagURLKey = "__bagurl";
+constexpr const char* kRefreshDisabledKey = "__refresh_disabled";
+constexpr const char* kCacheFileName = "bag.plist";
+constexpr const char* kNewsUserAgent = "news/1.0";
+constexpr double kBagLifetimeSeconds = 14400;
+// A bag this close to its expiry is fetched again already, so that it never serves stale.
+constexpr double kRefreshMarginSeconds = 600;
+constexpr int kFetchRetries = 5;
+constexpr long kBagFetchErrorCode = 2;
+
+platform::Logger& bagLog() { return TavixLogForCategory(TavixLoggingCategoryBag); }
+
+std::string lowercased(std::string_view s) {
+  std::string out(s);
+  for (char& c : out) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+  return out;
+}
+
+std::string uppercased(std::string_view s) {
+  std::string out(s);
+  for (char& c : out) c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
+  return out;
+}
+
+bool isLoopbackHost(std::string host) {
+  host = lowercased(host);
+  if (host == "localhost") return true;
+  if (host.size() > 2 && host.front() == '[' && host.back() == ']') host = host.substr(1, host.size() - 2);
+  in_addr v4{};
+  if (inet_pton(AF_INET, host.c_str(), &v4) == 1) return (ntohl(v4.s_addr) >> 24) == 127;
+  in6_addr v6{};
+  if (inet_pton(AF_INET6, host.c_str(), &v6) == 1) return IN6_IS_ADDR_LOOPBACK(&v6);
+  return false;
+}
+
+// An absolute URL the daemon may fetch a bag from: HTTPS with a host, or plain HTTP to this
+// machine only (development servers); the configuration must not travel in clear text.
+bool isUsableBagURL(const std::string& url) {
+  if (!TavixURLRequestBuilder::requestBuilderWithURL(url)) return false;
+  const auto sep = url.find("://");
+  if (sep == std::string::npos) return false;
+  const std::string scheme = lowercased(url.substr(0, sep));
+  std::string authority = url.substr(sep + 3, url.find_first_of("/?#", sep + 3) - (sep + 3));
+  if (auto at = authority.rfind('@'); at != std::string::npos) authority = authority.substr(at + 1);
+  std::string host = authority;
+  if (!authority.empty() && authority.front() == '[') {
+    const auto close = authority.find(']');
+    if (close == std::string::npos) return false;
+    host = authority.substr(0, close + 1);
+  } else if (auto colon = authority.find(':'); colon != std::string::npos) {
+    host = authority.substr(0, colon);
+  }
+  if (host.empty()) return false;
+  if (scheme == "https") return true;
+  return scheme == "http" && isLoopbackHost(host);
+}
+
+std::string describeHeaders(const platform::http::HeaderFields& headers) {
+  std::string out = "{";
+  for (const auto& [name, value] : headers.all()) {
+    if (out.size() > 1) out += ", ";
+    out += name + ": " + value;
+  }
+  return out + "}";
+}
+
+std::string describeResponse(const std::optional<platform::http::HTTPURLResponse>& response) {
+  if (!response) return "(none)";
+  return fmt::format("{{status: {}, url: {}, headers: {}}}", response->statusCode, response->url,
+                     describeHeaders(response->headers));
+}
+
+const char* typeName(PropertyValue::Type type) {
+  switch (type) {
+    case PropertyValue::Type::Boolean: return "Boolean";
+    case PropertyValue::Type::Integer: return "Integer";
+    case PropertyValue::Type::Real: return "Real";
+    case PropertyValue::Type::String: return "String";
+    case PropertyValue::Type::Date: return "Date";
+    case PropertyValue::Type::Data: return "Data";
+    case PropertyValue::Type::Array: return "Array";
+    case PropertyValue::Type::Dictionary: return "Dictionary";
+  }
+  return "unknown";
+}
+
+// 0 or 1 for a bag, 2 when there is none yet.
+unsigned long newsAvailability(const std::shared_ptr<const TVXBag>& bag) {
+  if (!bag) return 2;
+  return TVXBag(bag->sharedRawBag(), kNewsUserAgent).isEnabled() ? 1 : 0;
+}
+
+// The decimal string of a version number the server sent; empty for anything that is not one.
+std::optional<std::string> versionString(const PropertyValue* value) {
+  if (!value) return std::nullopt;
+  if (auto i = value->integer()) return std::to_string(*i);
+  if (auto r = value->real()) {
+    if (!std::isfinite(*r)) return std::nullopt;
+    if (*r == std::trunc(*r) && std::fabs(*r) < 1e15) return fmt::format("{:.0f}", *r);
+    return fmt::format("{}", *r);
+  }
+  if (auto s = value->string()) {
+    // A number written as text still names a version; anything else does not.
+    if (s->empty() || !std::isdigit(static_cast<unsigned char>(s->front()))) return std::nullopt;
+    return *s;
+  }
+  return std::nullopt;
+}
+
+TVXBagError bagError(std::string reason) { return {kErrorDomain, kBagFetchErrorCode, std::move(reason)}; }
+
+}  // namespace
+
+// The assembly's clock while the controller lives; afterwards pauses are dropped and pending ones
+// cancelled, so that a retry loop still on the wire ends quietly instead of reaching a queue, a
+// pool or a clock that shutdown has taken away.
+class TavixBagController::RetryClock final : public platform::Clock {
+ public:
+  explicit RetryClock(platform::Clock& inner) : inner_(inner), last_(inner.now()) {}
+
+  platform::TimePoint now() const override {
+    std::lock_guard hold(lock_);
+    if (!off_) last_ = inner_.now();
+    return last_;
+  }
+  platform::TimerHandle after(platform::Duration delay, platform::SerialQueue& queue, platform::Task task) override {
+    std::lock_guard hold(lock_);
+    if (off_) return {};
+    std::erase_if(pending_, [](const platform::TimerHandle& h) { return h.isCancelled(); });
+    auto handle = inner_.after(delay, queue, std::move(task));
+    pending_.push_back(handle);
+    return handle;
+  }
+  void shutdown() {
+    std::lock_guard hold(lock_);
+    off_ = true;
+    for (auto& handle : pending_) handle.cancel();
+    pending_.clear();
+  }
+
+ private:
+  platform::Clock& inner_;
+  mutable std::mutex lock_;
+  mutable platform::TimePoint last_;
+  bool off_ = false;
+  std::vector<platform::TimerHandle> pending_;
+};
+
+int compareNumericStrings(std::string_view a, std::string_view b) {
+  std::size_t i = 0, j = 0;
+  while (i < a.size() && j < b.size()) {
+    const bool da = std::isdigit(static_cast<unsigned char>(a[i]));
+    const bool db = std::isdigit(static_cast<unsigned char>(b[j]));
+    if (da && db) {
+      std::size_t ei = i, ej = j;
+      while (ei < a.size() && std::isdigit(static_cast<unsigned char>(a[ei]))) ++ei;
+      while (ej < b.size() && std::isdigit(static_cast<unsigned char>(b[ej]))) ++ej;
+      // Leading zeros do not make a number bigger.
+      std::size_t si = i, sj = j;
+      while (si + 1 < ei && a[si] == '0') ++si;
+      while (sj + 1 < ej && b[sj] == '0') ++sj;
+      const std::size_t li = ei - si, lj = ej - sj;
+      if (li != lj) return li < lj ? -1 : 1;
+      if (int c = a.substr(si, li).compare(b.substr(sj, lj)); c != 0) return c < 0 ? -1 : 1;
+      i = ei;
+      j = ej;
+      continue;
+    }
+    if (a[i] != b[j]) return static_cast<unsigned char>(a[i]) < static_cast<unsigned char>(b[j]) ? -1 : 1;
+    ++i;
+    ++j;
+  }
+  if (i < a.size()) return 1;
+  if (j < b.size()) return -1;
+  return 0;
+}
+
+std::shared_ptr<TavixBagController> TavixBagController::create(Assembly& assembly) {
+  std::shared_ptr<TavixBagController> controller(new TavixBagController(assembly));
+  controller->start();
+  return controller;
+}
+
+TavixBagController::TavixBagController(Assembly& assembly)
+    : assembly_(assembly),
+      inMemoryBagCacheAccessQueue_(*assembly.dispatchPool, "com.norvel.tavixd.bagcontroller.cacheaccess"),
+      retryQueue_(*assembly.dispatchPool, "com.norvel.tavixd.bagcontroller.retry"),
+      retryClock_(std::make_shared<RetryClock>(*assembly.clock)) {
+  DeviceInformation device(assembly.userDefaults.get());
+  userAgent_ = createUserAgentString(std::nullopt, device);
+}
+
+TavixBagController::~TavixBagController() {
+  refreshRegistration_.reset();
+  invalidate();
+}
+
+void TavixBagController::start() {
+  if (auto dictionary = diskCachedBagDictionary()) {
+    cacheBagState(std::make_shared<const TVXBag>(std::move(*dictionary), userAgent_.value_or("")), true);
+  }
+  std::weak_ptr<TavixBagController> weak = weak_from_this();
+  refreshRegistration_ = assembly_.notificationCenter->addObserver(
+      kTVXBagRefreshRequiredNotification, assembly_.requestFactory.get(), nullptr,
+      [weak](const platform::Notification&) {
+        if (auto self = weak.lock()) self->handleRefreshNotification();
+      });
+}
+
+std::string TavixBagController::bagFetchURLWithCountry(std::string_view countryCode) {
+  const auto configured = assembly_.userDefaults->stringForKey(kBagURLDefaultsKey);
+  if (configured && !configured->empty()) {
+    if (isUsableBagURL(*configured)) return *configured;
+    bagLog().error("Malformed tavix bag URL in user defaults key {}", kBagURLDefaultsKey);
+  }
+  return uppercased(countryCode) == "CN" ? kTVXDefaultBagURLForCN : kTVXDefaultBagURL;
+}
+
+std::optional<std::string> TavixBagController::currentBagCacheURL() {
+  auto request = assembly_.requestFactory->bagCacheRequest(*this, userAgent_, std::nullopt);
+  if (!request) return std::nullopt;
+  return request->url;
+}
+
+bool TavixBagController::isRefreshRequiredForCachedBag(const Dictionary& rawBag) {
+  if (rawBag.count(kRefreshDisabledKey)) {
+    bagLog().info("Bag refresh is disabled.");
+    return false;
+  }
+  double expiration = 0;
+  if (auto it = rawBag.find(kExpirationKey); it != rawBag.end()) expiration = it->second.asReal().value_or(0);
+  const double remaining = expiration - platform::toUnixSeconds(assembly_.clock->now());
+  if (remaining < kRefreshMarginSeconds) {
+    bagLog().info("bag expired: {:f}", remaining);
+    TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.bag.expired");
+    return true;
+  }
+  const auto cached = rawBag.find(kBagURLKey);
+  if (cached == rawBag.end()) {
+    bagLog().info("no bag URL found in cache");
+    return true;
+  }
+  const std::string cachedURL = cached->second.string() ? *cached->second.string() : std::string();
+  const std::string currentURL = currentBagCacheURL().value_or("");
+  if (cachedURL != currentURL) {
+    bagLog().info("bag url changed from: {} to {}", cachedURL, currentURL);
+    return true;
+  }
+  return false;
+}
+
+std::shared_ptr<const TVXBag> TavixBagController::inMemoryBag() {
+  std::shared_ptr<const TVXBag> bag;
+  inMemoryBagCacheAccessQueue_.read([&] { bag = inMemoryBag_; });
+  return bag;
+}
+
+void TavixBagController::setInMemoryBag(std::shared_ptr<const TVXBag> bag) {
+  inMemoryBagCacheAccessQueue_.writeSync([&] { inMemoryBag_ = std::move(bag); });
+}
+
+std::shared_ptr<const TVXBag> TavixBagController::cachedBagState() {
+  std::shared_ptr<const TVXBag> bag;
+  bool refresh = false;
+  inMemoryBagCacheAccessQueue_.read([&] {
+    bag = inMemoryBag_;
+    refresh = bag && isRefreshRequiredForCachedBag(bag->rawBag());
+  });
+  if (refresh) {
+    // Not from inside the read: a fetch's completion takes the write side.
+    std::weak_ptr<TavixBagController> weak = weak_from_this();
+    assembly_.dispatchPool->post([weak] {
+      if (auto self = weak.lock()) self->fetchBagStateWithVersion(std::nullopt);
+    });
+  }
+  return bag;
+}
+
+std::shared_ptr<const TVXBag> TavixBagController::currentBag() {
+  auto bag = cachedBagState();
+  if (!bag) fetchBagStateWithVersion(std::nullopt);
+  return bag;
+}
+
+std::optional<std::string> TavixBagController::warmURL() {
+  auto bag = currentBag();
+  if (!bag) return std::nullopt;
+  return bag->warmURL();
+}
+
+void TavixBagController::forceFetchBag(const Dictionary& dictionary) {
+  std::optional<std::string> current;
+  if (auto bag = inMemoryBag()) current = bag->version();
+  const auto it = dictionary.find("bag");
+  const auto requested = versionString(it == dictionary.end() ? nullptr : &it->second);
+  if (requested && current && compareNumericStrings(*current, *requested) < 0) fetchBagStateWithVersion(requested);
+}
+
+void TavixBagController::handleRefreshNotification() {
+  bagLog().debug("something significant changed (locale, geo). checking to see if bag needs update");
+  auto bag = inMemoryBag();
+  if (bag && isRefreshRequiredForCachedBag(bag->rawBag())) fetchBagStateWithVersion(std::nullopt);
+}
+
+void TavixBagController::invalidate() {
+  std::lock_guard hold(completionLock_);
+  invalidated_.store(true);
+  retryClock_->shutdown();
+  fetchTransaction_.reset();
+}
+
+bool TavixBagController::fetchBagStateWithVersion(std::optional<std::string> version, Completion completion) {
+  if (invalidated_.load() || fetchInProgress_.exchange(true)) return false;
+  runFetch(std::move(version), std::move(completion));
+  return true;
+}
+
+void TavixBagController::runFetch(std::optional<std::string> version, Completion completion) {
+  if (assembly_.transactions) {
+    std::lock_guard hold(completionLock_);
+    fetchTransaction_ = std::make_unique<platform::TransactionTracker::Transaction>(assembly_.transactions->begin("bagFetch"));
+  }
+
+  auto request = assembly_.requestFactory->bagFetchRequest(*this, userAgent_, version);
+  if (!request) {
+    // Only a URL that does not parse gets here; the endpoint logic falls back before that.
+    bagLog().error("Error fetching bag: {}", "no request for the bag URL");
+    TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.bag.fetchesfailed");
+    {
+      std::lock_guard hold(completionLock_);
+      fetchTransaction_.reset();
+    }
+    if (completion) completion(nullptr, bagError("no request"));
+    fetchInProgress_.store(false);
+    return;
+  }
+  TavixLogForCategory(TavixLoggingCategoryProtocol)
+      .notice("Initiating bag fetch attempt with request {} header {}", request->url, describeHeaders(request->headers));
+
+  auto retryable = std::make_shared<const TVXRetryableNetworkRequest>(*request, std::nullopt, true);
+  std::weak_ptr<TavixBagController> weak = weak_from_this();
+  auto retryClock = retryClock_;
+  auto task = dataTaskWithRetryableRequest(
+      assembly_.bagSession(), retryable, 1, kFetchRetries, *retryClock, retryQueue_,
+      [weak, retryClock, completion = std::move(completion)](
+          std::string data, std::optional<platform::http::HTTPURLResponse> response,
+          std::optional<platform::http::URLError> error) {
+        bagLog().debug("resp: {}", describeResponse(response));
+        auto self = weak.lock();
+        if (!self) {
+          bagLog().error("Error fetching bag, bag fetch task completed after BagFetchController was cleaned up");
+          return;
+        }
+        std::unique_lock hold(self->completionLock_);
+        if (self->invalidated_.load()) return;
+        std::shared_ptr<const TVXBag> bag;
+        std::optional<TVXBagError> outcome;
+        if (error) {
+          bagLog().error("Error fetching bag: {} ({} {})", error->description, error->domain, error->code);
+          outcome = TVXBagError{error->domain, error->code, error->description};
+        } else if (!response) {
+          bagLog().error("Error fetching bag: returned data was not of the expected type.");
+          outcome = bagError("no data");
+        } else if (response->statusCode != 200) {
+          bagLog().error("Error fetching bag status code: {}", response->statusCode);
+          outcome = bagError(fmt::format("statusCode {}", response->statusCode));
+        } else {
+          auto parsed = platform::parseJson(data);
+          if (!parsed || !parsed->dictionary()) {
+            bagLog().error("Error fetching bag: returned data was not of the expected type.");
+            outcome = bagError("not JSON object");
+          } else {
+            bagLog().notice("Got bag: {}", data);
+            Dictionary augmented = self->cacheBagDictionary(*parsed->dictionary());
+            bag = std::make_shared<const TVXBag>(std::move(augmented), self->userAgent_.value_or(""));
+            self->cacheBagState(bag, false);
+          }
+        }
+        TavixDiagnosticDataReporter::addValue(
+            1, outcome ? "com.norvel.tavixd.bag.fetchesfailed" : "com.norvel.tavixd.bag.fetches");
+        self->fetchTransaction_.reset();
+        hold.unlock();
+        // The caller may start the next fetch from here; it merges until the flag is down.
+        if (completion) completion(outcome ? nullptr : bag, outcome);
+        self->fetchInProgress_.store(false);
+      });
+  task->resume();
+}
+
+Dictionary TavixBagController::cacheBagDictionary(const Dictionary& dictionary) {
+  Dictionary augmented = dictionary;
+  augmented[kExpirationKey] = PropertyValue(platform::toUnixSeconds(assembly_.clock->now()) + kBagLifetimeSeconds);
+  if (auto url = currentBagCacheURL()) augmented[kBagURLKey] = PropertyValue(*url);
+
+  if (!assembly_.diskBagCacheEnabled()) {
+    bagLog().info("skipping writing bag to disk because the flag is disabled");
+    return augmented;
+  }
+  std::error_code ec;
+  auto path = pathToCachedBag(&ec);
+  if (!path) {
+    bagLog().fault("Couldn't get path to cache bag.  Error: {}.", ec.message());
+    return augmented;
+  }
+  const std::string bytes = platform::toBinaryPlist(PropertyValue(augmented));
+  if (bytes.empty()) bagLog().error("Error writing bag to persistent cache: {}.", "empty property list");
+  if (auto werr = platform::writeFileAtomically(*path, bytes, 0600)) {
+    bagLog().error("Could not write to {}", path->string());
+  }
+  return augmented;
+}
+
+std::optional<platform::fs::path> TavixBagController::pathToCachedBag(std::error_code* error) {
+  std::error_code ec = platform::createDirectory(assembly_.paths.cacheHome, true, 0700);
+  if (ec) {
+    bagLog().fault("error getting cache directory {}", ec.message());
+    if (error) *error = ec;
+    return std::nullopt;
+  }
+  const auto folder = assembly_.cachesFolder();
+  ec = platform::createDirectory(folder, true, 0700);
+  if (ec) {
+    bagLog().fault("error creating agent-specific cache directory {}", ec.message());
+    if (error) *error = ec;
+    return std::nullopt;
+  }
+  return folder / kCacheFileName;
+}
+
+std::optional<Dictionary> TavixBagController::diskCachedBagDictionary() {
+  if (!assembly_.diskBagCacheEnabled()) {
+    bagLog().info("skipping check for bag on disk because the flag is disabled");
+    return std::nullopt;
+  }
+  auto path = pathToCachedBag(nullptr);
+  if (!path) return std::nullopt;
+  std::string bytes;
+  if (auto ec = platform::readFile(*path, &bytes)) {
+    // No bag yet is the normal first start.
+    if (ec != std::errc::no_such_file_or_directory) bagLog().fault("Error reading from bag cache: {}.", ec.message());
+    return std::nullopt;
+  }
+  auto value = platform::parsePlist(bytes);
+  if (!value) {
+    bagLog().fault("Error reading from bag cache: {}.", "not a property list");
+    return std::nullopt;
+  }
+  if (!value->dictionary()) {
+    bagLog().fault("Unexpected class deserialized from bag cache: {}.", typeName(value->type()));
+    return std::nullopt;
+  }
+  Dictionary dictionary = std::move(*value->dictionary());
+  if (isRefreshRequiredForCachedBag(dictionary)) {
+    // The stale bag still serves until the new one arrives.
+    std::weak_ptr<TavixBagController> weak = weak_from_this();
+    assembly_.dispatchPool->post([weak] {
+      if (auto self = weak.lock()) self->fetchBagStateWithVersion(std::nullopt);
+    });
+  }
+  return dictionary;
+}
+
+void TavixBagController::cacheBagState(std::shared_ptr<const TVXBag> bag, bool fromDisk) {
+  if (!bag) return;
+  inMemoryBagCacheAccessQueue_.writeSync([&] {
+    const unsigned long oldNews = newsAvailability(inMemoryBag_);
+    const unsigned long newNews = newsAvailability(bag);
+    inMemoryBag_ = bag;
+    auto& center = *assembly_.notificationCenter;
+    center.post(kTVXBagChangeNotification, this, bag);
+    if (oldNews != newNews && !fromDisk) {
+      bagLog().notice("setting Tavix News Available status to {}", newNews);
+      center.post(newNews == 1 ? kTVXNotifyEnabled : kTVXNotifyDisabled, this);
+    }
+  });
+}
+
+}  // namespace tavix

@@ -1,0 +1,144 @@
+// tavixd and the tavix-devserver program, both real processes: the bag fetched at start, kept on
+// disk, served again after a restart, and kept when the server fails.
+#include <poll.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <future>
+#include <thread>
+
+#include "platform/clock.h"
+#include "platform/defaults.h"
+#include "platform/dispatch.h"
+#include "platform/files.h"
+#include "platform/http/url_session.h"
+#include "platform/json_value.h"
+#include "platform/property_value.h"
+#include "support/daemon_process.h"
+
+namespace {
+
+using namespace tavix::platform;
+
+// The devserver program on a free port; killed at the end.
+struct DevServerProcess {
+  pid_t pid = -1;
+  std::string base;
+
+  explicit DevServerProcess() {
+    int out[2];
+    if (pipe(out) != 0) return;
+    pid = fork();
+    if (pid == 0) {
+      dup2(out[1], 1);
+      close(out[0]);
+      execl(DEVSERVER_BINARY, DEVSERVER_BINARY, "--port", "0", "--max-lifetime", "60", static_cast<char*>(nullptr));
+      _exit(127);
+    }
+    close(out[1]);
+    std::string line;
+    pollfd fd{out[0], POLLIN, 0};
+    char c;
+    while (poll(&fd, 1, 5000) == 1 && read(out[0], &c, 1) == 1 && c != '\n') line += c;
+    close(out[0]);
+    const std::string prefix = "listening on ";
+    if (line.rfind(prefix, 0) == 0) base = line.substr(prefix.size());
+  }
+  ~DevServerProcess() {
+    if (pid > 0) {
+      kill(pid, SIGKILL);
+      waitpid(pid, nullptr, 0);
+    }
+  }
+};
+
+class BagDaemonTest : public ::testing::Test {
+ protected:
+  std::string call(const std::string& path, const std::string& method = "GET", std::string body = {}) {
+    http::URLRequest r;
+    r.url = server.base + path;
+    r.method = method;
+    r.body = std::move(body);
+    std::promise<std::string> done;
+    session.dataTask(r, [&](std::string data, auto, auto) { done.set_value(std::move(data)); })->resume();
+    return done.get_future().get();
+  }
+  std::size_t bagFetches() {
+    auto recorded = parseJson(call("/_recorded"));
+    std::size_t n = 0;
+    for (const auto& entry : *recorded->array()) n += *entry.dictionary()->at("path").string() == "/bag";
+    return n;
+  }
+  fs::path bagFile() const { return home.cache() / "com.norvel.tavixd" / "bag.plist"; }
+  Dictionary readBag(std::string* bytes = nullptr) const {
+    std::string data;
+    EXPECT_FALSE(readFile(bagFile(), &data));
+    if (bytes) *bytes = data;
+    auto value = parsePlist(data);
+    return value && value->dictionary() ? *value->dictionary() : Dictionary{};
+  }
+  tavix::testing::DaemonProcess start(const std::string& logName) {
+    return tavix::testing::DaemonProcess(TAVIXD_BINARY, home, {}, logName);
+  }
+
+  tavix::testing::TempHome home;
+  DevServerProcess server;
+  DispatchPool pool{1};
+  http::URLSession session{http::URLSessionConfiguration{.delegatePool = &pool}};
+};
+
+TEST_F(BagDaemonTest, FetchedOnceAtStartThenServedFromDiskUntilDue) {
+  ASSERT_FALSE(server.base.empty());
+  {
+    UserDefaults defaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
+    defaults.setObject("TVXBagURL", server.base + "/bag");
+    ASSERT_TRUE(defaults.synchronize());
+  }
+
+  const double startedAt = toUnixSeconds(std::chrono::system_clock::now());
+  {
+    auto daemon = start("first.log");
+    ASSERT_TRUE(daemon.waitForLog("Got bag")) << daemon.log();
+    ASSERT_TRUE(tavix::testing::waitFor([&] { return fs::exists(bagFile()); })) << daemon.log();
+    EXPECT_EQ(bagFetches(), 1u);
+    EXPECT_EQ(daemon.stop(), 0);
+  }
+  std::string bytes;
+  const Dictionary bag = readBag(&bytes);
+  EXPECT_EQ(bytes.rfind("bplist00", 0), 0u);
+  struct stat st {};
+  ASSERT_EQ(stat(bagFile().c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  ASSERT_TRUE(bag.count("search_url") && bag.count("__bagurl") && bag.count("__expiration"));
+  EXPECT_EQ(*bag.at("search_url").string(), server.base + "/search");
+  EXPECT_EQ(bag.at("__bagurl").string()->rfind(server.base + "/bag?", 0), 0u);
+  EXPECT_NEAR(*bag.at("__expiration").real(), startedAt + 14400, 30);
+
+  {
+    auto daemon = start("second.log");
+    ASSERT_TRUE(daemon.waitForLog("tavixd started")) << daemon.log();
+    std::this_thread::sleep_for(std::chrono::milliseconds(500));
+    EXPECT_EQ(bagFetches(), 1u) << daemon.log();
+    EXPECT_EQ(daemon.log().find("Initiating bag fetch"), std::string::npos);
+    EXPECT_EQ(daemon.stop(), 0);
+  }
+
+  // Due, but the server fails: the daemon says why and the old bag stays on disk.
+  Dictionary due = bag;
+  due["__expiration"] = PropertyValue(startedAt + 100);
+  ASSERT_FALSE(writeFileAtomically(bagFile(), toBinaryPlist(PropertyValue(due))));
+  call("/_faults", "POST", R"({"path": "/bag", "status": 500})");
+  {
+    auto daemon = start("third.log");
+    EXPECT_TRUE(daemon.waitForLog("Error fetching bag status code: 500")) << daemon.log();
+    EXPECT_EQ(daemon.stop(), 0);
+  }
+  EXPECT_EQ(bagFetches(), 2u);
+  EXPECT_EQ(readBag(), due);
+}
+
+}  // namespace
