@@ -11,6 +11,7 @@
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
+#include "core/names.h"
 #include "network/retryable_request.h"
 #include "network/url_request_builder.h"
 #include "network/user_agent.h"
@@ -27,7 +28,6 @@ using platform::PropertyValue;
 namespace {
 
 constexpr const char* kBagURLDefaultsKey = "TVXBagURL";
-constexpr const char* kErrorDomain = "kTVXErrorDomain";
 constexpr const char* kExpirationKey = "__expiration";
 constexpr const char* kBagURLKey = "__bagurl";
 constexpr const char* kRefreshDisabledKey = "__refresh_disabled";
@@ -138,7 +138,7 @@ std::optional<std::string> versionString(const PropertyValue* value) {
   return std::nullopt;
 }
 
-TVXBagError bagError(std::string reason) { return {kErrorDomain, kBagFetchErrorCode, std::move(reason)}; }
+TVXBagError bagError(std::string reason) { return {kTVXErrorDomain, kBagFetchErrorCode, std::move(reason)}; }
 
 }  // namespace
 

@@ -20,6 +20,7 @@
 #include <string_view>
 #include <system_error>
 
+#include "core/names.h"
 #include "network/request_factory.h"
 #include "platform/dispatch.h"
 #include "platform/files.h"
@@ -32,8 +33,6 @@ namespace tavix {
 class Assembly;
 class TVXBag;
 
-inline constexpr const char* kTVXBagChangeNotification = "TVXBagChangeNotification";
-inline constexpr const char* kTVXBagRefreshRequiredNotification = "TVXBagRefreshRequired";
 inline constexpr const char* kTVXNotificationBagKey = "bag";
 // News availability, posted on the assembly's notification centre when a fetched bag turns the
 // news reader's feature on or off.

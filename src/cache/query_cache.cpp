@@ -10,6 +10,7 @@
 
 #include "core/assembly.h"
 #include "core/logging.h"
+#include "core/names.h"
 #include "platform/http/url_request.h"
 #include "platform/memory_pressure.h"
 
@@ -123,7 +124,7 @@ QueryCache::~QueryCache() {
 
 void QueryCache::registerNotifications() {
   static constexpr const char* names[] = {
-      "TVXUserGUIDChangeNotification",    "TVXSessionSoftLimitNotification",   "TVXSessionMaxLimitNotification",
+      kTVXUserGUIDChangeNotification,     kTVXSessionSoftLimitNotification,    kTVXSessionMaxLimitNotification,
       kCountryCodeDidChangeNotification,  kSystemTimeZoneDidChangeNotification, kCurrentLocaleDidChangeNotification,
       kManagedSettingsDidChangeNotification, kAccountStoreDidChangeNotification,
       kAccountCredentialsDidChangeNotification,

@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "cache/critbit.h"
+#include "core/names.h"
 #include "platform/clock.h"
 #include "platform/dispatch.h"
 #include "platform/notification_center.h"
@@ -80,14 +81,6 @@ struct CacheSearchRequest {
   double scale = 0;
   QueryItems queryItems;
 };
-
-// Names of the platform notifications that also clear every query cache.
-inline constexpr const char* kCountryCodeDidChangeNotification = "TVXCountryCodeDidChangeNotification";
-inline constexpr const char* kSystemTimeZoneDidChangeNotification = "TVXSystemTimeZoneDidChangeNotification";
-inline constexpr const char* kCurrentLocaleDidChangeNotification = "TVXCurrentLocaleDidChangeNotification";
-inline constexpr const char* kManagedSettingsDidChangeNotification = "TVXManagedSettingsDidChangeNotification";
-inline constexpr const char* kAccountStoreDidChangeNotification = "TVXAccountStoreDidChangeNotification";
-inline constexpr const char* kAccountCredentialsDidChangeNotification = "TVXAccountCredentialsDidChangeNotification";
 
 class QueryCache : public std::enable_shared_from_this<QueryCache> {
  public:

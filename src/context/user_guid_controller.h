@@ -10,6 +10,7 @@
 
 #include <string>
 
+#include "core/names.h"
 #include "platform/clock.h"
 #include "platform/dispatch.h"
 
@@ -17,7 +18,6 @@ namespace tavix {
 
 class Assembly;
 
-inline constexpr const char* kTVXUserGUIDChangeNotification = "TVXUserGUIDChangeNotification";
 inline constexpr double kTavixUserGUIDLifetimeSeconds = 900;
 
 // A fresh random (version 4) UUID in its upper-case textual form.

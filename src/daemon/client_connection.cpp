@@ -2,6 +2,7 @@
 
 #include "core/assembly.h"
 #include "core/logging.h"
+#include "core/names.h"
 #include "network/user_agent.h"
 #include "platform/activity.h"
 #include "platform/ipc/launch_events.h"
@@ -39,11 +40,11 @@ void ClientConnection::start() {
   if (assembly_.notificationCenter) {
     std::weak_ptr<ClientConnection> weak = weak_from_this();
     downloadObserver_ = assembly_.notificationCenter->addObserver(
-        "TVXFileDownloadCompletedNotification", nullptr, nullptr, [weak](const platform::Notification& n) {
+        kTVXFileDownloadCompletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
           if (auto self = weak.lock()) self->relayResourceNotification(n, true);
         });
     deleteObserver_ = assembly_.notificationCenter->addObserver(
-        "TVXFileDeletedNotification", nullptr, nullptr, [weak](const platform::Notification& n) {
+        kTVXFileDeletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
           if (auto self = weak.lock()) self->relayResourceNotification(n, false);
         });
   }

@@ -13,6 +13,7 @@
 #include <optional>
 #include <string>
 
+#include "core/names.h"
 #include "platform/clock.h"
 #include "platform/notification_center.h"
 #include "platform/transactions.h"
@@ -30,8 +31,6 @@ namespace proto {
 class Envelope;
 class TVXError;
 }  // namespace proto
-
-inline constexpr const char* kTVXErrorDomain = "kTVXErrorDomain";
 
 // How long a silent client keeps the daemon alive.
 inline constexpr double kIdleTransactionSeconds = 60;

@@ -7,19 +7,18 @@
 #include <csignal>
 
 #include "bag/tavix_bag_controller.h"
+#include "cache/engaged_completion_cache.h"
+#include "context/location.h"
+#include "context/motion.h"
 #include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
+#include "core/names.h"
 #include "daemon/tavix_service.h"
 #include "feedback/persistent_storage.h"
-#include "cache/engaged_completion_cache.h"
-#include "context/location.h"
-#include "context/motion.h"
 #include "network/request_factory.h"
 #include "network/tracing.h"
-#include "platform/json_value.h"
-#include "platform/memory_pressure.h"
 #include "platform/activity.h"
 #include "platform/clock.h"
 #include "platform/counters.h"
@@ -27,6 +26,8 @@
 #include "platform/dispatch.h"
 #include "platform/ipc/launch_events.h"
 #include "platform/ipc/server.h"
+#include "platform/json_value.h"
+#include "platform/memory_pressure.h"
 #include "platform/notification_center.h"
 #include "platform/run_loop.h"
 #include "platform/transactions.h"
@@ -169,7 +170,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
 
   // Warm the bag: a valid disk bag is already in memory; otherwise this starts the first fetch.
   pool.post([bagController = assembly.bagController] { bagController->currentBag(); });
-  pool.post([center = assembly.notificationCenter] { center->post("TVXStartup"); });
+  pool.post([center = assembly.notificationCenter] { center->post(kTVXStartupNotification); });
 
   platform::SignalSource sigint(pool, SIGINT, [&] {
     log.debug("SIGINT");

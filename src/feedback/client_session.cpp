@@ -9,6 +9,7 @@
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
+#include "core/names.h"
 #include "feedback/feedback_json.h"
 #include "feedback/persistent_storage.h"
 #include "feedback/session_processing_helper.h"
@@ -124,7 +125,7 @@ void ClientSession::addFeedback(const FeedbackRef& feedback) {
   if (handle) handle->writeFeedback(*feedback);
   if (backingStore_.has_user_guid_string() && feedback->user_guid() != backingStore_.user_guid_string()) {
     proto::CTErrorFeedback error;
-    error.set_domain("kTVXErrorDomain");
+    error.set_domain(kTVXErrorDomain);
     error.set_code(500);
     error.set_reason("different guid in session");
     auto wrapped = makeTavixFeedbackWithCodable(error, 0, "", feedback->user_agent());

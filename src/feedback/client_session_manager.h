@@ -15,6 +15,7 @@
 #include <memory>
 #include <string>
 
+#include "core/names.h"
 #include "feedback/client_session.h"
 #include "platform/clock.h"
 #include "platform/dispatch.h"
@@ -23,8 +24,6 @@ namespace tavix {
 
 class TavixUserGUIDController;
 
-inline constexpr const char* kTVXSessionSoftLimitNotification = "TVXSessionSoftLimitNotification";
-inline constexpr const char* kTVXSessionMaxLimitNotification = "TVXSessionMaxLimitNotification";
 
 // One session per client user agent, opened and closed together (shared sessions).
 // Owns the queue "com.norvel.tavixd.clientSessionSharedQueue", always entered after the

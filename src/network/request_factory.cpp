@@ -10,6 +10,7 @@
 #include "context/motion.h"
 #include "core/assembly.h"
 #include "core/logging.h"
+#include "core/names.h"
 #include "network/locale_context.h"
 #include "network/url_request_builder.h"
 #include "network/user_agent.h"
@@ -27,8 +28,6 @@ using platform::PropertyValue;
 namespace {
 
 constexpr const char* kAccessKey = "tapirowl3860";
-constexpr const char* kBagChangeNotification = "TVXBagChangeNotification";
-constexpr const char* kBagRefreshRequired = "TVXBagRefreshRequired";
 constexpr const char* kNoLocationUser = "userno";
 constexpr const char* kNoLocationInit = "error.init";
 constexpr const char* kNoLocationSlow = "slow";
@@ -261,7 +260,7 @@ class TVXNetworkRequestFactory::Builder {
     // Never from inside the context queue: observers may come back into the factory.
     auto center = f.assembly_.notificationCenter;
     const void* sender = &f;
-    f.assembly_.dispatchPool->post([center, sender] { center->post(kBagRefreshRequired, sender); });
+    f.assembly_.dispatchPool->post([center, sender] { center->post(kTVXBagRefreshRequiredNotification, sender); });
   }
 
   static std::optional<TavixURLRequestBuilder> builderFor(const std::optional<std::string>& url) {
@@ -610,14 +609,14 @@ void TVXNetworkRequestFactory::start() {
     });
   });
   context_->bagRegistration = assembly_.notificationCenter->addObserver(
-      kBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
+      kTVXBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
         auto self = weak.lock();
         auto bag = bagFromNotification(n);
         if (self && bag) Builder::didGetBag(*self, std::move(bag));
       });
   // A new user identifier starts a new maps user session, so "X-Norvel-GeoSession" follows it.
   context_->guidRegistration = assembly_.notificationCenter->addObserver(
-      "TVXUserGUIDChangeNotification", nullptr, nullptr, [weak](const platform::Notification&) {
+      kTVXUserGUIDChangeNotification, nullptr, nullptr, [weak](const platform::Notification&) {
         auto self = weak.lock();
         if (!self || !self->providers_.locationManager) return;
         self->context_->queue.async([weak] {

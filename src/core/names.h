@@ -1,0 +1,28 @@
+// Names the daemon's parts share: the error domain and the notifications they post and observe
+// on the assembly's notification centre. One spelling each, here.
+#pragma once
+
+namespace tavix {
+
+inline constexpr const char* kTVXErrorDomain = "kTVXErrorDomain";
+
+inline constexpr const char* kTVXStartupNotification = "TVXStartup";
+// Object: the new bag (std::shared_ptr<const TVXBag>).
+inline constexpr const char* kTVXBagChangeNotification = "TVXBagChangeNotification";
+inline constexpr const char* kTVXBagRefreshRequiredNotification = "TVXBagRefreshRequired";
+inline constexpr const char* kTVXUserGUIDChangeNotification = "TVXUserGUIDChangeNotification";
+inline constexpr const char* kTVXSessionSoftLimitNotification = "TVXSessionSoftLimitNotification";
+inline constexpr const char* kTVXSessionMaxLimitNotification = "TVXSessionMaxLimitNotification";
+inline constexpr const char* kTVXFileDownloadCompletedNotification = "TVXFileDownloadCompletedNotification";
+inline constexpr const char* kTVXFileDeletedNotification = "TVXFileDeletedNotification";
+
+// Changes in the world around the daemon that make cached replies stale (posted by whatever
+// watches for them).
+inline constexpr const char* kCountryCodeDidChangeNotification = "TVXCountryCodeDidChangeNotification";
+inline constexpr const char* kSystemTimeZoneDidChangeNotification = "TVXSystemTimeZoneDidChangeNotification";
+inline constexpr const char* kCurrentLocaleDidChangeNotification = "TVXCurrentLocaleDidChangeNotification";
+inline constexpr const char* kManagedSettingsDidChangeNotification = "TVXManagedSettingsDidChangeNotification";
+inline constexpr const char* kAccountStoreDidChangeNotification = "TVXAccountStoreDidChangeNotification";
+inline constexpr const char* kAccountCredentialsDidChangeNotification = "TVXAccountCredentialsDidChangeNotification";
+
+}  // namespace tavix
