@@ -178,13 +178,16 @@ std::shared_ptr<EngagedCompletionCache> EngagedCompletionCache::create(Environme
 }
 
 std::shared_ptr<EngagedCompletionCache> EngagedCompletionCache::sharedInstance(const Assembly& assembly) {
+  // Lives as long as the process and is never destroyed: its queues belong to the daemon's pool,
+  // which is gone by the time static destructors run. Every statement is committed as it runs, so
+  // there is nothing to close at exit.
   static std::once_flag once;
-  static std::shared_ptr<EngagedCompletionCache> instance;
+  static std::shared_ptr<EngagedCompletionCache>* instance = nullptr;
   std::call_once(once, [&] {
-    instance = create(Environment{assembly.cachesFolder(), assembly.clock, assembly.dispatchPool,
-                                  assembly.userDefaults.get()});
+    instance = new std::shared_ptr<EngagedCompletionCache>(create(Environment{
+        assembly.cachesFolder(), assembly.clock, assembly.dispatchPool, assembly.userDefaults.get()}));
   });
-  return instance;
+  return *instance;
 }
 
 EngagedCompletionCache::EngagedCompletionCache(Environment env)
