@@ -10,6 +10,7 @@
 #include "core/diagnostics.h"
 #include "feedback/tavix_feedback.h"
 #include "network/user_agent.h"
+#include "platform/clock.h"
 #include "platform/counters.h"
 #include "platform/defaults.h"
 #include "platform/transactions.h"

@@ -13,19 +13,9 @@
 #include <mutex>
 
 #include "platform/dispatch.h"
+#include "platform/time.h"
 
 namespace tavix::platform {
-
-using TimePoint = std::chrono::system_clock::time_point;
-using Duration = std::chrono::system_clock::duration;
-
-// Seconds as a Duration, for the many limits expressed in seconds.
-constexpr Duration seconds(double s) {
-  return std::chrono::duration_cast<Duration>(std::chrono::duration<double>(s));
-}
-// Seconds since the Unix epoch, and back.
-double toUnixSeconds(TimePoint t);
-TimePoint fromUnixSeconds(double s);
 
 // Cancels a pending timer. Copies share the timer; dropping every copy does not cancel it.
 class TimerHandle {

@@ -9,7 +9,7 @@
 #include <variant>
 #include <vector>
 
-#include "platform/clock.h"
+#include "platform/time.h"
 
 namespace tavix::platform {
 
