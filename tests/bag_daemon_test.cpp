@@ -19,42 +19,12 @@
 #include "platform/json_value.h"
 #include "platform/property_value.h"
 #include "support/daemon_process.h"
+#include "support/devserver_process.h"
 
 namespace {
 
 using namespace tavix::platform;
 
-// The devserver program on a free port; killed at the end.
-struct DevServerProcess {
-  pid_t pid = -1;
-  std::string base;
-
-  explicit DevServerProcess() {
-    int out[2];
-    if (pipe(out) != 0) return;
-    pid = fork();
-    if (pid == 0) {
-      dup2(out[1], 1);
-      close(out[0]);
-      execl(DEVSERVER_BINARY, DEVSERVER_BINARY, "--port", "0", "--max-lifetime", "60", static_cast<char*>(nullptr));
-      _exit(127);
-    }
-    close(out[1]);
-    std::string line;
-    pollfd fd{out[0], POLLIN, 0};
-    char c;
-    while (poll(&fd, 1, 5000) == 1 && read(out[0], &c, 1) == 1 && c != '\n') line += c;
-    close(out[0]);
-    const std::string prefix = "listening on ";
-    if (line.rfind(prefix, 0) == 0) base = line.substr(prefix.size());
-  }
-  ~DevServerProcess() {
-    if (pid > 0) {
-      kill(pid, SIGKILL);
-      waitpid(pid, nullptr, 0);
-    }
-  }
-};
 
 class BagDaemonTest : public ::testing::Test {
  protected:
@@ -86,7 +56,7 @@ class BagDaemonTest : public ::testing::Test {
   }
 
   tavix::testing::TempHome home;
-  DevServerProcess server;
+  tavix::testing::DevServerProcess server{DEVSERVER_BINARY};
   DispatchPool pool{1};
   http::URLSession session{http::URLSessionConfiguration{.delegatePool = &pool}};
 };

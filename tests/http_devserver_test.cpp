@@ -12,6 +12,7 @@
 
 #include "platform/dispatch.h"
 #include "platform/http/url_session.h"
+#include "support/devserver_process.h"
 #include "support/temp_home.h"
 
 namespace {
@@ -20,35 +21,6 @@ using namespace tavix::platform;
 using namespace tavix::platform::http;
 using json = nlohmann::json;
 
-// Starts the program and reads its first line; kills it at the end if it is still there.
-struct DevServerProcess {
-  pid_t pid = -1;
-  std::string firstLine;
-
-  explicit DevServerProcess(const std::filesystem::path& dataDir) {
-    int out[2];
-    if (pipe(out) != 0) return;
-    pid = fork();
-    if (pid == 0) {
-      dup2(out[1], 1);
-      close(out[0]);
-      execl(DEVSERVER_BINARY, DEVSERVER_BINARY, "--port", "0", "--data-dir", dataDir.c_str(), "--max-lifetime", "60",
-            static_cast<char*>(nullptr));
-      _exit(127);
-    }
-    close(out[1]);
-    pollfd fd{out[0], POLLIN, 0};
-    char c;
-    while (poll(&fd, 1, 5000) == 1 && read(out[0], &c, 1) == 1 && c != '\n') firstLine += c;
-    close(out[0]);
-  }
-  ~DevServerProcess() {
-    if (pid > 0 && waitpid(pid, nullptr, WNOHANG) == 0) {
-      kill(pid, SIGKILL);
-      waitpid(pid, nullptr, 0);
-    }
-  }
-};
 
 std::pair<long, json> get(URLSession& session, const std::string& url) {
   std::promise<std::pair<long, json>> done;
@@ -61,7 +33,7 @@ std::pair<long, json> get(URLSession& session, const std::string& url) {
 
 TEST(HTTPDevServerTest, ServesItsBagAndSearchAndKeepsWhatItRecords) {
   tavix::testing::TempHome home;
-  DevServerProcess server(home.root() / "data");
+  tavix::testing::DevServerProcess server(DEVSERVER_BINARY, {"--data-dir", (home.root() / "data").string()});
   const std::string prefix = "listening on http://127.0.0.1:";
   ASSERT_EQ(server.firstLine.rfind(prefix, 0), 0u) << server.firstLine;
   const std::string base = server.firstLine.substr(std::string("listening on ").size());

@@ -1,0 +1,41 @@
+#include "support/devserver_process.h"
+
+#include <poll.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+namespace tavix::testing {
+
+DevServerProcess::DevServerProcess(const std::string& binary, std::vector<std::string> args) {
+  int out[2];
+  if (pipe(out) != 0) return;
+  pid = fork();
+  if (pid == 0) {
+    dup2(out[1], 1);
+    close(out[0]);
+    std::vector<std::string> all{binary, "--port", "0", "--max-lifetime", "60"};
+    all.insert(all.end(), args.begin(), args.end());
+    std::vector<char*> argv;
+    for (auto& a : all) argv.push_back(a.data());
+    argv.push_back(nullptr);
+    execv(binary.c_str(), argv.data());
+    _exit(127);
+  }
+  close(out[1]);
+  pollfd fd{out[0], POLLIN, 0};
+  char c;
+  while (poll(&fd, 1, 5000) == 1 && read(out[0], &c, 1) == 1 && c != '\n') firstLine += c;
+  close(out[0]);
+  const std::string prefix = "listening on ";
+  if (firstLine.rfind(prefix, 0) == 0) base = firstLine.substr(prefix.size());
+}
+
+DevServerProcess::~DevServerProcess() {
+  if (pid > 0 && waitpid(pid, nullptr, WNOHANG) == 0) {
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+  }
+}
+
+}  // namespace tavix::testing
