@@ -3,11 +3,13 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "platform/http/url_request.h"
 #include "platform/property_value.h"
 
 namespace tavix {
@@ -79,5 +81,35 @@ struct TVXLookupRequest : TVXRequest {
 struct TVXFlightSearchRequest : TVXRequest {
   std::string flightQuery;
 };
+
+// What a client says about itself when it connects: its identifier keys its state, its user agent
+// is the client's own part of the full user agent.
+struct TVXSessionConfiguration {
+  std::string identifier;
+  std::string userAgent;
+  bool operator==(const TVXSessionConfiguration&) const = default;
+};
+
+// An error answered to a client: a domain (kTVXErrorDomain for the daemon's own, the transport's
+// otherwise), a code and the "reason".
+struct TVXError {
+  std::string domain;
+  std::int64_t code = 0;
+  std::string reason;
+};
+
+// The daemon's answer to a query.
+struct TVXReply {
+  double scale = 0;
+  std::string data;  // the server's body, as it came (or as cached)
+  std::optional<platform::http::URLRequest> httpRequest;       // verbose replies only
+  std::optional<platform::http::HTTPURLResponse> httpResponse;  // verbose replies only
+  std::optional<std::string> geoSessionEntityString;
+  std::vector<std::string> localSuggestions;  // engaged completions found on the device
+};
+
+// Called exactly once per query: the request's query id, then a reply or none, an error or none.
+using TVXReplyBlock =
+    std::function<void(std::uint64_t queryId, std::optional<TVXReply> reply, std::optional<TVXError> error)>;
 
 }  // namespace tavix

@@ -258,6 +258,9 @@ bool DevServer::start(const Options& options, std::string* error) {
   impl_->routes();
   // Head and body go out in separate writes; without this Nagle holds the body for the client's ACK.
   impl_->server.set_tcp_nodelay(true);
+  // stop() waits for idle keep-alive connections to time out; a second keeps reuse under load
+  // without making every shutdown (one per test) wait five.
+  impl_->server.set_keep_alive_timeout(1);
   impl_->port = options.port == 0 ? impl_->server.bind_to_any_port("127.0.0.1")
                                   : (impl_->server.bind_to_port("127.0.0.1", options.port) ? options.port : -1);
   if (impl_->port <= 0) return fail("cannot bind 127.0.0.1:" + std::to_string(options.port));

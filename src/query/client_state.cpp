@@ -1,0 +1,190 @@
+// The client state's creation, its bag and its bookkeeping. The query paths live in
+// client_state_search.cpp and client_state_queries.cpp.
+#include "query/client_state.h"
+
+#include <chrono>
+
+#include "bag/tavix_bag_controller.h"
+#include "bag/tvx_bag.h"
+#include "cache/query_cache.h"
+#include "context/user_guid_controller.h"
+#include "core/assembly.h"
+#include "core/logging.h"
+#include "core/names.h"
+#include "feedback/client_session_manager.h"
+#include "network/user_agent.h"
+#include "platform/clock.h"
+#include "platform/defaults.h"
+
+namespace tavix {
+
+namespace {
+
+platform::Logger& cachingLog() { return TavixLogForCategory(TavixLoggingCategoryCaching); }
+platform::Logger& sessionLog() { return TavixLogForCategory(TavixLoggingCategorySession); }
+
+// The bag a change notification carries, whichever shared form the poster used.
+std::shared_ptr<const TVXBag> bagOfNotification(const platform::Notification& notification) {
+  if (auto* bag = std::any_cast<std::shared_ptr<const TVXBag>>(&notification.object)) return *bag;
+  if (auto* bag = std::any_cast<std::shared_ptr<TVXBag>>(&notification.object)) return *bag;
+  if (auto* bag = std::any_cast<TVXBag>(&notification.object)) return std::make_shared<const TVXBag>(*bag);
+  return nullptr;
+}
+
+std::shared_ptr<const TVXBag> labelled(const TVXBag& bag, const std::string& userAgent) {
+  return std::make_shared<const TVXBag>(bag.sharedRawBag(), userAgent);
+}
+
+}  // namespace
+
+std::shared_ptr<ClientState> ClientState::create(Assembly& assembly, std::string identifier) {
+  return std::shared_ptr<ClientState>(new ClientState(assembly, std::move(identifier)));
+}
+
+ClientState::ClientState(Assembly& assembly, std::string identifier)
+    : assembly_(assembly),
+      identifier_(std::move(identifier)),
+      clientShortName_(extractClientNameFromString(identifier_)) {
+  if (!assembly_.userDefaults || !assembly_.userDefaults->boolForKey("TVXNoQueryCache")) {
+    queryCache_ = QueryCache::create(assembly_);
+    cachingLog().debug("query cache ON for {}", identifier_);
+  } else {
+    cachingLog().debug("query cache OFF for {}", identifier_);
+  }
+  if (assembly_.sharedSession && assembly_.guidController && assembly_.clientSessionManager) {
+    sessionLog().debug("Tavix is using shared instance of guid controller");
+    guidController_ = assembly_.guidController;
+    sessionManager_ = assembly_.clientSessionManager;
+  } else {
+    guidController_ = std::make_shared<TavixUserGUIDController>(assembly_);
+    sessionLog().debug("Tavix is using individual instance of guid controller {}",
+                       static_cast<const void*>(guidController_.get()));
+    sessionManager_ = std::make_shared<ClientSessionManager>(assembly_, guidController_, identifier_);
+  }
+}
+
+ClientState::~ClientState() { bagObserver_.reset(); }
+
+std::optional<std::string> ClientState::userAgent() const {
+  std::lock_guard lock(mutex_);
+  return userAgent_;
+}
+
+void ClientState::setUserAgent(std::optional<std::string> userAgent) {
+  std::lock_guard lock(mutex_);
+  userAgent_ = std::move(userAgent);
+  relabelBagLocked();
+}
+
+std::optional<TVXSessionConfiguration> ClientState::configuration() const {
+  std::lock_guard lock(mutex_);
+  return configuration_;
+}
+
+void ClientState::setConfiguration(TVXSessionConfiguration configuration) {
+  std::lock_guard lock(mutex_);
+  configuration_ = std::move(configuration);
+}
+
+std::shared_ptr<const TVXBag> ClientState::currentBag() const {
+  std::lock_guard lock(mutex_);
+  return bag_;
+}
+
+std::optional<platform::TimePoint> ClientState::lastNetworkRequest() const {
+  std::lock_guard lock(mutex_);
+  return lastNetworkRequest_;
+}
+
+void ClientState::markNetworkRequest() {
+  const auto now = assembly_.clock ? assembly_.clock->now() : platform::TimePoint{};
+  std::lock_guard lock(mutex_);
+  lastNetworkRequest_ = now;
+}
+
+bool ClientState::isProbablyFirstLaunchEver() const {
+  return !assembly_.userDefaults || !assembly_.userDefaults->objectForKey("download_resources");
+}
+
+void ClientState::relabelBagLocked() {
+  if (bag_ && userAgent_) bag_ = labelled(*bag_, *userAgent_);
+}
+
+void ClientState::bag(const std::string& userAgent, const BagReply& reply) {
+  bool relabelled = false;
+  {
+    std::lock_guard lock(mutex_);
+    if (!userAgent.empty() && userAgent_ != userAgent) {
+      userAgent_ = userAgent;
+      relabelBagLocked();
+      relabelled = true;
+    }
+    if (!userAgent_) {
+      reply(nullptr, TVXError{kTVXErrorDomain, 1, "no UserAgent"});
+      return;
+    }
+  }
+  // Replies cached for the old user agent were made for another client identity.
+  if (relabelled && queryCache_) queryCache_->removeAllObjects();
+  const bool ok = ensureBag();
+  std::optional<TVXError> error;
+  if (!ok) error = TVXError{kTVXErrorDomain, 1, "timeout"};
+  reply(currentBag(), std::move(error));
+}
+
+void ClientState::observeBagChangesLocked() {
+  if (bagObserver_ || !assembly_.notificationCenter) return;
+  std::weak_ptr<ClientState> weak = weak_from_this();
+  bagObserver_ = assembly_.notificationCenter->addObserver(
+      kTVXBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& notification) {
+        if (auto self = weak.lock()) self->bagChangeNotification(notification);
+      });
+}
+
+bool ClientState::ensureBag() {
+  std::string agent;
+  {
+    std::lock_guard lock(mutex_);
+    if (!userAgent_) return false;
+    if (bag_) return true;
+    agent = *userAgent_;
+    observeBagChangesLocked();
+  }
+  cachingLog().info("Warming bag cache for agent: {}", agent);
+  auto current = assembly_.bagController ? assembly_.bagController->currentBag() : nullptr;
+  if (current) {
+    std::lock_guard lock(mutex_);
+    if (!bag_) bag_ = labelled(*current, userAgent_.value_or(agent));
+    return true;
+  }
+  // currentBag() has started a fetch: wait a little for it, so that a query without a bag fails
+  // fast rather than hanging.
+  markNetworkRequest();
+  const int waitMs = isProbablyFirstLaunchEver() ? kTVXFirstLaunchBagSemaphoreWait : kTVXDefaultBagSemaphoreWait;
+  std::unique_lock lock(mutex_);
+  if (bagSignal_.wait_for(lock, std::chrono::milliseconds(waitMs), [this] { return bagSignals_ > 0; })) {
+    --bagSignals_;
+  }
+  TavixLogForCategory(TavixLoggingCategoryDefault).notice("client {} finished waiting for bag", identifier_);
+  return bag_ != nullptr;
+}
+
+void ClientState::bagChangeNotification(const platform::Notification& notification) {
+  auto bag = bagOfNotification(notification);
+  {
+    std::lock_guard lock(mutex_);
+    if (bag) bag_ = labelled(*bag, userAgent_.value_or(bag->userAgent()));
+    ++bagSignals_;
+  }
+  bagSignal_.notify_one();
+}
+
+void ClientState::updateClient(const std::string& userAgent) {
+  std::lock_guard lock(mutex_);
+  if (userAgent_ == userAgent) return;
+  userAgent_ = userAgent;
+  relabelBagLocked();
+  sessionLog().notice("userAgent changed to {}", userAgent);
+}
+
+}  // namespace tavix

@@ -1,0 +1,122 @@
+// ClientState: everything the daemon keeps for one client identifier, shared by all of that
+// client's connections and outliving them: its user agent and configuration, its own copy of the
+// bag (labelled with its user agent), its query cache, its user GUID controller and feedback
+// session manager, and the query paths (search, zero-keyword, more results, card, look-up,
+// flight) with the feedback records around their network requests.
+//
+// Threading: any method may be called from any thread; the fields below are guarded by one mutex.
+// bag() and ensureBag() may block the caller for up to kTVXFirstLaunchBagSemaphoreWait while the
+// bag controller fetches. The query methods run their synchronous part on the caller's queue and
+// finish on the URL session's queue; their reply block is called exactly once.
+#pragma once
+
+#include <condition_variable>
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "core/requests.h"
+#include "platform/notification_center.h"
+#include "platform/time.h"
+
+namespace tavix {
+
+class Assembly;
+class ClientSessionManager;
+class QueryCache;
+class TavixUserGUIDController;
+class TVXBag;
+
+namespace proto {
+class CTStartNetworkSearchFeedback;
+}
+
+// How long a query waits for a bag that is being fetched, in milliseconds: longer on a device that
+// has never recorded resources (first launch), where the bag is certainly on its way.
+inline constexpr int kTVXFirstLaunchBagSemaphoreWait = 600;
+inline constexpr int kTVXDefaultBagSemaphoreWait = 300;
+
+class ClientState : public std::enable_shared_from_this<ClientState> {
+ public:
+  using BagReply = std::function<void(std::shared_ptr<const TVXBag> bag, std::optional<TVXError> error)>;
+
+  // Reads "TVXNoQueryCache"; shares the assembly's GUID controller and session manager when the
+  // assembly's sharedSession is set, else makes its own (the manager keyed by `identifier`).
+  static std::shared_ptr<ClientState> create(Assembly& assembly, std::string identifier);
+  ~ClientState();
+  ClientState(const ClientState&) = delete;
+  ClientState& operator=(const ClientState&) = delete;
+
+  // ---- The bag
+
+  // Adopts `userAgent` when non-empty and new (re-labelling the bag, emptying the query cache),
+  // then answers the bag: error code 1 "no UserAgent" without a user agent, "timeout" when none
+  // came in time. Blocks the caller for at most the bag wait.
+  void bag(const std::string& userAgent, const BagReply& reply);
+  // Whether a bag is held, fetching and waiting for one when not.
+  bool ensureBag();
+  // The tool's connections re-label the state with their user agent.
+  void updateClient(const std::string& userAgent);
+
+  // ---- Connection warming: a warm-up request when the bag names one and no request went out in
+  // the last 30 seconds.
+  void warm();
+
+  // ---- Queries. Each calls `reply` exactly once.
+  void search(std::shared_ptr<const TVXSearchRequest> request, TVXReplyBlock reply);
+  void zeroKeyword(std::shared_ptr<const TVXZeroKeywordRequest> request, TVXReplyBlock reply);
+  void moreResults(std::shared_ptr<const TVXMoreResultsRequest> request, TVXReplyBlock reply);
+  void card(std::shared_ptr<const TVXCardRequest> request, TVXReplyBlock reply);
+  void lookup(std::shared_ptr<const TVXLookupRequest> request, TVXReplyBlock reply);
+  void flightSearch(std::shared_ptr<const TVXFlightSearchRequest> request, TVXReplyBlock reply);
+
+  // ---- Fields
+  Assembly& assembly() const { return assembly_; }
+  const std::string& identifier() const { return identifier_; }
+  const std::optional<std::string>& clientShortName() const { return clientShortName_; }
+  std::optional<std::string> userAgent() const;
+  void setUserAgent(std::optional<std::string> userAgent);  // as loaded from the persisted list
+  std::optional<TVXSessionConfiguration> configuration() const;
+  void setConfiguration(TVXSessionConfiguration configuration);
+  // The client's bag, none until one was loaded.
+  std::shared_ptr<const TVXBag> currentBag() const;
+  // None when "TVXNoQueryCache" is set.
+  const std::shared_ptr<QueryCache>& queryCache() const { return queryCache_; }
+  const std::shared_ptr<TavixUserGUIDController>& guidController() const { return guidController_; }
+  const std::shared_ptr<ClientSessionManager>& sessionManager() const { return sessionManager_; }
+  std::optional<platform::TimePoint> lastNetworkRequest() const;
+
+  // A network request went out for this client now (warming is skipped for 30 seconds).
+  void markNetworkRequest();
+  // No resource has ever been recorded ("download_resources" absent from the defaults).
+  bool isProbablyFirstLaunchEver() const;
+
+ private:
+  ClientState(Assembly& assembly, std::string identifier);
+  void bagChangeNotification(const platform::Notification& notification);
+  // Replaces the held bag (if any) by one labelled with `userAgent`. Under mutex_.
+  void relabelBagLocked();
+  void observeBagChangesLocked();
+
+  Assembly& assembly_;
+  const std::string identifier_;
+  const std::optional<std::string> clientShortName_;
+  std::shared_ptr<QueryCache> queryCache_;
+  std::shared_ptr<TavixUserGUIDController> guidController_;
+  std::shared_ptr<ClientSessionManager> sessionManager_;
+
+  mutable std::mutex mutex_;
+  std::condition_variable bagSignal_;
+  unsigned bagSignals_ = 0;  // the semaphore's count: a signal without a waiter is kept
+  std::optional<std::string> userAgent_;
+  std::optional<TVXSessionConfiguration> configuration_;
+  std::shared_ptr<const TVXBag> bag_;
+  std::optional<platform::TimePoint> lastNetworkRequest_;
+  std::vector<std::string> completionCacheSuggestions_;  // found for the previous keystroke
+  platform::NotificationCenter::Registration bagObserver_;
+};
+
+}  // namespace tavix
