@@ -1,13 +1,25 @@
 #include "daemon/client_connection.h"
 
+#include "bag/tvx_bag.h"
+#include "cache/query_cache.h"
+#include "cache/engaged_completion_cache.h"
 #include "core/assembly.h"
 #include "core/logging.h"
 #include "core/names.h"
+#include "daemon/wire_records.h"
+#include "feedback/client_session.h"
+#include "feedback/client_session_manager.h"
+#include "network/locale_context.h"
+#include "network/tracing.h"
 #include "network/user_agent.h"
 #include "platform/activity.h"
+#include "platform/defaults.h"
 #include "platform/ipc/launch_events.h"
 #include "platform/ipc/server.h"
+#include "platform/json_value.h"
 #include "platform/notification_center.h"
+#include "query/client_state.h"
+#include "query/client_state_manager.h"
 #include "tavix_proto/ipc.pb.h"
 
 namespace tavix {
@@ -18,6 +30,49 @@ constexpr const char* kNotifyStream = "com.norvel.notifyd.matching";
 
 platform::Logger& connectionLog() { return TavixLogForCategory(TavixLoggingCategoryConnection); }
 platform::Logger& sessionLog() { return TavixLogForCategory(TavixLoggingCategorySession); }
+platform::Logger& bagLog() { return TavixLogForCategory(TavixLoggingCategoryBag); }
+
+// Kernel trace points stand in as debug lines on the Request category when tracing is on.
+void trace(std::uint32_t code) {
+  if (TVXTraceEnabled) TavixLogForCategory(TavixLoggingCategoryRequest).debug("trace 0x{:08x}", code);
+}
+
+struct TraceCodes {
+  std::uint32_t start = 0;
+  std::uint32_t end = 0;
+};
+
+TraceCodes traceCodesFor(proto::TVXRequest::KindCase kind) {
+  switch (kind) {
+    case proto::TVXRequest::kSearch: return {0x2b000004, 0x2b000008};
+    case proto::TVXRequest::kCard: return {0x2b00000c, 0x2b000010};
+    case proto::TVXRequest::kZeroKeyword: return {0x2b00001c, 0x2b000020};
+    case proto::TVXRequest::kLookup: return {0x2b00002c, 0x2b000030};
+    default: return {};
+  }
+}
+
+// The display scale of the device when a client does not say: "TVXMainScreenScale", else 1.
+double mainScreenScale(const platform::UserDefaults* defaults) {
+  const double scale = defaults ? defaults->doubleForKey("TVXMainScreenScale") : 0;
+  return scale > 0 ? scale : 1.0;
+}
+
+// The keyboard's input mode when a client does not say: the keyboard preference
+// ("TVXKeyboardInputMode"), else the current locale, which is the first input mode it enables.
+std::string defaultKeyboardInputMode(const platform::UserDefaults* defaults) {
+  if (defaults) {
+    if (auto mode = defaults->stringForKey("TVXKeyboardInputMode"); mode && !mode->empty()) return *mode;
+  }
+  return TVXCurrentLocaleSettings(defaults).locale;
+}
+
+// The engaged-completion cache's client number of a client short name.
+unsigned long completionClientNumber(const std::optional<std::string>& shortName) {
+  if (shortName == "brovane") return 1;
+  if (shortName == "seekara") return 2;
+  return 0;
+}
 
 void setError(proto::TVXError* error, std::int64_t code, const std::string& reason) {
   error->set_domain(kTVXErrorDomain);
@@ -70,6 +125,7 @@ void ClientConnection::relayResourceNotification(const platform::Notification& n
 void ClientConnection::invalidated() {
   downloadObserver_.reset();
   deleteObserver_.reset();
+  bagObserver_.reset();
   idleTimer_.cancel();
   closeTransaction();
 }
@@ -93,6 +149,8 @@ void ClientConnection::openOrExtendTransaction() {
 
 void ClientConnection::closeTransaction() {
   if (!transactionOpen_.exchange(false)) return;
+  // A client silent for a minute has left its typing session: its cached replies go with it.
+  if (state_ && state_->queryCache()) state_->queryCache()->removeAllObjects();
   std::lock_guard lock(transactionLock_);
   transaction_.reset();
 }
@@ -126,42 +184,60 @@ void ClientConnection::handleMessage(const std::string& payload) {
     case proto::Envelope::kConfigure:
       configure(callId, in);
       return;
-    case proto::Envelope::kBag:
-      notAvailable(out.mutable_bag_reply()->mutable_error());
-      break;
-    case proto::Envelope::kRequest: {
-      if (in.request().request().kind_case() == proto::TVXRequest::KIND_NOT_SET) {
-        // A kind we do not route gets no reply at all, as a class we do not know would.
-        connectionLog().error("request of unknown kind from pid {}", pid);
-        return;
-      }
-      auto* reply = out.mutable_request_reply();
-      reply->set_query_id(in.request().request().query_id());
-      notAvailable(reply->mutable_error());
-      break;
+    case proto::Envelope::kBag: {
+      ensureState();
+      if (!state_) return;  // no bound state, no reply: as for queries
+      std::weak_ptr<platform::ipc::IpcConnection> weak = connection_;
+      state_->bagAsync(userAgent_, [weak, callId](const std::shared_ptr<const TVXBag>& bag,
+                                                  const std::optional<TVXError>& error) {
+        proto::Envelope reply;
+        reply.set_call_id(callId);
+        if (bag) bagToWire(*bag, reply.mutable_bag_reply()->mutable_bag());
+        if (error) errorToWire(*error, reply.mutable_bag_reply()->mutable_error());
+        if (!bag && !error) reply.mutable_bag_reply();
+        if (auto connection = weak.lock(); connection && callId != 0) connection->send(reply.SerializeAsString());
+      });
+      return;
     }
+    case proto::Envelope::kRequest:
+      request(callId, in);
+      return;
     case proto::Envelope::kFeedback:
-      notAvailable(out.mutable_feedback_reply()->mutable_error());
-      break;
+      feedback(callId);
+      return;
     case proto::Envelope::kListenToFlusher:
+      ensureState();
       notAvailable(out.mutable_listen_to_flusher_reply()->mutable_error());
       break;
-    case proto::Envelope::kListSessions:
-      notAvailable(out.mutable_list_sessions_reply()->mutable_error());
+    case proto::Envelope::kListSessions: {
+      ensureState();
+      auto* reply = out.mutable_list_sessions_reply();
+      if (assembly_.clientStateManager) {
+        for (const auto& session : assembly_.clientStateManager->sessions()) {
+          reply->add_sessions(platform::toJson(session));
+        }
+      }
       break;
+    }
     case proto::Envelope::kFileHandleAndAttributesForResource:
+      ensureState();
       notAvailable(out.mutable_file_handle_and_attributes_for_resource_reply()->mutable_error());
       break;
-    case proto::Envelope::kGetImageMap:
-      notAvailable(out.mutable_get_image_map_reply()->mutable_error());
+    case proto::Envelope::kGetImageMap: {
+      ensureState();
+      // Without a bound state the answer is empty, as for a bag without resources.
+      auto bag = state_ ? state_->currentBag() : nullptr;
+      if (bag) out.mutable_get_image_map_reply()->set_resources_json(platform::toJson(bag->resources()));
+      else out.mutable_get_image_map_reply();
       break;
+    }
     case proto::Envelope::kReportFeedbackPayloadData:
+      reportFeedbackPayloadData(in.report_feedback_payload_data().data(), in.report_feedback_payload_data().query_id());
+      return;
     case proto::Envelope::kClearEngagedCompletions:
     case proto::Envelope::kAddCompletion:
     case proto::Envelope::kUpdateParameters:
-      // One-way messages whose receivers are not part of this daemon yet.
-      connectionLog().debug("message {} from pid {} dropped: not available", static_cast<int>(in.message_case()),
-                            pid);
+      engagedCompletionMessage(in);
       return;
     case proto::Envelope::kNotify: {
       const std::string stream = in.notify().stream().empty() ? kNotifyStream : in.notify().stream();
@@ -190,23 +266,56 @@ void ClientConnection::handleMessage(const std::string& payload) {
   send(callId, out);
 }
 
+void ClientConnection::ensureState() {
+  if (!configuration_) return;
+  if (configuration_->identifier.empty()) {
+    sessionLog().fault("configuration requires identifier");
+    return;
+  }
+  if (state_) {
+    if (state_->identifier() != configuration_->identifier) sessionLog().fault("session identifier must match");
+    return;
+  }
+  if (!assembly_.clientStateManager) return;
+  auto state = assembly_.clientStateManager->stateForClientIdentifier(configuration_->identifier);
+  if (!state) return;
+  std::string fullUserAgent;
+  if (!configuration_->userAgent.empty()) {
+    fullUserAgent = createUserAgentString(configuration_->userAgent, DeviceInformation(assembly_.userDefaults.get()))
+                        .value_or(configuration_->userAgent);
+  }
+  // The tool re-labels its state with each connection's agent; other clients keep the state's
+  // first one on purpose.
+  if (configuration_->identifier == "tavix_tool") state->updateClient(fullUserAgent);
+  if (auto shared = state->configuration()) {
+    configuration_ = *shared;
+  } else {
+    state->setConfiguration(*configuration_);
+  }
+  if (fullUserAgent.empty()) {
+    sessionLog().fault("configuration requires userAgent");
+    return;
+  }
+  userAgent_ = std::move(fullUserAgent);
+  state_ = std::move(state);
+}
+
 void ClientConnection::configure(std::uint64_t callId, const proto::Envelope& in) {
   const auto& config = in.configure().configuration();
   sessionLog().notice("client configuration {{identifier: {}, userAgent: {}}}", config.identifier(),
                       config.user_agent());
-  if (configuration_ && configuration_->identifier != config.identifier()) {
+  const auto previous = configuration_;
+  if (!previous || previous->identifier == config.identifier()) {
+    configuration_ = Configuration{config.identifier(), config.user_agent()};
+  }
+  ensureState();
+  if (previous && previous->identifier != config.identifier()) {
     // The first identifier keeps the connection; a client cannot switch identities mid-way.
     sessionLog().fault("session identifier must match");
-  } else if (config.identifier().empty()) {
-    sessionLog().fault("configuration requires identifier");
-  } else if (config.user_agent().empty()) {
-    sessionLog().fault("configuration requires userAgent");
-  } else {
-    configuration_ = Configuration{config.identifier(), config.user_agent()};
-    userAgent_ = createUserAgentString(config.user_agent(), DeviceInformation(assembly_.userDefaults.get()))
-                     .value_or(config.user_agent());
   }
-  if (!configuration_) {
+  if (!state_) {
+    configuration_.reset();
+    ClientSessionManager::reportErrorAsTavixdFeedback(500, kTVXErrorDomain, "invalid configuration", assembly_);
     // No reply at all: the client learns of it by the closed connection.
     sessionLog().fault("invalid configuration, closing connection");
     connection_->invalidate();
@@ -215,6 +324,192 @@ void ClientConnection::configure(std::uint64_t callId, const proto::Envelope& in
   proto::Envelope out;
   out.mutable_configure_reply()->set_has_endpoint(false);
   if (callId != 0) send(callId, out);
+  if (previous && state_ && previous->identifier == state_->identifier() && bagObserver_) return;
+
+  // The bag may take a fetch: it is handed over as bagDidLoad when it comes, without holding up
+  // the client's next calls.
+  std::weak_ptr<ClientConnection> weak = weak_from_this();
+  state_->bagAsync(userAgent_, [weak](const std::shared_ptr<const TVXBag>& bag, const std::optional<TVXError>& error) {
+    auto self = weak.lock();
+    if (!self) return;
+    self->connection_->queue().async([self, bag, error] { self->bagDidLoad(bag, error); });
+  });
+}
+
+void ClientConnection::bagDidLoad(const std::shared_ptr<const TVXBag>& bag, const std::optional<TVXError>& error) {
+  if (error) bagLog().error("error fetching bag: {}", error->reason);
+  if (bag && !bag->feedbackEnabled()) {
+    TavixLogForCategory(TavixLoggingCategoryFeedback)
+        .debug("feedback collection disabled in bag for user agent {}", userAgent_);
+  }
+  bagLog().debug("sending bag with version: {} to client: {} error: {}", bag ? bag->version().value_or("(null)") : "(null)",
+                 configuration_ ? configuration_->identifier : "(null)", error ? error->reason : "(null)");
+  proto::Envelope out;
+  if (bag) bagToWire(*bag, out.mutable_bag_did_load()->mutable_bag());
+  if (error) errorToWire(*error, out.mutable_bag_did_load()->mutable_error());
+  if (!bag && !error) out.mutable_bag_did_load();
+  send(0, out);
+  if (bag) setEngagedCompletionCacheValues(*bag);
+  if (!bagObserver_ && assembly_.notificationCenter) {
+    std::weak_ptr<ClientConnection> weak = weak_from_this();
+    bagObserver_ = assembly_.notificationCenter->addObserver(
+        kTVXBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
+          if (auto self = weak.lock()) self->bagChangeNotification(n);
+        });
+  }
+  if (assembly_.clientStateManager) assembly_.clientStateManager->saveState();
+}
+
+void ClientConnection::bagChangeNotification(const platform::Notification& notification) {
+  std::shared_ptr<const TVXBag> bag;
+  if (auto* p = std::any_cast<std::shared_ptr<const TVXBag>>(&notification.object)) bag = *p;
+  bagLog().info("bag change notification: {}", bag ? bag->version().value_or("(no version)") : "(null)");
+  if (!bag) return;
+  // Labelled for this client, as its state holds it.
+  auto labelled = std::make_shared<const TVXBag>(bag->sharedRawBag(), userAgent_);
+  proto::Envelope out;
+  bagToWire(*labelled, out.mutable_bag_did_load()->mutable_bag());
+  send(0, out);
+  setEngagedCompletionCacheValues(*labelled);
+}
+
+void ClientConnection::setEngagedCompletionCacheValues(const TVXBag& bag) {
+  if (!bag.smartHistoryEnabled()) return;
+  EngagedCompletionParameters parameters;
+  parameters.last1hour = bag.brovaneLast1hour();
+  parameters.last1day = bag.brovaneLast1day();
+  parameters.last1week = bag.brovaneLast1week();
+  parameters.last1month = bag.brovaneLast1month();
+  parameters.all = bag.brovaneAll();
+  parameters.mostRecent = bag.brovaneMostRecent();
+  parameters.minThresholdToSend = bag.minThresholdToSend();
+  EngagedCompletionCache::sharedInstance(assembly_)->updateParameters(parameters);
+}
+
+void ClientConnection::request(std::uint64_t callId, const proto::Envelope& in) {
+  const pid_t pid = connection_->peer().pid;
+  const auto& wire = in.request().request();
+  if (wire.kind_case() == proto::TVXRequest::KIND_NOT_SET) {
+    // A kind we do not route gets no reply at all, as a class we do not know would.
+    connectionLog().error("request of unknown kind from pid {}", pid);
+    return;
+  }
+  ensureState();
+  if (!state_) {
+    // Queries of an unbound connection are never answered; say so in the log at least.
+    connectionLog().error("query {} from pid {} before a valid configuration: not answered", wire.query_id(), pid);
+    return;
+  }
+  auto request = requestFromWire(wire);
+  auto* defaults = assembly_.userDefaults.get();
+  if (!request->keyboardInputMode) {
+    request->keyboardInputMode = defaultKeyboardInputMode(defaults);
+    connectionLog().debug("keyboardInputMode property not set, using {}", *request->keyboardInputMode);
+  }
+  if (request->scale == 0) {
+    request->scale = mainScreenScale(defaults);
+    connectionLog().debug("request scale property not set, using {:f}", request->scale);
+  }
+
+  const TraceCodes codes = traceCodesFor(wire.kind_case());
+  if (codes.start) trace(codes.start);
+  std::weak_ptr<platform::ipc::IpcConnection> weakConnection = connection_;
+  TVXReplyBlock reply = [weakConnection, callId, endCode = codes.end](std::uint64_t queryId, std::optional<TVXReply> r,
+                                                                         std::optional<TVXError> error) {
+    proto::Envelope out;
+    out.set_call_id(callId);
+    auto* wireReply = out.mutable_request_reply();
+    wireReply->set_query_id(queryId);
+    if (r) replyToWire(*r, wireReply->mutable_reply());
+    if (error) errorToWire(*error, wireReply->mutable_error());
+    if (auto connection = weakConnection.lock(); connection && callId != 0) connection->send(out.SerializeAsString());
+    if (endCode) trace(endCode);
+  };
+  switch (wire.kind_case()) {
+    case proto::TVXRequest::kSearch:
+      state_->search(std::static_pointer_cast<const TVXSearchRequest>(request), std::move(reply));
+      break;
+    case proto::TVXRequest::kMoreResults:
+      state_->moreResults(std::static_pointer_cast<const TVXMoreResultsRequest>(request), std::move(reply));
+      break;
+    case proto::TVXRequest::kCard:
+      state_->card(std::static_pointer_cast<const TVXCardRequest>(request), std::move(reply));
+      break;
+    case proto::TVXRequest::kZeroKeyword:
+      state_->zeroKeyword(std::static_pointer_cast<const TVXZeroKeywordRequest>(request), std::move(reply));
+      break;
+    case proto::TVXRequest::kLookup:
+      state_->lookup(std::static_pointer_cast<const TVXLookupRequest>(request), std::move(reply));
+      break;
+    case proto::TVXRequest::kFlightSearch:
+      state_->flightSearch(std::static_pointer_cast<const TVXFlightSearchRequest>(request), std::move(reply));
+      break;
+    case proto::TVXRequest::KIND_NOT_SET:
+      break;
+  }
+}
+
+void ClientConnection::feedback(std::uint64_t callId) {
+  trace(0x2b000024);
+  ensureState();
+  proto::Envelope out;
+  auto* reply = out.mutable_feedback_reply();
+  auto manager = state_ ? state_->sessionManager() : nullptr;
+  if (!manager) {
+    if (callId != 0) send(callId, out);
+    trace(0x2b000028);
+    return;
+  }
+  std::weak_ptr<platform::ipc::IpcConnection> weak = connection_;
+  manager->currentSessionFeedbacks([weak, callId, out](std::vector<std::string> feedbacks) mutable {
+    for (auto& feedback : feedbacks) out.mutable_feedback_reply()->add_feedbacks(std::move(feedback));
+    out.set_call_id(callId);
+    if (auto connection = weak.lock(); connection && callId != 0) connection->send(out.SerializeAsString());
+    trace(0x2b000028);
+  });
+  (void)reply;
+}
+
+void ClientConnection::engagedCompletionMessage(const proto::Envelope& in) {
+  ensureState();
+  auto cache = EngagedCompletionCache::sharedInstance(assembly_);
+  switch (in.message_case()) {
+    case proto::Envelope::kClearEngagedCompletions: {
+      const auto client = completionClientNumber(state_ ? state_->clientShortName() : std::nullopt);
+      cache->clearCompletionsFromDate(platform::fromUnixSeconds(in.clear_engaged_completions().from_date()),
+                                      platform::fromUnixSeconds(in.clear_engaged_completions().to_date()), client);
+      break;
+    }
+    case proto::Envelope::kAddCompletion:
+      cache->addCompletion(in.add_completion().completion(), in.add_completion().input());
+      break;
+    case proto::Envelope::kUpdateParameters: {
+      auto bag = state_ ? state_->currentBag() : nullptr;
+      if (!bag || !bag->smartHistoryEnabled()) return;
+      const auto& p = in.update_parameters();
+      EngagedCompletionParameters parameters;
+      parameters.last1hour = p.brovane_last1hour();
+      parameters.last1day = p.brovane_last1day();
+      parameters.last1week = p.brovane_last1week();
+      parameters.last1month = p.brovane_last1month();
+      parameters.all = p.brovane_all();
+      parameters.mostRecent = p.brovane_most_recent();
+      parameters.minThresholdToSend = p.min_threshold_to_send();
+      cache->updateParameters(parameters);
+      break;
+    }
+    default:
+      break;
+  }
+}
+
+void ClientConnection::flushSessionInvalidation(std::function<void(bool flushed)> callback) {
+  auto manager = state_ ? state_->sessionManager() : nullptr;
+  if (!manager || userAgent_.empty()) {
+    callback(false);
+    return;
+  }
+  manager->flushSessionInvalidationWithAgent(userAgent_, std::move(callback));
 }
 
 }  // namespace tavix

@@ -1,12 +1,15 @@
 // The daemon's side of one client's IPC connection: decodes the client's calls, validates its
-// configuration and answers each call once. The query paths, the bag and the feedback sessions
-// plug in here as they arrive; until then their calls get the error 500 "not available".
+// configuration, binds the connection to the client's ClientState (shared by all connections of
+// the same client identifier), routes queries to it, takes the client's feedback, relays bag and
+// resource notifications, and answers each call once.
 //
 // Runs on the IPC connection's own serial queue: handleMessage() and invalidated() are called
-// there, and everything they touch is touched only there, except `transactionOpen_` (atomic).
+// there, and the configuration and bound state are touched only there. Replies to queries come
+// back from the URL session's threads and go straight to the connection, which is thread-safe.
 #pragma once
 
 #include <atomic>
+#include <functional>
 #include <cstdint>
 #include <memory>
 #include <mutex>
@@ -14,6 +17,7 @@
 #include <string>
 
 #include "core/names.h"
+#include "core/requests.h"
 #include "platform/clock.h"
 #include "platform/notification_center.h"
 #include "platform/transactions.h"
@@ -21,6 +25,8 @@
 namespace tavix {
 
 class Assembly;
+class ClientState;
+class TVXBag;
 
 namespace platform::ipc {
 class IpcConnection;
@@ -37,10 +43,7 @@ inline constexpr double kIdleTransactionSeconds = 60;
 
 class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
  public:
-  struct Configuration {
-    std::string identifier;
-    std::string userAgent;
-  };
+  using Configuration = TVXSessionConfiguration;
 
   // `launchEvents` may be null (no launch events then); it and the assembly outlive the object.
   ClientConnection(Assembly& assembly, std::shared_ptr<platform::ipc::IpcConnection> connection,
@@ -65,19 +68,35 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   // The configuration and full user agent once a valid configuration came. On the queue only.
   const std::optional<Configuration>& configuration() const { return configuration_; }
   const std::string& userAgent() const { return userAgent_; }
+  // The bound state, none until a valid configuration came. On the queue only.
+  const std::shared_ptr<ClientState>& state() const { return state_; }
+
+  // The connection has gone: the client state's session manager closes or marks the session;
+  // `callback` says whether it was flushed. Safe from any thread.
+  void flushSessionInvalidation(std::function<void(bool flushed)> callback);
 
  private:
   void openOrExtendTransaction();
   void closeTransaction();
   void configure(std::uint64_t callId, const proto::Envelope& in);
+  // Binds the state for the configuration when it can; logs why not otherwise.
+  void ensureState();
   void send(std::uint64_t callId, proto::Envelope& out);
   void relayResourceNotification(const platform::Notification& notification, bool downloaded);
+  void bagDidLoad(const std::shared_ptr<const TVXBag>& bag, const std::optional<TVXError>& error);
+  void bagChangeNotification(const platform::Notification& notification);
+  void setEngagedCompletionCacheValues(const TVXBag& bag);
+  void request(std::uint64_t callId, const proto::Envelope& in);
+  void reportFeedbackPayloadData(const std::string& data, std::uint64_t queryId);
+  void feedback(std::uint64_t callId);
+  void engagedCompletionMessage(const proto::Envelope& in);
 
   Assembly& assembly_;
   std::shared_ptr<platform::ipc::IpcConnection> connection_;
   platform::ipc::LaunchEventRegistry* launchEvents_;
   std::optional<Configuration> configuration_;
   std::string userAgent_;
+  std::shared_ptr<ClientState> state_;
 
   std::atomic<bool> transactionOpen_{false};
   std::mutex transactionLock_;
@@ -85,6 +104,7 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   platform::TimerHandle idleTimer_;
   platform::NotificationCenter::Registration downloadObserver_;
   platform::NotificationCenter::Registration deleteObserver_;
+  platform::NotificationCenter::Registration bagObserver_;
 };
 
 }  // namespace tavix

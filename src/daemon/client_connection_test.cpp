@@ -11,10 +11,13 @@
 
 #include "core/assembly.h"
 #include "platform/activity.h"
+#include "platform/defaults.h"
 #include "platform/ipc/frame.h"
 #include "platform/ipc/launch_events.h"
 #include "platform/ipc/server.h"
 #include "platform/log.h"
+#include "query/client_state.h"
+#include "query/client_state_manager.h"
 #include "support/temp_home.h"
 #include "tavix_proto/ipc.pb.h"
 
@@ -33,6 +36,7 @@ struct Harness {
   platform::SerialQueue eventQueue{pool, "test.events"};
   ipc::LaunchEventRegistry events{eventQueue};
   platform::Logger log{"test", "connection"};
+  testing::TempHome home;
   Assembly assembly;
   ipc::UniqueFd client;
   std::shared_ptr<ipc::IpcConnection> connection;
@@ -45,6 +49,9 @@ struct Harness {
     assembly.transactions = &transactions;
     assembly.activityScheduler = &activities;
     assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
+    assembly.paths = platform::Paths{home.cache(), home.config(), home.runtime()};
+    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
+    assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
     int fds[2];
     EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
     client.reset(fds[1]);
@@ -157,25 +164,22 @@ TEST(ClientConnection, RelaysResourceNotificationsThatNameAResource) {
   EXPECT_EQ(got, (std::vector<std::string>{"+hints", "-old"}));
 }
 
-TEST(ClientConnection, RequestsOfKnownKindsAreRefusedClearlyAndOfUnknownKindNotAnswered) {
+TEST(ClientConnection, QueriesBeforeAValidConfigurationAndOfUnknownKindAreNotAnswered) {
   Harness h;
+  auto post = [&](const proto::Envelope& e, std::uint64_t id) {
+    proto::Envelope copy = e;
+    copy.set_call_id(id);
+    auto frame = ipc::encodeFrame(copy.SerializeAsString());
+    std::size_t sent = 0;
+    ASSERT_FALSE(ipc::sendWithFds(h.client.get(), frame, {}, true, &sent));
+  };
   proto::Envelope request;
   request.mutable_request()->mutable_request()->set_query_id(9);
   request.mutable_request()->mutable_request()->mutable_flight_search()->set_flight_query("NV 12");
-  auto reply = h.call(request, 3);
-  EXPECT_EQ(reply.call_id(), 3u);
-  EXPECT_EQ(reply.request_reply().query_id(), 9u);
-  EXPECT_FALSE(reply.request_reply().has_reply()) << "never a made-up reply";
-  EXPECT_EQ(reply.request_reply().error().code(), 500);
-  EXPECT_EQ(reply.request_reply().error().reason(), "not available");
-
+  post(request, 3);  // no state bound yet
   request.mutable_request()->mutable_request()->clear_kind();
-  proto::Envelope unanswered = request;
-  unanswered.set_call_id(4);
-  auto frame = ipc::encodeFrame(unanswered.SerializeAsString());
-  std::size_t sent = 0;
-  ASSERT_FALSE(ipc::sendWithFds(h.client.get(), frame, {}, true, &sent));
-  EXPECT_EQ(h.call(notify("after"), 5).call_id(), 5u) << "the kind-less request got no reply";
+  post(request, 4);  // no kind
+  EXPECT_EQ(h.call(notify("after"), 5).call_id(), 5u) << "neither request got a reply";
 }
 
 TEST(ClientConnection, KeepsItsFirstIdentifierAndBuildsTheFullUserAgent) {
@@ -191,6 +195,8 @@ TEST(ClientConnection, KeepsItsFirstIdentifierAndBuildsTheFullUserAgent) {
   h.connection->queue().sync([&] {
     ASSERT_TRUE(h.subject->configuration());
     EXPECT_EQ(h.subject->configuration()->identifier, "first");
+    ASSERT_TRUE(h.subject->state());
+    EXPECT_EQ(h.subject->state(), h.assembly.clientStateManager->stateForClientIdentifier("first"));
     const auto& ua = h.subject->userAgent();
     EXPECT_EQ(ua.rfind(std::string(kTVXTavixdNameVersion) + " (", 0), 0u) << ua;
     EXPECT_EQ(ua.substr(ua.size() - 10), ") client/2") << ua;

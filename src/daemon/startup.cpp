@@ -30,6 +30,7 @@
 #include "platform/memory_pressure.h"
 #include "platform/notification_center.h"
 #include "platform/run_loop.h"
+#include "query/client_state_manager.h"
 #include "platform/transactions.h"
 
 namespace tavix {
@@ -129,6 +130,8 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   platform::SerialQueue ipcEventQueue(pool, "com.norvel.tavixd.ipc_event");
   platform::ipc::LaunchEventRegistry launchEvents(ipcEventQueue);
   TavixService service(assembly, &launchEvents);
+  // After the service: a client state shares the service's GUID controller and session manager.
+  assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
 
   // Socket activation hands the listening socket over; otherwise we make our own.
   auto& connectionLog = TavixLogForCategory(TavixLoggingCategoryConnection);

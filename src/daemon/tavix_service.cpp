@@ -102,11 +102,7 @@ void TavixService::connectionInvalidated(const std::shared_ptr<ClientConnection>
       });
     };
     // A connection that never said who it is has no session to close.
-    if (assembly_.clientSessionManager && !client->userAgent().empty()) {
-      assembly_.clientSessionManager->flushSessionInvalidationWithAgent(client->userAgent(), removeAndPurge);
-    } else {
-      removeAndPurge(false);
-    }
+    client->flushSessionInvalidation(removeAndPurge);
   });
 }
 

@@ -153,6 +153,23 @@ std::vector<FeedbackRef> ClientSession::getSessionFeedbacks() {
   return events;
 }
 
+std::vector<std::string> ClientSession::feedbacksWithRelativeTimestamp() {
+  std::uint64_t base = 0;
+  std::vector<std::string> out;
+  for (const auto& event : getSessionFeedbacks()) {
+    const std::uint64_t stamp = codableTimestamp(mutableFeedbackCodable(event->mutable_payload()));
+    if (base == 0) base = stamp;
+    event->set_rel_timestamp(stamp >= base ? hostTicksToMilliseconds(stamp - base) : 0);
+    std::string dictionary = feedbackDictionary(*event);
+    if (dictionary.empty()) {
+      sessionLog().error("Feedback didn't parse to JSON.");
+      continue;
+    }
+    out.push_back(std::move(dictionary));
+  }
+  return out;
+}
+
 std::vector<std::string> ClientSession::privacyFilteredFeedbacksWithRelativeTimestamp(
     const std::vector<FeedbackRef>& events) {
   SessionProcessingHelper helper;

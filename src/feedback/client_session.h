@@ -54,6 +54,9 @@ class ClientSession {
   // The dictionary forms (JSON texts) after privacy filtering of `events`, missing suggestions and
   // missing results first.
   std::vector<std::string> privacyFilteredFeedbacksWithRelativeTimestamp(const std::vector<FeedbackRef>& events);
+  // The dictionary (JSON) forms of the session's events with their relative time stamps, as the
+  // client's feedback call shows them; events that do not serialise are left out.
+  std::vector<std::string> feedbacksWithRelativeTimestamp();
 
   std::string agent() const;
   std::string userGuid() const;  // empty unless the stored string is a valid UUID

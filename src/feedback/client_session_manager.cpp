@@ -291,4 +291,18 @@ void ClientSessionManager::flushSessionWithReason(int reason, std::function<void
   if (callback) callback();
 }
 
+void ClientSessionManager::currentSessionFeedbacks(std::function<void(std::vector<std::string>)> done) {
+  auto self = shared_from_this();
+  sessionQueue_.async([self, done = std::move(done)] {
+    std::vector<std::string> all;
+    auto gather = [&all](ClientSession& session) {
+      auto some = session.feedbacksWithRelativeTimestamp();
+      all.insert(all.end(), std::make_move_iterator(some.begin()), std::make_move_iterator(some.end()));
+    };
+    if (self->shared_) self->shared_->enumerateSessionsUsingBlock(gather);
+    if (self->single_) gather(*self->single_);
+    done(std::move(all));
+  });
+}
+
 }  // namespace tavix

@@ -73,6 +73,10 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   // and `callback(false)` runs at once; otherwise the session is flushed, then `callback(true)`.
   void flushSessionInvalidationWithAgent(const std::string& agent, std::function<void(bool)> callback);
 
+  // The open session's events (all member sessions when shared), JSON with relative time stamps;
+  // `done` runs on the session queue, with an empty list when no session is open.
+  void currentSessionFeedbacks(std::function<void(std::vector<std::string>)> done);
+
   // Wraps an error as daemon feedback (query id 0, current GUID, tavixdUserAgent()) and adds it
   // through the assembly's manager.
   static void reportErrorAsTavixdFeedback(int code, const std::string& domain, const std::string& reason,

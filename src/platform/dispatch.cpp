@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
+#include <deque>
 #include <future>
 #include <thread>
 #include <vector>
@@ -77,38 +78,139 @@ unsigned DispatchPool::threadCount() const { return static_cast<unsigned>(impl_-
 
 void* DispatchPool::nativeContext() { return &impl_->context; }
 
+// A serial queue is a list of tasks and an owner: at most one thread at a time "is on" the queue
+// and runs its tasks. async() appends and, when nobody owns the queue, posts a drain job to the
+// pool. sync() never waits for another pool thread to come free: when nobody owns the queue it
+// takes ownership and runs the tasks ahead of its own, then its own, on the calling thread; when
+// a thread owns it, that thread is running and hands ownership over when it reaches the caller's
+// turn. So any number of threads may sync at once, on a pool of any size, without starving it.
 struct SerialQueue::Impl {
-  explicit Impl(DispatchPool& p) : pool(p), strand(asio::make_strand(asioContext(p))) {}
+  explicit Impl(DispatchPool& p) : pool(p) {}
+
+  struct Waiter {
+    bool turn = false;  // ownership was handed to this caller
+  };
+  struct Item {
+    Task task;                // an async task
+    Waiter* waiter = nullptr;  // or a caller of sync() waiting for its turn
+  };
+
   DispatchPool& pool;
-  asio::strand<asio::io_context::executor_type> strand;
+  std::mutex lock;
+  std::condition_variable changed;
+  std::deque<Item> items;
+  bool owned = false;        // a thread is on the queue
+  bool drainPosted = false;  // a drain job is posted and has not started
+
+  // Runs tasks from the front while the caller owns the queue, until the list is empty or the
+  // front is a waiting sync caller (who then gets the queue) or `until` (left in place).
+  // Answers true when ownership passed to a waiter. Called and returns with `guard` held.
+  bool runFront(std::unique_lock<std::mutex>& guard, const Waiter* until);
+  // Gives the queue up: to the waiter at the front, to a new drain job, or to nobody.
+  void release(std::unique_lock<std::mutex>& guard, const std::shared_ptr<Impl>& self);
+  void postDrain(const std::shared_ptr<Impl>& self);
 };
 
+namespace {
+// The queues the calling thread is on, innermost last (sync() nests).
+thread_local std::vector<const SerialQueue::Impl*> tCurrentQueues;
+
+struct OnQueue {
+  explicit OnQueue(const SerialQueue::Impl* q) { tCurrentQueues.push_back(q); }
+  ~OnQueue() { tCurrentQueues.pop_back(); }
+};
+}  // namespace
+
+bool SerialQueue::Impl::runFront(std::unique_lock<std::mutex>& guard, const Waiter* until) {
+  while (!items.empty()) {
+    Item& front = items.front();
+    if (until && front.waiter == until) return false;
+    if (front.waiter) {
+      front.waiter->turn = true;
+      items.pop_front();
+      changed.notify_all();
+      return true;
+    }
+    Task task = std::move(front.task);
+    items.pop_front();
+    guard.unlock();
+    {
+      OnQueue on(this);
+      task();
+    }
+    pool.endWork();
+    guard.lock();
+  }
+  return false;
+}
+
+void SerialQueue::Impl::postDrain(const std::shared_ptr<Impl>& self) {
+  drainPosted = true;
+  pool.post([self] {
+    std::unique_lock<std::mutex> guard(self->lock);
+    self->drainPosted = false;
+    if (self->owned) return;  // the owner will see the new tasks
+    self->owned = true;
+    if (self->runFront(guard, nullptr)) return;
+    self->owned = false;
+    self->changed.notify_all();
+  });
+}
+
+void SerialQueue::Impl::release(std::unique_lock<std::mutex>& guard, const std::shared_ptr<Impl>& self) {
+  if (!items.empty() && items.front().waiter) {
+    items.front().waiter->turn = true;
+    items.pop_front();
+    changed.notify_all();
+    return;
+  }
+  owned = false;
+  if (!items.empty() && !drainPosted) postDrain(self);
+  changed.notify_all();
+}
+
 SerialQueue::SerialQueue(DispatchPool& pool, std::string label)
-    : label_(std::move(label)), impl_(std::make_unique<Impl>(pool)) {}
+    : label_(std::move(label)), impl_(std::make_shared<Impl>(pool)) {}
 
 SerialQueue::~SerialQueue() = default;
 
 void SerialQueue::async(Task task) {
   // Counted by the pool so that DispatchPool::drain() also waits for queue work.
-  DispatchPool& pool = impl_->pool;
-  pool.beginWork();
-  asio::post(impl_->strand, [&pool, task = std::move(task)] {
-    task();
-    pool.endWork();
-  });
+  impl_->pool.beginWork();
+  std::lock_guard<std::mutex> guard(impl_->lock);
+  impl_->items.push_back({std::move(task), nullptr});
+  if (!impl_->owned && !impl_->drainPosted) impl_->postDrain(impl_);
 }
 
 void SerialQueue::sync(const Task& task) {
   if (isCurrent()) die("sync onto queue '" + label_ + "' from itself would deadlock");
-  std::promise<void> done;
-  asio::post(impl_->strand, [&] {
+  Impl& q = *impl_;
+  std::unique_lock<std::mutex> guard(q.lock);
+  Impl::Waiter waiter;
+  q.items.push_back({nullptr, &waiter});
+  for (;;) {
+    if (waiter.turn) break;  // handed over by the owner
+    if (!q.owned) {
+      // Nobody is on the queue: run what is ahead of us here rather than wait for a pool thread.
+      q.owned = true;
+      if (q.runFront(guard, &waiter)) continue;  // a waiter ahead of us got the queue
+      q.items.pop_front();                       // our own entry
+      break;
+    }
+    q.changed.wait(guard);
+  }
+  guard.unlock();
+  {
+    OnQueue on(&q);
     task();
-    done.set_value();
-  });
-  done.get_future().wait();
+  }
+  guard.lock();
+  q.release(guard, impl_);
 }
 
-bool SerialQueue::isCurrent() const { return impl_->strand.running_in_this_thread(); }
+bool SerialQueue::isCurrent() const {
+  return std::find(tCurrentQueues.begin(), tCurrentQueues.end(), impl_.get()) != tCurrentQueues.end();
+}
 
 void SerialQueue::assertCurrent(const char* what) const {
 #ifndef NDEBUG

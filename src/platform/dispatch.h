@@ -1,8 +1,9 @@
 // Serial queues on one shared thread pool: the daemon's concurrency model.
 //
 // Every object that owns state owns a SerialQueue and runs its private operations on it. Public
-// operations hop onto the queue: reads with sync(), writes with async(). A queue is an Asio strand
-// over the process's pool, so queues cost nothing while idle and never need a thread of their own.
+// operations hop onto the queue: reads with sync(), writes with async(). A queue is a task list
+// over the process's pool, so queues cost nothing while idle and never need a thread of their own;
+// sync() runs on the calling thread, so waiting callers never starve the pool.
 //
 // Threading: every method of SerialQueue and ReaderWriterQueue is safe from any thread.
 #pragma once
@@ -54,6 +55,8 @@ class DispatchPool {
 // A serial queue: tasks run one at a time, in submission order, on some pool thread.
 class SerialQueue {
  public:
+  struct Impl;  // the task list, private to dispatch.cpp
+
   SerialQueue(DispatchPool& pool, std::string label);
   ~SerialQueue();
   SerialQueue(const SerialQueue&) = delete;
@@ -64,7 +67,8 @@ class SerialQueue {
   // Queues `task` and returns at once.
   void async(Task task);
 
-  // Runs `task` on the queue and waits for it. Never call sync() on the queue you are running
+  // Runs `task` on the queue and waits for it; the task runs on the calling thread, after every
+  // task queued before it (which the caller may run too). Never call sync() on the queue you are running
   // on (directly or through a chain of sync calls): that would wait on itself for ever, so it is
   // checked and stops the process with a message naming the queue.
   void sync(const Task& task);
@@ -77,9 +81,8 @@ class SerialQueue {
   void assertCurrent(const char* what) const;
 
  private:
-  struct Impl;
   std::string label_;
-  std::unique_ptr<Impl> impl_;
+  std::shared_ptr<Impl> impl_;  // shared with drain jobs still posted when the queue goes
 };
 
 // "Synchronous reads, barrier writes": reads run on the caller's thread and may overlap one

@@ -55,6 +55,37 @@ TEST(SerialQueue, NestedSyncAcrossQueuesWorks) {
   EXPECT_EQ(seen, 7);
 }
 
+TEST(SerialQueue, ManyQueuesSyncingOntoOneNeverStarveASmallPool) {
+  // Every pool thread is busy in a task that syncs onto one shared queue, which also has async
+  // work pending: no caller may wait for a free pool thread, or this never ends.
+  platform::DispatchPool pool(2);
+  platform::SerialQueue shared(pool, "test.shared");
+  std::vector<std::unique_ptr<platform::SerialQueue>> callers;
+  std::atomic<int> inside{0}, maxInside{0}, done{0};
+  int counter = 0;  // touched only on `shared`
+  for (int i = 0; i < 16; ++i) {
+    callers.push_back(std::make_unique<platform::SerialQueue>(pool, "test.caller"));
+    shared.async([&] { ++counter; });
+    callers.back()->async([&, &caller = *callers.back()] {
+      shared.sync([&] {
+        const int now = ++inside;
+        maxInside = std::max(maxInside.load(), now);
+        EXPECT_TRUE(shared.isCurrent());
+        EXPECT_TRUE(caller.isCurrent()) << "still on the caller's queue while on the shared one";
+        ++counter;
+        --inside;
+      });
+      ++done;
+    });
+  }
+  pool.drain();
+  EXPECT_EQ(done.load(), 16);
+  EXPECT_EQ(maxInside.load(), 1) << "the shared queue ran two tasks at once";
+  int seen = 0;
+  shared.sync([&] { seen = counter; });
+  EXPECT_EQ(seen, 32);
+}
+
 TEST(SerialQueueDeathTest, SyncOntoItselfStopsWithTheQueueName) {
   EXPECT_DEATH(
       {

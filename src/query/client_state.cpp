@@ -2,6 +2,7 @@
 // client_state_search.cpp and client_state_queries.cpp.
 #include "query/client_state.h"
 
+#include <algorithm>
 #include <chrono>
 
 #include "bag/tavix_bag_controller.h"
@@ -44,7 +45,8 @@ std::shared_ptr<ClientState> ClientState::create(Assembly& assembly, std::string
 ClientState::ClientState(Assembly& assembly, std::string identifier)
     : assembly_(assembly),
       identifier_(std::move(identifier)),
-      clientShortName_(extractClientNameFromString(identifier_)) {
+      clientShortName_(extractClientNameFromString(identifier_)),
+      waitQueue_(std::make_unique<platform::SerialQueue>(*assembly.dispatchPool, "com.norvel.tavixd.clientState")) {
   if (!assembly_.userDefaults || !assembly_.userDefaults->boolForKey("TVXNoQueryCache")) {
     queryCache_ = QueryCache::create(assembly_);
     cachingLog().debug("query cache ON for {}", identifier_);
@@ -110,26 +112,95 @@ void ClientState::relabelBagLocked() {
   if (bag_ && userAgent_) bag_ = labelled(*bag_, *userAgent_);
 }
 
+std::optional<TVXError> ClientState::adoptUserAgentLocked(const std::string& userAgent, bool* relabelled) {
+  *relabelled = false;
+  if (!userAgent.empty() && userAgent_ != userAgent) {
+    userAgent_ = userAgent;
+    relabelBagLocked();
+    *relabelled = true;
+  }
+  if (!userAgent_) return TVXError{kTVXErrorDomain, 1, "no UserAgent"};
+  return std::nullopt;
+}
+
 void ClientState::bag(const std::string& userAgent, const BagReply& reply) {
   bool relabelled = false;
+  std::optional<TVXError> noAgent;
   {
     std::lock_guard lock(mutex_);
-    if (!userAgent.empty() && userAgent_ != userAgent) {
-      userAgent_ = userAgent;
-      relabelBagLocked();
-      relabelled = true;
-    }
-    if (!userAgent_) {
-      reply(nullptr, TVXError{kTVXErrorDomain, 1, "no UserAgent"});
-      return;
-    }
+    noAgent = adoptUserAgentLocked(userAgent, &relabelled);
   }
   // Replies cached for the old user agent were made for another client identity.
   if (relabelled && queryCache_) queryCache_->removeAllObjects();
+  if (noAgent) {
+    reply(nullptr, noAgent);
+    return;
+  }
   const bool ok = ensureBag();
   std::optional<TVXError> error;
   if (!ok) error = TVXError{kTVXErrorDomain, 1, "timeout"};
   reply(currentBag(), std::move(error));
+}
+
+void ClientState::bagAsync(const std::string& userAgent, BagReply reply) {
+  bool relabelled = false;
+  std::optional<TVXError> noAgent;
+  std::string agent;
+  {
+    std::lock_guard lock(mutex_);
+    noAgent = adoptUserAgentLocked(userAgent, &relabelled);
+    if (!noAgent) agent = *userAgent_;
+  }
+  if (relabelled && queryCache_) queryCache_->removeAllObjects();
+  if (noAgent) {
+    reply(nullptr, noAgent);
+    return;
+  }
+  if (auto held = currentBag()) {
+    reply(held, std::nullopt);
+    return;
+  }
+  {
+    std::lock_guard lock(mutex_);
+    observeBagChangesLocked();
+  }
+  cachingLog().info("Warming bag cache for agent: {}", agent);
+  if (auto current = assembly_.bagController ? assembly_.bagController->currentBag() : nullptr) {
+    std::shared_ptr<const TVXBag> bag;
+    {
+      std::lock_guard lock(mutex_);
+      if (!bag_) bag_ = labelled(*current, userAgent_.value_or(agent));
+      bag = bag_;
+    }
+    reply(bag, std::nullopt);
+    return;
+  }
+  markNetworkRequest();
+  auto waiter = std::make_shared<BagReply>(std::move(reply));
+  {
+    std::lock_guard lock(mutex_);
+    bagWaiters_.push_back(waiter);
+  }
+  // The waiter is answered once: by the bag's arrival or by this timer, whichever takes it first.
+  std::weak_ptr<ClientState> weak = weak_from_this();
+  assembly_.clock->after(platform::seconds(bagWaitMilliseconds() / 1000.0), *waitQueue_, [weak, waiter] {
+    auto self = weak.lock();
+    if (!self) return;
+    {
+      std::lock_guard lock(self->mutex_);
+      auto& waiters = self->bagWaiters_;
+      auto it = std::find(waiters.begin(), waiters.end(), waiter);
+      if (it == waiters.end()) return;
+      waiters.erase(it);
+    }
+    TavixLogForCategory(TavixLoggingCategoryDefault).notice("client {} finished waiting for bag", self->identifier_);
+    auto bag = self->currentBag();
+    (*waiter)(bag, bag ? std::nullopt : std::optional<TVXError>(TVXError{kTVXErrorDomain, 1, "timeout"}));
+  });
+}
+
+int ClientState::bagWaitMilliseconds() const {
+  return isProbablyFirstLaunchEver() ? kTVXFirstLaunchBagSemaphoreWait : kTVXDefaultBagSemaphoreWait;
 }
 
 void ClientState::observeBagChangesLocked() {
@@ -160,7 +231,7 @@ bool ClientState::ensureBag() {
   // currentBag() has started a fetch: wait a little for it, so that a query without a bag fails
   // fast rather than hanging.
   markNetworkRequest();
-  const int waitMs = isProbablyFirstLaunchEver() ? kTVXFirstLaunchBagSemaphoreWait : kTVXDefaultBagSemaphoreWait;
+  const int waitMs = bagWaitMilliseconds();
   std::unique_lock lock(mutex_);
   if (bagSignal_.wait_for(lock, std::chrono::milliseconds(waitMs), [this] { return bagSignals_ > 0; })) {
     --bagSignals_;
@@ -171,12 +242,20 @@ bool ClientState::ensureBag() {
 
 void ClientState::bagChangeNotification(const platform::Notification& notification) {
   auto bag = bagOfNotification(notification);
+  std::vector<std::shared_ptr<BagReply>> waiters;
+  std::shared_ptr<const TVXBag> held;
   {
     std::lock_guard lock(mutex_);
     if (bag) bag_ = labelled(*bag, userAgent_.value_or(bag->userAgent()));
     ++bagSignals_;
+    held = bag_;
+    if (held) waiters.swap(bagWaiters_);
   }
   bagSignal_.notify_one();
+  // Off the poster's thread: the waiters' replies may do anything.
+  for (auto& waiter : waiters) {
+    waitQueue_->async([waiter, held] { (*waiter)(held, std::nullopt); });
+  }
 }
 
 void ClientState::updateClient(const std::string& userAgent) {

@@ -19,6 +19,7 @@
 #include <vector>
 
 #include "core/requests.h"
+#include "platform/dispatch.h"
 #include "platform/notification_center.h"
 #include "platform/time.h"
 
@@ -56,6 +57,9 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   // then answers the bag: error code 1 "no UserAgent" without a user agent, "timeout" when none
   // came in time. Blocks the caller for at most the bag wait.
   void bag(const std::string& userAgent, const BagReply& reply);
+  // The same without blocking: `reply` runs at once when the bag is held, else on the state's
+  // queue when a bag arrives or the wait is over. For callers that must not hold a thread.
+  void bagAsync(const std::string& userAgent, BagReply reply);
   // Whether a bag is held, fetching and waiting for one when not.
   bool ensureBag();
   // The tool's connections re-label the state with their user agent.
@@ -100,6 +104,11 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   // Replaces the held bag (if any) by one labelled with `userAgent`. Under mutex_.
   void relabelBagLocked();
   void observeBagChangesLocked();
+  // Adopts a new non-empty user agent; answers whether the query cache must be emptied, or an
+  // error when the state has no user agent at all. Under mutex_.
+  std::optional<TVXError> adoptUserAgentLocked(const std::string& userAgent, bool* relabelled);
+  // A fetch is under way: the wait of ensureBag(), in milliseconds.
+  int bagWaitMilliseconds() const;
 
   Assembly& assembly_;
   const std::string identifier_;
@@ -117,6 +126,9 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   std::optional<platform::TimePoint> lastNetworkRequest_;
   std::vector<std::string> completionCacheSuggestions_;  // found for the previous keystroke
   platform::NotificationCenter::Registration bagObserver_;
+  // Callers of bagAsync() waiting for a bag; answered on waitQueue_.
+  std::vector<std::shared_ptr<BagReply>> bagWaiters_;
+  std::unique_ptr<platform::SerialQueue> waitQueue_;
 };
 
 }  // namespace tavix
