@@ -2,6 +2,7 @@
 // work with the daemon stopped; everything else talks to the daemon through libtavix.
 #include <cstdio>
 #include <cstdlib>
+#include <unistd.h>
 #include <map>
 #include <string>
 #include <vector>
@@ -10,6 +11,7 @@
 #include "platform/defaults.h"
 #include "platform/files.h"
 #include "platform/property_value.h"
+#include "search_commands.h"
 #include "tavix/client.h"
 
 namespace {
@@ -27,6 +29,14 @@ int usage() {
       "  defaults delete [--domain D] KEY\n"
       "  notify NAME                              deliver the launch event NAME to the daemon\n"
       "  activity run NAME                        run the background activity NAME now\n"
+      "  search [--client ID] [--agent UA] [--trigger N] TEXT|-\n"
+      "                                           one JSON reply a line; - reads one input a line\n"
+      "  bag [--client ID] [--agent UA]           print the client's bag\n"
+      "  sessions                                 list the known client states\n"
+      "  type [--client ID] [--agent UA] [TEXT...]\n"
+      "                                           type on a terminal and see each keystroke's\n"
+      "                                           suggestions; without one, type TEXT and print\n"
+      "  (no command, on a terminal)              the same as type\n"
       "\n"
       "counters and defaults work with the daemon stopped.\n",
       stderr);
@@ -130,6 +140,9 @@ int main(int argc, char** argv) {
     options.socketPath = args[1];
     args.erase(args.begin(), args.begin() + 2);
   }
+  if (args.empty() && isatty(STDIN_FILENO) && isatty(STDOUT_FILENO)) {
+    return tavix::tool::interactiveCommand(options.socketPath, {});
+  }
   if (args.empty() || args[0] == "--help" || args[0] == "-h") return usage();
   const auto paths = tavix::platform::Paths::fromEnvironment();
   const std::string command = args[0];
@@ -137,6 +150,10 @@ int main(int argc, char** argv) {
 
   if (command == "counters") return args.empty() ? counters(paths) : usage();
   if (command == "defaults") return defaults(paths, args);
+  if (command == "search") return tavix::tool::searchCommand(options.socketPath, args);
+  if (command == "bag") return tavix::tool::bagCommand(options.socketPath, args);
+  if (command == "sessions") return args.empty() ? tavix::tool::sessionsCommand(options.socketPath) : usage();
+  if (command == "type") return tavix::tool::interactiveCommand(options.socketPath, args);
 
   options.configuration.set_identifier("tavix_tool");
   options.configuration.set_user_agent("tavix_tool/1");
@@ -144,9 +161,5 @@ int main(int argc, char** argv) {
   tavix::client::Client client(options);
   if (command == "notify" && args.size() == 1) return report(client.notifySync(args[0]));
   if (command == "activity" && args.size() == 2 && args[0] == "run") return report(client.runActivitySync(args[1]));
-  if (command == "search" || command == "bag" || command == "sessions") {
-    std::fprintf(stderr, "tavix_tool: %s is not available yet\n", command.c_str());
-    return 1;
-  }
   return usage();
 }
