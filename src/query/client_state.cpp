@@ -15,6 +15,7 @@
 #include "network/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
+#include "platform/dispatch.h"
 
 namespace tavix {
 
@@ -44,7 +45,8 @@ std::shared_ptr<ClientState> ClientState::create(Assembly& assembly, std::string
 ClientState::ClientState(Assembly& assembly, std::string identifier)
     : assembly_(assembly),
       identifier_(std::move(identifier)),
-      clientShortName_(extractClientNameFromString(identifier_)) {
+      clientShortName_(extractClientNameFromString(identifier_)),
+      retryQueue_(std::make_unique<platform::SerialQueue>(*assembly.dispatchPool, "com.norvel.tavixd.clientState.retry")) {
   if (!assembly_.userDefaults || !assembly_.userDefaults->boolForKey("TVXNoQueryCache")) {
     queryCache_ = QueryCache::create(assembly_);
     cachingLog().debug("query cache ON for {}", identifier_);
