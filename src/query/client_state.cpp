@@ -16,6 +16,7 @@
 #include "network/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
+#include "platform/dispatch.h"
 
 namespace tavix {
 
@@ -46,7 +47,8 @@ ClientState::ClientState(Assembly& assembly, std::string identifier)
     : assembly_(assembly),
       identifier_(std::move(identifier)),
       clientShortName_(extractClientNameFromString(identifier_)),
-      waitQueue_(std::make_unique<platform::SerialQueue>(*assembly.dispatchPool, "com.norvel.tavixd.clientState")) {
+      waitQueue_(std::make_unique<platform::SerialQueue>(*assembly.dispatchPool, "com.norvel.tavixd.clientState")),
+      retryQueue_(std::make_unique<platform::SerialQueue>(*assembly.dispatchPool, "com.norvel.tavixd.clientState.retry")) {
   if (!assembly_.userDefaults || !assembly_.userDefaults->boolForKey("TVXNoQueryCache")) {
     queryCache_ = QueryCache::create(assembly_);
     cachingLog().debug("query cache ON for {}", identifier_);

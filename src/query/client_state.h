@@ -23,9 +23,14 @@
 #include "platform/notification_center.h"
 #include "platform/time.h"
 
+namespace google::protobuf {
+class Message;
+}
+
 namespace tavix {
 
 class Assembly;
+struct ClientStateQueryKind;
 class ClientSessionManager;
 class QueryCache;
 class TavixUserGUIDController;
@@ -34,6 +39,16 @@ class TVXBag;
 namespace proto {
 class CTStartNetworkSearchFeedback;
 }
+namespace platform {
+class SerialQueue;
+namespace http {
+class URLSessionDataTask;
+struct URLSessionTaskMetrics;
+}  // namespace http
+}  // namespace platform
+
+// The domain of the error that comes with a reply body that is not JSON.
+inline constexpr const char* kTVXJSONErrorDomain = "TavixJSONErrorDomain";
 
 // How long a query waits for a bag that is being fetched, in milliseconds: longer on a device that
 // has never recorded resources (first launch), where the bag is certainly on its way.
@@ -93,6 +108,9 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   const std::shared_ptr<ClientSessionManager>& sessionManager() const { return sessionManager_; }
   std::optional<platform::TimePoint> lastNetworkRequest() const;
 
+  // The engaged completion kept for the last keystroke (none or one).
+  std::vector<std::string> completionCacheSuggestions() const;
+
   // A network request went out for this client now (warming is skipped for 30 seconds).
   void markNetworkRequest();
   // No resource has ever been recorded ("download_resources" absent from the defaults).
@@ -109,6 +127,39 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   std::optional<TVXError> adoptUserAgentLocked(const std::string& userAgent, bool* relabelled);
   // A fetch is under way: the wait of ensureBag(), in milliseconds.
   int bagWaitMilliseconds() const;
+
+  // ---- Network feedback (client_state_feedback.cpp)
+  using StartRecord = std::shared_ptr<proto::CTStartNetworkSearchFeedback>;
+  // A start record for `request` (URL, headers, a new UUID), not yet added anywhere.
+  StartRecord startSearchEventForRequest(const platform::http::URLRequest& request);
+  // Adds the end record: server values from the first element of the JSON reply `rawResponse`
+  // (none when it is not a list of dictionaries), size, status and the task's timing data.
+  void endNetworkFeedback(const StartRecord& start, const std::string& rawResponse, std::uint64_t responseSize,
+                          long statusCode, const platform::http::URLSessionTaskMetrics& timing, std::uint64_t queryId);
+  void endNetworkFeedback(const StartRecord& start, const std::string& rawResponse, std::uint64_t responseSize,
+                          long statusCode, const platform::http::URLSessionTaskMetrics& timing, std::uint64_t queryId,
+                          const std::string& userAgent);
+  // The error record and the end record of a request that failed; counts transport errors.
+  void failSearchFeedback(const std::optional<TVXError>& error, const TVXRequest& request, const StartRecord& start,
+                          std::uint64_t responseSize, long statusCode,
+                          const platform::http::URLSessionTaskMetrics& timing);
+  // Counts the server's HTTP status per user agent.
+  void recordSearchResult(long statusCode);
+  void setPerformedSearch();
+  // 1 when requests go through the bag's proxy, else 0.
+  int marvolaStatus() const;
+  // Points the task at the bag's proxy; false when there is none to use.
+  bool proxyEnableForTask(platform::http::URLSessionDataTask& task) const;
+  // Wraps `codable` with this client's user agent (and the current GUID when asked) and adds it.
+  void addCodable(const google::protobuf::Message& codable, std::uint64_t queryId, bool withUserGuid);
+  void recordSkipSearch(int reason, const std::string& input, std::uint64_t queryId);
+  void recordDidGoToSearch(const TVXRequest& request, const std::string& input);
+  std::optional<std::string> geoSessionEntityString();
+  std::string currentUserGuid();
+
+  // ---- The kinds besides search (client_state_queries.cpp)
+  void performQuery(const ClientStateQueryKind& kind, std::shared_ptr<const TVXRequest> request, TVXReplyBlock reply);
+  void debugFlightSearch(const TVXFlightSearchRequest& request, const TVXReplyBlock& reply);
 
   Assembly& assembly_;
   const std::string identifier_;
@@ -129,6 +180,8 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   // Callers of bagAsync() waiting for a bag; answered on waitQueue_.
   std::vector<std::shared_ptr<BagReply>> bagWaiters_;
   std::unique_ptr<platform::SerialQueue> waitQueue_;
+  // Where retried attempts of the retryable kinds are started.
+  std::unique_ptr<platform::SerialQueue> retryQueue_;
 };
 
 }  // namespace tavix

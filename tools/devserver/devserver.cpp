@@ -1,11 +1,15 @@
 #include "devserver/devserver.h"
 
 #include <httplib.h>
+#include <sys/socket.h>
+#include <netinet/in.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
 #include <cctype>
 #include <chrono>
+#include <condition_variable>
 #include <fstream>
 #include <functional>
 #include <map>
@@ -26,6 +30,8 @@ struct Fault {
   bool drop = false;
   int remaining = -1;  // -1: every request
   std::optional<std::string> body;  // served as it stands instead of the route's answer
+  bool hang = false;   // never answers (until the server stops)
+  bool reset = false;  // the connection is reset (TCP RST) instead of answered
 };
 
 std::string lowercase(std::string s) {
@@ -68,6 +74,31 @@ struct DevServer::Impl {
 
   std::string base() const { return "http://127.0.0.1:" + std::to_string(port); }
 
+  // Hung requests wait here until stop(), so that the server can still be stopped.
+  std::mutex hangLock;
+  std::condition_variable hangWake;
+  bool stopping = false;
+
+  void hangUntilStopped() {
+    std::unique_lock guard(hangLock);
+    hangWake.wait(guard, [this] { return stopping; });
+  }
+
+  // httplib does not hand out the socket: find it by its two ports, and make its close abortive
+  // (linger 0), so that the peer gets a reset rather than an orderly end.
+  void resetConnection(const httplib::Request& req) const {
+    for (int fd = 0; fd < 4096; ++fd) {
+      sockaddr_in local{}, peer{};
+      socklen_t localSize = sizeof local, peerSize = sizeof peer;
+      if (::getsockname(fd, reinterpret_cast<sockaddr*>(&local), &localSize) != 0 || local.sin_family != AF_INET) continue;
+      if (::getpeername(fd, reinterpret_cast<sockaddr*>(&peer), &peerSize) != 0) continue;
+      if (ntohs(local.sin_port) != port || ntohs(peer.sin_port) != req.remote_port) continue;
+      linger abortive{1, 0};
+      ::setsockopt(fd, SOL_SOCKET, SO_LINGER, &abortive, sizeof abortive);
+      return;
+    }
+  }
+
   void record(const httplib::Request& req) {
     json params = json::object();
     for (const auto& [name, value] : req.params) params[name] = value;
@@ -103,6 +134,13 @@ struct DevServer::Impl {
       record(req);
       const auto fault = takeFault(req.path);
       if (fault && fault->delayMs > 0) std::this_thread::sleep_for(std::chrono::milliseconds(fault->delayMs));
+      if (fault && fault->hang) hangUntilStopped();
+      if (fault && fault->reset) {
+        resetConnection(req);
+        res.set_content_provider(
+            1024, "application/json", [](size_t, size_t, httplib::DataSink&) { return false; });
+        return;
+      }
       if (fault && fault->drop) {
         // The head goes out, then the connection closes before the promised body.
         res.set_content_provider(
@@ -174,6 +212,46 @@ struct DevServer::Impl {
                          {"results", results}}});
   }
 
+  // Suggestions before anything is typed: the first entries of the corpus.
+  json zeroKeyword() const {
+    json suggestions = json::array();
+    for (std::size_t i = 0; i < corpus.size() && i < 5; ++i) suggestions.push_back({{"suggestion", corpus[i]}});
+    return json::array({{{"status", "ok"}, {"qtype", "zkw"}, {"suggestions", suggestions}}});
+  }
+
+  // The results after the first five for "q".
+  json moreResults(const httplib::Request& req) const {
+    const std::string needle = lowercase(req.get_param_value("q"));
+    json results = json::array();
+    std::size_t matched = 0;
+    for (const auto& line : corpus) {
+      if (needle.empty() || lowercase(line).rfind(needle, 0) != 0) continue;
+      if (++matched > 5 && results.size() < 20) results.push_back({{"title", line}, {"url", base() + "/card?id=" + percentEncode(line)}});
+    }
+    return json::array({{{"status", "ok"}, {"results", results}}});
+  }
+
+  json card(const httplib::Request& req) const {
+    const std::string id = req.get_param_value("id");
+    return json::array({{{"status", "ok"},
+                         {"id", id},
+                         {"sections", json::array({{{"type", "title"}, {"text", id}},
+                                                   {{"type", "description"}, {"text", "About " + id}}})}}});
+  }
+
+  // A dictionary entry for the selected text.
+  json lookup(const httplib::Request& req) const {
+    const std::string q = req.get_param_value("q");
+    return json::array({{{"status", "ok"},
+                         {"ltype", req.get_param_value("ltype")},
+                         {"results", json::array({{{"title", q}, {"definition", "The meaning of " + q}}})}}});
+  }
+
+  // Flight status, in the binary type the client asks for; the devserver's record is plain text.
+  void flight(const httplib::Request& req, httplib::Response& res) const {
+    res.set_content("flight " + req.get_param_value("q") + " on time", "application/x-protobuf");
+  }
+
   // A resource file: a fixed body with an ETag, cacheable for "max_age" seconds (default 60).
   void resource(const httplib::Request& req, httplib::Response& res) {
     const std::string name = req.matches[1];
@@ -212,6 +290,8 @@ struct DevServer::Impl {
       fault.status = body.value("status", 0);
       fault.drop = body.value("drop", false);
       fault.remaining = body.value("times", -1);
+      fault.hang = body.value("hang", false);
+      fault.reset = body.value("reset", false);
       if (body.contains("body") && body["body"].is_string()) fault.body = body["body"].get<std::string>();
       std::lock_guard guard(lock);
       faults[body["path"].get<std::string>()] = fault;
@@ -219,8 +299,18 @@ struct DevServer::Impl {
     });
 
     server.Get("/bag", served_([this](const httplib::Request&, httplib::Response& res) { replyJSON(res, bag()); }));
-    server.Get("/search",
-               served_([this](const httplib::Request& req, httplib::Response& res) { replyJSON(res, search(req)); }));
+    server.Get("/search", served_([this](const httplib::Request& req, httplib::Response& res) {
+                 // Zero-keyword and look-up requests share the search URL and are told apart by
+                 // their query items.
+                 if (req.get_param_value("qtype") == "zkw") return replyJSON(res, zeroKeyword());
+                 if (req.has_param("ltype")) return replyJSON(res, lookup(req));
+                 replyJSON(res, search(req));
+               }));
+    server.Get("/more",
+               served_([this](const httplib::Request& req, httplib::Response& res) { replyJSON(res, moreResults(req)); }));
+    server.Get("/card",
+               served_([this](const httplib::Request& req, httplib::Response& res) { replyJSON(res, card(req)); }));
+    server.Get("/flight", served_([this](const httplib::Request& req, httplib::Response& res) { flight(req, res); }));
     server.Get("/warm", served_([](const httplib::Request&, httplib::Response& res) { res.status = 204; }));
     server.Get(R"(/resources/([A-Za-z0-9_.-]+))",
                served_([this](const httplib::Request& req, httplib::Response& res) { resource(req, res); }));
@@ -272,6 +362,11 @@ bool DevServer::start(const Options& options, std::string* error) {
 
 void DevServer::stop() {
   if (!impl_->thread.joinable()) return;
+  {
+    std::lock_guard guard(impl_->hangLock);
+    impl_->stopping = true;
+  }
+  impl_->hangWake.notify_all();
   impl_->server.stop();
   impl_->thread.join();
 }

@@ -1,12 +1,16 @@
 // tavix-devserver: a small back end for development and tests, on 127.0.0.1 only.
 //
-// It serves a bag whose URLs point at itself, a completing search endpoint, and records every
+// It serves a bag whose URLs point at itself, a completing search endpoint (which also answers
+// zero-keyword, qtype=zkw, and look-up, ltype=..., requests), more results (/more), cards (/card)
+// and flight status (/flight), and records every
 // request so that tests can assert on what went over the wire. Control endpoints (never recorded):
 //   GET  /_recorded  JSON list of {"method","path","query","headers","body_size"}
 //   POST /_reset     forget recordings and faults
 //   POST /_faults    {"path": "/search", "delay_ms": 500, "status": 500, "drop": true, "times": 2}
 //                    applies to requests of that path; "times" limits how many (absent: all);
-//                    "body": "[1]" answers that text (with "status", default 200) instead
+//                    "body": "[1]" answers that text (with "status", default 200) instead;
+//                    "hang": true never answers (until stop()); "reset": true resets the
+//                    connection (TCP RST) after the response head
 //
 // Threading: start() and stop() from one thread; the server answers on its own threads.
 #pragma once

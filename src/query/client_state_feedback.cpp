@@ -1,0 +1,253 @@
+// The records that bracket every network request of a client state, the counters kept beside
+// them, the proxy switch, and connection warming.
+#include <fmt/format.h>
+
+#include <algorithm>
+#include <cctype>
+
+#include "bag/tavix_bag_controller.h"
+#include "bag/tvx_bag.h"
+#include "context/location.h"
+#include "context/user_guid_controller.h"
+#include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "core/logging.h"
+#include "feedback/client_session_manager.h"
+#include "feedback/tavix_feedback.h"
+#include "feedback/vocabulary.h"
+#include "network/request_factory.h"
+#include "network/user_agent.h"
+#include "platform/clock.h"
+#include "platform/http/url_session.h"
+#include "platform/json_value.h"
+#include "query/client_state.h"
+#include "tavix_proto/feedback_records.pb.h"
+
+namespace tavix {
+
+using platform::http::URLSessionDataTask;
+using platform::http::URLSessionTaskMetrics;
+
+namespace {
+
+platform::Logger& searchLog() { return TavixLogForCategory(TavixLoggingCategorySearch); }
+
+// Event time stamps follow the assembly's clock, so that sessions and records agree in tests.
+std::uint64_t eventTimestamp(const Assembly& assembly) {
+  if (!assembly.clock) return 0;
+  const double seconds = platform::toUnixSeconds(assembly.clock->now());
+  return seconds > 0 ? static_cast<std::uint64_t>(seconds * 1e9) : 0;
+}
+
+// The transport's phases, in seconds from the task's start, as the server's dashboards chart them.
+void fillTimingData(proto::CTEndNetworkSearchFeedback& end, const URLSessionTaskMetrics& timing) {
+  auto& data = *end.mutable_network_timing_data();
+  data["domain_lookup"] = timing.domainLookupSeconds;
+  data["connect"] = timing.connectSeconds;
+  data["secure_connection"] = timing.secureConnectionSeconds;
+  data["response_start"] = timing.firstByteSeconds;
+  data["total"] = timing.totalSeconds;
+  data["request_body_bytes"] = static_cast<double>(timing.requestBodyBytes);
+  data["response_body_bytes"] = static_cast<double>(timing.responseBodyBytes);
+  end.set_connection_reused(timing.reusedConnection);
+  end.set_peer_address(timing.peerAddress);
+}
+
+proto::CTEndNetworkSearchFeedback makeEndRecord(const proto::CTStartNetworkSearchFeedback& start,
+                                                std::uint64_t responseSize, long statusCode,
+                                                const URLSessionTaskMetrics& timing, std::uint64_t timestamp) {
+  proto::CTEndNetworkSearchFeedback end;
+  end.set_timestamp(timestamp);
+  end.set_uuid(start.uuid());
+  end.set_endpoint_type(start.endpoint_type());
+  end.set_status_code(static_cast<std::int32_t>(statusCode));
+  end.set_response_size(static_cast<std::uint32_t>(std::min<std::uint64_t>(responseSize, UINT32_MAX)));
+  fillTimingData(end, timing);
+  return end;
+}
+
+}  // namespace
+
+std::string ClientState::currentUserGuid() { return guidController_ ? guidController_->currentUserGUID() : std::string(); }
+
+void ClientState::addCodable(const google::protobuf::Message& codable, std::uint64_t queryId, bool withUserGuid) {
+  if (!sessionManager_) return;
+  const std::string guid = withUserGuid ? currentUserGuid() : std::string();
+  sessionManager_->addTavixFeedback(
+      makeTavixFeedbackWithCodable(codable, static_cast<std::int64_t>(queryId), guid, userAgent().value_or("")));
+}
+
+void ClientState::recordSkipSearch(int reason, const std::string& input, std::uint64_t queryId) {
+  proto::CTSkipSearchFeedback skip;
+  skip.set_timestamp(eventTimestamp(assembly_));
+  skip.set_input(input);
+  skip.set_reason(static_cast<proto::SkipSearchType::Value>(reason));
+  addCodable(skip, queryId, false);
+}
+
+void ClientState::recordDidGoToSearch(const TVXRequest& request, const std::string& input) {
+  const auto agent = userAgent();
+  if (!agent || request.triggerEvent != proto::TriggerSearchRequestEvent::return_key) return;
+  std::string lower = *agent;
+  std::transform(lower.begin(), lower.end(), lower.begin(), [](unsigned char c) { return std::tolower(c); });
+  if (lower.find("messages") == std::string::npos) return;
+  proto::CTDidGoToSearchFeedback didGo;
+  didGo.set_timestamp(eventTimestamp(assembly_));
+  didGo.set_input(input);
+  didGo.set_endpoint_type(proto::EndpointType::tavix_search);
+  addCodable(didGo, request.queryId, true);
+}
+
+std::optional<std::string> ClientState::geoSessionEntityString() {
+  if (!assembly_.locationManager) return std::nullopt;
+  auto session = assembly_.locationManager->getMapsUserSessionEntityAndReset(true);
+  if (!session || session->sessionId.empty()) return std::nullopt;
+  return fmt::format("{} {} {:f}", session->sessionId, session->sequenceNumber, session->relativeTimestamp);
+}
+
+ClientState::StartRecord ClientState::startSearchEventForRequest(const platform::http::URLRequest& request) {
+  auto start = std::make_shared<proto::CTStartNetworkSearchFeedback>();
+  start->set_timestamp(eventTimestamp(assembly_));
+  start->set_url(request.url);
+  auto& headers = *start->mutable_headers();
+  for (const auto& [name, value] : request.headers.all()) headers[name] = value;
+  start->set_uuid(makeRandomUUIDString());
+  return start;
+}
+
+void ClientState::endNetworkFeedback(const StartRecord& start, const std::string& rawResponse,
+                                     std::uint64_t responseSize, long statusCode, const URLSessionTaskMetrics& timing,
+                                     std::uint64_t queryId) {
+  endNetworkFeedback(start, rawResponse, responseSize, statusCode, timing, queryId, userAgent().value_or(""));
+}
+
+void ClientState::endNetworkFeedback(const StartRecord& start, const std::string& rawResponse,
+                                     std::uint64_t responseSize, long statusCode, const URLSessionTaskMetrics& timing,
+                                     std::uint64_t queryId, const std::string& agent) {
+  if (!start || !sessionManager_) return;
+  auto end = makeEndRecord(*start, responseSize, statusCode, timing, eventTimestamp(assembly_));
+  // The server's own account of the request sits in the first element of its reply.
+  const auto reply = platform::parseJson(rawResponse);
+  const auto* list = reply ? reply->array() : nullptr;
+  const auto* first = list && !list->empty() ? list->front().dictionary() : nullptr;
+  if (first) {
+    auto string = [&](const char* key) -> const std::string* {
+      const auto it = first->find(key);
+      return it == first->end() ? nullptr : it->second.string();
+    };
+    if (const auto* status = string("status")) end.set_tavix_status(*status);
+    if (const auto* ip = string("partial_client_ip")) end.set_tavix_partial_client_ip(*ip);
+    if (const auto it = first->find("duration"); it != first->end()) {
+      if (const auto* real = it->second.real()) end.set_tavix_duration(*real);
+      if (const auto* integer = it->second.integer()) end.set_tavix_duration(static_cast<double>(*integer));
+    }
+  }
+  // No proxy control connection on this platform: the record goes out at once.
+  sessionManager_->addTavixFeedback(makeTavixFeedbackWithCodable(end, static_cast<std::int64_t>(queryId), "", agent));
+}
+
+void ClientState::failSearchFeedback(const std::optional<TVXError>& error, const TVXRequest& request,
+                                     const StartRecord& start, std::uint64_t responseSize, long statusCode,
+                                     const URLSessionTaskMetrics& timing) {
+  const auto agent = userAgent();
+  if (error) {
+    if (auto shortName = agent ? extractClientNameFromString(*agent) : std::nullopt) {
+      TavixDiagnosticDataReporter::addValue(1, createCounterKey(*shortName, "fedapicall.noconnection"));
+    }
+  }
+  proto::CTErrorFeedback errorRecord;
+  errorRecord.set_timestamp(eventTimestamp(assembly_));
+  if (error) {
+    errorRecord.set_code(static_cast<std::int32_t>(error->code));
+    errorRecord.set_domain(error->domain);
+    errorRecord.set_reason(error->reason);
+  }
+  addCodable(errorRecord, request.queryId, false);
+  if (!start || !sessionManager_) return;
+  auto end = makeEndRecord(*start, responseSize, statusCode, timing, eventTimestamp(assembly_));
+  addCodable(end, request.queryId, false);
+}
+
+void ClientState::recordSearchResult(long statusCode) {
+  const auto agent = userAgent();
+  if (!agent) return;
+  TavixDiagnosticDataReporter::addValue(
+      1, fmt::format("{}{}", createCounterKey(*agent, "fedapicall.serverstatus"), statusCode));
+}
+
+void ClientState::setPerformedSearch() {
+  if (assembly_.requestFactory) assembly_.requestFactory->setPerformedSearch();
+}
+
+int ClientState::marvolaStatus() const {
+  if (!assembly_.useMarvola()) return 0;
+  const auto bag = currentBag();
+  const auto configuration = bag ? bag->marvolaConfiguration() : std::nullopt;
+  if (!configuration) return 0;
+  const auto enabled = configuration->find("enabled");
+  const auto proxy = configuration->find("proxy");
+  const bool on = enabled != configuration->end() && enabled->second.asBool().value_or(false);
+  return on && proxy != configuration->end() && proxy->second.string() ? 1 : 0;
+}
+
+bool ClientState::proxyEnableForTask(URLSessionDataTask& task) const {
+  const auto bag = currentBag();
+  const auto configuration = bag ? bag->marvolaConfiguration() : std::nullopt;
+  if (!configuration) return false;
+  const auto proxy = configuration->find("proxy");
+  const std::string* url = proxy == configuration->end() ? nullptr : proxy->second.string();
+  if (!url || url->find("://") == std::string::npos) return false;
+  task.setProxy(*url);
+  return true;
+}
+
+void ClientState::warm() {
+  const auto warmURL = assembly_.bagController ? assembly_.bagController->warmURL() : std::nullopt;
+  if (!warmURL) {
+    searchLog().debug("warm not required, bag fetch in process");
+    return;
+  }
+  const auto now = assembly_.clock ? assembly_.clock->now() : platform::TimePoint{};
+  {
+    std::lock_guard lock(mutex_);
+    if (lastNetworkRequest_ && now - *lastNetworkRequest_ < platform::seconds(30)) {
+      searchLog().debug("warm not required, connection still warm");
+      return;
+    }
+    // Taken now, under the lock, so that a second warm racing this one stays home.
+    lastNetworkRequest_ = now;
+  }
+  auto request = assembly_.requestFactory ? assembly_.requestFactory->warmRequest(*warmURL) : std::nullopt;
+  if (!request) return;
+  auto start = startSearchEventForRequest(*request);
+  start->set_input("");
+  start->set_trigger_event(proto::TriggerSearchRequestEvent::warm);
+  start->set_endpoint_type(proto::EndpointType::tavix_warm);
+  const std::string agent = userAgent().value_or("");
+  if (assembly_.clientSessionManager) {
+    assembly_.clientSessionManager->addTavixFeedback(makeTavixFeedbackWithCodable(*start, 0, "", agent));
+  }
+  auto holder = std::make_shared<std::shared_ptr<URLSessionDataTask>>();
+  std::weak_ptr<ClientState> weak = weak_from_this();
+  auto task = assembly_.urlSession()->dataTask(
+      *request, [weak, start, holder, agent](std::string data, std::optional<platform::http::HTTPURLResponse> response,
+                                             std::optional<platform::http::URLError> error) {
+        auto task = std::move(*holder);
+        auto self = weak.lock();
+        const long status = response ? response->statusCode : 0;
+        searchLog().notice("Status for warm request: ({}) error: ({})", status,
+                           error ? error->description : std::string("none"));
+        if (!self || !task) return;
+        self->endNetworkFeedback(start, data, data.size(), status, task->metrics(), 0, agent);
+      });
+  *holder = task;
+  // A pre-connect task: only the connection matters, so no cached answer may stand in for it.
+  task->setValue("preconnect", true);
+  if (marvolaStatus() == 1 && !proxyEnableForTask(*task)) {
+    TavixLogForCategory(TavixLoggingCategoryConnection).error("Enabling Marvola for request failed.");
+  }
+  task->resume();
+  markNetworkRequest();
+}
+
+}  // namespace tavix

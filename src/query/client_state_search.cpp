@@ -1,0 +1,253 @@
+// The search path: what the user has typed so far, answered from the local completions, the query
+// cache or the server.
+#include <fmt/format.h>
+
+#include "bag/tavix_bag_controller.h"
+#include "bag/tvx_bag.h"
+#include "cache/engaged_completion_cache.h"
+#include "cache/query_cache.h"
+#include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "core/logging.h"
+#include "core/names.h"
+#include "feedback/client_session_manager.h"
+#include "feedback/tavix_feedback.h"
+#include "feedback/vocabulary.h"
+#include "platform/clock.h"
+#include "platform/http/url_session.h"
+#include "platform/json_value.h"
+#include "query/client_state.h"
+#include "tavix_proto/feedback_records.pb.h"
+
+namespace tavix {
+
+using platform::http::HTTPURLResponse;
+using platform::http::URLError;
+using platform::http::URLRequest;
+
+namespace {
+
+platform::Logger& searchLog() { return TavixLogForCategory(TavixLoggingCategorySearch); }
+platform::Logger& protocolLog() { return TavixLogForCategory(TavixLoggingCategoryProtocol); }
+
+std::string headersText(const platform::http::HeaderFields& headers) {
+  std::string out;
+  for (const auto& [name, value] : headers.all()) out += fmt::format("{}{}: {}", out.empty() ? "" : ", ", name, value);
+  return out;
+}
+
+// Lengths are counted in characters, as the user typed them, not in UTF-8 bytes.
+std::int64_t characterCount(const std::string& text) {
+  std::int64_t count = 0;
+  for (unsigned char c : text) count += (c & 0xC0) != 0x80;
+  return count;
+}
+
+std::uint64_t nowTicks(const Assembly& assembly) {
+  if (!assembly.clock) return 0;
+  const double seconds = platform::toUnixSeconds(assembly.clock->now());
+  return seconds > 0 ? static_cast<std::uint64_t>(seconds * 1e9) : 0;
+}
+
+}  // namespace
+
+std::vector<std::string> ClientState::completionCacheSuggestions() const {
+  std::lock_guard lock(mutex_);
+  return completionCacheSuggestions_;
+}
+
+void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXReplyBlock reply) {
+  const std::string input = request->queryString;
+  const std::uint64_t queryId = request->queryId;
+  searchLog().notice("session {} performing query[{}] {}, reply {}", identifier_, queryId, input,
+                     static_cast<const void*>(&reply));
+  if (clientShortName_) TavixDiagnosticDataReporter::addValue(1, createCounterKey(*clientShortName_, "keystrokes"));
+
+  // Paths that end here answer first and write their bookkeeping after, so the client never
+  // waits for it.
+  if (!ensureBag()) {
+    searchLog().error("Bag fetch failed, can't complete non-cached query {}.", input);
+    reply(queryId, std::nullopt, TVXError{kTVXErrorDomain, 1, "timeout"});
+    recordSkipSearch(proto::SkipSearchType::bag_fetch_failed, input, queryId);
+    return;
+  }
+  const auto bag = currentBag();
+  if (!bag->isEnabled()) {
+    searchLog().notice("no search, bag disabled");
+    reply(queryId, std::nullopt, std::nullopt);
+    recordSkipSearch(proto::SkipSearchType::bag_disabled, input, queryId);
+    return;
+  }
+
+  // Local completions: the browser's and, for suggestion-bearing keystrokes, the search screen's.
+  std::vector<std::string> localSuggestions;
+  std::vector<std::string> kept;
+  const std::int64_t length = characterCount(input);
+  const std::int64_t smartMinimum = bag->smartHistoryMinimumQueryLength();
+  const std::string clientName = bag->clientName().value_or("");
+  const bool seekaraTrigger = request->triggerEvent == proto::TriggerSearchRequestEvent::suggest_queries ||
+                              request->triggerEvent == 24;
+  if ((smartMinimum == 0 || length >= smartMinimum - 1) && bag->smartHistoryEnabled() &&
+      (clientName == "brovane" || (clientName == "seekara" && seekaraTrigger))) {
+    proto::CTStartLocalSearchFeedback start;
+    start.set_timestamp(nowTicks(assembly_));
+    start.set_input(input);
+    start.set_trigger_event(length < smartMinimum ? proto::TriggerSearchRequestEvent::warm
+                                                  : proto::TriggerSearchRequestEvent::new_character);
+    addCodable(start, queryId, true);
+
+    const bool brovane = clientName == "brovane";
+    const unsigned long client = brovane ? 1 : 2;
+    unsigned long count = 1;
+    if (!brovane) {
+      const auto asked = bag->smartHistoryCompletionReturnCount();
+      count = asked > 0 ? static_cast<unsigned long>(asked) : 3;
+    }
+    const auto timeout = static_cast<unsigned long>(std::max<std::int64_t>(bag->smartHistoryTimeout(), 0));
+    auto found = EngagedCompletionCache::sharedInstance(assembly_)->completionsForInput(input, client, count, timeout);
+    if (!found || found->empty()) {
+      TavixLogForCategory(TavixLoggingCategoryDefault).notice("Local completion not found: input {}", input);
+    } else {
+      kept.push_back(found->front().suggestion);
+      for (std::size_t i = 1; i < found->size(); ++i) localSuggestions.push_back((*found)[i].suggestion);
+      if (found->size() > 1) {
+        searchLog().notice("{} Total completions found for {}, {} remaining", found->size(), input,
+                           localSuggestions.size());
+      }
+    }
+    std::lock_guard lock(mutex_);
+    completionCacheSuggestions_ = kept;
+  } else {
+    kept = completionCacheSuggestions();
+  }
+
+  if (length < bag->minimumQueryLength() && kept.empty()) {
+    searchLog().notice("query[{}] input '{}' less than {}", queryId, input, bag->minimumQueryLength());
+    reply(queryId, std::nullopt, std::nullopt);
+    recordSkipSearch(proto::SkipSearchType::less_than_minimum_query_length, input, queryId);
+    return;
+  }
+
+  recordDidGoToSearch(*request, input);
+
+  const std::string guid = currentUserGuid();
+  auto built = assembly_.requestFactory ? assembly_.requestFactory->searchRequest(*request, *bag, guid)
+                                        : std::nullopt;
+  if (!built) {
+    // A bag without a search URL: nothing to send.
+    searchLog().error("error with request {}", input);
+    reply(queryId, std::nullopt, TVXError{kTVXErrorDomain, 500, "no search URL"});
+    return;
+  }
+  const auto httpRequest = std::make_shared<const URLRequest>(std::move(*built));
+  protocolLog().info("request: {} header: {}", httpRequest->url, headersText(httpRequest->headers));
+
+  if (queryCache_) {
+    CacheSearchRequest lookup{input, request->scale, {}};
+    for (const auto& item : request->queryItems) lookup.queryItems.emplace_back(item.name, item.value);
+    if (auto hit = queryCache_->getRequest(lookup, httpRequest.get())) {
+      TVXReply cached;
+      cached.scale = request->scale;
+      cached.data = hit->data();
+      cached.geoSessionEntityString = geoSessionEntityString();
+      cached.localSuggestions = localSuggestions;
+      reply(queryId, std::move(cached), std::nullopt);
+      if (clientShortName_) {
+        TavixDiagnosticDataReporter::addValue(1, createCounterKey(*clientShortName_, "ondevicecachehits"));
+      }
+      proto::CTCacheHitFeedback cacheHit;
+      cacheHit.set_timestamp(nowTicks(assembly_));
+      cacheHit.set_input(input);
+      cacheHit.set_uuid(request->uuid);
+      cacheHit.set_reason(proto::SkipSearchType::cache_hit);
+      addCodable(cacheHit, queryId, false);
+      return;
+    }
+  }
+
+  auto start = startSearchEventForRequest(*httpRequest);
+  start->set_input(input);
+  start->set_trigger_event(static_cast<proto::TriggerSearchRequestEvent::Value>(request->triggerEvent));
+  start->set_endpoint_type(proto::EndpointType::tavix_search);
+  addCodable(*start, queryId, false);
+  searchLog().notice("Dispatching network request for (id, query): ({}, {})", queryId, input);
+
+  auto holder = std::make_shared<std::shared_ptr<platform::http::URLSessionDataTask>>();
+  auto self = shared_from_this();
+  auto task = assembly_.urlSession()->dataTask(
+      *httpRequest, [self, request, reply, httpRequest, start, holder, localSuggestions](
+                        std::string data, std::optional<HTTPURLResponse> response, std::optional<URLError> error) {
+        auto task = std::move(*holder);
+        const auto timing = task ? task->metrics() : platform::http::URLSessionTaskMetrics{};
+        const std::uint64_t queryId = request->queryId;
+        const std::string& input = request->queryString;
+        const long status = response ? response->statusCode : 0;
+        if (response) self->recordSearchResult(status);
+        searchLog().notice("Got network response for (id, query): ({}, {})", queryId, input);
+        protocolLog().info("resp: {}", response ? fmt::format("{} {}", status, response->url) : std::string("none"));
+
+        if (error || data.empty()) {
+          searchLog().error("error with request {}", httpRequest->url);
+          std::optional<TVXError> failure;
+          if (error) failure = TVXError{error->domain, error->code, error->description};
+          reply(queryId, std::nullopt, failure);
+          self->failSearchFeedback(failure, *request, start, data.size(), status, timing);
+          return;
+        }
+        if (!response) {
+          searchLog().error("not http response? {}", httpRequest->url);
+          TVXError failure{kTVXErrorDomain, 500, "invalid response class"};
+          reply(queryId, std::nullopt, failure);
+          self->failSearchFeedback(failure, *request, start, data.size(), status, timing);
+          return;
+        }
+
+        std::string parseError;
+        const auto parsed = platform::parseJson(data, &parseError);
+        std::optional<TVXError> jsonError;
+        if (!parsed) {
+          jsonError = TVXError{kTVXJSONErrorDomain, 3840, parseError.empty() ? "not JSON" : parseError};
+        } else if (self->queryCache_) {
+          // The server's reply is a list; its first dictionary names the completed query.
+          const platform::Dictionary* first = parsed->dictionary();
+          if (const auto* list = parsed->array(); list && !list->empty()) first = list->front().dictionary();
+          if (first) {
+            auto now = self->assembly_.clock ? self->assembly_.clock->now() : platform::TimePoint{};
+            self->queryCache_->set(Ref<CachedResultSet>(
+                new CachedResultSet(input, httpRequest.get(), *first, request->uuid, data, now)));
+          }
+        }
+        self->endNetworkFeedback(start, data, data.size(), status, timing, queryId);
+
+        TVXReply answer;
+        answer.scale = request->scale;
+        if (request->verboseReply) {
+          answer.httpRequest = *httpRequest;
+          answer.httpResponse = *response;
+        }
+        answer.data = data;
+        answer.geoSessionEntityString = self->geoSessionEntityString();
+        answer.localSuggestions = localSuggestions;
+        reply(queryId, std::move(answer), jsonError);
+
+        if (auto forceFetch = response->headers.get("X-Norvel-ForceFetch")) {
+          const auto value = platform::parseJson(*forceFetch);
+          if (value && value->dictionary()) {
+            if (self->assembly_.bagController) self->assembly_.bagController->forceFetchBag(*value->dictionary());
+          } else {
+            searchLog().error("Failed to deserialize X-Norvel-ForceFetch header data into a dictionary: {}",
+                              *forceFetch);
+          }
+        }
+      });
+  *holder = task;
+  if (assembly_.requestFactory && marvolaStatus() == 1 && !proxyEnableForTask(*task)) {
+    TavixLogForCategory(TavixLoggingCategoryConnection).error("Enabling Marvola for request failed.");
+  }
+  task->resume();
+  TavixDiagnosticDataReporter::addValue(1, TavixSearchCounterKey);
+  setPerformedSearch();
+  markNetworkRequest();
+}
+
+}  // namespace tavix
