@@ -285,7 +285,7 @@ int interactiveCommand(const std::string& socketPath, std::vector<std::string> a
   if (args.empty() && isatty(STDIN_FILENO) && isatty(STDOUT_FILENO)) return typeOnTerminal(client, identity);
 
   // No terminal: type each given text a character at a time and show every step.
-  if (args.empty()) args = {"weather", "wea"};
+  if (args.empty()) args = {"weather", "news"};
   std::uint64_t queryId = 0;
   int failures = 0;
   for (const auto& text : args) {
