@@ -69,7 +69,7 @@ std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackR
     const auto date = assembly.userDefaults->dateForKey(*key);
     if (date) {
       store.set_first_use_date(platform::toUnixSeconds(*date));
-    } else {
+    } else if (assembly.userDefaults->objectForKey(*key)) {  // no first use yet is not an error
       TavixLogForCategory(TavixLoggingCategoryFeedbackErrors)
           .error("Found something other than a date in defaults for key {}.", *key);
       assembly.userDefaults->removeObject(*key);
@@ -156,7 +156,17 @@ std::vector<FeedbackRef> ClientSession::getSessionFeedbacks() {
 std::vector<std::string> ClientSession::feedbacksWithRelativeTimestamp() {
   std::uint64_t base = 0;
   std::vector<std::string> out;
-  for (const auto& event : getSessionFeedbacks()) {
+  auto events = getSessionFeedbacks();
+  // An open session keeps its events in its file only: read them back from there.
+  if (events.empty()) {
+    if (auto handle = storageHandle()) {
+      if (auto record = handle->peekRecord()) {
+        for (const auto& f : record->feedbacks()) events.push_back(std::make_shared<proto::CTTavixFeedback>(f));
+        sortByTimeStamp(events);
+      }
+    }
+  }
+  for (const auto& event : events) {
     const std::uint64_t stamp = codableTimestamp(mutableFeedbackCodable(event->mutable_payload()));
     if (base == 0) base = stamp;
     event->set_rel_timestamp(stamp >= base ? hostTicksToMilliseconds(stamp - base) : 0);

@@ -235,6 +235,21 @@ std::optional<proto::CTClientSession> FileContainer::readRecord() {
   return result;
 }
 
+std::optional<proto::CTClientSession> FileContainer::peekRecord() {
+  std::optional<proto::CTClientSession> result;
+  queue_.sync([&] {
+    const int readFd = ::open(fileUrl_.c_str(), O_RDONLY | O_CLOEXEC);
+    if (readFd < 0) return;
+    // On the queue no append runs meanwhile; the writing descriptor is put back untouched.
+    const int writeFd = fd_;
+    fd_ = readFd;
+    result = unarchiveObject();
+    ::close(readFd);
+    fd_ = writeFd;
+  });
+  return result;
+}
+
 std::optional<proto::CTClientSession> FileContainer::unarchiveObject() {
   struct stat st {};
   if (::fstat(fd_, &st) != 0) {

@@ -61,6 +61,9 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   // A file whose last event was cut off gives the events before it.
   std::optional<proto::CTClientSession> readRecord();
 
+  // The same for a file still open for writing, which stays open: what has been written so far.
+  std::optional<proto::CTClientSession> peekRecord();
+
   // Asynchronously closes the file handle.
   void close();
 
