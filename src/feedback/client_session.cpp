@@ -10,6 +10,7 @@
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "core/names.h"
+#include "feedback/cba_filter.h"
 #include "feedback/feedback_json.h"
 #include "feedback/persistent_storage.h"
 #include "feedback/session_processing_helper.h"
@@ -189,8 +190,10 @@ std::vector<std::string> ClientSession::privacyFilteredFeedbacksWithRelativeTime
 }
 
 std::string ClientSession::getFeedbacksToSend() {
-  // Brovane sessions would pass through the CBA filter here; it is not part of this build yet.
-  const std::vector<std::string> filtered = privacyFilteredFeedbacksWithRelativeTimestamp(getSessionFeedbacks());
+  std::vector<FeedbackRef> events = getSessionFeedbacks();
+  // Only the browser reports completion-bar engagements.
+  if (lower(agent()).find("brovane") != std::string::npos) events = CBAFilterController().arrayOfCBAFilteredFeedback(events);
+  const std::vector<std::string> filtered = privacyFilteredFeedbacksWithRelativeTimestamp(events);
   nlohmann::json fb = nlohmann::json::array();
   for (const auto& text : filtered) fb.push_back(nlohmann::json::parse(text, nullptr, false));
   nlohmann::json versions = nlohmann::json::object();
