@@ -3,7 +3,8 @@
 // upload record of every session that is accepted: sorting, privacy filtering and, for browser
 // agents, the completion-bar filter with whatever URLs the file holds.
 //
-// Run: <build>/bin/session_file_fuzzer -max_total_time=300 [corpus-dir]
+// Run: UBSAN_OPTIONS=halt_on_error=1 <build>/bin/session_file_fuzzer -max_total_time=300 [corpus-dir]
+// (undefined behaviour only warns otherwise, and the run would go on past it).
 #include <unistd.h>
 
 #include <cstddef>
