@@ -155,7 +155,9 @@ TEST(FeedbackReliability, SessionFilesSurviveAKillAtAnyPoint) {
         }
       });
     }
-    std::uniform_int_distribution<int> pause(20, 400);
+    // The kill lands while sessions are being written, not before the first one exists.
+    ASSERT_TRUE(daemon->waitForLog("new file url")) << daemon->log();
+    std::uniform_int_distribution<int> pause(0, 300);
     std::this_thread::sleep_for(std::chrono::milliseconds(pause(random)));
     daemon->signal(SIGKILL);
     EXPECT_EQ(daemon->waitExit(5000), 128 + SIGKILL);
