@@ -4,19 +4,24 @@
 
 #include <cctype>
 #include <cmath>
+#include <utility>
 
 #include <fmt/core.h>
 
 #include "bag/tvx_bag.h"
+#include "context/user_guid_controller.h"
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "core/names.h"
+#include "feedback/client_session.h"
+#include "feedback/tavix_feedback.h"
 #include "network/retryable_request.h"
 #include "network/url_request_builder.h"
 #include "network/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
+#include "platform/http/url_session.h"
 #include "platform/json_value.h"
 #include "platform/transactions.h"
 
@@ -139,6 +144,47 @@ std::optional<std::string> versionString(const PropertyValue* value) {
 }
 
 TVXBagError bagError(std::string reason) { return {kTVXErrorDomain, kBagFetchErrorCode, std::move(reason)}; }
+
+// Event time stamps are host ticks: nanoseconds of the daemon's clock.
+std::uint64_t hostTicks(platform::Clock& clock) {
+  return static_cast<std::uint64_t>(
+      std::chrono::duration_cast<std::chrono::nanoseconds>(clock.now().time_since_epoch()).count());
+}
+
+proto::CTStartNetworkSearchFeedback bagFetchStartRecord(const platform::http::URLRequest& request,
+                                                        std::uint64_t ticks) {
+  proto::CTStartNetworkSearchFeedback start;
+  start.set_timestamp(ticks);
+  start.set_input("");
+  start.set_url(request.url);
+  for (const auto& [name, value] : request.headers.all()) (*start.mutable_headers())[name] = value;
+  start.set_trigger_event(proto::TriggerSearchRequestEvent::bag);
+  start.set_endpoint_type(proto::EndpointType::tavix_bag);
+  start.set_uuid(makeRandomUUIDString());
+  return start;
+}
+
+// The end of the fetch, matched to its start by uuid; timing in milliseconds.
+proto::CTEndNetworkSearchFeedback bagFetchEndRecord(const proto::CTStartNetworkSearchFeedback& start,
+                                                    std::size_t responseSize, long statusCode,
+                                                    const platform::http::URLSessionTaskMetrics& metrics,
+                                                    std::uint64_t ticks) {
+  proto::CTEndNetworkSearchFeedback end;
+  end.set_timestamp(ticks);
+  end.set_uuid(start.uuid());
+  end.set_endpoint_type(start.endpoint_type());
+  end.set_status_code(static_cast<std::int32_t>(statusCode));
+  end.set_response_size(static_cast<std::uint32_t>(responseSize));
+  auto& timing = *end.mutable_network_timing_data();
+  timing["domain_lookup"] = metrics.domainLookupSeconds * 1000;
+  timing["connect"] = metrics.connectSeconds * 1000;
+  timing["secure_connection"] = metrics.secureConnectionSeconds * 1000;
+  timing["first_byte"] = metrics.firstByteSeconds * 1000;
+  timing["total"] = metrics.totalSeconds * 1000;
+  end.set_connection_reused(metrics.reusedConnection);
+  end.set_peer_address(metrics.peerAddress);
+  return end;
+}
 
 }  // namespace
 
@@ -368,15 +414,24 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
   TavixLogForCategory(TavixLoggingCategoryProtocol)
       .notice("Initiating bag fetch attempt with request {} header {}", request->url, describeHeaders(request->headers));
 
+  // The fetch is a feedback session of its own: start, end and, on failure, the error.
+  const auto start = bagFetchStartRecord(*request, hostTicks(*assembly_.clock));
+  auto session = ClientSession::open(assembly_, wrapFetchRecord(start));
+
   auto retryable = std::make_shared<const TVXRetryableNetworkRequest>(*request, std::nullopt, true);
   std::weak_ptr<TavixBagController> weak = weak_from_this();
   auto retryClock = retryClock_;
+  // The completion reads the timing of the task, which exists only once the call returns. The
+  // completion lets go of the task, which breaks the cycle task -> completion -> holder -> task.
+  auto taskHolder = std::make_shared<std::shared_ptr<platform::http::URLSessionDataTask>>();
   auto task = dataTaskWithRetryableRequest(
       assembly_.bagSession(), retryable, 1, kFetchRetries, *retryClock, retryQueue_,
-      [weak, retryClock, completion = std::move(completion)](
+      [weak, retryClock, session, start, taskHolder, completion = std::move(completion)](
           std::string data, std::optional<platform::http::HTTPURLResponse> response,
           std::optional<platform::http::URLError> error) {
         bagLog().debug("resp: {}", describeResponse(response));
+        platform::http::URLSessionTaskMetrics metrics;
+        if (auto task = std::exchange(*taskHolder, nullptr)) metrics = task->metrics();
         auto self = weak.lock();
         if (!self) {
           bagLog().error("Error fetching bag, bag fetch task completed after BagFetchController was cleaned up");
@@ -384,6 +439,9 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
         }
         std::unique_lock hold(self->completionLock_);
         if (self->invalidated_.load()) return;
+        const auto end = bagFetchEndRecord(start, data.size(), response ? response->statusCode : 0, metrics,
+                                           hostTicks(*self->assembly_.clock));
+        session->addFeedback(self->wrapFetchRecord(end));
         std::shared_ptr<const TVXBag> bag;
         std::optional<TVXBagError> outcome;
         if (error) {
@@ -407,15 +465,30 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
             self->cacheBagState(bag, false);
           }
         }
+        if (outcome) {
+          proto::CTErrorFeedback failure;
+          failure.set_timestamp(hostTicks(*self->assembly_.clock));
+          failure.set_domain(outcome->domain);
+          failure.set_code(static_cast<std::int32_t>(outcome->code));
+          failure.set_reason(outcome->reason);
+          session->addFeedback(self->wrapFetchRecord(failure));
+        }
         TavixDiagnosticDataReporter::addValue(
             1, outcome ? "com.norvel.tavixd.bag.fetchesfailed" : "com.norvel.tavixd.bag.fetches");
+        session->sessionComplete();
         self->fetchTransaction_.reset();
         hold.unlock();
         // The caller may start the next fetch from here; it merges until the flag is down.
         if (completion) completion(outcome ? nullptr : bag, outcome);
         self->fetchInProgress_.store(false);
       });
+  *taskHolder = task;
   task->resume();
+}
+
+FeedbackRef TavixBagController::wrapFetchRecord(const google::protobuf::Message& record) {
+  const std::string guid = assembly_.guidController ? assembly_.guidController->currentUserGUID() : std::string();
+  return makeTavixFeedbackWithCodable(record, 0, guid, userAgent_.value_or(""));
 }
 
 Dictionary TavixBagController::cacheBagDictionary(const Dictionary& dictionary) {

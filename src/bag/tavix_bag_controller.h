@@ -4,7 +4,8 @@
 // in memory and as the binary property list "bag.plist" in the daemon's caches folder, treats it
 // as stale four hours after the fetch, refetches when it is stale, when the server asks for a
 // newer version or when the locale or country changes, and posts "TVXBagChangeNotification"
-// (object: the new bag as std::shared_ptr<const TVXBag>) each time the bag is replaced.
+// (object: the new bag as std::shared_ptr<const TVXBag>) each time the bag is replaced. Every
+// fetch is written as a feedback session of its own: its start, its end and any failure.
 //
 // Threading: every public operation is safe from any thread. The in-memory bag sits behind a
 // reader/writer queue; the change notification is posted from inside its write, so observers
@@ -32,6 +33,14 @@ namespace tavix {
 
 class Assembly;
 class TVXBag;
+namespace proto {
+class CTTavixFeedback;
+}
+}  // namespace tavix
+namespace google::protobuf {
+class Message;
+}
+namespace tavix {
 
 inline constexpr const char* kTVXNotificationBagKey = "bag";
 // News availability, posted on the assembly's notification centre when a fetched bag turns the
@@ -112,6 +121,9 @@ class TavixBagController final : public TVXBagURLSource,
   void runFetch(std::optional<std::string> version, Completion completion);
   void handleRefreshNotification();
   std::optional<std::string> currentBagCacheURL();
+  // One of the fetch's feedback records, wrapped with query id 0, the current user GUID and the
+  // controller's user agent.
+  std::shared_ptr<proto::CTTavixFeedback> wrapFetchRecord(const google::protobuf::Message& record);
 
   Assembly& assembly_;
   platform::ReaderWriterQueue inMemoryBagCacheAccessQueue_;

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <array>
 #include <cctype>
+#include <cmath>
 #include <ctime>
 
 #include "context/user_guid_controller.h"
@@ -10,6 +11,7 @@
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "core/names.h"
+#include "feedback/cba_filter.h"
 #include "feedback/feedback_json.h"
 #include "feedback/persistent_storage.h"
 #include "feedback/session_processing_helper.h"
@@ -216,14 +218,20 @@ std::vector<std::string> ClientSession::privacyFilteredFeedbacksWithRelativeTime
 }
 
 std::string ClientSession::getFeedbacksToSend() {
-  // Brovane sessions would pass through the CBA filter here; it is not part of this build yet.
-  const std::vector<std::string> filtered = privacyFilteredFeedbacksWithRelativeTimestamp(getSessionFeedbacks());
+  std::vector<FeedbackRef> events = getSessionFeedbacks();
+  // Only the browser reports completion-bar engagements.
+  if (lower(agent()).find("brovane") != std::string::npos) events = CBAFilterController().arrayOfCBAFilteredFeedback(events);
+  const std::vector<std::string> filtered = privacyFilteredFeedbacksWithRelativeTimestamp(events);
   nlohmann::json fb = nlohmann::json::array();
   for (const auto& text : filtered) fb.push_back(nlohmann::json::parse(text, nullptr, false));
   nlohmann::json versions = nlohmann::json::object();
   for (const auto& [name, version] : backingStore_.resource_versions()) versions[name] = version;
+  // A start read back from a damaged file may be no time at all (NaN, or beyond any clock): no
+  // base time then, rather than an undefined conversion.
+  const double start = backingStore_.session_start();
+  const bool usableStart = std::isfinite(start) && std::fabs(start) < 9.0e18;
   const std::int64_t baseTime =
-      backingStore_.remove_timestamps() ? 0 : static_cast<std::int64_t>(backingStore_.session_start());
+      backingStore_.remove_timestamps() || !usableStart ? 0 : static_cast<std::int64_t>(start);
   nlohmann::json record = {
       {ClientSessionFeedbackKey, fb},
       {ClientSessionAgentKey, agent()},

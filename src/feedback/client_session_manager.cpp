@@ -1,5 +1,7 @@
 #include "feedback/client_session_manager.h"
 
+#include "bag/tavix_bag_controller.h"
+#include "bag/tvx_bag.h"
 #include "context/user_guid_controller.h"
 #include "core/assembly.h"
 #include "core/logging.h"
@@ -95,8 +97,8 @@ void ClientSessionManager::addTavixFeedback(FeedbackRef feedback) {
   if (!feedback) return;
   auto transaction = std::make_shared<platform::TransactionTracker::Transaction>();
   if (assembly_.transactions) *transaction = assembly_.transactions->begin("addFeedback");
-  // The feedbackEnabled check of the client's bag belongs here once the bag controller exists.
   sessionQueue_.async([self = shared_from_this(), feedback, transaction] {
+    if (!self->feedbackEnabledFor(feedback->user_agent())) return;
     const platform::TimePoint now = self->assembly_.clock->now();
     feedback->set_user_guid(self->guidController_ ? self->guidController_->currentUserGUID() : std::string());
     if (self->currentState_ != kNoSession && self->sessionGuid() != feedback->user_guid()) {
@@ -144,6 +146,14 @@ void ClientSessionManager::reportErrorAsTavixdFeedback(int code, const std::stri
   error.set_reason(reason);
   const std::string guid = assembly.guidController ? assembly.guidController->currentUserGUID() : std::string();
   assembly.clientSessionManager->addTavixFeedback(makeTavixFeedbackWithCodable(error, 0, guid, tavixdUserAgent()));
+}
+
+bool ClientSessionManager::feedbackEnabledFor(const std::string& userAgent) const {
+  // Without a bag nothing says no: feedback is kept until the first bag arrives.
+  if (!assembly_.bagController) return true;
+  auto bag = assembly_.bagController->inMemoryBag();
+  if (!bag) return true;
+  return TVXBag(bag->sharedRawBag(), userAgent).feedbackEnabled();
 }
 
 unsigned ClientSessionManager::currentState() {

@@ -65,7 +65,8 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   ClientSessionManager(const ClientSessionManager&) = delete;
   ClientSessionManager& operator=(const ClientSessionManager&) = delete;
 
-  // Asynchronous; the whole path holds the "addFeedback" transaction.
+  // Asynchronous; the whole path holds the "addFeedback" transaction. Dropped when a bag is
+  // loaded and the sender's view of it has feedback disabled.
   void addTavixFeedback(FeedbackRef feedback);
   // Asynchronous: closes the open session with reason 2, then calls `done` (also with none open).
   void flushSession(std::function<void()> done = {});
@@ -97,6 +98,8 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   void onSoftLimitReached();
   void flushSessionWithReason(int reason, std::function<void()> callback = {});
   std::string sessionGuid() const;
+  // Whether the loaded bag, as the client with this user agent sees it, lets feedback through.
+  bool feedbackEnabledFor(const std::string& userAgent) const;
 
   Assembly& assembly_;
   std::shared_ptr<TavixUserGUIDController> guidController_;

@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include <cmath>
+
 #include <nlohmann/json.hpp>
 
 #include "core/assembly.h"
@@ -111,6 +113,19 @@ TEST(ClientSession, UploadRecordIsPrivacyFilteredWithMissingObjectsFirst) {
   EXPECT_EQ(fb[2]["timestamp"], 0);
   EXPECT_EQ(fb[3]["timestamp"], 1000);
   EXPECT_EQ(upload.dump().find("device-result-7"), std::string::npos);
+}
+
+TEST(ClientSession, BaseTimeIsTheTruncatedStartOrNothingForADamagedOne) {
+  SessionFixture f;
+  auto baseTime = [&](double start) {
+    proto::CTClientSession record;
+    record.set_session_start(start);
+    return nlohmann::json::parse(ClientSession::fromRecord(f.assembly, record)->getFeedbacksToSend())["base_time"];
+  };
+  EXPECT_EQ(baseTime(1767225600.9), 1767225600);
+  EXPECT_EQ(baseTime(2.8e246), 0);
+  EXPECT_EQ(baseTime(-1e30), 0);
+  EXPECT_EQ(baseTime(std::nan("")), 0);
 }
 
 }  // namespace

@@ -1,0 +1,197 @@
+// Bag fetches written as feedback sessions, and the bag's feedback switch in the session manager:
+// the real bag controller, session manager and session files against the development server over
+// loopback HTTP.
+#include <gtest/gtest.h>
+
+#include <future>
+#include <nlohmann/json.hpp>
+
+#include "bag/tavix_bag_controller.h"
+#include "bag/tvx_bag.h"
+#include "context/user_guid_controller.h"
+#include "core/assembly.h"
+#include "devserver/devserver.h"
+#include "feedback/client_session_manager.h"
+#include "feedback/persistent_storage.h"
+#include "network/request_factory.h"
+#include "network/user_agent.h"
+#include "platform/clock.h"
+#include "platform/defaults.h"
+#include "platform/dispatch.h"
+#include "platform/http/url_session.h"
+#include "platform/notification_center.h"
+#include "support/temp_home.h"
+
+namespace tavix {
+namespace {
+
+using tavix::testing::waitFor;
+
+class BagFeedbackTest : public ::testing::Test {
+ protected:
+  BagFeedbackTest() {
+    EXPECT_TRUE(server.start({}, nullptr));
+    auto defaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
+    defaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
+                                {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})},
+                                {"TVXSessionSoftLimitOverride", platform::PropertyValue(std::int64_t{600})},
+                                {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
+    defaults->setObject("TVXBagURL", server.baseURL() + "/bag");
+    assembly.dispatchPool = &pool;
+    assembly.clock = &clock;
+    assembly.paths = platform::Paths{home.cache(), home.config(), home.runtime()};
+    assembly.userDefaults = defaults;
+    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
+    assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+    assembly.guidController = std::make_shared<TavixUserGUIDController>(assembly);
+    assembly.bagController = TavixBagController::create(assembly);
+    assembly.clientSessionManager =
+        std::make_shared<ClientSessionManager>(assembly, assembly.guidController, "tavix");
+  }
+  ~BagFeedbackTest() override {
+    assembly.bagController->invalidate();
+    pool.drain();
+    assembly.clientSessionManager.reset();
+    assembly.bagController.reset();
+    assembly.requestFactory.reset();
+  }
+
+  void fault(const nlohmann::json& f) {
+    platform::http::URLRequest r;
+    r.url = server.baseURL() + "/_faults";
+    r.method = "POST";
+    r.body = f.dump();
+    std::promise<void> done;
+    control->dataTask(r, [&](auto, auto, auto) { done.set_value(); })->resume();
+    done.get_future().get();
+  }
+
+  std::optional<TVXBagError> fetch() {
+    std::promise<std::optional<TVXBagError>> done;
+    EXPECT_TRUE(assembly.bagController->fetchBagStateWithVersion(std::nullopt,
+                                                                 [&](auto, auto error) { done.set_value(error); }));
+    auto error = done.get_future().get();
+    EXPECT_TRUE(waitFor([&] { return !assembly.bagController->fetchInProgress(); }));
+    return error;
+  }
+
+  // The waiting sessions, oldest file first, read back; consumed (deleted) as they are read.
+  std::vector<proto::CTClientSession> takeSessions() {
+    pool.drain();
+    std::vector<proto::CTClientSession> out;
+    for (auto& handle : assembly.persistentStorage->getAvailableSessionHandles()) {
+      if (auto record = handle->readRecord()) out.push_back(*record);
+      assembly.persistentStorage->deleteSessionWithFileContainer(handle);
+    }
+    pool.drain();
+    return out;
+  }
+
+  FeedbackRef event(const std::string& agent) {
+    proto::CTCacheHitFeedback hit;
+    hit.set_input("x");
+    return makeTavixFeedbackWithCodable(hit, 3, "", agent);
+  }
+
+  testing::TempHome home;
+  devserver::DevServer server;
+  platform::DispatchPool pool{4};
+  platform::VirtualClock clock;
+  Assembly assembly;
+  std::shared_ptr<platform::http::URLSession> control = std::make_shared<platform::http::URLSession>();
+};
+
+TEST_F(BagFeedbackTest, EachFetchIsASessionOfItsOwnWithStartEndAndFailure) {
+  const std::string agent = assembly.bagController->userAgent().value_or("");
+  ASSERT_FALSE(agent.empty());
+  ASSERT_FALSE(fetch());
+
+  auto sessions = takeSessions();
+  ASSERT_EQ(sessions.size(), 1u);
+  EXPECT_EQ(sessions[0].agent(), agent);
+  ASSERT_EQ(sessions[0].feedbacks_size(), 2);
+  const auto& startWrap = sessions[0].feedbacks(0);
+  EXPECT_EQ(startWrap.query_id(), 0);
+  EXPECT_EQ(startWrap.user_guid(), assembly.guidController->currentUserGUID());
+  EXPECT_EQ(startWrap.user_agent(), agent);
+  ASSERT_TRUE(startWrap.payload().has_network_search_start());
+  const auto& start = startWrap.payload().network_search_start();
+  EXPECT_EQ(start.input(), "");
+  EXPECT_EQ(start.trigger_event(), proto::TriggerSearchRequestEvent::bag);
+  EXPECT_EQ(start.endpoint_type(), proto::EndpointType::tavix_bag);
+  EXPECT_EQ(start.url().rfind(server.baseURL() + "/bag?", 0), 0u) << start.url();
+  EXPECT_EQ(start.headers().at("User-Agent"), agent);
+  ASSERT_TRUE(sessions[0].feedbacks(1).payload().has_network_search_end());
+  const auto& end = sessions[0].feedbacks(1).payload().network_search_end();
+  EXPECT_EQ(end.uuid(), start.uuid());
+  EXPECT_FALSE(end.uuid().empty());
+  EXPECT_EQ(end.status_code(), 200);
+  EXPECT_GT(end.response_size(), 10u);
+  EXPECT_EQ(end.peer_address(), "127.0.0.1");
+  EXPECT_GT(end.network_timing_data().at("total"), 0.0);
+
+  // A server error: the end record carries the status, then the failure follows.
+  fault({{"path", "/bag"}, {"status", 503}, {"body", "busy"}, {"times", 1}});
+  ASSERT_TRUE(fetch());
+  sessions = takeSessions();
+  ASSERT_EQ(sessions.size(), 1u);
+  ASSERT_EQ(sessions[0].feedbacks_size(), 3);
+  EXPECT_EQ(sessions[0].feedbacks(1).payload().network_search_end().status_code(), 503);
+  EXPECT_EQ(sessions[0].feedbacks(1).payload().network_search_end().response_size(), 4u);
+  const auto& failure = sessions[0].feedbacks(2).payload().error();
+  EXPECT_EQ(failure.domain(), kTVXErrorDomain);
+  EXPECT_EQ(failure.code(), 2);
+  EXPECT_EQ(failure.reason(), "statusCode 503");
+
+  // A body that is not a JSON object.
+  fault({{"path", "/bag"}, {"body", "[1]"}, {"times", 1}});
+  ASSERT_TRUE(fetch());
+  sessions = takeSessions();
+  ASSERT_EQ(sessions.size(), 1u);
+  ASSERT_EQ(sessions[0].feedbacks_size(), 3);
+  EXPECT_EQ(sessions[0].feedbacks(1).payload().network_search_end().status_code(), 200);
+  EXPECT_EQ(sessions[0].feedbacks(2).payload().error().reason(), "not JSON object");
+
+  // Fetch sessions stay apart from the clients' session of the manager.
+  EXPECT_FALSE(assembly.clientSessionManager->hasSession());
+}
+
+TEST_F(BagFeedbackTest, ABagThatDisablesFeedbackForAClientDropsItsEvents) {
+  auto& manager = *assembly.clientSessionManager;
+  // No bag yet: events are kept.
+  manager.addTavixFeedback(event("com.norvel.Brovane/17"));
+  EXPECT_EQ(manager.currentState(), ClientSessionManager::kActive);
+  manager.flushSession();
+  EXPECT_EQ(manager.currentState(), ClientSessionManager::kNoSession);
+
+  const nlohmann::json bag = {{"version", "7"},
+                              {"feedback_enabled", true},
+                              {"clients", {{"brovane", {{"feedback_enabled", false}}}}}};
+  fault({{"path", "/bag"}, {"body", bag.dump()}, {"times", 1}});
+  ASSERT_FALSE(fetch());
+  ASSERT_TRUE(assembly.bagController->inMemoryBag());
+  takeSessions();
+
+  manager.addTavixFeedback(event("com.norvel.Brovane/17"));
+  EXPECT_EQ(manager.currentState(), ClientSessionManager::kNoSession);
+  manager.addTavixFeedback(event("seekara/3"));
+  EXPECT_EQ(manager.currentState(), ClientSessionManager::kActive);
+  manager.addTavixFeedback(event("com.norvel.Brovane/17"));
+  manager.flushSession();
+  manager.currentState();
+  auto sessions = takeSessions();
+  ASSERT_EQ(sessions.size(), 1u);
+  EXPECT_EQ(sessions[0].agent(), "seekara/3");
+  for (const auto& f : sessions[0].feedbacks()) EXPECT_NE(f.user_agent(), "com.norvel.Brovane/17");
+
+  // A bag without the key disables feedback for everyone.
+  fault({{"path", "/bag"}, {"body", nlohmann::json({{"version", "8"}}).dump()}, {"times", 1}});
+  ASSERT_FALSE(fetch());
+  takeSessions();
+  manager.addTavixFeedback(event("seekara/3"));
+  EXPECT_EQ(manager.currentState(), ClientSessionManager::kNoSession);
+}
+
+}  // namespace
+}  // namespace tavix

@@ -1,0 +1,218 @@
+// A daemon killed with SIGKILL while it writes feedback sessions: every session file it reported
+// is afterwards read back whole or cleanly discarded, never accepted torn, and the restarted
+// daemon recovers the files and goes on numbering after them. One file per round also loses a
+// random tail, as a torn write would leave it.
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <fstream>
+#include <map>
+#include <random>
+#include <regex>
+#include <set>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "feedback/persistent_storage.h"
+#include "network/user_agent.h"
+#include "platform/dispatch.h"
+#include "support/daemon_process.h"
+#include "tavix_proto/feedback_session.pb.h"
+#include "tavix_proto/ipc.pb.h"
+
+namespace tavix {
+namespace {
+
+constexpr int kAgents = 6;
+constexpr std::uint64_t kMaxFileSize = 2097152;
+
+std::string agentName(int i) { return "reliability-" + std::to_string(i) + "/1.0"; }
+
+struct Daemon : testing::DaemonProcess {
+  std::string socket;
+  Daemon(const testing::TempHome& home, const std::string& logName)
+      : DaemonProcess(TAVIXD_BINARY, home, {"--log-level", "debug"}, logName),
+        socket((home.runtime() / "com.norvel.tavixd" / "socket").string()) {}
+};
+
+// Connects, says who it is, waits for the answer and hangs up: the daemon then records the
+// connection's invalidation as feedback of that agent. False when the daemon is not there.
+bool connectAndLeave(const std::string& path, const std::string& agent) {
+  const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path.c_str());
+  if (::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
+    ::close(fd);
+    return false;
+  }
+  timeval tv{2, 0};
+  ::setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
+  proto::Envelope e;
+  e.set_call_id(1);
+  e.mutable_configure()->mutable_configuration()->set_identifier("reliability");
+  e.mutable_configure()->mutable_configuration()->set_user_agent(agent);
+  const std::string payload = e.SerializeAsString();
+  const auto n = static_cast<std::uint32_t>(payload.size());
+  std::string frame{static_cast<char>(n >> 24), static_cast<char>(n >> 16), static_cast<char>(n >> 8),
+                    static_cast<char>(n)};
+  frame += payload;
+  bool ok = ::send(fd, frame.data(), frame.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(frame.size());
+  char buf[256];
+  if (ok) ok = ::recv(fd, buf, sizeof buf, 0) > 0;  // the configure reply
+  ::close(fd);
+  return ok;
+}
+
+// The session files that a daemon's log says it created, by number.
+std::map<int, std::string> reportedFiles(const std::string& log) {
+  static const std::regex line(R"(new file url (\S*session\.(\d+)))");
+  std::map<int, std::string> files;
+  for (std::sregex_iterator it(log.begin(), log.end(), line), end; it != end; ++it) {
+    files[std::stoi((*it)[2])] = (*it)[1];
+  }
+  return files;
+}
+
+struct Verdict {
+  int accepted = 0;
+  int discarded = 0;
+  int events = 0;
+  int cutShort = 0;  // accepted without a last record that the kill cut off
+};
+
+// Reads every session file in the folder as the flusher will, and checks that what is accepted
+// is whole: a known header and only complete events of the kinds this daemon writes.
+Verdict checkFolder(const platform::fs::path& folder, platform::SerialQueue& queue) {
+  // The daemon's own agent, or a client's as the daemon completes it ("<daemon> (<device>) <client>").
+  const auto known = [](const std::string& agent) {
+    if (agent == tavixdUserAgent()) return true;
+    for (int i = 0; i < kAgents; ++i) {
+      const std::string client = " " + agentName(i);
+      if (agent.size() > client.size() && agent.compare(agent.size() - client.size(), client.size(), client) == 0) {
+        return true;
+      }
+    }
+    return false;
+  };
+  Verdict v;
+  for (const auto& entry : platform::fs::directory_iterator(folder)) {
+    const std::string name = entry.path().filename().string();
+    if (name.rfind("session.", 0) != 0) continue;
+    FileContainer container(entry.path(), tavixdUserAgent(), queue, kMaxFileSize);
+    auto record = container.readRecord();
+    if (!record) {
+      ++v.discarded;
+      continue;
+    }
+    ++v.accepted;
+    if (platform::fs::file_size(entry.path()) > record->ByteSizeLong()) ++v.cutShort;
+    EXPECT_TRUE(known(record->agent())) << name << " header agent '" << record->agent() << "'";
+    EXPECT_EQ(record->version(), tavixdUserAgent()) << name;
+    for (const auto& f : record->feedbacks()) {
+      ++v.events;
+      EXPECT_TRUE(known(f.user_agent())) << name << " event agent '" << f.user_agent() << "'";
+      EXPECT_EQ(f.user_agent() == tavixdUserAgent() ? record->agent() : f.user_agent(), record->agent()) << name;
+      const auto& p = f.payload();
+      EXPECT_TRUE(p.has_connection_invalidated() || p.has_network_search_start() || p.has_network_search_end() ||
+                  p.has_error() || p.has_session_end())
+          << name << " type " << p.type();
+    }
+  }
+  return v;
+}
+
+TEST(FeedbackReliability, SessionFilesSurviveAKillAtAnyPoint) {
+  testing::TempHome home;
+  platform::DispatchPool pool{1};
+  platform::SerialQueue queue(pool, "com.norvel.tavixd.persistentStorageQueue");
+  const platform::fs::path folder = home.cache() / "com.norvel.tavixd";
+  std::mt19937 random(std::random_device{}());
+  int highest = -1;
+  int totalAccepted = 0;
+
+  for (int round = 0; round < 6; ++round) {
+    const std::string logName = "round" + std::to_string(round) + ".log";
+    auto daemon = std::make_unique<Daemon>(home, logName);
+    ASSERT_TRUE(daemon->waitForLog("tavixd started")) << daemon->log();
+
+    // Clients come and go on two threads until the daemon dies under them.
+    std::atomic<bool> stop{false};
+    std::atomic<int> delivered{0};
+    std::vector<std::thread> clients;
+    for (int t = 0; t < 2; ++t) {
+      clients.emplace_back([&, t] {
+        for (int i = 0; !stop.load(); ++i) {
+          if (!connectAndLeave(daemon->socket, agentName((i * 2 + t) % kAgents))) break;
+          delivered.fetch_add(1);
+        }
+      });
+    }
+    // The kill lands while sessions are being written, not before the first one exists.
+    ASSERT_TRUE(daemon->waitForLog("new file url")) << daemon->log();
+    std::uniform_int_distribution<int> pause(0, 300);
+    std::this_thread::sleep_for(std::chrono::milliseconds(pause(random)));
+    daemon->signal(SIGKILL);
+    EXPECT_EQ(daemon->waitExit(5000), 128 + SIGKILL);
+    stop.store(true);
+    for (auto& c : clients) c.join();
+
+    const auto reported = reportedFiles(daemon->log());
+    EXPECT_FALSE(reported.empty()) << "round " << round << " delivered " << delivered.load();
+    for (const auto& [number, path] : reported) {
+      EXPECT_GT(number, highest) << "a new file reused the number of a recovered one";
+      EXPECT_TRUE(platform::fs::exists(path)) << path;
+    }
+    if (!reported.empty()) highest = reported.rbegin()->first;
+
+    // A write torn by a power cut rather than a kill: one of the files loses a random tail. It
+    // must come back with a prefix of its events, or not at all.
+    if (!reported.empty()) {
+      auto it = reported.begin();
+      std::advance(it, std::uniform_int_distribution<std::size_t>(0, reported.size() - 1)(random));
+      const platform::fs::path victim = it->second;
+      auto before = FileContainer(victim, tavixdUserAgent(), queue, kMaxFileSize).readRecord();
+      const auto size = platform::fs::file_size(victim);
+      if (before && size > 0) {
+        platform::fs::resize_file(victim, std::uniform_int_distribution<std::uintmax_t>(0, size - 1)(random));
+        auto after = FileContainer(victim, tavixdUserAgent(), queue, kMaxFileSize).readRecord();
+        if (after) {
+          EXPECT_LE(after->feedbacks_size(), before->feedbacks_size());
+          for (int i = 0; i < after->feedbacks_size(); ++i) {
+            EXPECT_EQ(after->feedbacks(i).SerializeAsString(), before->feedbacks(i).SerializeAsString());
+          }
+        }
+      }
+    }
+
+    const Verdict v = checkFolder(folder, queue);
+    totalAccepted += v.accepted;
+    ::testing::Test::RecordProperty("round" + std::to_string(round),
+                                    std::to_string(v.accepted) + " accepted, " + std::to_string(v.discarded) +
+                                        " discarded, " + std::to_string(v.events) + " events, " +
+                                        std::to_string(v.cutShort) + " cut short");
+  }
+  EXPECT_GT(totalAccepted, 0);
+
+  // The last restart finds every file of the earlier runs and goes on.
+  Daemon last(home, "last.log");
+  ASSERT_TRUE(last.waitForLog("tavixd started")) << last.log();
+  ASSERT_TRUE(connectAndLeave(last.socket, agentName(0)));
+  ASSERT_TRUE(last.waitForLog("new file url")) << last.log();
+  const auto reported = reportedFiles(last.log());
+  ASSERT_FALSE(reported.empty());
+  EXPECT_GT(reported.begin()->first, highest);
+  EXPECT_TRUE(last.alive());
+  EXPECT_EQ(last.stop(), 0);
+  checkFolder(folder, queue);
+}
+
+}  // namespace
+}  // namespace tavix
