@@ -71,7 +71,7 @@ std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackR
     const auto date = assembly.userDefaults->dateForKey(*key);
     if (date) {
       store.set_first_use_date(platform::toUnixSeconds(*date));
-    } else if (assembly.userDefaults->objectForKey(*key)) {  // no first use yet is not an error
+    } else {
       TavixLogForCategory(TavixLoggingCategoryFeedbackErrors)
           .error("Found something other than a date in defaults for key {}.", *key);
       assembly.userDefaults->removeObject(*key);
