@@ -224,9 +224,9 @@ void ClientState::warm() {
   start->set_trigger_event(proto::TriggerSearchRequestEvent::warm);
   start->set_endpoint_type(proto::EndpointType::tavix_warm);
   const std::string agent = userAgent().value_or("");
-  if (assembly_.clientSessionManager) {
-    assembly_.clientSessionManager->addTavixFeedback(makeTavixFeedbackWithCodable(*start, 0, "", agent));
-  }
+  // The state's manager is the assembly's when sessions are shared; otherwise it is the one the
+  // end record goes to, and the two records stay in one session.
+  if (sessionManager_) sessionManager_->addTavixFeedback(makeTavixFeedbackWithCodable(*start, 0, "", agent));
   auto holder = std::make_shared<std::shared_ptr<URLSessionDataTask>>();
   std::weak_ptr<ClientState> weak = weak_from_this();
   auto task = assembly_.urlSession()->dataTask(

@@ -153,8 +153,10 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
       return;
     }
   } else {
-    // These kinds follow a result the client already has, so a bag was had before.
+    // These kinds follow a result the client already has, so a bag was had before; a state that
+    // never loaded one (a new connection opening a card) takes the controller's.
     bag = currentBag();
+    if (!bag && ensureBag()) bag = currentBag();
     if (!bag) {
       reply(queryId, std::nullopt, TVXError{kTVXErrorDomain, 1, "no bag"});
       return;

@@ -74,29 +74,42 @@ struct DevServer::Impl {
 
   std::string base() const { return "http://127.0.0.1:" + std::to_string(port); }
 
-  // Hung requests wait here until stop(), so that the server can still be stopped.
+  // Hung requests wait here until their client gives up or the server stops, so that they do
+  // not hold the server's threads for ever.
   std::mutex hangLock;
   std::condition_variable hangWake;
   bool stopping = false;
 
-  void hangUntilStopped() {
+  void hangUntilAbandoned(const httplib::Request& req) {
+    const int fd = socketOf(req);
     std::unique_lock guard(hangLock);
-    hangWake.wait(guard, [this] { return stopping; });
+    while (!stopping) {
+      hangWake.wait_for(guard, std::chrono::milliseconds(50));
+      char byte;
+      if (fd >= 0 && ::recv(fd, &byte, 1, MSG_PEEK | MSG_DONTWAIT) == 0) return;
+    }
   }
 
-  // httplib does not hand out the socket: find it by its two ports, and make its close abortive
-  // (linger 0), so that the peer gets a reset rather than an orderly end.
-  void resetConnection(const httplib::Request& req) const {
+  // httplib does not hand out the socket: find it by its two ports.
+  int socketOf(const httplib::Request& req) const {
     for (int fd = 0; fd < 4096; ++fd) {
       sockaddr_in local{}, peer{};
       socklen_t localSize = sizeof local, peerSize = sizeof peer;
       if (::getsockname(fd, reinterpret_cast<sockaddr*>(&local), &localSize) != 0 || local.sin_family != AF_INET) continue;
       if (::getpeername(fd, reinterpret_cast<sockaddr*>(&peer), &peerSize) != 0) continue;
-      if (ntohs(local.sin_port) != port || ntohs(peer.sin_port) != req.remote_port) continue;
-      linger abortive{1, 0};
-      ::setsockopt(fd, SOL_SOCKET, SO_LINGER, &abortive, sizeof abortive);
-      return;
+      if (ntohs(local.sin_port) == port && ntohs(peer.sin_port) == req.remote_port) return fd;
     }
+    return -1;
+  }
+
+  // Disconnecting a connected TCP socket (connect to AF_UNSPEC) resets it: the peer gets a RST at
+  // once, and httplib's own later writes and close on the descriptor stay harmless.
+  void resetConnection(const httplib::Request& req) const {
+    const int fd = socketOf(req);
+    if (fd < 0) return;
+    sockaddr unspecified{};
+    unspecified.sa_family = AF_UNSPEC;
+    ::connect(fd, &unspecified, sizeof unspecified);
   }
 
   void record(const httplib::Request& req) {
@@ -134,11 +147,14 @@ struct DevServer::Impl {
       record(req);
       const auto fault = takeFault(req.path);
       if (fault && fault->delayMs > 0) std::this_thread::sleep_for(std::chrono::milliseconds(fault->delayMs));
-      if (fault && fault->hang) hangUntilStopped();
+      if (fault && fault->hang) {
+        hangUntilAbandoned(req);
+        res.set_content_provider(1024, "application/json", [](size_t, size_t, httplib::DataSink&) { return false; });
+        return;
+      }
       if (fault && fault->reset) {
         resetConnection(req);
-        res.set_content_provider(
-            1024, "application/json", [](size_t, size_t, httplib::DataSink&) { return false; });
+        res.set_header("Connection", "close");
         return;
       }
       if (fault && fault->drop) {
