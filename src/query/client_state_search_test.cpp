@@ -206,5 +206,30 @@ TEST_F(SearchTest, MessagesReturnKeyRecordsAGoToSearchAndVerboseRepliesCarryTheE
   EXPECT_EQ(went[0].payload().did_go_to_search().endpoint_type(), 6);
 }
 
+TEST_F(SearchTest, TheServerCanAskForANewerBagAndTheBagCanRouteThroughItsProxy) {
+  devserver::DevServer proxy;
+  ASSERT_TRUE(proxy.start({}, nullptr));
+  serveBag(bagWith({{"marvola_configuration",
+                     platform::Dictionary{{"enabled", true}, {"proxy", proxy.baseURL()}}}}));
+  auto state = make("com.norvel.seekara", "Seekara/1.0");
+
+  // With the proxy feature off, requests go straight to the server, which asks for bag 2.
+  defaults->setObject("TVXUseMarvola", false);
+  fault("/search", {{"headers", platform::Dictionary{{"X-Norvel-ForceFetch", "{\"bag\": 2}"}}}, {"times", 1}});
+  Replies direct;
+  state->search(request<TVXSearchRequest>(40, "camera"), direct.block());
+  EXPECT_TRUE(direct.first().reply);
+  EXPECT_EQ(received("/search").size(), 1u);
+  EXPECT_TRUE(testing::waitFor([&] { return received("/bag").size() == 2; }, 5000));
+
+  // With it on, the request goes to the bag's proxy, which is asked for the absolute URL.
+  defaults->setObject("TVXUseMarvola", true);
+  Replies proxied;
+  state->search(request<TVXSearchRequest>(41, "lens"), proxied.block());
+  proxied.first();
+  EXPECT_EQ(received("/search").size(), 1u);
+  EXPECT_EQ(received(server.baseURL() + "/search", &proxy).size(), 1u);
+}
+
 }  // namespace
 }  // namespace tavix::query_testing

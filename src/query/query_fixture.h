@@ -120,9 +120,10 @@ class QueryFixture : public ::testing::Test {
     ASSERT_TRUE(testing::waitFor([&] { return assembly.bagController->currentBag() != nullptr; }, 5000));
   }
 
-  std::string send(const std::string& method, const std::string& path, const std::string& body = {}) {
+  std::string send(const std::string& method, const std::string& path, const std::string& body = {},
+                   const devserver::DevServer* to = nullptr) {
     platform::http::URLRequest r;
-    r.url = server.baseURL() + path;
+    r.url = (to ? to : &server)->baseURL() + path;
     r.method = method;
     r.body = body;
     r.reloadIgnoringLocalCacheData = true;
@@ -134,10 +135,10 @@ class QueryFixture : public ::testing::Test {
     settings["path"] = path;
     send("POST", "/_faults", platform::toJson(platform::PropertyValue(std::move(settings))));
   }
-  // The requests the devserver received on `path`, with their query items.
-  std::vector<platform::Dictionary> received(const std::string& path) {
+  // The requests the devserver (or `on`) received on `path`, with their query items.
+  std::vector<platform::Dictionary> received(const std::string& path, const devserver::DevServer* on = nullptr) {
     std::vector<platform::Dictionary> out;
-    const auto recorded = platform::parseJson(send("GET", "/_recorded"));
+    const auto recorded = platform::parseJson(send("GET", "/_recorded", {}, on));
     if (!recorded || !recorded->array()) return out;
     for (const auto& entry : *recorded->array()) {
       const auto* d = entry.dictionary();

@@ -32,6 +32,7 @@ struct Fault {
   std::optional<std::string> body;  // served as it stands instead of the route's answer
   bool hang = false;   // never answers (until the server stops)
   bool reset = false;  // the connection is reset (TCP RST) instead of answered
+  std::vector<std::pair<std::string, std::string>> headers;  // added to the answer
 };
 
 std::string lowercase(std::string s) {
@@ -162,6 +163,9 @@ struct DevServer::Impl {
         res.set_content_provider(
             1024, "application/json", [](size_t, size_t, httplib::DataSink&) { return false; });
         return;
+      }
+      if (fault) {
+        for (const auto& [name, value] : fault->headers) res.set_header(name, value);
       }
       if (fault && fault->body) {
         res.status = fault->status != 0 ? fault->status : 200;
@@ -308,6 +312,11 @@ struct DevServer::Impl {
       fault.remaining = body.value("times", -1);
       fault.hang = body.value("hang", false);
       fault.reset = body.value("reset", false);
+      if (body.contains("headers") && body["headers"].is_object()) {
+        for (const auto& [name, value] : body["headers"].items()) {
+          if (value.is_string()) fault.headers.emplace_back(name, value.get<std::string>());
+        }
+      }
       if (body.contains("body") && body["body"].is_string()) fault.body = body["body"].get<std::string>();
       std::lock_guard guard(lock);
       faults[body["path"].get<std::string>()] = fault;
