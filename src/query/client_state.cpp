@@ -46,7 +46,8 @@ ClientState::ClientState(Assembly& assembly, std::string identifier)
     : assembly_(assembly),
       identifier_(std::move(identifier)),
       clientShortName_(extractClientNameFromString(identifier_)),
-      retryQueue_(std::make_unique<platform::SerialQueue>(*assembly.dispatchPool, "com.norvel.tavixd.clientState.retry")) {
+      retryQueue_(
+          std::make_unique<platform::SerialQueue>(*assembly.dispatchPool, "com.norvel.tavixd.clientState.retry")) {
   if (!assembly_.userDefaults || !assembly_.userDefaults->boolForKey("TVXNoQueryCache")) {
     queryCache_ = QueryCache::create(assembly_);
     cachingLog().debug("query cache ON for {}", identifier_);

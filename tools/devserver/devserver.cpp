@@ -96,7 +96,8 @@ struct DevServer::Impl {
     for (int fd = 0; fd < 4096; ++fd) {
       sockaddr_in local{}, peer{};
       socklen_t localSize = sizeof local, peerSize = sizeof peer;
-      if (::getsockname(fd, reinterpret_cast<sockaddr*>(&local), &localSize) != 0 || local.sin_family != AF_INET) continue;
+      if (::getsockname(fd, reinterpret_cast<sockaddr*>(&local), &localSize) != 0) continue;
+      if (local.sin_family != AF_INET) continue;
       if (::getpeername(fd, reinterpret_cast<sockaddr*>(&peer), &peerSize) != 0) continue;
       if (ntohs(local.sin_port) == port && ntohs(peer.sin_port) == req.remote_port) return fd;
     }
@@ -246,7 +247,8 @@ struct DevServer::Impl {
     std::size_t matched = 0;
     for (const auto& line : corpus) {
       if (needle.empty() || lowercase(line).rfind(needle, 0) != 0) continue;
-      if (++matched > 5 && results.size() < 20) results.push_back({{"title", line}, {"url", base() + "/card?id=" + percentEncode(line)}});
+      if (++matched <= 5 || results.size() >= 20) continue;
+      results.push_back({{"title", line}, {"url", base() + "/card?id=" + percentEncode(line)}});
     }
     return json::array({{{"status", "ok"}, {"results", results}}});
   }
@@ -331,8 +333,9 @@ struct DevServer::Impl {
                  if (req.has_param("ltype")) return replyJSON(res, lookup(req));
                  replyJSON(res, search(req));
                }));
-    server.Get("/more",
-               served_([this](const httplib::Request& req, httplib::Response& res) { replyJSON(res, moreResults(req)); }));
+    server.Get("/more", served_([this](const httplib::Request& req, httplib::Response& res) {
+                 replyJSON(res, moreResults(req));
+               }));
     server.Get("/card",
                served_([this](const httplib::Request& req, httplib::Response& res) { replyJSON(res, card(req)); }));
     server.Get("/flight", served_([this](const httplib::Request& req, httplib::Response& res) { flight(req, res); }));
