@@ -21,23 +21,18 @@
 #include "platform/http/url_session.h"
 #include "platform/json_value.h"
 #include "query/client_state.h"
+#include "query/client_state_internal.h"
 #include "tavix_proto/feedback_records.pb.h"
 
 namespace tavix {
 
 using platform::http::URLSessionDataTask;
 using platform::http::URLSessionTaskMetrics;
+using query_internal::eventTimestamp;
 
 namespace {
 
 platform::Logger& searchLog() { return TavixLogForCategory(TavixLoggingCategorySearch); }
-
-// Event time stamps follow the assembly's clock, so that sessions and records agree in tests.
-std::uint64_t eventTimestamp(const Assembly& assembly) {
-  if (!assembly.clock) return 0;
-  const double seconds = platform::toUnixSeconds(assembly.clock->now());
-  return seconds > 0 ? static_cast<std::uint64_t>(seconds * 1e9) : 0;
-}
 
 // The transport's phases, in seconds from the task's start, as the server's dashboards chart them.
 void fillTimingData(proto::CTEndNetworkSearchFeedback& end, const URLSessionTaskMetrics& timing) {
@@ -68,7 +63,9 @@ proto::CTEndNetworkSearchFeedback makeEndRecord(const proto::CTStartNetworkSearc
 
 }  // namespace
 
-std::string ClientState::currentUserGuid() { return guidController_ ? guidController_->currentUserGUID() : std::string(); }
+std::string ClientState::currentUserGuid() {
+  return guidController_ ? guidController_->currentUserGUID() : std::string();
+}
 
 void ClientState::addCodable(const google::protobuf::Message& codable, std::uint64_t queryId, bool withUserGuid) {
   if (!sessionManager_) return;
@@ -224,9 +221,9 @@ void ClientState::warm() {
   start->set_trigger_event(proto::TriggerSearchRequestEvent::warm);
   start->set_endpoint_type(proto::EndpointType::tavix_warm);
   const std::string agent = userAgent().value_or("");
-  if (assembly_.clientSessionManager) {
-    assembly_.clientSessionManager->addTavixFeedback(makeTavixFeedbackWithCodable(*start, 0, "", agent));
-  }
+  // The state's manager is the assembly's when sessions are shared; otherwise it is the one the
+  // end record goes to, and the two records stay in one session.
+  if (sessionManager_) sessionManager_->addTavixFeedback(makeTavixFeedbackWithCodable(*start, 0, "", agent));
   auto holder = std::make_shared<std::shared_ptr<URLSessionDataTask>>();
   std::weak_ptr<ClientState> weak = weak_from_this();
   auto task = assembly_.urlSession()->dataTask(

@@ -20,6 +20,7 @@
 #include "platform/http/url_session.h"
 #include "platform/json_value.h"
 #include "query/client_state.h"
+#include "query/client_state_internal.h"
 #include "tavix_proto/feedback_records.pb.h"
 
 namespace tavix {
@@ -58,18 +59,6 @@ struct ClientStateQueryKind {
 };
 
 namespace {
-
-std::string headersText(const platform::http::HeaderFields& headers) {
-  std::string out;
-  for (const auto& [name, value] : headers.all()) out += fmt::format("{}{}: {}", out.empty() ? "" : ", ", name, value);
-  return out;
-}
-
-std::uint64_t nowTicks(const Assembly& assembly) {
-  if (!assembly.clock) return 0;
-  const double seconds = platform::toUnixSeconds(assembly.clock->now());
-  return seconds > 0 ? static_cast<std::uint64_t>(seconds * 1e9) : 0;
-}
 
 std::string emptyInput(const TVXRequest&, const URLRequest&) { return {}; }
 
@@ -153,8 +142,10 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
       return;
     }
   } else {
-    // These kinds follow a result the client already has, so a bag was had before.
+    // These kinds follow a result the client already has, so a bag was had before; a state that
+    // never loaded one (a new connection opening a card) takes the controller's.
     bag = currentBag();
+    if (!bag && ensureBag()) bag = currentBag();
     if (!bag) {
       reply(queryId, std::nullopt, TVXError{kTVXErrorDomain, 1, "no bag"});
       return;
@@ -170,14 +161,14 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
   }
   const auto httpRequest = std::make_shared<const URLRequest>(std::move(*built));
   TavixLogForCategory(TavixLoggingCategoryProtocol)
-      .info(fmt::runtime(kind.requestLog), httpRequest->url, headersText(httpRequest->headers));
+      .info(fmt::runtime(kind.requestLog), httpRequest->url, query_internal::headersText(httpRequest->headers));
   const std::string input = kind.input(*request, *httpRequest);
   if (kind.messagesRule) recordDidGoToSearch(*request, input);
 
   StartRecord start;
   if (kind.startWithoutUUID) {
     start = std::make_shared<proto::CTStartNetworkSearchFeedback>();
-    start->set_timestamp(nowTicks(assembly_));
+    start->set_timestamp(query_internal::eventTimestamp(assembly_));
     start->set_url(httpRequest->url);
     for (const auto& [name, value] : httpRequest->headers.all()) (*start->mutable_headers())[name] = value;
   } else {

@@ -17,6 +17,7 @@
 #include "platform/http/url_session.h"
 #include "platform/json_value.h"
 #include "query/client_state.h"
+#include "query/client_state_internal.h"
 #include "tavix_proto/feedback_records.pb.h"
 
 namespace tavix {
@@ -30,23 +31,11 @@ namespace {
 platform::Logger& searchLog() { return TavixLogForCategory(TavixLoggingCategorySearch); }
 platform::Logger& protocolLog() { return TavixLogForCategory(TavixLoggingCategoryProtocol); }
 
-std::string headersText(const platform::http::HeaderFields& headers) {
-  std::string out;
-  for (const auto& [name, value] : headers.all()) out += fmt::format("{}{}: {}", out.empty() ? "" : ", ", name, value);
-  return out;
-}
-
 // Lengths are counted in characters, as the user typed them, not in UTF-8 bytes.
 std::int64_t characterCount(const std::string& text) {
   std::int64_t count = 0;
   for (unsigned char c : text) count += (c & 0xC0) != 0x80;
   return count;
-}
-
-std::uint64_t nowTicks(const Assembly& assembly) {
-  if (!assembly.clock) return 0;
-  const double seconds = platform::toUnixSeconds(assembly.clock->now());
-  return seconds > 0 ? static_cast<std::uint64_t>(seconds * 1e9) : 0;
 }
 
 }  // namespace
@@ -90,7 +79,7 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
   if ((smartMinimum == 0 || length >= smartMinimum - 1) && bag->smartHistoryEnabled() &&
       (clientName == "brovane" || (clientName == "seekara" && seekaraTrigger))) {
     proto::CTStartLocalSearchFeedback start;
-    start.set_timestamp(nowTicks(assembly_));
+    start.set_timestamp(query_internal::eventTimestamp(assembly_));
     start.set_input(input);
     start.set_trigger_event(length < smartMinimum ? proto::TriggerSearchRequestEvent::warm
                                                   : proto::TriggerSearchRequestEvent::new_character);
@@ -140,7 +129,7 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
     return;
   }
   const auto httpRequest = std::make_shared<const URLRequest>(std::move(*built));
-  protocolLog().info("request: {} header: {}", httpRequest->url, headersText(httpRequest->headers));
+  protocolLog().info("request: {} header: {}", httpRequest->url, query_internal::headersText(httpRequest->headers));
 
   if (queryCache_) {
     CacheSearchRequest lookup{input, request->scale, {}};
@@ -156,7 +145,7 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
         TavixDiagnosticDataReporter::addValue(1, createCounterKey(*clientShortName_, "ondevicecachehits"));
       }
       proto::CTCacheHitFeedback cacheHit;
-      cacheHit.set_timestamp(nowTicks(assembly_));
+      cacheHit.set_timestamp(query_internal::eventTimestamp(assembly_));
       cacheHit.set_input(input);
       cacheHit.set_uuid(request->uuid);
       cacheHit.set_reason(proto::SkipSearchType::cache_hit);

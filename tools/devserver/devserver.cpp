@@ -32,6 +32,7 @@ struct Fault {
   std::optional<std::string> body;  // served as it stands instead of the route's answer
   bool hang = false;   // never answers (until the server stops)
   bool reset = false;  // the connection is reset (TCP RST) instead of answered
+  std::vector<std::pair<std::string, std::string>> headers;  // added to the answer
 };
 
 std::string lowercase(std::string s) {
@@ -74,29 +75,43 @@ struct DevServer::Impl {
 
   std::string base() const { return "http://127.0.0.1:" + std::to_string(port); }
 
-  // Hung requests wait here until stop(), so that the server can still be stopped.
+  // Hung requests wait here until their client gives up or the server stops, so that they do
+  // not hold the server's threads for ever.
   std::mutex hangLock;
   std::condition_variable hangWake;
   bool stopping = false;
 
-  void hangUntilStopped() {
+  void hangUntilAbandoned(const httplib::Request& req) {
+    const int fd = socketOf(req);
     std::unique_lock guard(hangLock);
-    hangWake.wait(guard, [this] { return stopping; });
+    while (!stopping) {
+      hangWake.wait_for(guard, std::chrono::milliseconds(50));
+      char byte;
+      if (fd >= 0 && ::recv(fd, &byte, 1, MSG_PEEK | MSG_DONTWAIT) == 0) return;
+    }
   }
 
-  // httplib does not hand out the socket: find it by its two ports, and make its close abortive
-  // (linger 0), so that the peer gets a reset rather than an orderly end.
-  void resetConnection(const httplib::Request& req) const {
+  // httplib does not hand out the socket: find it by its two ports.
+  int socketOf(const httplib::Request& req) const {
     for (int fd = 0; fd < 4096; ++fd) {
       sockaddr_in local{}, peer{};
       socklen_t localSize = sizeof local, peerSize = sizeof peer;
-      if (::getsockname(fd, reinterpret_cast<sockaddr*>(&local), &localSize) != 0 || local.sin_family != AF_INET) continue;
+      if (::getsockname(fd, reinterpret_cast<sockaddr*>(&local), &localSize) != 0) continue;
+      if (local.sin_family != AF_INET) continue;
       if (::getpeername(fd, reinterpret_cast<sockaddr*>(&peer), &peerSize) != 0) continue;
-      if (ntohs(local.sin_port) != port || ntohs(peer.sin_port) != req.remote_port) continue;
-      linger abortive{1, 0};
-      ::setsockopt(fd, SOL_SOCKET, SO_LINGER, &abortive, sizeof abortive);
-      return;
+      if (ntohs(local.sin_port) == port && ntohs(peer.sin_port) == req.remote_port) return fd;
     }
+    return -1;
+  }
+
+  // Disconnecting a connected TCP socket (connect to AF_UNSPEC) resets it: the peer gets a RST at
+  // once, and httplib's own later writes and close on the descriptor stay harmless.
+  void resetConnection(const httplib::Request& req) const {
+    const int fd = socketOf(req);
+    if (fd < 0) return;
+    sockaddr unspecified{};
+    unspecified.sa_family = AF_UNSPEC;
+    ::connect(fd, &unspecified, sizeof unspecified);
   }
 
   void record(const httplib::Request& req) {
@@ -134,11 +149,14 @@ struct DevServer::Impl {
       record(req);
       const auto fault = takeFault(req.path);
       if (fault && fault->delayMs > 0) std::this_thread::sleep_for(std::chrono::milliseconds(fault->delayMs));
-      if (fault && fault->hang) hangUntilStopped();
+      if (fault && fault->hang) {
+        hangUntilAbandoned(req);
+        res.set_content_provider(1024, "application/json", [](size_t, size_t, httplib::DataSink&) { return false; });
+        return;
+      }
       if (fault && fault->reset) {
         resetConnection(req);
-        res.set_content_provider(
-            1024, "application/json", [](size_t, size_t, httplib::DataSink&) { return false; });
+        res.set_header("Connection", "close");
         return;
       }
       if (fault && fault->drop) {
@@ -146,6 +164,9 @@ struct DevServer::Impl {
         res.set_content_provider(
             1024, "application/json", [](size_t, size_t, httplib::DataSink&) { return false; });
         return;
+      }
+      if (fault) {
+        for (const auto& [name, value] : fault->headers) res.set_header(name, value);
       }
       if (fault && fault->body) {
         res.status = fault->status != 0 ? fault->status : 200;
@@ -226,7 +247,8 @@ struct DevServer::Impl {
     std::size_t matched = 0;
     for (const auto& line : corpus) {
       if (needle.empty() || lowercase(line).rfind(needle, 0) != 0) continue;
-      if (++matched > 5 && results.size() < 20) results.push_back({{"title", line}, {"url", base() + "/card?id=" + percentEncode(line)}});
+      if (++matched <= 5 || results.size() >= 20) continue;
+      results.push_back({{"title", line}, {"url", base() + "/card?id=" + percentEncode(line)}});
     }
     return json::array({{{"status", "ok"}, {"results", results}}});
   }
@@ -292,6 +314,11 @@ struct DevServer::Impl {
       fault.remaining = body.value("times", -1);
       fault.hang = body.value("hang", false);
       fault.reset = body.value("reset", false);
+      if (body.contains("headers") && body["headers"].is_object()) {
+        for (const auto& [name, value] : body["headers"].items()) {
+          if (value.is_string()) fault.headers.emplace_back(name, value.get<std::string>());
+        }
+      }
       if (body.contains("body") && body["body"].is_string()) fault.body = body["body"].get<std::string>();
       std::lock_guard guard(lock);
       faults[body["path"].get<std::string>()] = fault;
@@ -306,8 +333,9 @@ struct DevServer::Impl {
                  if (req.has_param("ltype")) return replyJSON(res, lookup(req));
                  replyJSON(res, search(req));
                }));
-    server.Get("/more",
-               served_([this](const httplib::Request& req, httplib::Response& res) { replyJSON(res, moreResults(req)); }));
+    server.Get("/more", served_([this](const httplib::Request& req, httplib::Response& res) {
+                 replyJSON(res, moreResults(req));
+               }));
     server.Get("/card",
                served_([this](const httplib::Request& req, httplib::Response& res) { replyJSON(res, card(req)); }));
     server.Get("/flight", served_([this](const httplib::Request& req, httplib::Response& res) { flight(req, res); }));

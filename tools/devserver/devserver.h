@@ -9,8 +9,9 @@
 //   POST /_faults    {"path": "/search", "delay_ms": 500, "status": 500, "drop": true, "times": 2}
 //                    applies to requests of that path; "times" limits how many (absent: all);
 //                    "body": "[1]" answers that text (with "status", default 200) instead;
-//                    "hang": true never answers (until stop()); "reset": true resets the
-//                    connection (TCP RST) after the response head
+//                    "hang": true never answers (until the client gives up or stop());
+//                    "reset": true resets the connection (TCP RST) instead of answering;
+//                    "headers": {"Name": "value"} adds header fields to the answer
 //
 // Threading: start() and stop() from one thread; the server answers on its own threads.
 #pragma once

@@ -1,0 +1,314 @@
+// The other query kinds and warming against the development server, including a back end that
+// hangs, resets the connection or answers garbage.
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <functional>
+#include <thread>
+
+#include "core/diagnostics.h"
+#include "platform/counters.h"
+#include "core/names.h"
+#include "query/query_fixture.h"
+
+namespace tavix::query_testing {
+namespace {
+
+using QueriesTest = QueryFixture;
+
+// Sends one query of each kind; `path` is the devserver path that kind reaches.
+struct Kind {
+  const char* name;
+  const char* path;
+  std::function<void(ClientState&, std::uint64_t, TVXReplyBlock)> send;
+};
+
+std::vector<Kind> allKinds() {
+  auto make = [](auto request, std::uint64_t id, const std::string& text) {
+    request->queryId = id;
+    request->queryString = text;
+    request->triggerEvent = 1;
+    return request;
+  };
+  return {
+      {"search", "/search",
+       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
+         s.search(make(std::make_shared<TVXSearchRequest>(), id, "camera" + std::to_string(id)), std::move(r));
+       }},
+      {"zero-keyword", "/search",
+       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
+         s.zeroKeyword(make(std::make_shared<TVXZeroKeywordRequest>(), id, ""), std::move(r));
+       }},
+      {"more results", "/more",
+       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
+         s.moreResults(make(std::make_shared<TVXMoreResultsRequest>(), id, "ca"), std::move(r));
+       }},
+      {"card", "/card",
+       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
+         s.card(make(std::make_shared<TVXCardRequest>(), id, ""), std::move(r));
+       }},
+      {"look-up", "/search",
+       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
+         s.lookup(make(std::make_shared<TVXLookupRequest>(), id, "serendipity"), std::move(r));
+       }},
+      {"flight", "/flight",
+       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
+         auto f = make(std::make_shared<TVXFlightSearchRequest>(), id, "");
+         f->flightQuery = "UA 123";
+         s.flightSearch(f, std::move(r));
+       }},
+  };
+}
+
+TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
+  // Short timeouts so that a hanging back end ends quickly: 0.4 s without progress per attempt,
+  // and for look-ups and flights a deadline of 1.0 - 0.5 s.
+  serveBag(bagWith({{"request_timeout_s", 0.4}, {"search_render_timeout_ms", 1000}}));
+  auto state = make("com.norvel.seekara", "Seekara/1.0");
+  const auto kinds = allKinds();
+
+  struct Outcome {
+    std::string what;
+    std::shared_ptr<Replies> replies = std::make_shared<Replies>();
+  };
+  std::vector<Outcome> outcomes;
+  std::uint64_t id = 100;
+  auto sendAll = [&](const std::string& backEnd) {
+    for (const auto& kind : kinds) {
+      outcomes.push_back({backEnd + " " + kind.name});
+      kind.send(*state, ++id, outcomes.back().replies->block());
+    }
+  };
+  auto waitAll = [&] {
+    for (auto& outcome : outcomes) outcome.replies->first(15000);
+  };
+  auto onEveryPath = [&](platform::Dictionary settings) {
+    for (const char* path : {"/search", "/more", "/card", "/flight"}) fault(path, settings);
+  };
+
+  sendAll("healthy");
+  waitAll();
+  for (std::size_t i = 0; i < kinds.size(); ++i) {
+    const auto call = outcomes[i].replies->first();
+    EXPECT_TRUE(call.reply && !call.error) << outcomes[i].what;
+    if (call.reply) EXPECT_FALSE(call.reply->data.empty()) << outcomes[i].what;
+  }
+
+  onEveryPath({{"hang", true}});
+  sendAll("hanging");
+  waitAll();
+  onEveryPath({{"reset", true}});
+  sendAll("resetting");
+  waitAll();
+  onEveryPath({{"body", "\x01garbage\xff"}});
+  sendAll("garbage");
+  waitAll();
+
+  for (std::size_t i = kinds.size(); i < outcomes.size(); ++i) {
+    const auto call = outcomes[i].replies->first(0);
+    const bool garbage = outcomes[i].what.rfind("garbage", 0) == 0;
+    // Garbage still reaches the search-like kinds, with the parse error; a flight body is not
+    // JSON anyway. Everything else is an error.
+    EXPECT_TRUE(call.error || (garbage && outcomes[i].what == "garbage flight")) << outcomes[i].what;
+    if (outcomes[i].what.rfind("hanging", 0) == 0 && call.error) {
+      EXPECT_EQ(call.error->code, platform::http::URLErrorTimedOut) << outcomes[i].what;
+    }
+    if (outcomes[i].what.rfind("resetting", 0) == 0 && call.error) {
+      EXPECT_EQ(call.error->domain, platform::http::kURLErrorDomain) << outcomes[i].what;
+    }
+  }
+  // Nothing comes twice, even late.
+  std::this_thread::sleep_for(std::chrono::milliseconds(300));
+  for (auto& outcome : outcomes) EXPECT_EQ(outcome.replies->count(), 1u) << outcome.what;
+
+  // Every request left a start record and either an end record or an error and end record.
+  auto starts = recordsOfType(*state, 14, outcomes.size());
+  EXPECT_EQ(starts.size(), outcomes.size());
+  auto ends = recordsOfType(*state, 15, outcomes.size());
+  EXPECT_EQ(ends.size(), outcomes.size());
+}
+
+TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAList) {
+  serveBag(bagWith({{"more_results_url", server.baseURL() + "/more?q=camera%20bag"}}));
+  auto state = make("com.norvel.seekara", "Seekara/1.0");
+  const std::string noConnection = createCounterKey("seekara", "fedapicall.noconnection");
+  const auto before = TavixDiagnosticDataReporter::store().value(noConnection);
+
+  // A transport failure is retried three times, then counted against the client. (First, while
+  // the query session holds no connection that curl would retry on its own.)
+  fault("/more", {{"reset", true}, {"times", 4}});
+  auto more = std::make_shared<TVXMoreResultsRequest>();
+  more->queryId = 43;
+  Replies lost;
+  state->moreResults(more, lost.block());
+  EXPECT_TRUE(lost.first().error);
+  EXPECT_EQ(received("/more").size(), 4u);
+  EXPECT_TRUE(testing::waitFor(
+      [&] { return TavixDiagnosticDataReporter::store().value(noConnection) == before + 1; }, 5000));
+  EXPECT_EQ(recordsOfType(*state, 18).size(), 1u);
+
+  auto card = std::make_shared<TVXCardRequest>();
+  card->queryId = 40;
+  card->triggerEvent = 14;
+  Replies good;
+  state->card(card, good.block());
+  auto call = good.first();
+  ASSERT_TRUE(call.reply);
+  EXPECT_EQ(call.reply->data.front(), '[');
+  // The more-results record takes its input from the "q" of the URL the bag gives.
+  auto starts = recordsOfType(*state, 14, 2);
+  ASSERT_EQ(starts.size(), 2u);
+  EXPECT_EQ(starts[0].payload().network_search_start().input(), "camera bag");
+  EXPECT_EQ(starts[0].payload().network_search_start().endpoint_type(), 6);
+  EXPECT_EQ(starts[1].payload().network_search_start().endpoint_type(), 11);
+  EXPECT_EQ(starts[1].payload().network_search_start().trigger_event(), 14);
+  EXPECT_EQ(starts[1].payload().network_search_start().input(), "");
+
+  fault("/card", {{"status", 204}, {"body", ""}, {"times", 1}});
+  Replies empty;
+  card->queryId = 41;
+  state->card(card, empty.block());
+  call = empty.first();
+  EXPECT_FALSE(call.reply);
+  ASSERT_TRUE(call.error);
+  // A failure without a transport error: an empty error record and the end record with the
+  // status, but the connection is not counted as lost. No retry for an HTTP status.
+  auto errors = recordsOfType(*state, 18, 2);
+  ASSERT_EQ(errors.size(), 2u);
+  EXPECT_EQ(errors[1].query_id(), 41);
+  EXPECT_EQ(errors[1].payload().error().code(), 0);
+  auto ends = recordsOfType(*state, 15, 3);
+  ASSERT_EQ(ends.size(), 3u);
+  EXPECT_EQ(ends[1].payload().network_search_end().status_code(), 200);
+  EXPECT_EQ(ends[2].payload().network_search_end().status_code(), 204);
+  EXPECT_EQ(TavixDiagnosticDataReporter::store().value(noConnection), before + 1);
+  EXPECT_EQ(received("/card").size(), 2u);
+
+  // More results: an object where a list belongs is a failure.
+  fault("/more", {{"body", "{\"results\": []}"}, {"times", 1}});
+  more->queryId = 42;
+  Replies notAList;
+  state->moreResults(more, notAList.block());
+  EXPECT_TRUE(notAList.first().error);
+  EXPECT_EQ(recordsOfType(*state, 18, 3).size(), 3u);
+  EXPECT_EQ(received("/more").size(), 5u);
+}
+
+TEST_F(QueriesTest, LookupsAndZeroKeywordRecordWhatTheyAskedFor) {
+  serveBag(bagWith());
+  auto state = make("com.norvel.lookup", "Lookup/1.0");
+  auto lookup = std::make_shared<TVXLookupRequest>();
+  lookup->queryId = 50;
+  lookup->queryString = "serendipity";
+  lookup->lookupSelectionType = TVXLookupSelectionTypeExplicit;
+  Replies replies;
+  state->lookup(lookup, replies.block());
+  auto call = replies.first();
+  ASSERT_TRUE(call.reply);
+  EXPECT_NE(call.reply->data.find("The meaning of serendipity"), std::string::npos);
+  auto zkw = std::make_shared<TVXZeroKeywordRequest>();
+  zkw->queryId = 51;
+  zkw->triggerEvent = 9;
+  Replies suggestions;
+  state->zeroKeyword(zkw, suggestions.block());
+  call = suggestions.first();
+  ASSERT_TRUE(call.reply);
+  EXPECT_NE(call.reply->data.find("\"zkw\""), std::string::npos);
+
+  auto starts = recordsOfType(*state, 14, 2);
+  ASSERT_EQ(starts.size(), 2u);
+  EXPECT_EQ(starts[0].payload().network_search_start().input(), "serendipity");
+  EXPECT_EQ(starts[0].payload().network_search_start().trigger_event(), 11);
+  EXPECT_EQ(starts[0].payload().network_search_start().endpoint_type(), 6);
+  EXPECT_EQ(starts[1].payload().network_search_start().input(), "");
+  EXPECT_EQ(starts[1].payload().network_search_start().trigger_event(), 9);
+  const auto sent = received("/search");
+  ASSERT_EQ(sent.size(), 2u);
+  EXPECT_EQ(sent[0].at("ltype"), platform::PropertyValue("explicit"));
+  EXPECT_EQ(sent[1].at("qtype"), platform::PropertyValue("zkw"));
+}
+
+TEST_F(QueriesTest, FlightDebugDataAnswersFromTheLocalFileWithoutTheNetwork) {
+  serveBag(bagWith());
+  const auto file = home.cache() / "flights.json";
+  std::ofstream(file) << R"([{"carrier_code": "UA", "flight_number": "123", "status": "landed"},
+                             {"carrier_code": "LH", "flight_number": 400, "status": "boarding"}])";
+  defaults->setObject("TVXFlightUseDebugData", true);
+  defaults->setObject("TVXFlightDebugDataLocation", "file://" + file.string());
+  auto state = make("com.norvel.flightinfo", "FlightInfo/1.0");
+  auto flight = std::make_shared<TVXFlightSearchRequest>();
+  flight->queryId = 60;
+  flight->flightQuery = "lh 400";
+  Replies found;
+  state->flightSearch(flight, found.block());
+  auto call = found.first();
+  ASSERT_TRUE(call.reply);
+  EXPECT_NE(call.reply->data.find("boarding"), std::string::npos);
+  EXPECT_EQ(call.reply->data.find("landed"), std::string::npos);
+
+  defaults->setObject("TVXFlightDebugDataLocation", "file://" + (home.cache() / "missing.json").string());
+  Replies missing;
+  state->flightSearch(flight, missing.block());
+  EXPECT_TRUE(missing.first().error);
+  EXPECT_TRUE(received("/flight").empty());
+}
+
+// Timers and deadlines on a clock the test moves.
+class VirtualTimeTest : public QueryFixture {
+ protected:
+  VirtualTimeTest() : QueryFixture(&virtualClock) {}
+  platform::VirtualClock virtualClock;
+};
+
+TEST_F(VirtualTimeTest, ALookupIsRetriedOnlyUntilItsRenderDeadline) {
+  // searchRenderTimeout 2000 ms: the deadline is 1.5 s after the request goes out.
+  serveBag(bagWith({{"search_render_timeout_ms", 2000}}));
+  auto state = make("com.norvel.lookup", "Lookup/1.0");
+  fault("/search", {{"delay_ms", 300}, {"reset", true}});
+  auto lookup = std::make_shared<TVXLookupRequest>();
+  lookup->queryString = "serendipity";
+
+  // Before the deadline every reset is retried: the first attempt and three retries.
+  Replies inTime;
+  lookup->queryId = 70;
+  state->lookup(lookup, inTime.block());
+  virtualClock.advance(platform::seconds(1.4));
+  EXPECT_TRUE(inTime.first().error);
+  EXPECT_EQ(received("/search").size(), 4u);
+
+  // Past it, the first failure is the last.
+  Replies late;
+  lookup->queryId = 71;
+  state->lookup(lookup, late.block());
+  virtualClock.advance(platform::seconds(1.6));
+  EXPECT_TRUE(late.first().error);
+  EXPECT_EQ(received("/search").size(), 5u);
+}
+
+TEST_F(VirtualTimeTest, TwoWarmsWithin30SecondsSendOneRequest) {
+  serveBag(bagWith());
+  auto state = make("com.norvel.seekara", "Seekara/1.0");
+  state->warm();
+  state->warm();
+  auto ends = recordsOfType(*state, 15);
+  ASSERT_EQ(ends.size(), 1u);
+  EXPECT_EQ(ends[0].payload().network_search_end().status_code(), 204);
+  EXPECT_EQ(ends[0].payload().network_search_end().endpoint_type(), 12);
+  auto starts = recordsOfType(*state, 14);
+  ASSERT_EQ(starts.size(), 1u);
+  EXPECT_EQ(starts[0].query_id(), 0);
+  EXPECT_EQ(starts[0].payload().network_search_start().trigger_event(), 19);
+  EXPECT_EQ(starts[0].payload().network_search_start().input(), "");
+  EXPECT_EQ(starts[0].payload().network_search_start().uuid(), ends[0].payload().network_search_end().uuid());
+  EXPECT_EQ(received("/warm").size(), 1u);
+
+  virtualClock.advance(platform::seconds(29));
+  state->warm();
+  virtualClock.advance(platform::seconds(2));
+  state->warm();
+  EXPECT_EQ(recordsOfType(*state, 15, 2).size(), 2u);
+  EXPECT_EQ(received("/warm").size(), 2u);
+}
+
+}  // namespace
+}  // namespace tavix::query_testing

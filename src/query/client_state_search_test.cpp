@@ -1,0 +1,235 @@
+// The search path against the development server: what reaches the network, what the client gets
+// back and what the client's feedback session records.
+#include <gtest/gtest.h>
+
+#include "cache/engaged_completion_cache.h"
+#include "core/diagnostics.h"
+#include "platform/counters.h"
+#include "core/names.h"
+#include "feedback/vocabulary.h"
+#include "query/query_fixture.h"
+
+namespace tavix::query_testing {
+namespace {
+
+using SearchTest = QueryFixture;
+
+TEST_F(SearchTest, WithoutABagInTimeTheQueryFailsFastAndRecordsWhy) {
+  // The bag is slow to come: the query gives up after the first-launch wait.
+  fault("/bag", {{"delay_ms", 1500}});
+  assembly.bagController = TavixBagController::create(assembly);
+  auto waiting = make("com.norvel.seekara", "Seekara/1.0");
+  Replies timedOut;
+  waiting->search(request<TVXSearchRequest>(7, "weather"), timedOut.block());
+  auto call = timedOut.first();
+  EXPECT_EQ(call.queryId, 7u);
+  EXPECT_FALSE(call.reply);
+  ASSERT_TRUE(call.error);
+  EXPECT_EQ(call.error->domain, kTVXErrorDomain);
+  EXPECT_EQ(call.error->code, 1);
+  EXPECT_EQ(call.error->reason, "timeout");
+  auto skipped = recordsOfType(*waiting, 38);
+  ASSERT_EQ(skipped.size(), 1u);
+  EXPECT_EQ(skipped[0].payload().skip_tavix_search().reason(), 3);
+  EXPECT_EQ(skipped[0].payload().skip_tavix_search().input(), "weather");
+  EXPECT_EQ(skipped[0].query_id(), 7);
+  EXPECT_EQ(skipped[0].user_agent(), "Seekara/1.0");
+  EXPECT_TRUE(received("/search").empty());
+}
+
+TEST_F(SearchTest, ADisabledBagAnswersWithNothingAndSendsNothing) {
+  serveBag(bagWith({{"enabled", false}}));
+  auto disabled = make("com.norvel.brovane", "Brovane/1.0");
+  Replies none;
+  disabled->search(request<TVXSearchRequest>(8, "weather"), none.block());
+  auto call = none.first();
+  EXPECT_FALSE(call.reply);
+  EXPECT_FALSE(call.error);
+  Replies zkwNone;
+  disabled->zeroKeyword(request<TVXZeroKeywordRequest>(9, "ignored"), zkwNone.block());
+  EXPECT_FALSE(zkwNone.first().error);
+  auto skipped = recordsOfType(*disabled, 38, 2);
+  ASSERT_EQ(skipped.size(), 2u);
+  EXPECT_EQ(skipped[0].payload().skip_tavix_search().reason(), 2);
+  EXPECT_EQ(skipped[0].payload().skip_tavix_search().input(), "weather");
+  EXPECT_EQ(skipped[1].payload().skip_tavix_search().reason(), 2);
+  EXPECT_EQ(skipped[1].payload().skip_tavix_search().input(), "");
+  EXPECT_TRUE(received("/search").empty());
+  EXPECT_EQ(none.count(), 1u);
+}
+
+TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
+  serveBag(bagWith({{"min_query_length", 3},
+                    {"smart_history_enabled", true},
+                    {"smart_history_min_query_length", 2},
+                    {"smart_history_timeout_ms", 3000}}));
+  auto seekara = make("com.norvel.seekara", "Seekara/1.0");
+  Replies skipped;
+  seekara->search(request<TVXSearchRequest>(1, "zq"), skipped.block());
+  auto call = skipped.first();
+  EXPECT_FALSE(call.reply);
+  EXPECT_FALSE(call.error);
+  auto skips = recordsOfType(*seekara, 38);
+  ASSERT_EQ(skips.size(), 1u);
+  EXPECT_EQ(skips[0].payload().skip_tavix_search().reason(), 1);
+  EXPECT_EQ(skips[0].payload().skip_tavix_search().input(), "zq");
+  EXPECT_TRUE(received("/search").empty());
+
+  // Engaged completions for "zq": the browser gets one and no more, kept for the keystroke;
+  // with it the short input goes to the network after all.
+  auto engaged = EngagedCompletionCache::sharedInstance(assembly);
+  for (const char* completion : {"zqalpha", "zqbeta", "zqgamma", "zqdelta"}) {
+    engaged->addCompletion(completion, "zq", 0, 1);
+    engaged->addCompletion(completion, "zq", 0, 2);
+  }
+  auto brovane = make("com.norvel.brovane", "Brovane/1.0");
+  Replies one;
+  brovane->search(request<TVXSearchRequest>(2, "zq"), one.block());
+  call = one.first();
+  ASSERT_TRUE(call.reply);
+  EXPECT_TRUE(call.reply->localSuggestions.empty());
+  EXPECT_EQ(brovane->completionCacheSuggestions().size(), 1u);
+  EXPECT_EQ(received("/search").size(), 1u);
+  auto localStart = recordsOfType(*brovane, 16);
+  ASSERT_EQ(localStart.size(), 1u);
+  EXPECT_EQ(localStart[0].payload().local_search_start().input(), "zq");
+  EXPECT_EQ(localStart[0].payload().local_search_start().trigger_event(), 1);
+
+  // The search screen asks for three on a suggestion keystroke (21): the first is kept, the
+  // other two go to the client; a plain keystroke looks for none.
+  Replies three;
+  seekara->search(request<TVXSearchRequest>(3, "zq", 21), three.block());
+  call = three.first();
+  ASSERT_TRUE(call.reply);
+  EXPECT_EQ(call.reply->localSuggestions.size(), 2u);
+  EXPECT_EQ(seekara->completionCacheSuggestions().size(), 1u);
+  // One character short of the smart-history minimum: still looked for, marked as such.
+  Replies shorter;
+  seekara->search(request<TVXSearchRequest>(4, "z", 21), shorter.block());
+  shorter.first();
+  localStart = recordsOfType(*seekara, 16, 2);
+  ASSERT_EQ(localStart.size(), 2u);
+  EXPECT_EQ(localStart[1].payload().local_search_start().trigger_event(), 19);
+}
+
+TEST_F(SearchTest, TheSameKeystrokeTwiceIsServedFromTheQueryCache) {
+  serveBag(bagWith());
+  auto state = make("com.norvel.seekara", "Seekara/1.0");
+  const auto hitsBefore = TavixDiagnosticDataReporter::store().value(createCounterKey("seekara", "ondevicecachehits"));
+  const auto okBefore = TavixDiagnosticDataReporter::store().value(
+      createCounterKey("Seekara/1.0", "fedapicall.serverstatus") + "200");
+
+  Replies first;
+  state->search(request<TVXSearchRequest>(10, "cam"), first.block());
+  auto call = first.first();
+  ASSERT_TRUE(call.reply);
+  EXPECT_FALSE(call.error);
+  EXPECT_NE(call.reply->data.find("\"status\":\"ok\""), std::string::npos);
+  // The end record carries the server's own account of the request and the transport's timing.
+  auto ends = recordsOfType(*state, 15);
+  auto starts = recordsOfType(*state, 14);
+  ASSERT_EQ(starts.size(), 1u);
+  ASSERT_EQ(ends.size(), 1u);
+  const auto& start = starts[0].payload().network_search_start();
+  const auto& end = ends[0].payload().network_search_end();
+  EXPECT_EQ(start.input(), "cam");
+  EXPECT_EQ(start.endpoint_type(), 6);
+  EXPECT_NE(start.url().find("/search?"), std::string::npos);
+  EXPECT_FALSE(start.uuid().empty());
+  EXPECT_EQ(end.uuid(), start.uuid());
+  EXPECT_EQ(end.status_code(), 200);
+  EXPECT_EQ(end.response_size(), call.reply->data.size());
+  EXPECT_EQ(end.tavix_status(), "ok");
+  EXPECT_EQ(end.tavix_partial_client_ip(), "127.0.0");
+  EXPECT_GT(end.network_timing_data().at("total"), 0.0);
+  EXPECT_EQ(end.peer_address(), "127.0.0.1");
+  EXPECT_EQ(ends[0].query_id(), 10);
+
+  Replies second;
+  state->search(request<TVXSearchRequest>(11, "cam"), second.block());
+  auto cached = second.first();
+  ASSERT_TRUE(cached.reply);
+  EXPECT_EQ(cached.reply->data, call.reply->data);
+  EXPECT_EQ(received("/search").size(), 1u);
+  auto hits = recordsOfType(*state, 39);
+  ASSERT_EQ(hits.size(), 1u);
+  EXPECT_EQ(hits[0].payload().cache_hit().reason(), 4);
+  EXPECT_EQ(hits[0].payload().cache_hit().input(), "cam");
+  EXPECT_EQ(hits[0].payload().cache_hit().uuid(), "uuid-11");
+  EXPECT_EQ(TavixDiagnosticDataReporter::store().value(createCounterKey("seekara", "ondevicecachehits")),
+            hitsBefore + 1);
+  EXPECT_EQ(TavixDiagnosticDataReporter::store().value(createCounterKey("Seekara/1.0", "fedapicall.serverstatus") +
+                                                       "200"),
+            okBefore + 1);
+}
+
+TEST_F(SearchTest, ABodyThatIsNotJsonReachesTheClientWithTheParseErrorAndIsNotCached) {
+  serveBag(bagWith());
+  auto state = make("com.norvel.seekara", "Seekara/1.0");
+  fault("/search", {{"body", "<html>busy</html>"}, {"times", 1}});
+  Replies garbled;
+  state->search(request<TVXSearchRequest>(20, "camera"), garbled.block());
+  auto call = garbled.first();
+  ASSERT_TRUE(call.reply);
+  EXPECT_EQ(call.reply->data, "<html>busy</html>");
+  ASSERT_TRUE(call.error);
+  EXPECT_EQ(call.error->domain, kTVXJSONErrorDomain);
+  // Still a finished network search, not a failure.
+  EXPECT_EQ(recordsOfType(*state, 15).size(), 1u);
+  EXPECT_TRUE(recordsOfType(*state, 18, 0).empty());
+
+  Replies again;
+  state->search(request<TVXSearchRequest>(21, "camera"), again.block());
+  call = again.first();
+  ASSERT_TRUE(call.reply);
+  EXPECT_FALSE(call.error);
+  EXPECT_EQ(received("/search").size(), 2u);
+  EXPECT_TRUE(recordsOfType(*state, 39, 0).empty());
+}
+
+TEST_F(SearchTest, MessagesReturnKeyRecordsAGoToSearchAndVerboseRepliesCarryTheExchange) {
+  serveBag(bagWith());
+  auto state = make("com.norvel.messages", "Messages/2.0");
+  auto typed = request<TVXSearchRequest>(30, "camera", 23);
+  typed->verboseReply = true;
+  Replies replies;
+  state->search(typed, replies.block());
+  auto call = replies.first();
+  ASSERT_TRUE(call.reply);
+  ASSERT_TRUE(call.reply->httpRequest);
+  ASSERT_TRUE(call.reply->httpResponse);
+  EXPECT_EQ(call.reply->httpResponse->statusCode, 200);
+  EXPECT_NE(call.reply->httpRequest->url.find("q=camera"), std::string::npos);
+  auto went = recordsOfType(*state, 29);
+  ASSERT_EQ(went.size(), 1u);
+  EXPECT_EQ(went[0].payload().did_go_to_search().input(), "camera");
+  EXPECT_EQ(went[0].payload().did_go_to_search().endpoint_type(), 6);
+}
+
+TEST_F(SearchTest, TheServerCanAskForANewerBagAndTheBagCanRouteThroughItsProxy) {
+  devserver::DevServer proxy;
+  ASSERT_TRUE(proxy.start({}, nullptr));
+  serveBag(bagWith({{"marvola_configuration",
+                     platform::Dictionary{{"enabled", true}, {"proxy", proxy.baseURL()}}}}));
+  auto state = make("com.norvel.seekara", "Seekara/1.0");
+
+  // With the proxy feature off, requests go straight to the server, which asks for bag 2.
+  defaults->setObject("TVXUseMarvola", false);
+  fault("/search", {{"headers", platform::Dictionary{{"X-Norvel-ForceFetch", "{\"bag\": 2}"}}}, {"times", 1}});
+  Replies direct;
+  state->search(request<TVXSearchRequest>(40, "camera"), direct.block());
+  EXPECT_TRUE(direct.first().reply);
+  EXPECT_EQ(received("/search").size(), 1u);
+  EXPECT_TRUE(testing::waitFor([&] { return received("/bag").size() == 2; }, 5000));
+
+  // With it on, the request goes to the bag's proxy, which is asked for the absolute URL.
+  defaults->setObject("TVXUseMarvola", true);
+  Replies proxied;
+  state->search(request<TVXSearchRequest>(41, "lens"), proxied.block());
+  proxied.first();
+  EXPECT_EQ(received("/search").size(), 1u);
+  EXPECT_EQ(received(server.baseURL() + "/search", &proxy).size(), 1u);
+}
+
+}  // namespace
+}  // namespace tavix::query_testing
