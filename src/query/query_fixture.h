@@ -101,6 +101,7 @@ class QueryFixture : public ::testing::Test {
     const std::string b = server.baseURL();
     platform::Dictionary bag{{"version", "1"},
                              {"enabled", true},
+                             {"feedback_enabled", true},
                              {"search_url", b + "/search"},
                              {"more_results_url", b + "/more"},
                              {"card_url", b + "/card"},
