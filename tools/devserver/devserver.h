@@ -7,6 +7,10 @@
 //   POST /_faults    {"path": "/search", "delay_ms": 500, "status": 500, "drop": true, "times": 2}
 //                    applies to requests of that path; "times" limits how many (absent: all);
 //                    "body": "[1]" answers that text (with "status", default 200) instead
+//   GET  /_feedback  JSON list of the feedback uploads accepted by POST /feedback and
+//                    POST /crowdsourcing: {"path","type","v","digest","compressed_size","size",
+//                    "json" (or "text" when the body is not JSON)}; also kept in feedback.jsonl
+//                    of the data dir. Uploads with a wrong digest or a corrupt body get 400.
 //
 // Threading: start() and stop() from one thread; the server answers on its own threads.
 #pragma once
