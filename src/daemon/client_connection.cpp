@@ -3,6 +3,7 @@
 #include "core/assembly.h"
 #include "core/logging.h"
 #include "core/names.h"
+#include "delivery/flusher_ipc.h"
 #include "network/user_agent.h"
 #include "platform/activity.h"
 #include "platform/ipc/launch_events.h"
@@ -143,9 +144,24 @@ void ClientConnection::handleMessage(const std::string& payload) {
     case proto::Envelope::kFeedback:
       notAvailable(out.mutable_feedback_reply()->mutable_error());
       break;
-    case proto::Envelope::kListenToFlusher:
-      notAvailable(out.mutable_listen_to_flusher_reply()->mutable_error());
-      break;
+    case proto::Envelope::kListenToFlusher: {
+      // The tool's end of a fresh flusher channel rides with the reply.
+      auto* reply = out.mutable_listen_to_flusher_reply();
+      platform::ipc::UniqueFd endpoint;
+      if (assembly_.flusherIPCListener) endpoint = assembly_.flusherIPCListener->endpoint();
+      if (!endpoint.valid()) {
+        notAvailable(reply->mutable_error());
+        break;
+      }
+      if (callId == 0) return;
+      reply->set_has_endpoint(true);
+      out.set_attached_fds(1);
+      out.set_call_id(callId);
+      std::vector<platform::ipc::UniqueFd> fds;
+      fds.push_back(std::move(endpoint));
+      connection_->send(out.SerializeAsString(), std::move(fds));
+      return;
+    }
     case proto::Envelope::kListSessions:
       notAvailable(out.mutable_list_sessions_reply()->mutable_error());
       break;

@@ -108,7 +108,7 @@ class UploadManagerTest : public ::testing::Test {
   static std::int64_t counter(const std::string& key) { return TavixDiagnosticDataReporter::store().value(key); }
 
   testing::TempHome home;
-  platform::DispatchPool pool{2};
+  platform::DispatchPool pool;  // flushes chain synchronous hops: the default, deep enough, pool
   platform::VirtualClock clock;
   Assembly assembly;
   devserver::DevServer server;
@@ -261,6 +261,9 @@ TEST_F(UploadManagerTest, PendingUploadsSurviveARestartAndAreSentOnce) {
   session.reset();
   make();
   EXPECT_EQ(pendingTasks(), 0u);
+  manager.reset();
+  session.reset();
+  transport.reset();  // its idle connection would hold the server's stop for the keep-alive time
 }
 
 }  // namespace

@@ -93,6 +93,7 @@ ClientSessionManager::~ClientSessionManager() {
 
 void ClientSessionManager::addTavixFeedback(FeedbackRef feedback) {
   if (!feedback) return;
+  if (feedbackObserver_) feedbackObserver_(*feedback);
   auto transaction = std::make_shared<platform::TransactionTracker::Transaction>();
   if (assembly_.transactions) *transaction = assembly_.transactions->begin("addFeedback");
   // The feedbackEnabled check of the client's bag belongs here once the bag controller exists.

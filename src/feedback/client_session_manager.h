@@ -67,6 +67,11 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
 
   // Asynchronous; the whole path holds the "addFeedback" transaction.
   void addTavixFeedback(FeedbackRef feedback);
+  // Sees every event as it arrives, before any filtering, on the caller's thread (the flush
+  // command channel's live stream). Set once at start, before feedback flows.
+  void setFeedbackObserver(std::function<void(const proto::CTTavixFeedback&)> observer) {
+    feedbackObserver_ = std::move(observer);
+  }
   // Asynchronous: closes the open session with reason 2, then calls `done` (also with none open).
   void flushSession(std::function<void()> done = {});
   // A client's connection went away: with shared sessions a connection-invalidated event is added
@@ -108,6 +113,7 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   platform::TimePoint expirationTime_{};
   std::vector<platform::TimerHandle> timers_;
   platform::SerialQueue sessionQueue_;
+  std::function<void(const proto::CTTavixFeedback&)> feedbackObserver_;
 };
 
 }  // namespace tavix
