@@ -11,6 +11,7 @@
 #include "platform/files.h"
 #include "platform/property_value.h"
 #include "tavix/client.h"
+#include "flush_commands.h"
 
 namespace {
 
@@ -26,7 +27,10 @@ int usage() {
       "  defaults write [--domain D] KEY [--int|--float|--bool|--string] VALUE\n"
       "  defaults delete [--domain D] KEY\n"
       "  notify NAME                              deliver the launch event NAME to the daemon\n"
-      "  activity run NAME                        run the background activity NAME now\n"
+      "  activity run NAME                        run the background activity NAME now\n",
+      stderr);
+  std::fputs(tavix::tool::flushCommandsUsage(), stderr);
+  std::fputs(
       "\n"
       "counters and defaults work with the daemon stopped.\n",
       stderr);
@@ -144,6 +148,10 @@ int main(int argc, char** argv) {
   tavix::client::Client client(options);
   if (command == "notify" && args.size() == 1) return report(client.notifySync(args[0]));
   if (command == "activity" && args.size() == 2 && args[0] == "run") return report(client.runActivitySync(args[1]));
+  if (tavix::tool::isFlushCommand(command)) {
+    const int status = tavix::tool::runFlushCommand(client, command, args);
+    return status == 2 ? usage() : status;
+  }
   if (command == "search" || command == "bag" || command == "sessions") {
     std::fprintf(stderr, "tavix_tool: %s is not available yet\n", command.c_str());
     return 1;
