@@ -3,7 +3,9 @@
 // body and accepts it only when its digest matches).
 #include <gtest/gtest.h>
 #include <httplib.h>
+#include <signal.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
 #include <cstdio>
 #include <map>
@@ -161,6 +163,62 @@ TEST_F(DeliveryDaemon, EverySessionReachesTheServerOnceAcrossRestartsDumpsAndPer
   const auto agents = uploadsByAgent();
   EXPECT_EQ(agents, (std::map<std::string, int>{
                         {"brovane/2", 1}, {"lookup/5", 1}, {"news/3", 1}, {"seekara/1", 1}, {"vocly/4", 1}}));
+}
+
+// tavix_tool running in the background, its stdout read line by line.
+class BackgroundTool {
+ public:
+  explicit BackgroundTool(std::vector<std::string> args) {
+    int fds[2];
+    EXPECT_EQ(::pipe(fds), 0);
+    pid_ = ::fork();
+    if (pid_ == 0) {
+      ::dup2(fds[1], 1);
+      ::close(fds[0]);
+      std::vector<char*> argv{const_cast<char*>(TAVIX_TOOL_BINARY)};
+      for (auto& a : args) argv.push_back(a.data());
+      argv.push_back(nullptr);
+      ::execv(TAVIX_TOOL_BINARY, argv.data());
+      ::_exit(127);
+    }
+    ::close(fds[1]);
+    out_ = ::fdopen(fds[0], "r");
+  }
+  ~BackgroundTool() {
+    ::kill(pid_, SIGTERM);
+    ::waitpid(pid_, nullptr, 0);
+    std::fclose(out_);
+  }
+  std::string readLine() {
+    char buffer[65536];
+    return std::fgets(buffer, sizeof buffer, out_) ? std::string(buffer) : std::string();
+  }
+
+ private:
+  pid_t pid_ = -1;
+  FILE* out_ = nullptr;
+};
+
+TEST_F(DeliveryDaemon, WatchUploadsShowsEachBodyAsItIsSent) {
+  ASSERT_FALSE(server.base.empty()) << server.firstLine;
+  writeSessions(home, {"messages/7"});
+  Daemon d(home, "tavixd-watch.log");
+  BackgroundTool watcher({"watch-uploads", "--inflate"});
+  ASSERT_TRUE(d.waitForLog("new listener for flusher client sessions")) << d.log();
+
+  std::string out;
+  ASSERT_EQ(runTool("dump", &out), 0) << out << d.log();
+  // The watcher subscribed first, so the bodies go to it, inflated back to the records sent.
+  bool seen = false;
+  for (int i = 0; i < 5 && !seen; ++i) {
+    const json line = json::parse(watcher.readLine(), nullptr, false);
+    ASSERT_TRUE(line.is_object()) << d.log();
+    EXPECT_GT(line["compressed_size"].get<int>(), 0);
+    seen = line["json"]["agent"] == "messages/7";
+  }
+  EXPECT_TRUE(seen);
+  EXPECT_TRUE(waitFor([&] { return uploadsByAgent().count("messages/7") == 1; }, 10000));
+  EXPECT_EQ(d.stop(), 0);
 }
 
 }  // namespace
