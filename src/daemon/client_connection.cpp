@@ -7,6 +7,7 @@
 #include "core/logging.h"
 #include "core/names.h"
 #include "daemon/wire_records.h"
+#include "delivery/flusher_ipc.h"
 #include "feedback/client_session.h"
 #include "feedback/client_session_manager.h"
 #include "network/locale_context.h"
@@ -205,10 +206,25 @@ void ClientConnection::handleMessage(const std::string& payload) {
     case proto::Envelope::kFeedback:
       feedback(callId);
       return;
-    case proto::Envelope::kListenToFlusher:
+    case proto::Envelope::kListenToFlusher: {
       ensureState();
-      notAvailable(out.mutable_listen_to_flusher_reply()->mutable_error());
-      break;
+      // The tool's end of a fresh flusher channel rides with the reply.
+      auto* reply = out.mutable_listen_to_flusher_reply();
+      platform::ipc::UniqueFd endpoint;
+      if (assembly_.flusherIPCListener) endpoint = assembly_.flusherIPCListener->endpoint();
+      if (!endpoint.valid()) {
+        notAvailable(reply->mutable_error());
+        break;
+      }
+      if (callId == 0) return;
+      reply->set_has_endpoint(true);
+      out.set_attached_fds(1);
+      out.set_call_id(callId);
+      std::vector<platform::ipc::UniqueFd> fds;
+      fds.push_back(std::move(endpoint));
+      connection_->send(out.SerializeAsString(), std::move(fds));
+      return;
+    }
     case proto::Envelope::kListSessions: {
       ensureState();
       auto* reply = out.mutable_list_sessions_reply();

@@ -15,7 +15,13 @@
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "core/names.h"
+#include "daemon/client_connection.h"
 #include "daemon/tavix_service.h"
+#include "delivery/custom_feedback_flusher.h"
+#include "delivery/feedback_flusher.h"
+#include "delivery/flusher_ipc.h"
+#include "delivery/upload_manager.h"
+#include "feedback/client_session_manager.h"
 #include "feedback/persistent_storage.h"
 #include "network/request_factory.h"
 #include "network/tracing.h"
@@ -26,10 +32,12 @@
 #include "platform/dispatch.h"
 #include "platform/ipc/launch_events.h"
 #include "platform/ipc/server.h"
+#include "platform/ipc/unix_socket.h"
 #include "platform/json_value.h"
 #include "platform/memory_pressure.h"
 #include "platform/notification_center.h"
 #include "platform/run_loop.h"
+#include "query/client_state.h"
 #include "query/client_state_manager.h"
 #include "platform/transactions.h"
 
@@ -113,6 +121,8 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   assembly.motionManager = std::make_shared<DefaultsMotionManager>(*defaults, pool);
   assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
 
+  // Uploads left unsent by the last run resume here; endpoints come with the bag.
+  assembly.uploadManager = UploadManager::create(assembly);
   assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
 
   const auto countersFile = assembly.cachesFolder() / "counters.plist";
@@ -132,6 +142,33 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   TavixService service(assembly, &launchEvents);
   // After the service: a client state shares the service's GUID controller and session manager.
   assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
+  assembly.flusherIPCListener = TavixFlusherIPC::create(assembly, [&service, &assembly] {
+    std::vector<TavixFlusherIPC::ClientConnectionHandle> handles;
+    for (const auto& client : service.getClientConnections()) {
+      TavixFlusherIPC::ClientConnectionHandle handle;
+      // The user agent and the bound state belong to the connection's queue.
+      std::shared_ptr<ClientSessionManager> manager = assembly.clientSessionManager;
+      client->connection()->queue().sync([&] {
+        handle.userAgent = client->userAgent();
+        if (client->state() && client->state()->sessionManager()) manager = client->state()->sessionManager();
+      });
+      handle.flushSession = [manager](std::function<void()> done) {
+        if (manager) {
+          manager->flushSession(std::move(done));
+        } else if (done) {
+          done();
+        }
+      };
+      handles.push_back(std::move(handle));
+    }
+    return handles;
+  });
+  if (assembly.clientSessionManager) {
+    std::weak_ptr<TavixFlusherIPC> channel = assembly.flusherIPCListener;
+    assembly.clientSessionManager->setFeedbackObserver([channel](const proto::CTTavixFeedback& feedback) {
+      if (auto c = channel.lock()) c->sendDataToReceivingStreamListener(feedback);
+    });
+  }
 
   // Socket activation hands the listening socket over; otherwise we make our own.
   auto& connectionLog = TavixLogForCategory(TavixLoggingCategoryConnection);
@@ -162,14 +199,22 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
     }
   });
 
-  // The activities' work (the feedback flushers) plugs into these handlers.
-  for (const auto& [name, interval] : {std::pair{kFlusherActivity, kFlusherIntervalSeconds},
-                                       std::pair{kCustomFeedbackActivity, kCustomFeedbackIntervalSeconds}}) {
-    activities.checkIn(name, platform::seconds(interval), [name = std::string(name)](const auto& activity) {
-      TavixLogForCategory(TavixLoggingCategoryFlusher)
-          .debug("activity {} delivered in state {}", name, platform::activityStateName(activity->state()));
-    });
-  }
+  activities.checkIn(kFlusherActivity, platform::seconds(kFlusherIntervalSeconds), [&assembly](const auto& activity) {
+    TavixFeedbackFlusher::handlePeriodicFlushActivity(assembly, activity);
+  });
+  activities.checkIn(kCustomFeedbackActivity, platform::seconds(kCustomFeedbackIntervalSeconds),
+                     [&assembly, &log](const std::shared_ptr<platform::Activity>& activity) {
+                       if (activity->state() != platform::ActivityState::Run) return;
+                       log.debug("Flushing custom feedback.");
+                       if (!activity->setState(platform::ActivityState::Continue)) {
+                         log.fault("Couldn't transition flusher activity to continue state.");
+                       }
+                       TavixCustomFeedbackFlusher(assembly).flushCustomFeedbackWithCompletionHandler([activity, &log] {
+                         if (!activity->setState(platform::ActivityState::Done)) {
+                           log.fault("Couldn't transition flusher activity to done state.");
+                         }
+                       });
+                     });
 
   // Warm the bag: a valid disk bag is already in memory; otherwise this starts the first fetch.
   pool.post([bagController = assembly.bagController] { bagController->currentBag(); });
@@ -218,6 +263,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   runLoop.run();
 
   listener.reset();  // no new clients while shutting down
+  assembly.flusherIPCListener.reset();  // its dumps reach the service, which goes next
   housekeeping.sync([&] {
     saveCounters.stop();
     idleCheck.stop();

@@ -95,6 +95,7 @@ ClientSessionManager::~ClientSessionManager() {
 
 void ClientSessionManager::addTavixFeedback(FeedbackRef feedback) {
   if (!feedback) return;
+  if (feedbackObserver_) feedbackObserver_(*feedback);
   auto transaction = std::make_shared<platform::TransactionTracker::Transaction>();
   if (assembly_.transactions) *transaction = assembly_.transactions->begin("addFeedback");
   sessionQueue_.async([self = shared_from_this(), feedback, transaction] {

@@ -68,6 +68,11 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   // Asynchronous; the whole path holds the "addFeedback" transaction. Dropped when a bag is
   // loaded and the sender's view of it has feedback disabled.
   void addTavixFeedback(FeedbackRef feedback);
+  // Sees every event as it arrives, before any filtering, on the caller's thread (the flush
+  // command channel's live stream). Set once at start, before feedback flows.
+  void setFeedbackObserver(std::function<void(const proto::CTTavixFeedback&)> observer) {
+    feedbackObserver_ = std::move(observer);
+  }
   // Asynchronous: closes the open session with reason 2, then calls `done` (also with none open).
   void flushSession(std::function<void()> done = {});
   // A client's connection went away: with shared sessions a connection-invalidated event is added
@@ -115,6 +120,7 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   platform::TimePoint expirationTime_{};
   std::vector<platform::TimerHandle> timers_;
   platform::SerialQueue sessionQueue_;
+  std::function<void(const proto::CTTavixFeedback&)> feedbackObserver_;
 };
 
 }  // namespace tavix

@@ -1,4 +1,5 @@
 #include "devserver/devserver.h"
+#include "devserver/feedback_routes.h"
 
 #include <httplib.h>
 #include <sys/socket.h>
@@ -67,6 +68,7 @@ struct DevServer::Impl {
   int port = 0;
   Options options;
   std::vector<std::string> corpus;
+  FeedbackStore feedbackStore;  // uploads that arrived, digest checked
 
   std::mutex lock;  // guards the fields below
   json recorded = json::array();
@@ -298,6 +300,7 @@ struct DevServer::Impl {
       std::lock_guard guard(lock);
       recorded = json::array();
       faults.clear();
+      feedbackStore.reset();
       replyJSON(res, json::object());
     });
     server.Post("/_faults", [this](const httplib::Request& req, httplib::Response& res) {
@@ -342,6 +345,7 @@ struct DevServer::Impl {
     server.Get("/warm", served_([](const httplib::Request&, httplib::Response& res) { res.status = 204; }));
     server.Get(R"(/resources/([A-Za-z0-9_.-]+))",
                served_([this](const httplib::Request& req, httplib::Response& res) { resource(req, res); }));
+    addFeedbackRoutes(server, feedbackStore, [this](httplib::Server::Handler handler) { return served_(std::move(handler)); });
     auto notFound = served_([](const httplib::Request&, httplib::Response& res) {
       res.status = 404;
       replyJSON(res, {{"error", "not found"}});
@@ -373,6 +377,7 @@ bool DevServer::start(const Options& options, std::string* error) {
     std::filesystem::create_directories(options.dataDir, ec);
     if (ec) return fail("cannot create " + options.dataDir.string() + ": " + ec.message());
   }
+  impl_->feedbackStore.setDataDir(options.dataDir);
   impl_->routes();
   // Head and body go out in separate writes; without this Nagle holds the body for the client's ACK.
   impl_->server.set_tcp_nodelay(true);

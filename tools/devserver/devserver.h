@@ -12,6 +12,10 @@
 //                    "hang": true never answers (until the client gives up or stop());
 //                    "reset": true resets the connection (TCP RST) instead of answering;
 //                    "headers": {"Name": "value"} adds header fields to the answer
+//   GET  /_feedback  JSON list of the feedback uploads accepted by POST /feedback and
+//                    POST /crowdsourcing: {"path","type","v","digest","compressed_size","size",
+//                    "json" (or "text" when the body is not JSON)}; also kept in feedback.jsonl
+//                    of the data dir. Uploads with a wrong digest or a corrupt body get 400.
 //
 // Threading: start() and stop() from one thread; the server answers on its own threads.
 #pragma once

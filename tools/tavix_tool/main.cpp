@@ -13,6 +13,7 @@
 #include "platform/property_value.h"
 #include "search_commands.h"
 #include "tavix/client.h"
+#include "flush_commands.h"
 
 namespace {
 
@@ -36,7 +37,10 @@ int usage() {
       "  type [--client ID] [--agent UA] [TEXT...]\n"
       "                                           type on a terminal and see each keystroke's\n"
       "                                           suggestions; without one, type TEXT and print\n"
-      "  (no command, on a terminal)              the same as type\n"
+      "  (no command, on a terminal)              the same as type\n",
+      stderr);
+  std::fputs(tavix::tool::flushCommandsUsage(), stderr);
+  std::fputs(
       "\n"
       "counters and defaults work with the daemon stopped.\n",
       stderr);
@@ -161,5 +165,9 @@ int main(int argc, char** argv) {
   tavix::client::Client client(options);
   if (command == "notify" && args.size() == 1) return report(client.notifySync(args[0]));
   if (command == "activity" && args.size() == 2 && args[0] == "run") return report(client.runActivitySync(args[1]));
+  if (tavix::tool::isFlushCommand(command)) {
+    const int status = tavix::tool::runFlushCommand(client, command, args);
+    return status == 2 ? usage() : status;
+  }
   return usage();
 }

@@ -1,0 +1,139 @@
+#include "delivery/custom_feedback_flusher.h"
+
+#include <algorithm>
+
+#include "bag/tavix_bag_controller.h"
+#include "bag/tvx_bag.h"
+#include "core/assembly.h"
+#include "core/custom_feedback_dirs.h"
+#include "core/diagnostics.h"
+#include "core/logging.h"
+#include "core/names.h"
+#include "delivery/upload_manager.h"
+#include "feedback/client_session.h"
+#include "feedback/tavix_feedback.h"
+#include "context/user_guid_controller.h"
+#include "network/user_agent.h"
+#include "tavix_proto/feedback_records.pb.h"
+
+namespace tavix {
+
+namespace {
+
+platform::Logger& flusherLog() { return TavixLogForCategory(TavixLoggingCategoryFlusher); }
+
+// An oversize item is reported as a session of its own whose only event is the error.
+void reportOversizeItem(Assembly& assembly, std::uint64_t size, const std::string& type) {
+  proto::CTErrorFeedback error;
+  error.set_code(4);
+  error.set_domain(kTVXErrorDomain);
+  // The record has no user-info dictionary; its two entries travel in the reason.
+  error.set_reason("size=" + std::to_string(size) + " type=" + type);
+  const std::string guid = assembly.guidController ? assembly.guidController->currentUserGUID() : std::string();
+  auto session = ClientSession::open(assembly, makeTavixFeedbackWithCodable(error, 0, guid, tavixdUserAgent()));
+  if (session) session->sessionComplete();
+}
+
+}  // namespace
+
+std::vector<platform::fs::path> CrowdsourcingReportStore::reportsNotYetSubmitted() const {
+  return TavixCustomFeedbackFlusher::reportsInDirectory(folder_);
+}
+
+void CrowdsourcingReportStore::retireReports(const std::vector<platform::fs::path>& reports) {
+  for (const auto& report : reports) {
+    std::error_code ec;
+    platform::fs::remove(report, ec);
+  }
+}
+
+const std::vector<std::string>& customFeedbackTypesInFlushOrder() {
+  static const std::vector<std::string> types = {
+      std::string(kTVXSeekaraResultFeaturesDir), std::string(kTVXBrovaneAutoFillDir),
+      std::string(kTVXBrovaneAutoPlayDir),       std::string(kTVXQuilletDir),
+      std::string(kTVXProactiveEventTrackerDir), std::string(kTVXEngagedCompletionDir),
+  };
+  return types;
+}
+
+TavixCustomFeedbackFlusher::TavixCustomFeedbackFlusher(Assembly& assembly, std::shared_ptr<CrowdsourcingReportStore> reports)
+    : assembly_(assembly), mgr_(std::move(reports)) {
+  if (!mgr_) mgr_ = std::make_shared<CrowdsourcingReportStore>(assembly.cachesFolder() / "CrowdsourcingReports");
+}
+
+std::vector<platform::fs::path> TavixCustomFeedbackFlusher::reportsInDirectory(const platform::fs::path& directory) {
+  std::vector<platform::fs::path> files;
+  std::error_code ec;
+  platform::fs::directory_iterator it(directory, ec);
+  for (; !ec && it != platform::fs::directory_iterator(); it.increment(ec)) {
+    const auto& path = it->path();
+    if (path.filename().string().rfind('.', 0) == 0) continue;
+    std::error_code typeError;
+    if (it->is_regular_file(typeError)) files.push_back(path);
+  }
+  if (ec) flusherLog().info("{} {}", ec.message(), directory.string());
+  std::sort(files.begin(), files.end());
+  return files;
+}
+
+void TavixCustomFeedbackFlusher::flushCustomFeedbackWithCompletionHandler(const std::function<void()>& completion) {
+  const auto& caches = assembly_.paths.cacheHome;
+  if (auto ec = platform::createDirectory(caches, true, 0700)) {
+    flusherLog().notice("Failed to get cache directory: {}", ec.message());
+    return;
+  }
+  const auto root = assembly_.cachesFolder() / kTVXCustomFeedbackDir;
+  std::error_code ec;
+  if (root.empty() || !platform::fs::exists(root, ec)) {
+    flusherLog().info("No custom feedback found. Nothing to flush.");
+    return;
+  }
+  auto bag = assembly_.bagController ? assembly_.bagController->currentBag() : nullptr;
+  for (const auto& type : customFeedbackTypesInFlushOrder()) {
+    const auto directory = root / type;
+    // Start-up makes every folder; one missing means something else is wrong: stop here.
+    if (!platform::fs::exists(directory, ec)) return;
+    const auto items = reportsInDirectory(directory);
+    if (items.empty()) {
+      flusherLog().info("No {} custom feedback available for flushing", type);
+      continue;
+    }
+    std::int64_t limit = bag ? bag->maximumSizeForFeedbackType(type) : 0;
+    const std::uint64_t maximum = limit > 0 ? static_cast<std::uint64_t>(limit) : kDefaultCustomFeedbackLimit;
+    for (const auto& item : items) {
+      if (item.empty()) continue;
+      std::error_code sizeError;
+      const std::uint64_t size = platform::fs::file_size(item, sizeError);
+      if (sizeError) continue;
+      if (size > maximum) {
+        reportOversizeItem(assembly_, size, type);
+        TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.customfeedback." + type + ".filetoolarge");
+        flusherLog().error("Custom feedback item {} too big to process: {}", type, size);
+      } else if (assembly_.uploadManager) {
+        assembly_.uploadManager->uploadFeedback(item, type, kFeedbackEndpoint);
+      }
+    }
+    for (const auto& item : items) {
+      std::error_code removeError;
+      if (!platform::fs::remove(item, removeError) || removeError) {
+        flusherLog().notice("Failed to remove custom feedback: {}", removeError ? removeError.message() : item.string());
+      }
+    }
+  }
+  flushDPFeedback();
+  if (completion) completion();
+}
+
+void TavixCustomFeedbackFlusher::flushDPFeedback() {
+  const auto reports = mgr_->reportsNotYetSubmitted();
+  if (reports.empty()) {
+    flusherLog().info("No crowdsourcing reports available for flushing");
+    return;
+  }
+  for (const auto& report : reports) {
+    if (assembly_.uploadManager) assembly_.uploadManager->uploadFeedback(report, "", kCrowdsourcingEndpoint);
+  }
+  mgr_->retireReports(reports);
+}
+
+}  // namespace tavix

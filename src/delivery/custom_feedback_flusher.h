@@ -1,0 +1,62 @@
+// Custom feedback: files that other components leave in per-type folders under
+// "<caches>/com.norvel.tavixd/CustomFeedback", each uploaded as it is (compressed) with its type,
+// then deleted; then the crowdsourcing reports of the report store. Items larger than the bag's
+// limit for their type are not uploaded: an error session (code 4) reports them instead.
+//
+// Threading: a run executes on the caller's thread from start to end; the upload manager
+// compresses there too and enqueues background uploads.
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "platform/files.h"
+
+namespace tavix {
+
+class Assembly;
+
+// The reports waiting for the crowdsourcing endpoint: the regular files of one folder (by
+// default "<caches>/com.norvel.tavixd/CrowdsourcingReports"), in name order. Retiring a report
+// deletes it. Safe from any thread (the file system is the only state).
+class CrowdsourcingReportStore {
+ public:
+  explicit CrowdsourcingReportStore(platform::fs::path folder) : folder_(std::move(folder)) {}
+  std::vector<platform::fs::path> reportsNotYetSubmitted() const;
+  void retireReports(const std::vector<platform::fs::path>& reports);
+  const platform::fs::path& folder() const { return folder_; }
+
+ private:
+  platform::fs::path folder_;
+};
+
+// The type folders in the order they are flushed; the folder name is the upload's type.
+const std::vector<std::string>& customFeedbackTypesInFlushOrder();
+
+// Bytes a custom-feedback item may have when the bag names no limit for its type.
+inline constexpr std::uint64_t kDefaultCustomFeedbackLimit = 2097152;
+
+class TavixCustomFeedbackFlusher {
+ public:
+  // Uses the assembly's paths, bagController and uploadManager. `reports` defaults to the store
+  // in the daemon's caches folder.
+  explicit TavixCustomFeedbackFlusher(Assembly& assembly, std::shared_ptr<CrowdsourcingReportStore> reports = nullptr);
+
+  // One run. `completion` is called at the end, except when the caches or CustomFeedback folder
+  // cannot be found, or a type folder is missing: the run then stops where it is.
+  void flushCustomFeedbackWithCompletionHandler(const std::function<void()>& completion);
+
+  // The regular, non-hidden files directly in `directory`.
+  static std::vector<platform::fs::path> reportsInDirectory(const platform::fs::path& directory);
+
+  // Uploads every unsent crowdsourcing report to the crowdsourcing endpoint and retires them.
+  void flushDPFeedback();
+
+ private:
+  Assembly& assembly_;
+  std::shared_ptr<CrowdsourcingReportStore> mgr_;
+};
+
+}  // namespace tavix

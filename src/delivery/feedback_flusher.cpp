@@ -1,0 +1,151 @@
+#include "delivery/feedback_flusher.h"
+
+#include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "core/logging.h"
+#include "delivery/flusher_ipc.h"
+#include "delivery/upload_manager.h"
+#include "feedback/client_session.h"
+#include "feedback/persistent_storage.h"
+#include "platform/activity.h"
+#include "platform/defaults.h"
+#include "platform/transactions.h"
+#include "tavix_proto/feedback_session.pb.h"
+
+namespace tavix {
+
+namespace {
+
+platform::Logger& defaultLog() { return TavixLogForCategory(TavixLoggingCategoryDefault); }
+platform::Logger& flusherLog() { return TavixLogForCategory(TavixLoggingCategoryFlusher); }
+
+}  // namespace
+
+std::shared_ptr<TavixFeedbackFlusher> TavixFeedbackFlusher::create(Assembly& assembly) {
+  return std::shared_ptr<TavixFeedbackFlusher>(new TavixFeedbackFlusher(assembly));
+}
+
+TavixFeedbackFlusher::TavixFeedbackFlusher(Assembly& assembly)
+    : assembly_(assembly),
+      queueBuffer_(*assembly.dispatchPool, "com.norvel.tavixd.tavixDataBufferQueue"),
+      feedbackCountQueue_(*assembly.dispatchPool, "com.norvel.tavixd.feedbackCountQueue") {}
+
+TavixFeedbackFlusher::~TavixFeedbackFlusher() = default;
+
+void TavixFeedbackFlusher::handlePeriodicFlushActivity(Assembly& assembly,
+                                                       const std::shared_ptr<platform::Activity>& activity) {
+  if (assembly.userDefaults && assembly.userDefaults->boolForKey("TVXFeedbackFlushDisabled")) {
+    defaultLog().debug(
+        "Flusher bailing because periodic flush is disabled. Dump feedback with tavix_tool to re-enable.");
+    return;
+  }
+  defaultLog().debug("Flushing Tavix feedback.");
+  create(assembly)->performPeriodicFlushActivity(activity);
+}
+
+void TavixFeedbackFlusher::performPeriodicFlushActivity(const std::shared_ptr<platform::Activity>& activity) {
+  if (activity->state() != platform::ActivityState::Run) {
+    defaultLog().fault("Bailing on periodic flush because background activity state != RUN");
+    return;
+  }
+  if (!activity->setState(platform::ActivityState::Continue)) {
+    defaultLog().fault("Error transitioning ACTIVITY_STATE_CONTINUE");
+  }
+  forceFlushWithCompletion([activity] {
+    if (!activity->setState(platform::ActivityState::Done)) {
+      defaultLog().fault("Error transitioning ACTIVITY_STATE_DONE");
+    }
+    defaultLog().notice("All periodic flush tasks completed.");
+  });
+}
+
+void TavixFeedbackFlusher::forceFlushWithCompletion(std::function<void()> completion) {
+  auto transaction = std::make_shared<platform::TransactionTracker::Transaction>();
+  if (assembly_.transactions) *transaction = assembly_.transactions->begin("com.norvel.tavixd.feedbackFlusherTx");
+  // One queue per run: files are read and deleted one at a time, in list order.
+  auto runQueue = std::make_shared<platform::SerialQueue>(*assembly_.dispatchPool, "com.norvel.tavixd.feedbackFlusherQueue");
+  auto channel = assembly_.flusherIPCListener;
+  auto storage = assembly_.persistentStorage;
+  const auto files = storage ? storage->getAvailableSessionHandles() : std::vector<std::shared_ptr<FileContainer>>{};
+  auto self = shared_from_this();
+  for (const auto& file : files) {
+    runQueue->async([self, file, storage, channel] {
+      std::shared_ptr<ClientSession> session;
+      if (auto record = file->readRecord()) session = ClientSession::fromRecord(self->assembly_, std::move(*record));
+      // Unreadable files (too large, another version, empty, corrupt) go too: they never would be.
+      storage->deleteSessionWithFileContainer(file);
+      if (!session) return;
+      self->flushSyncFromArray({session});
+      std::vector<std::string> bodies;
+      self->flushToWireSync(channel ? &bodies : nullptr);
+      if (channel && !bodies.empty()) channel->sendDataToSendingStreamListener(std::move(bodies));
+    });
+  }
+  // The queue is serial: this runs once every file above has been handled.
+  runQueue->async([runQueue, transaction, completion = std::move(completion)]() mutable {
+    if (completion) completion();
+    transaction->reset();
+  });
+}
+
+void TavixFeedbackFlusher::flush(std::shared_ptr<ClientSession> session, std::function<void()> callback) {
+  queueBuffer_.async([self = shared_from_this(), session = std::move(session), callback = std::move(callback)] {
+    self->sessionBuffer_.push_back(session);
+    if (callback) callback();
+  });
+}
+
+void TavixFeedbackFlusher::flushSyncFromArray(std::vector<std::shared_ptr<ClientSession>> sessions) {
+  queueBuffer_.async([self = shared_from_this(), sessions = std::move(sessions)] {
+    self->sessionBuffer_.insert(self->sessionBuffer_.end(), sessions.begin(), sessions.end());
+  });
+}
+
+void TavixFeedbackFlusher::flushToWireSync(std::vector<std::string>* returned) {
+  queueBuffer_.sync([&] {
+    auto bodies = flushToWireWithObjectsReturned(returned != nullptr);
+    if (returned) returned->insert(returned->end(), std::make_move_iterator(bodies.begin()), std::make_move_iterator(bodies.end()));
+  });
+}
+
+void TavixFeedbackFlusher::flushToWireAsync(std::function<void(std::vector<std::string>)> callback) {
+  queueBuffer_.async([self = shared_from_this(), callback = std::move(callback)] {
+    auto bodies = self->flushToWireWithObjectsReturned(static_cast<bool>(callback));
+    // The key is the connection counter's; kept as the counter has always been fed.
+    TavixDiagnosticDataReporter::addValue(static_cast<std::int64_t>(bodies.size()), "com.norvel.tavixd.clientconnection");
+    if (callback) callback(std::move(bodies));
+  });
+}
+
+std::vector<std::string> TavixFeedbackFlusher::flushToWireWithObjectsReturned(bool returnObjects) {
+  queueBuffer_.assertCurrent("TavixFeedbackFlusher::flushToWireWithObjectsReturned");
+  flusherLog().debug("Sessions Flushed {}", sessionBuffer_.size());
+  std::vector<std::string> bodies;
+  auto uploads = assembly_.uploadManager;
+  for (const auto& session : sessionBuffer_) {
+    if (!uploads) break;
+    auto file = uploads->uploadJSONFeedback(session->getFeedbacksToSend(), identifier_);
+    if (!returnObjects || !file) continue;
+    if (auto contents = file->readContents()) {
+      bodies.push_back(std::move(*contents));
+    } else {
+      TavixLogForCategory(TavixLoggingCategorySession).error("error mapping tmp file {}", file->path().string());
+    }
+  }
+  sessionBuffer_.clear();
+  return bodies;
+}
+
+std::size_t TavixFeedbackFlusher::countOfDatabuffer() {
+  std::size_t count = 0;
+  queueBuffer_.sync([&] { count = sessionBuffer_.size(); });
+  return count;
+}
+
+std::vector<std::shared_ptr<ClientSession>> TavixFeedbackFlusher::sessionBuffer() {
+  std::vector<std::shared_ptr<ClientSession>> copy;
+  queueBuffer_.sync([&] { copy = sessionBuffer_; });
+  return copy;
+}
+
+}  // namespace tavix

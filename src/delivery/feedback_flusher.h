@@ -1,0 +1,78 @@
+// TavixFeedbackFlusher: moves finished sessions from disk to the server. One flusher serves one
+// run: it reads each waiting session file, deletes it, turns the session into its upload record
+// and hands that to the upload manager, one compressed upload per session. When the flush
+// command channel exists, the compressed bodies also go to it.
+//
+// Deletion comes before the upload: a session whose upload fails is lost, never retried.
+//
+// Threading: owns the serial queue "com.norvel.tavixd.tavixDataBufferQueue" (`queueBuffer`),
+// which guards the session buffer and the sending; a run reads and deletes files on a queue of
+// its own. Must be owned by a shared_ptr (made by create()); a run keeps its flusher alive.
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "platform/dispatch.h"
+
+namespace tavix {
+
+class Assembly;
+class ClientSession;
+
+namespace platform {
+class Activity;
+}
+
+class TavixFeedbackFlusher : public std::enable_shared_from_this<TavixFeedbackFlusher> {
+ public:
+  // Uses the assembly's persistentStorage, uploadManager, flusherIPCListener (may be null) and
+  // transactions (may be null).
+  static std::shared_ptr<TavixFeedbackFlusher> create(Assembly& assembly);
+  ~TavixFeedbackFlusher();
+  TavixFeedbackFlusher(const TavixFeedbackFlusher&) = delete;
+  TavixFeedbackFlusher& operator=(const TavixFeedbackFlusher&) = delete;
+
+  // The periodic activity's handler: nothing at all while "TVXFeedbackFlushDisabled" is set;
+  // otherwise a new flusher runs performPeriodicFlushActivity().
+  static void handlePeriodicFlushActivity(Assembly& assembly, const std::shared_ptr<platform::Activity>& activity);
+
+  // Only from RUN: moves the activity to CONTINUE, flushes everything, then sets DONE.
+  void performPeriodicFlushActivity(const std::shared_ptr<platform::Activity>& activity);
+
+  // Flushes every waiting session file; `completion` runs (on the run's queue) once all are
+  // handled. Holds the transaction "com.norvel.tavixd.feedbackFlusherTx" until then.
+  void forceFlushWithCompletion(std::function<void()> completion);
+
+  // Asynchronously on queueBuffer: appends the session, then calls `callback`.
+  void flush(std::shared_ptr<ClientSession> session, std::function<void()> callback = {});
+  // Asynchronously on queueBuffer (its order is what makes a following flushToWireSync see them).
+  void flushSyncFromArray(std::vector<std::shared_ptr<ClientSession>> sessions);
+  // Synchronously on queueBuffer: sends the buffer; when `returned` is given, the compressed
+  // bodies are appended to it. Not from queueBuffer.
+  void flushToWireSync(std::vector<std::string>* returned);
+  // Asynchronously on queueBuffer: sends the buffer, and hands the bodies to `callback` if any.
+  void flushToWireAsync(std::function<void(std::vector<std::string>)> callback = {});
+
+  // Synchronous, not from queueBuffer.
+  std::size_t countOfDatabuffer();
+  std::vector<std::shared_ptr<ClientSession>> sessionBuffer();
+
+  // The endpoint kind of the uploads (the feedback endpoint).
+  int identifier() const { return identifier_; }
+
+ private:
+  explicit TavixFeedbackFlusher(Assembly& assembly);
+  std::vector<std::string> flushToWireWithObjectsReturned(bool returnObjects);  // on queueBuffer_
+
+  Assembly& assembly_;
+  std::vector<std::shared_ptr<ClientSession>> sessionBuffer_;  // on queueBuffer_
+  platform::SerialQueue queueBuffer_;
+  // Kept for counting feedback per run; no flow uses it today.
+  platform::SerialQueue feedbackCountQueue_;
+  int identifier_ = 1;
+};
+
+}  // namespace tavix

@@ -1,0 +1,300 @@
+#include <gtest/gtest.h>
+#include <httplib.h>
+
+#include <fstream>
+#include <nlohmann/json.hpp>
+
+#include "bag/tavix_bag_controller.h"
+#include "core/assembly.h"
+#include "core/custom_feedback_dirs.h"
+#include "core/diagnostics.h"
+#include "delivery/custom_feedback_flusher.h"
+#include "delivery/feedback_flusher.h"
+#include "delivery/upload_manager.h"
+#include "devserver/devserver.h"
+#include "feedback/client_session.h"
+#include "feedback/persistent_storage.h"
+#include "feedback/tavix_feedback.h"
+#include "network/request_factory.h"
+#include "platform/activity.h"
+#include "platform/clock.h"
+#include "platform/counters.h"
+#include "platform/defaults.h"
+#include "platform/dispatch.h"
+#include "platform/http/url_session.h"
+#include "platform/log.h"
+#include "platform/notification_center.h"
+#include "platform/transactions.h"
+#include "support/temp_home.h"
+#include "tavix_proto/feedback_records.pb.h"
+
+namespace tavix {
+namespace {
+
+using json = nlohmann::json;
+using testing::waitFor;
+
+constexpr const char* kActivity = "com.norvel.tavixd.flusher.background";
+
+// The whole delivery path over real files and real HTTP: session files in a temporary caches
+// folder, the devserver as the server, a bag fetched from it.
+class FlusherTest : public ::testing::Test {
+ protected:
+  FlusherTest() {
+    home.exportEnvironment();
+    std::string error;
+    EXPECT_TRUE(server.start({}, &error)) << error;
+    assembly.dispatchPool = &pool;
+    assembly.clock = &clock;
+    assembly.transactions = &transactions;
+    assembly.activityScheduler = &activities;
+    assembly.paths = platform::Paths::fromEnvironment();
+    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
+    assembly.userDefaults->setObject("TVXBagURL", server.baseURL() + "/bag");
+    // What the daemon registers at start.
+    assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
+                                             {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})}});
+    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
+    assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+  }
+  ~FlusherTest() override {
+    pool.drain();
+    if (assembly.bagController) assembly.bagController->invalidate();
+    assembly.uploadManager.reset();
+    session.reset();
+    transport.reset();
+    pool.drain();
+  }
+
+  // Serves `extra` merged into the devserver's own bag, then waits until the daemon has it.
+  void start(json extra = json::object()) {
+    httplib::Client control("127.0.0.1", server.port());
+    json bag = json::parse(control.Get("/bag")->body);
+    bag.update(extra);
+    control.Post("/_faults", json{{"path", "/bag"}, {"body", bag.dump()}}.dump(), "application/json");
+    control.Post("/_reset_recordings", "", "application/json");
+    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+    session = BackgroundUploadSession::create(transport, home.cache() / "journal", pool);
+    assembly.uploadManager = UploadManager::create(assembly, session);
+    assembly.bagController = TavixBagController::create(assembly);
+    assembly.bagController->currentBag();
+    ASSERT_TRUE(waitFor([&] { return assembly.uploadManager->feedbackEndpoint().has_value(); }));
+  }
+
+  void writeSession(const std::string& agent, int events) {
+    proto::CTErrorFeedback error;
+    error.set_code(500);
+    error.set_domain("test");
+    error.set_reason("first");
+    auto s = ClientSession::open(assembly, makeTavixFeedbackWithCodable(error, 0, "", agent));
+    for (int i = 1; i < events; ++i) {
+      error.set_reason("event " + std::to_string(i));
+      s->addFeedback(makeTavixFeedbackWithCodable(error, 0, "", agent));
+    }
+    s->sessionComplete();
+  }
+  std::size_t waitingSessions() { return assembly.persistentStorage->getAvailableSessionHandles().size(); }
+  std::size_t sessionFilesOnDisk() {
+    std::size_t n = 0;
+    for (const auto& e : platform::fs::directory_iterator(assembly.cachesFolder())) {
+      n += e.path().filename().string().rfind("session.", 0) == 0;
+    }
+    return n;
+  }
+  json received() {
+    httplib::Client client("127.0.0.1", server.port());
+    return json::parse(client.Get("/_feedback")->body);
+  }
+  static std::int64_t counter(const std::string& key) { return TavixDiagnosticDataReporter::store().value(key); }
+
+  testing::TempHome home;
+  devserver::DevServer server;
+  platform::DispatchPool pool;  // flushes chain synchronous hops: the default, deep enough, pool
+  platform::VirtualClock clock;
+  platform::TransactionTracker transactions;
+  platform::SerialQueue activityQueue{pool, "activities"};
+  platform::ActivityScheduler activities{clock, activityQueue, transactions};
+  Assembly assembly;
+  std::shared_ptr<platform::http::URLSession> transport =
+      std::make_shared<platform::http::URLSession>(platform::http::URLSessionConfiguration{});
+  std::shared_ptr<BackgroundUploadSession> session;
+};
+
+TEST_F(FlusherTest, PeriodicRunSendsEachSessionOnceAndDeletesItsFile) {
+  // A file that is not a session of ours: deleted unread, never uploaded.
+  platform::createDirectory(home.cache() / "com.norvel.tavixd", true);
+  std::ofstream(home.cache() / "com.norvel.tavixd" / "session.40") << "not a session";
+  start();
+  writeSession("seekara/1", 3);
+  writeSession("brovane/2", 1);
+  writeSession("news/3", 2);
+  ASSERT_TRUE(waitFor([&] { return waitingSessions() == 4; }));
+  const auto sent = counter("com.norvel.tavixd.feedbacksent");
+
+  platform::LogCapture logs;
+  activities.checkIn(kActivity, platform::seconds(0), [this](const auto& activity) {
+    TavixFeedbackFlusher::handlePeriodicFlushActivity(assembly, activity);
+  });
+  EXPECT_TRUE(waitFor([&] { return logs.contains("Bailing on periodic flush because background activity state != RUN"); }))
+      << "the check-in call is not a run";
+  EXPECT_EQ(waitingSessions(), 4u);
+
+  ASSERT_TRUE(activities.runNow(kActivity));
+  ASSERT_TRUE(waitFor([&] { return activities.state(kActivity) == platform::ActivityState::Done; }));
+  ASSERT_TRUE(waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sent + 21; }))
+      << "three uploads of seven keys each";
+  EXPECT_EQ(logs.count("All periodic flush tasks completed."), 1u);
+  EXPECT_EQ(waitingSessions(), 0u);
+  EXPECT_TRUE(waitFor([&] { return sessionFilesOnDisk() == 0; }));
+
+  auto got = received();
+  ASSERT_EQ(got.size(), 3u);
+  std::multiset<std::string> agents;
+  std::size_t events = 0;
+  for (const auto& upload : got) {
+    EXPECT_EQ(upload["path"], "/feedback");
+    EXPECT_EQ(upload["v"], "2");
+    EXPECT_EQ(upload["json"].size(), 7u);
+    agents.insert(upload["json"]["agent"].get<std::string>());
+    events += upload["json"]["fb"].size();
+  }
+  EXPECT_EQ(agents, (std::multiset<std::string>{"brovane/2", "news/3", "seekara/1"}));
+  EXPECT_EQ(events, 6u);
+
+  // Nothing left: the next run completes at once and sends nothing.
+  ASSERT_TRUE(activities.runNow(kActivity));
+  ASSERT_TRUE(waitFor([&] { return logs.count("All periodic flush tasks completed.") == 2; }));
+  pool.drain();
+  EXPECT_EQ(received().size(), 3u);
+  EXPECT_EQ(transactions.openCount(), 0u);
+}
+
+TEST_F(FlusherTest, DisabledFlushingReadsAndDeletesNothing) {
+  start();
+  writeSession("seekara/1", 2);
+  ASSERT_TRUE(waitFor([&] { return waitingSessions() == 1; }));
+  assembly.userDefaults->setObject("TVXFeedbackFlushDisabled", platform::PropertyValue(true));
+  platform::LogCapture logs;
+  activities.checkIn(kActivity, platform::seconds(0), [this](const auto& activity) {
+    TavixFeedbackFlusher::handlePeriodicFlushActivity(assembly, activity);
+  });
+  ASSERT_TRUE(waitFor([&] { return logs.count("Flusher bailing because periodic flush is disabled") == 1; }));
+  ASSERT_TRUE(activities.runNow(kActivity));
+  ASSERT_TRUE(waitFor([&] { return activities.state(kActivity) == platform::ActivityState::Done; }));
+  pool.drain();
+  EXPECT_EQ(logs.count("Flusher bailing because periodic flush is disabled"), 2u);
+  EXPECT_EQ(waitingSessions(), 1u);
+  EXPECT_EQ(sessionFilesOnDisk(), 1u);
+  EXPECT_TRUE(received().empty());
+
+  // The buffer operations on their own: sessions wait in the buffer until sent.
+  auto flusher = TavixFeedbackFlusher::create(assembly);
+  auto record = assembly.persistentStorage->getAvailableSessionHandles().front()->readRecord();
+  ASSERT_TRUE(record);
+  flusher->flush(ClientSession::fromRecord(assembly, *record));
+  EXPECT_EQ(flusher->countOfDatabuffer(), 1u);
+  std::vector<std::string> bodies;
+  flusher->flushToWireSync(&bodies);
+  EXPECT_EQ(flusher->countOfDatabuffer(), 0u);
+  ASSERT_EQ(bodies.size(), 1u);
+  ASSERT_TRUE(waitFor([&] { return received().size() == 1; }));
+  EXPECT_EQ(received()[0]["compressed_size"], bodies[0].size()) << "the body handed back is the one sent";
+}
+
+class CustomFeedbackTest : public FlusherTest {
+ protected:
+  platform::fs::path root() { return home.cache() / "com.norvel.tavixd" / kTVXCustomFeedbackDir; }
+  void makeDirectories() {
+    for (int type = 1; type <= 7; ++type) {
+      if (auto name = customFeedbackDirectoryForType(type)) platform::fs::create_directories(root() / *name);
+    }
+  }
+  void writeItem(std::string_view type, const std::string& name, std::size_t size) {
+    std::string bytes(size, 'a');
+    for (std::size_t i = 0; i < size; i += 13) bytes[i] = static_cast<char>('a' + i % 26);
+    std::ofstream(root() / type / name, std::ios::binary) << bytes;
+  }
+  std::size_t itemsLeft() {
+    std::size_t n = 0;
+    for (const auto& e : platform::fs::recursive_directory_iterator(root())) n += e.is_regular_file();
+    return n;
+  }
+};
+
+TEST_F(CustomFeedbackTest, ItemsUpToTheLimitAreUploadedLargerOnesReportedAndAllDeleted) {
+  makeDirectories();
+  start({{"custom_feedback_max_bytes", {{"BrovaneAutoFill", 1000}}}});
+  writeItem(kTVXBrovaneAutoFillDir, "exact", 1000);
+  writeItem(kTVXBrovaneAutoFillDir, "over", 1001);
+  writeItem(kTVXQuilletDir, "default-limit", 2097152);
+  writeItem(kTVXQuilletDir, "over-default", 2097153);
+  auto reports = std::make_shared<CrowdsourcingReportStore>(home.cache() / "reports");
+  platform::fs::create_directories(reports->folder());
+  std::ofstream(reports->folder() / "report-1") << R"({"dp":1})";
+  std::ofstream(reports->folder() / ".hidden") << "x";
+  const auto tooLarge = counter("com.norvel.tavixd.customfeedback.BrovaneAutoFill.filetoolarge");
+
+  platform::LogCapture logs;
+  int completions = 0;
+  TavixCustomFeedbackFlusher(assembly, reports).flushCustomFeedbackWithCompletionHandler([&] { ++completions; });
+  EXPECT_EQ(completions, 1);
+  EXPECT_EQ(itemsLeft(), 0u);
+  EXPECT_EQ(counter("com.norvel.tavixd.customfeedback.BrovaneAutoFill.filetoolarge"), tooLarge + 1);
+  EXPECT_EQ(logs.count("Custom feedback item BrovaneAutoFill too big to process: 1001"), 1u);
+  EXPECT_EQ(logs.count("Custom feedback item Quillet too big to process: 2097153"), 1u);
+  EXPECT_EQ(logs.count("No SeekaraResultFeatures custom feedback available for flushing"), 1u);
+  EXPECT_EQ(reports->reportsNotYetSubmitted().size(), 0u);
+
+  ASSERT_TRUE(waitFor([&] { return received().size() == 3; }));
+  std::map<std::string, std::size_t> sizes;  // type (or path) -> size
+  for (const auto& upload : received()) {
+    sizes[upload["path"] == "/crowdsourcing" ? "crowdsourcing" : upload["type"].get<std::string>()] = upload["size"];
+  }
+  EXPECT_EQ(sizes, (std::map<std::string, std::size_t>{{"BrovaneAutoFill", 1000}, {"Quillet", 2097152}, {"crowdsourcing", 8}}));
+
+  // The two oversize items became error sessions, waiting for the next feedback flush.
+  ASSERT_TRUE(waitFor([&] { return waitingSessions() == 2; }));
+  std::vector<std::string> bodies;
+  auto flusher = TavixFeedbackFlusher::create(assembly);
+  bool done = false;
+  flusher->forceFlushWithCompletion([&] { done = true; });
+  ASSERT_TRUE(waitFor([&] { return done && received().size() == 5; }));
+  std::size_t errorEvents = 0;
+  for (const auto& upload : received()) {
+    if (!upload.contains("json") || !upload["json"].contains("fb")) continue;
+    for (const auto& event : upload["json"]["fb"]) {
+      if (event.value("code", 0) == 4 && event.value("domain", "") == "kTVXErrorDomain") ++errorEvents;
+    }
+  }
+  EXPECT_EQ(errorEvents, 2u);
+}
+
+TEST_F(CustomFeedbackTest, AMissingTypeFolderEndsTheRunEarly) {
+  makeDirectories();
+  start();
+  writeItem(kTVXSeekaraResultFeaturesDir, "features", 10);
+  writeItem(kTVXBrovaneAutoPlayDir, "play", 10);
+  platform::fs::remove_all(root() / kTVXBrovaneAutoFillDir);
+  auto reports = std::make_shared<CrowdsourcingReportStore>(home.cache() / "reports");
+  platform::fs::create_directories(reports->folder());
+  std::ofstream(reports->folder() / "report-1") << "dp";
+
+  int completions = 0;
+  TavixCustomFeedbackFlusher(assembly, reports).flushCustomFeedbackWithCompletionHandler([&] { ++completions; });
+  EXPECT_EQ(completions, 0);
+  EXPECT_FALSE(platform::fs::exists(root() / kTVXSeekaraResultFeaturesDir / "features"));
+  EXPECT_TRUE(platform::fs::exists(root() / kTVXBrovaneAutoPlayDir / "play"));
+  EXPECT_EQ(reports->reportsNotYetSubmitted().size(), 1u);
+  ASSERT_TRUE(waitFor([&] { return received().size() == 1; }));
+  pool.drain();
+  EXPECT_EQ(received().size(), 1u);
+  EXPECT_EQ(received()[0]["type"], "SeekaraResultFeatures");
+
+  // No CustomFeedback folder at all: nothing to do, no completion either.
+  platform::fs::remove_all(root());
+  TavixCustomFeedbackFlusher(assembly, reports).flushCustomFeedbackWithCompletionHandler([&] { ++completions; });
+  EXPECT_EQ(completions, 0);
+}
+
+}  // namespace
+}  // namespace tavix

@@ -1,0 +1,322 @@
+#include "delivery/upload_manager.h"
+
+#include <fcntl.h>
+#include <stdlib.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <random>
+#include <nlohmann/json.hpp>
+
+#include "bag/tavix_bag_controller.h"
+#include "bag/tvx_bag.h"
+#include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "core/logging.h"
+#include "core/names.h"
+#include "delivery/output_stream.h"
+#include "network/request_factory.h"
+#include "platform/http/url_session.h"
+
+namespace tavix {
+
+namespace {
+
+using platform::http::HTTPURLResponse;
+using platform::http::URLError;
+using platform::http::URLRequest;
+
+platform::Logger& uploadLog() { return TavixLogForCategory(TavixLoggingCategoryUploadManager); }
+
+constexpr double kUploadTimeoutSeconds = 300;
+constexpr std::size_t kCopyChunkSize = 8192;
+constexpr std::size_t kMaximumTempPathLength = 1024;
+
+std::string headersDescription(const platform::http::HeaderFields& headers) {
+  std::string out = "{";
+  for (const auto& [name, value] : headers.all()) {
+    if (out.size() > 1) out += ", ";
+    out += name + ": " + value;
+  }
+  return out + "}";
+}
+
+}  // namespace
+
+// ---- TempFile
+
+TempFile::~TempFile() {
+  if (fd_ >= 0) ::close(fd_);
+}
+
+std::optional<std::string> TempFile::readContents() const {
+  std::string out;
+  char buffer[kCopyChunkSize];
+  off_t offset = 0;
+  for (;;) {
+    const ssize_t n = ::pread(fd_, buffer, sizeof buffer, offset);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return std::nullopt;
+    }
+    if (n == 0) return out;
+    out.append(buffer, static_cast<std::size_t>(n));
+    offset += n;
+  }
+}
+
+// ---- helpers
+
+std::string appendingQueryItem(std::string_view url, std::string_view name, std::string_view value) {
+  static constexpr char kHex[] = "0123456789ABCDEF";
+  std::string encoded;
+  for (unsigned char c : value) {
+    if (std::isalnum(c) || c == '-' || c == '_' || c == '.' || c == '~') {
+      encoded += static_cast<char>(c);
+    } else {
+      encoded += '%';
+      encoded += kHex[c >> 4];
+      encoded += kHex[c & 0xf];
+    }
+  }
+  std::string base(url);
+  std::string fragment;
+  if (const auto hash = base.find('#'); hash != std::string::npos) {
+    fragment = base.substr(hash);
+    base.resize(hash);
+  }
+  const auto question = base.find('?');
+  if (question == std::string::npos) {
+    base += '?';
+  } else if (question + 1 < base.size() && base.back() != '&') {
+    base += '&';
+  }
+  return base + std::string(name) + "=" + encoded + fragment;
+}
+
+// ---- UploadManager
+
+std::shared_ptr<UploadManager> UploadManager::create(Assembly& assembly, std::shared_ptr<BackgroundUploadSession> session) {
+  if (!session) {
+    session = BackgroundUploadSession::create(assembly.uploadURLSession(), assembly.cachesFolder() / "UploadJournal",
+                                              *assembly.dispatchPool);
+  }
+  auto manager = std::shared_ptr<UploadManager>(new UploadManager(assembly, session));
+  session->setDelegate(manager);
+  if (assembly.notificationCenter) {
+    std::weak_ptr<UploadManager> weak = manager;
+    manager->bagObserver_ = assembly.notificationCenter->addObserver(
+        kTVXBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& notification) {
+          if (auto self = weak.lock()) self->bagDidChange(notification);
+        });
+  }
+  if (assembly.bagController) manager->takeEndpointsFromBag(assembly.bagController->inMemoryBag().get());
+  session->resumePendingTasks();
+  return manager;
+}
+
+UploadManager::UploadManager(Assembly& assembly, std::shared_ptr<BackgroundUploadSession> session)
+    : assembly_(assembly), session_(std::move(session)), queue_(*assembly.dispatchPool, "com.norvel.tavixd.uploadmanager") {}
+
+UploadManager::~UploadManager() = default;
+
+std::optional<std::string> UploadManager::feedbackEndpointFromBag(const TVXBag* bag) {
+  if (!bag || !bag->feedbackEnabled()) return std::nullopt;
+  auto url = bag->feedbackURL();
+  if (!url) return std::nullopt;
+  return appendingQueryItem(*url, "v", "2");
+}
+
+std::optional<std::string> UploadManager::crowdsourcingEndpointFromBag(const TVXBag* bag) {
+  if (!bag || !bag->feedbackEnabled()) return std::nullopt;
+  return bag->crowdsourcingURL();
+}
+
+void UploadManager::takeEndpointsFromBag(const TVXBag* bag) {
+  setFeedbackEndpoint(feedbackEndpointFromBag(bag));
+  setCrowdsourcingEndpoint(crowdsourcingEndpointFromBag(bag));
+}
+
+void UploadManager::bagDidChange(const platform::Notification& notification) {
+  TavixLogForCategory(TavixLoggingCategoryFlusher).notice("bag change notification received");
+  const auto* bag = std::any_cast<std::shared_ptr<const TVXBag>>(&notification.object);
+  if (bag && *bag) takeEndpointsFromBag(bag->get());
+}
+
+std::optional<std::string> UploadManager::feedbackEndpoint() {
+  std::optional<std::string> url;
+  queue_.sync([&] { url = feedbackEndpoint_; });
+  return url;
+}
+
+void UploadManager::setFeedbackEndpoint(std::optional<std::string> url) {
+  queue_.async([self = shared_from_this(), url = std::move(url)] { self->feedbackEndpoint_ = url; });
+}
+
+std::optional<std::string> UploadManager::crowdsourcingEndpoint() {
+  std::optional<std::string> url;
+  queue_.sync([&] { url = crowdsourcingEndpoint_; });
+  return url;
+}
+
+void UploadManager::setCrowdsourcingEndpoint(std::optional<std::string> url) {
+  queue_.async([self = shared_from_this(), url = std::move(url)] { self->crowdsourcingEndpoint_ = url; });
+}
+
+std::optional<std::string> UploadManager::urlForEndpoint(int endpoint, const std::string& type) {
+  auto url = endpoint == kCrowdsourcingEndpoint ? crowdsourcingEndpoint() : feedbackEndpoint();
+  if (!url) return std::nullopt;
+  if (!type.empty()) return appendingQueryItem(*url, "type", type);
+  return url;
+}
+
+std::shared_ptr<TempFile> UploadManager::makeTempFileWithAnnotation(const std::optional<std::string>& annotation) {
+  std::error_code ec;
+  const auto dir = platform::fs::temp_directory_path(ec);
+  if (ec) return nullptr;
+  const std::string templ = (dir / ("com.norvel.tavixd.upload_" + annotation.value_or("") + "_XXXXX")).string();
+  if (templ.size() >= kMaximumTempPathLength) return nullptr;
+  // glibc's mkstemp insists on six X; the name keeps its five, filled the way mkstemp would:
+  // random letters and digits, created exclusively, retried on a clash.
+  static constexpr char kLetters[] = "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789";
+  thread_local std::mt19937_64 random{std::random_device{}()};
+  for (int attempt = 0; attempt < 100; ++attempt) {
+    std::string path = templ;
+    for (std::size_t i = path.size() - 5; i < path.size(); ++i) path[i] = kLetters[random() % (sizeof kLetters - 1)];
+    const int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0600);
+    if (fd >= 0) return std::make_shared<TempFile>(fd, path);
+    if (errno != EEXIST) return nullptr;
+  }
+  return nullptr;
+}
+
+std::shared_ptr<TempFile> UploadManager::uploadJSONFeedback(std::string_view json, int endpoint) {
+  auto file = makeTempFileWithAnnotation("tavix");
+  if (!file) {
+    uploadLog().error("Error getting temp file.");
+    return nullptr;
+  }
+  uploadLog().debug("Compressing data for upload to {}", file->path().string());
+
+  const auto parsed = nlohmann::json::parse(json, nullptr, false);
+  if (parsed.is_discarded()) {
+    TavixLogForCategory(TavixLoggingCategorySession).error("Invalid JSON Object {} error {}", json, "not JSON");
+    return nullptr;
+  }
+  const std::int64_t count = parsed.is_object() || parsed.is_array() ? static_cast<std::int64_t>(parsed.size()) : 0;
+
+  CompressedOutputStream stream(std::make_shared<FileOutputStream>(file->path()), file->path());
+  stream.open();
+  // Written as the serializer would stream it: in pieces, never as one extra whole copy.
+  for (std::size_t offset = 0; offset < json.size(); offset += kCopyChunkSize) {
+    if (stream.write(json.substr(offset, kCopyChunkSize)) < 0) break;
+  }
+  stream.close();
+  if (stream.status() != 1) {
+    TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.feedbacknotsent");
+    uploadLog().error("Compression for upload failed");
+    return nullptr;
+  }
+  std::error_code ec;
+  if (!platform::fs::exists(file->path(), ec)) {
+    uploadLog().error("Couldn't find file {} after compression.", file->path().string());
+    return nullptr;
+  }
+  const auto url = urlForEndpoint(endpoint, "");
+  if (!url) return file;
+  auto request = assembly_.requestFactory
+                     ? assembly_.requestFactory->flusherUploadRequest(*url, kUploadTimeoutSeconds, stream.dataDigestForStream())
+                     : std::nullopt;
+  if (request) enqueueRequest(std::move(*request), file->path(), count);
+  return file;
+}
+
+void UploadManager::uploadFeedback(const platform::fs::path& source, const std::string& type, int endpoint) {
+  const auto url = urlForEndpoint(endpoint, type);
+  if (!url) {
+    uploadLog().error("Server feedback endpoint not set, data can't be sent to server");
+    return;
+  }
+  uploadLog().debug("uploadFile: {}", source.string());
+  const int in = ::open(source.c_str(), O_RDONLY | O_CLOEXEC);
+  auto file = makeTempFileWithAnnotation(type);
+  if (!file) {
+    uploadLog().error("Error getting temp file.");
+    if (in >= 0) ::close(in);
+    return;
+  }
+  uploadLog().debug("Compressing data for upload to {}", file->path().string());
+  CompressedOutputStream stream(std::make_shared<FileOutputStream>(file->path()), file->path());
+  stream.open();
+  ssize_t lastRead = -1;
+  if (in >= 0) {
+    std::uint8_t chunk[kCopyChunkSize];
+    for (;;) {
+      lastRead = ::read(in, chunk, sizeof chunk);
+      if (lastRead < 0 && errno == EINTR) continue;
+      if (lastRead <= 0) break;
+      stream.write(chunk, static_cast<std::size_t>(lastRead));
+    }
+    ::close(in);
+  }
+  stream.close();
+  std::error_code ec;
+  if (lastRead != -1 && stream.status() == 1 && platform::fs::exists(file->path(), ec)) {
+    auto request = assembly_.requestFactory
+                       ? assembly_.requestFactory->flusherUploadRequest(*url, kUploadTimeoutSeconds, stream.dataDigestForStream())
+                       : std::nullopt;
+    if (request) {
+      enqueueRequest(std::move(*request), file->path(), 0);
+      return;
+    }
+  }
+  uploadLog().error("Compression for upload failed");
+}
+
+void UploadManager::enqueueRequest(URLRequest request, const platform::fs::path& file,
+                                   std::optional<std::int64_t> numberOfFeedbacks) {
+  std::weak_ptr<UploadManager> weak = weak_from_this();
+  session_->getAllTasks([weak, request = std::move(request), file, numberOfFeedbacks](
+                            std::vector<BackgroundUploadSession::TaskInfo> tasks) mutable {
+    auto self = weak.lock();
+    if (!self) return;
+    if (tasks.size() < kMaximumPendingUploads) {
+      uploadLog().debug("Enqueuing for upload: {}, headers {}", file.string(), headersDescription(request.headers));
+      self->session_->uploadTask(std::move(request), file, numberOfFeedbacks);
+    } else {
+      // Dropped; the temporary file is left to the system's cleaning of its temporary folder.
+      uploadLog().error("too many uploads pending: {}", tasks.size());
+    }
+  });
+}
+
+void UploadManager::didCompleteWithError(const BackgroundUploadSession::TaskInfo& task,
+                                         const std::optional<HTTPURLResponse>& response,
+                                         const std::optional<URLError>& error) {
+  if (error && error->domain == platform::http::kURLErrorDomain && error->code == platform::http::URLErrorTimedOut) {
+    TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.fbrequesttimedout");
+  }
+  // File uploads carry 0 and count as one.
+  const std::int64_t count = task.numberOfFeedbacks.value_or(0) > 0 ? *task.numberOfFeedbacks : 1;
+  const long status = response ? response->statusCode : 0;
+  if (status != 200) {
+    uploadLog().fault("response error {}", response ? "status " + std::to_string(status) + " from " + response->url
+                                                    : "none: " + (error ? error->description : std::string("?")));
+    TavixDiagnosticDataReporter::addValue(count, "com.norvel.tavixd.feedbacknotsent");
+  } else {
+    TavixDiagnosticDataReporter::addValue(count, "com.norvel.tavixd.feedbacksent");
+  }
+  uploadLog().debug("URLSession:task:didCompleteWithError: id={}, error={}, statusCode={}", task.taskIdentifier,
+                    error ? error->description : std::string("(null)"), status);
+}
+
+void UploadManager::didSendBodyData(const BackgroundUploadSession::TaskInfo& task, std::int64_t totalBytesSent,
+                                    std::int64_t totalBytesExpectedToSend) {
+  const double fraction =
+      totalBytesExpectedToSend > 0 ? double(totalBytesSent) / double(totalBytesExpectedToSend) : 1.0;
+  uploadLog().debug("task {}, transfer {:f} complete", task.taskIdentifier, fraction);
+}
+
+}  // namespace tavix

@@ -1,0 +1,119 @@
+// UploadManager: sends feedback to the server. A JSON record (a session's upload record) or a
+// file of custom feedback is compressed with raw DEFLATE into a temporary file while its SHA-512
+// digest is computed, and the file goes to the background upload session with a request that
+// carries the digest ("X-Norvel-Digest") and "Content-Encoding: deflate". The feedback and
+// crowdsourcing endpoints follow the bag ("TVXBagChangeNotification"). Nothing is retried: a
+// failed upload is counted ("com.norvel.tavixd.feedbacknotsent") and forgotten.
+//
+// Threading: owns the serial queue "com.norvel.tavixd.uploadmanager", which guards the endpoints
+// (setters asynchronous, getters synchronous, not from that queue). Compression runs on the
+// caller's thread. Completions arrive on the upload session's queue. Must be owned by a
+// shared_ptr (made by create()).
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "delivery/background_upload_session.h"
+#include "platform/dispatch.h"
+#include "platform/files.h"
+#include "platform/notification_center.h"
+
+namespace tavix {
+
+class Assembly;
+class TVXBag;
+
+// A temporary file that closes its descriptor when released; the file itself stays (the
+// platform's temporary folder is cleaned by others).
+class TempFile {
+ public:
+  TempFile(int fd, platform::fs::path path) : fd_(fd), path_(std::move(path)) {}
+  ~TempFile();
+  TempFile(const TempFile&) = delete;
+  TempFile& operator=(const TempFile&) = delete;
+  int fileDescriptor() const { return fd_; }
+  const platform::fs::path& path() const { return path_; }
+  // The whole file as it is now, read through the descriptor; none on a read error.
+  std::optional<std::string> readContents() const;
+
+ private:
+  int fd_;
+  platform::fs::path path_;
+};
+
+// Endpoint kinds: 0 is the crowdsourcing endpoint, anything else the feedback endpoint.
+inline constexpr int kCrowdsourcingEndpoint = 0;
+inline constexpr int kFeedbackEndpoint = 1;
+
+class UploadManager : public std::enable_shared_from_this<UploadManager>, public BackgroundUploadSession::Delegate {
+ public:
+  // Uploads pending in the session beyond which new ones are dropped.
+  static constexpr std::size_t kMaximumPendingUploads = 100;
+
+  // Observes the bag and takes both endpoints from the current bag (when the assembly has a bag
+  // controller). `session` defaults to a journalled session over the assembly's
+  // uploadURLSession(), journal in "<caches>/com.norvel.tavixd/UploadJournal"; its pending
+  // uploads from an earlier run are resumed.
+  static std::shared_ptr<UploadManager> create(Assembly& assembly,
+                                               std::shared_ptr<BackgroundUploadSession> session = nullptr);
+  ~UploadManager() override;
+  UploadManager(const UploadManager&) = delete;
+  UploadManager& operator=(const UploadManager&) = delete;
+
+  // Compresses `json` (JSON text) and enqueues it for the endpoint `endpoint`; the upload reports
+  // the record's element count (keys of an object) as its number of feedbacks. Returns the
+  // temporary file holding exactly the compressed body, or null when it stopped early (invalid
+  // JSON, no temporary file, no endpoint).
+  std::shared_ptr<TempFile> uploadJSONFeedback(std::string_view json, int endpoint);
+
+  // Compresses the file's contents in 8192-byte chunks and enqueues them for `endpoint`, with
+  // "type" = `type` appended to the URL when not empty.
+  void uploadFeedback(const platform::fs::path& file, const std::string& type, int endpoint);
+
+  // A new "com.norvel.tavixd.upload_<annotation>_XXXXX" file in the temporary folder (mkstemp),
+  // or null.
+  static std::shared_ptr<TempFile> makeTempFileWithAnnotation(const std::optional<std::string>& annotation);
+
+  // Endpoint URLs, as the bag gives them ("v=2" added to the feedback URL).
+  std::optional<std::string> feedbackEndpoint();
+  void setFeedbackEndpoint(std::optional<std::string> url);
+  std::optional<std::string> crowdsourcingEndpoint();
+  void setCrowdsourcingEndpoint(std::optional<std::string> url);
+  platform::SerialQueue& queue() { return queue_; }
+  const std::shared_ptr<BackgroundUploadSession>& uploadSession() const { return session_; }
+
+  // Both endpoints from `bag` (none when feedback is disabled).
+  static std::optional<std::string> feedbackEndpointFromBag(const TVXBag* bag);
+  static std::optional<std::string> crowdsourcingEndpointFromBag(const TVXBag* bag);
+
+  // BackgroundUploadSession::Delegate.
+  void didCompleteWithError(const BackgroundUploadSession::TaskInfo& task,
+                            const std::optional<platform::http::HTTPURLResponse>& response,
+                            const std::optional<platform::http::URLError>& error) override;
+  void didSendBodyData(const BackgroundUploadSession::TaskInfo& task, std::int64_t totalBytesSent,
+                       std::int64_t totalBytesExpectedToSend) override;
+
+ private:
+  UploadManager(Assembly& assembly, std::shared_ptr<BackgroundUploadSession> session);
+  void bagDidChange(const platform::Notification& notification);
+  void takeEndpointsFromBag(const TVXBag* bag);
+  std::optional<std::string> urlForEndpoint(int endpoint, const std::string& type);
+  void enqueueRequest(platform::http::URLRequest request, const platform::fs::path& file,
+                      std::optional<std::int64_t> numberOfFeedbacks);
+
+  Assembly& assembly_;
+  std::shared_ptr<BackgroundUploadSession> session_;
+  platform::SerialQueue queue_;
+  std::optional<std::string> feedbackEndpoint_;       // on queue_
+  std::optional<std::string> crowdsourcingEndpoint_;  // on queue_
+  platform::NotificationCenter::Registration bagObserver_;
+};
+
+// Appends "name=value" (value percent-encoded) as the last query item of `url`.
+std::string appendingQueryItem(std::string_view url, std::string_view name, std::string_view value);
+
+}  // namespace tavix

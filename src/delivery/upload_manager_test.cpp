@@ -1,0 +1,270 @@
+#include "delivery/upload_manager.h"
+
+#include <gtest/gtest.h>
+#include <httplib.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <future>
+#include <nlohmann/json.hpp>
+
+#include "bag/tvx_bag.h"
+#include "core/assembly.h"
+#include "core/diagnostics.h"
+#include "core/names.h"
+#include "devserver/devserver.h"
+#include "devserver/feedback_routes.h"
+#include "network/request_factory.h"
+#include "platform/clock.h"
+#include "platform/counters.h"
+#include "platform/defaults.h"
+#include "platform/dispatch.h"
+#include "platform/http/url_session.h"
+#include "platform/json_value.h"
+#include "platform/log.h"
+#include "platform/notification_center.h"
+#include "support/temp_home.h"
+
+namespace tavix {
+namespace {
+
+using json = nlohmann::json;
+
+// A TCP port that takes connections into its backlog and never answers: uploads to it stay
+// pending until they are cancelled.
+class BlackHole {
+ public:
+  BlackHole() {
+    fd_ = ::socket(AF_INET, SOCK_STREAM, 0);
+    int on = 1;
+    ::setsockopt(fd_, SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);
+    sockaddr_in address{};
+    address.sin_family = AF_INET;
+    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    ::bind(fd_, reinterpret_cast<sockaddr*>(&address), sizeof address);
+    ::listen(fd_, 512);
+    socklen_t size = sizeof address;
+    ::getsockname(fd_, reinterpret_cast<sockaddr*>(&address), &size);
+    port_ = ntohs(address.sin_port);
+  }
+  ~BlackHole() { close(); }
+  void close() {
+    if (fd_ >= 0) ::close(fd_);
+    fd_ = -1;
+  }
+  int port() const { return port_; }
+  std::string url() const { return "http://127.0.0.1:" + std::to_string(port_); }
+
+ private:
+  int fd_ = -1;
+  int port_ = 0;
+};
+
+class UploadManagerTest : public ::testing::Test {
+ protected:
+  UploadManagerTest() {
+    home.exportEnvironment();
+    assembly.dispatchPool = &pool;
+    assembly.clock = &clock;
+    assembly.paths = platform::Paths::fromEnvironment();
+    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
+    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
+    assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+    std::string error;
+    EXPECT_TRUE(server.start({}, &error)) << error;
+  }
+  ~UploadManagerTest() override {
+    manager.reset();
+    session.reset();
+    transport.reset();
+    pool.drain();
+  }
+
+  void make(std::string journal = "journal") {
+    session = BackgroundUploadSession::create(transport, home.cache() / journal, pool);
+    manager = UploadManager::create(assembly, session);
+  }
+
+  void postBag(json raw) {
+    auto bag = std::make_shared<const TVXBag>(*platform::parseJson(raw.dump())->dictionary(), "tavixd/1");
+    assembly.notificationCenter->post(kTVXBagChangeNotification, nullptr, std::shared_ptr<const TVXBag>(bag));
+  }
+  json devserverBag(const std::string& base) {
+    return {{"feedback_enabled", true}, {"feedback_url", base + "/feedback"}, {"crowdsourcing_url", base + "/crowdsourcing"}};
+  }
+
+  json received() {
+    httplib::Client client("127.0.0.1", server.port());
+    auto res = client.Get("/_feedback");
+    return res ? json::parse(res->body) : json::array();
+  }
+  std::size_t pendingTasks() {
+    std::promise<std::size_t> count;
+    session->getAllTasks([&](auto tasks) { count.set_value(tasks.size()); });
+    return count.get_future().get();
+  }
+  static std::int64_t counter(const std::string& key) { return TavixDiagnosticDataReporter::store().value(key); }
+
+  testing::TempHome home;
+  platform::DispatchPool pool;  // flushes chain synchronous hops: the default, deep enough, pool
+  platform::VirtualClock clock;
+  Assembly assembly;
+  devserver::DevServer server;
+  std::shared_ptr<platform::http::URLSession> transport =
+      std::make_shared<platform::http::URLSession>(platform::http::URLSessionConfiguration{});
+  std::shared_ptr<BackgroundUploadSession> session;
+  std::shared_ptr<UploadManager> manager;
+};
+
+TEST_F(UploadManagerTest, EndpointsFollowTheBag) {
+  make();
+  EXPECT_FALSE(manager->feedbackEndpoint());
+  postBag({{"feedback_enabled", true},
+           {"feedback_url", "https://fb.example/upload?client=1"},
+           {"crowdsourcing_url", "https://cs.example/reports"}});
+  EXPECT_EQ(manager->feedbackEndpoint(), "https://fb.example/upload?client=1&v=2");
+  EXPECT_EQ(manager->crowdsourcingEndpoint(), "https://cs.example/reports");
+
+  // Feedback switched off: no endpoints, JSON uploads stop silently, file uploads say why.
+  postBag({{"feedback_enabled", false},
+           {"feedback_url", "https://fb.example/upload"},
+           {"crowdsourcing_url", "https://cs.example/reports"}});
+  EXPECT_FALSE(manager->feedbackEndpoint());
+  EXPECT_FALSE(manager->crowdsourcingEndpoint());
+  platform::LogCapture logs;
+  EXPECT_TRUE(manager->uploadJSONFeedback(R"({"fb":[]})", kFeedbackEndpoint));
+  const auto file = home.root() / "item";
+  std::ofstream(file) << "custom";
+  manager->uploadFeedback(file, "BrovaneAutoFill", kFeedbackEndpoint);
+  EXPECT_EQ(logs.count("Server feedback endpoint not set, data can't be sent to server"), 1u);
+  EXPECT_EQ(pendingTasks(), 0u);
+  EXPECT_TRUE(received().empty());
+
+  // A notification without a bag changes nothing.
+  postBag(devserverBag(server.baseURL()));
+  assembly.notificationCenter->post(kTVXBagChangeNotification);
+  EXPECT_EQ(manager->feedbackEndpoint(), server.baseURL() + "/feedback?v=2");
+}
+
+TEST_F(UploadManagerTest, UploadsReachTheServerCompressedWithTheirDigestAndAreCounted) {
+  make();
+  postBag(devserverBag(server.baseURL()));
+  const auto sentBefore = counter("com.norvel.tavixd.feedbacksent");
+  const auto notSentBefore = counter("com.norvel.tavixd.feedbacknotsent");
+
+  const json record = {{"fb", json::array({{{"type", "engagement"}}})},
+                       {"agent", "seekara/1"},
+                       {"user_guid", "A"},
+                       {"resource_versions", json::object()},
+                       {"first_use", false},
+                       {"base_time", 1},
+                       {"previous_session_end_reason", 1}};
+  auto file = manager->uploadJSONFeedback(record.dump(), kFeedbackEndpoint);
+  ASSERT_TRUE(file);
+  EXPECT_NE(file->path().filename().string().find("com.norvel.tavixd.upload_tavix_"), std::string::npos);
+  ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sentBefore + 7; }));
+  auto got = received();
+  ASSERT_EQ(got.size(), 1u);
+  EXPECT_EQ(got[0]["json"], record);
+  EXPECT_EQ(got[0]["v"], "2");
+  // The handle reads back exactly the body that was sent.
+  const auto body = file->readContents();
+  ASSERT_TRUE(body);
+  EXPECT_EQ(got[0]["compressed_size"], body->size());
+  std::string plain;
+  ASSERT_TRUE(devserver::inflateRaw(*body, &plain));
+  EXPECT_EQ(json::parse(plain), record);
+
+  // A file upload carries its type, goes out in one piece and counts as one.
+  const auto item = home.root() / "autofill.bin";
+  std::string content(50000, 'x');
+  for (std::size_t i = 0; i < content.size(); i += 7) content[i] = static_cast<char>(i * 31);
+  std::ofstream(item, std::ios::binary) << content;
+  manager->uploadFeedback(item, "BrovaneAutoFill", kFeedbackEndpoint);
+  ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sentBefore + 8; }));
+  got = received();
+  ASSERT_EQ(got.size(), 2u);
+  EXPECT_EQ(got[1]["type"], "BrovaneAutoFill");
+  EXPECT_EQ(got[1]["size"], content.size());
+
+  // The crowdsourcing endpoint takes no "v"; a server error is counted and not retried.
+  httplib::Client control("127.0.0.1", server.port());
+  control.Post("/_faults", R"({"path": "/crowdsourcing", "status": 500, "times": 1})", "application/json");
+  manager->uploadFeedback(item, "", kCrowdsourcingEndpoint);
+  ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacknotsent") == notSentBefore + 1; }));
+  EXPECT_EQ(pendingTasks(), 0u);
+  EXPECT_EQ(received().size(), 2u);
+  EXPECT_TRUE(platform::fs::is_empty(session->journalDirectory())) << "answered uploads leave the journal";
+}
+
+TEST_F(UploadManagerTest, AHundredPendingUploadsDropTheNext) {
+  BlackHole hole;
+  make();
+  postBag(devserverBag(hole.url()));
+  const auto body = home.root() / "body";
+  std::ofstream(body) << "x";
+  platform::http::URLRequest request;
+  request.url = hole.url() + "/feedback";
+  request.method = "POST";
+  for (int i = 0; i < 98; ++i) ASSERT_TRUE(session->uploadTask(request, body, 1));
+  ASSERT_EQ(pendingTasks(), 98u);
+
+  platform::LogCapture logs;
+  EXPECT_TRUE(manager->uploadJSONFeedback(R"({"a":1})", kFeedbackEndpoint));
+  ASSERT_TRUE(testing::waitFor([&] { return pendingTasks() == 99u; }));
+  EXPECT_TRUE(manager->uploadJSONFeedback(R"({"a":2})", kFeedbackEndpoint));  // 99 pending: still sent
+  ASSERT_TRUE(testing::waitFor([&] { return pendingTasks() == 100u; }));
+  EXPECT_TRUE(manager->uploadJSONFeedback(R"({"a":3})", kFeedbackEndpoint));
+  ASSERT_TRUE(testing::waitFor([&] { return logs.contains("too many uploads pending: 100"); }));
+  EXPECT_EQ(pendingTasks(), 100u);
+}
+
+TEST_F(UploadManagerTest, PendingUploadsSurviveARestartAndAreSentOnce) {
+  auto hole = std::make_unique<BlackHole>();
+  const int port = hole->port();
+  make();
+  postBag(devserverBag(hole->url()));
+  const json record = {{"fb", json::array()}, {"agent", "news/2"}};
+  ASSERT_TRUE(manager->uploadJSONFeedback(record.dump(), kFeedbackEndpoint));
+  ASSERT_TRUE(testing::waitFor([&] { return pendingTasks() == 1u; }));
+
+  // The daemon stops with the upload in flight: it stays journalled.
+  manager.reset();
+  session.reset();
+  transport.reset();
+  pool.drain();
+  std::size_t entries = 0;
+  for (const auto& e : platform::fs::directory_iterator(home.cache() / "journal")) entries += e.path().extension() == ".task";
+  EXPECT_EQ(entries, 1u);
+
+  // Next start, the server is back on that address.
+  hole.reset();
+  devserver::DevServer restarted;
+  std::string error;
+  devserver::Options options;
+  options.port = port;
+  ASSERT_TRUE(restarted.start(options, &error)) << error;
+  transport = std::make_shared<platform::http::URLSession>(platform::http::URLSessionConfiguration{});
+  const auto sentBefore = counter("com.norvel.tavixd.feedbacksent");
+  make();
+  ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sentBefore + 2; }));
+  httplib::Client client("127.0.0.1", port);
+  auto got = json::parse(client.Get("/_feedback")->body);
+  ASSERT_EQ(got.size(), 1u);
+  EXPECT_EQ(got[0]["json"], record);
+  EXPECT_TRUE(platform::fs::is_empty(home.cache() / "journal"));
+
+  // A third start finds nothing more to send.
+  manager.reset();
+  session.reset();
+  make();
+  EXPECT_EQ(pendingTasks(), 0u);
+  manager.reset();
+  session.reset();
+  transport.reset();  // its idle connection would hold the server's stop for the keep-alive time
+}
+
+}  // namespace
+}  // namespace tavix

@@ -1,0 +1,47 @@
+// The devserver's feedback back end: POST /feedback and POST /crowdsourcing take raw-DEFLATE
+// bodies with an "X-Norvel-Digest" header, inflate them, check the digest and keep what arrived.
+// GET /_feedback lists it; POST /_reset also forgets it (through reset()).
+#pragma once
+
+#include <filesystem>
+#include <functional>
+#include <mutex>
+#include <string>
+#include <string_view>
+
+#include <httplib.h>
+#include <nlohmann/json.hpp>
+
+namespace tavix::devserver {
+
+// What the daemon's compressing stream sends as its digest for `plain`, written in
+// `chunkSize`-byte writes: SHA-512 over the input of every compressor pass, a write that fills
+// the 4096-byte output buffer more than once being hashed once per pass. Lower-case hex.
+std::string expectedFeedbackDigest(std::string_view plain, std::size_t chunkSize = 8192);
+
+// Raw DEFLATE → bytes; false on a corrupt stream.
+bool inflateRaw(std::string_view compressed, std::string* out);
+
+class FeedbackStore {
+ public:
+  // `dataDir` (may be empty) receives feedback.jsonl, one line per accepted upload.
+  explicit FeedbackStore(std::filesystem::path dataDir = {}) : dataDir_(std::move(dataDir)) {}
+  void setDataDir(std::filesystem::path dataDir) { dataDir_ = std::move(dataDir); }
+  void add(nlohmann::json entry);
+  nlohmann::json all() const;
+  void reset();
+
+ private:
+  mutable std::mutex lock_;
+  std::filesystem::path dataDir_;
+  nlohmann::json received_ = nlohmann::json::array();
+};
+
+using RouteWrapper = std::function<httplib::Server::Handler(httplib::Server::Handler)>;
+
+// Adds the two upload routes (through `served`, so they are recorded and take faults) and the
+// control route GET /_feedback. Call before any catch-all route. Takes the server's pre-routing
+// handler (uploads' "Content-Encoding" is recorded as "X-Devserver-Content-Encoding").
+void addFeedbackRoutes(httplib::Server& server, FeedbackStore& store, const RouteWrapper& served);
+
+}  // namespace tavix::devserver
