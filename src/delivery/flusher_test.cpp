@@ -5,6 +5,7 @@
 #include <nlohmann/json.hpp>
 
 #include "bag/tavix_bag_controller.h"
+#include "network/user_agent.h"
 #include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
@@ -79,6 +80,17 @@ class FlusherTest : public ::testing::Test {
     assembly.bagController = TavixBagController::create(assembly);
     assembly.bagController->currentBag();
     ASSERT_TRUE(waitFor([&] { return assembly.uploadManager->feedbackEndpoint().has_value(); }));
+    // The fetch leaves a session of its own; the tests count only the sessions they write.
+    ASSERT_TRUE(waitFor([&] {
+      bool found = false;
+      for (auto& handle : assembly.persistentStorage->getAvailableSessionHandles()) {
+        auto record = handle->peekRecord();
+        if (!record || record->agent() != tavixdUserAgent()) continue;
+        assembly.persistentStorage->deleteSessionWithFileContainer(handle);
+        found = true;
+      }
+      return found;
+    }));
   }
 
   void writeSession(const std::string& agent, int events) {
