@@ -32,6 +32,13 @@ struct DispatchPool::Impl {
   std::mutex lock;
   std::condition_variable idle;
   std::size_t inFlight = 0;  // posted through post() or a queue and not yet finished
+  // The queues made on the pool, so that tasks still queued when it stops can be dropped: a task
+  // often holds the object that owns its queue, and would keep both alive for ever.
+  struct Queue {
+    std::weak_ptr<void> queue;
+    std::function<void()> dropPending;
+  };
+  std::vector<Queue> queues;  // under `lock`
 };
 
 DispatchPool::DispatchPool(unsigned threads) : impl_(std::make_unique<Impl>()) {
@@ -49,6 +56,22 @@ DispatchPool::~DispatchPool() {
   impl_->work.reset();
   impl_->context.stop();
   for (auto& t : impl_->threads) t.join();
+  std::vector<Impl::Queue> queues;
+  {
+    std::lock_guard<std::mutex> guard(impl_->lock);
+    queues.swap(impl_->queues);
+  }
+  for (auto& q : queues) {
+    if (auto alive = q.queue.lock()) q.dropPending();
+  }
+}
+
+void DispatchPool::registerQueue(std::weak_ptr<void> queue, std::function<void()> dropPending) {
+  std::lock_guard<std::mutex> guard(impl_->lock);
+  auto& queues = impl_->queues;
+  queues.erase(std::remove_if(queues.begin(), queues.end(), [](const auto& q) { return q.queue.expired(); }),
+               queues.end());
+  queues.push_back({std::move(queue), std::move(dropPending)});
 }
 
 void DispatchPool::beginWork() {
@@ -109,6 +132,14 @@ struct SerialQueue::Impl {
   // Gives the queue up: to the waiter at the front, to a new drain job, or to nobody.
   void release(std::unique_lock<std::mutex>& guard, const std::shared_ptr<Impl>& self);
   void postDrain(const std::shared_ptr<Impl>& self);
+  // The pool has stopped: the tasks never to run are destroyed, outside the lock.
+  void dropPending() {
+    std::deque<Item> dropped;
+    {
+      std::lock_guard<std::mutex> guard(lock);
+      dropped.swap(items);
+    }
+  }
 };
 
 namespace {
@@ -170,7 +201,12 @@ void SerialQueue::Impl::release(std::unique_lock<std::mutex>& guard, const std::
 }
 
 SerialQueue::SerialQueue(DispatchPool& pool, std::string label)
-    : label_(std::move(label)), impl_(std::make_shared<Impl>(pool)) {}
+    : label_(std::move(label)), impl_(std::make_shared<Impl>(pool)) {
+  std::weak_ptr<Impl> weak = impl_;
+  pool.registerQueue(impl_, [weak] {
+    if (auto queue = weak.lock()) queue->dropPending();
+  });
+}
 
 SerialQueue::~SerialQueue() = default;
 

@@ -45,6 +45,8 @@ class DispatchPool {
 
  private:
   friend class SerialQueue;
+  // A queue made on the pool: `dropPending` runs once the pool has stopped, while `queue` lives.
+  void registerQueue(std::weak_ptr<void> queue, std::function<void()> dropPending);
   void beginWork();
   void endWork();
 
