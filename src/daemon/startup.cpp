@@ -95,9 +95,10 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   platform::setLogLevel(options.logLevel);
   auto& log = TavixLogForCategory(TavixLoggingCategoryDefault);
 
+  // Before the pool: tasks dropped when the pool goes still end their transactions.
+  platform::TransactionTracker transactions;
   platform::DispatchPool pool;
   platform::SystemClock clock(pool);
-  platform::TransactionTracker transactions;
   platform::SerialQueue activityQueue(pool, "com.norvel.tavixd.activities");
   platform::ActivityScheduler activities(clock, activityQueue, transactions);
   platform::RunLoop runLoop;
@@ -272,6 +273,9 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   pool.drain();  // let queued work finish while everything it may touch is still alive
   // A bag fetch may still be on the wire; its completion must not reach the services going next.
   assembly.bagController->invalidate();
+  // Work that arrived since (a last feedback event, a closing connection) must not run while the
+  // assembly's objects are being destroyed: stop the workers first.
+  pool.shutdown();
   if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
   log.info("tavixd stopped");
   return 0;

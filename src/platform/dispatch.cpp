@@ -52,18 +52,30 @@ DispatchPool::DispatchPool(unsigned threads) : impl_(std::make_unique<Impl>()) {
 }
 
 DispatchPool::~DispatchPool() {
-  drain();
-  impl_->work.reset();
-  impl_->context.stop();
-  for (auto& t : impl_->threads) t.join();
+  shutdown();
+  dropPending();
+}
+
+void DispatchPool::dropPending() {
   std::vector<Impl::Queue> queues;
   {
     std::lock_guard<std::mutex> guard(impl_->lock);
-    queues.swap(impl_->queues);
+    queues = impl_->queues;
   }
   for (auto& q : queues) {
     if (auto alive = q.queue.lock()) q.dropPending();
   }
+}
+
+void DispatchPool::shutdown() {
+  if (impl_->threads.empty()) return;
+  drain();
+  impl_->work.reset();
+  impl_->context.stop();
+  for (auto& t : impl_->threads) t.join();
+  impl_->threads.clear();
+  // Tasks queued meanwhile will never run: destroy them now, while what they hold is alive.
+  dropPending();
 }
 
 void DispatchPool::registerQueue(std::weak_ptr<void> queue, std::function<void()> dropPending) {

@@ -37,6 +37,12 @@ class DispatchPool {
   // Only for tests and shutdown; never call it from a pool thread.
   void drain();
 
+  // Drains, then stops the workers and destroys the queued tasks that will never run: nothing runs
+  // on the pool afterwards, so the objects whose queues live on it can be destroyed safely. Work
+  // queued later never runs (it is destroyed with the pool); a sync() still does, on its caller's
+  // thread. From the thread that owns the pool. The destructor calls it.
+  void shutdown();
+
   unsigned threadCount() const;
 
   // The Asio io_context behind the pool, as an opaque pointer for the few platform pieces
@@ -47,6 +53,7 @@ class DispatchPool {
   friend class SerialQueue;
   // A queue made on the pool: `dropPending` runs once the pool has stopped, while `queue` lives.
   void registerQueue(std::weak_ptr<void> queue, std::function<void()> dropPending);
+  void dropPending();
   void beginWork();
   void endWork();
 
