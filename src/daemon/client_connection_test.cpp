@@ -16,6 +16,7 @@
 #include "platform/ipc/launch_events.h"
 #include "platform/ipc/server.h"
 #include "platform/log.h"
+#include "cache/query_cache.h"
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
 #include "support/temp_home.h"
@@ -105,12 +106,27 @@ proto::Envelope notify(const std::string& name, const std::string& stream = "") 
 TEST(ClientConnection, SilenceEndsTheKeepAliveTransactionAndTheNextMessageOpensOne) {
   Harness h;
   EXPECT_EQ(h.transactions.openCount(), 1u);
-  h.advance(59);
+  proto::Envelope configure;
+  configure.mutable_configure()->mutable_configuration()->set_identifier("com.norvel.seekara");
+  configure.mutable_configure()->mutable_configuration()->set_user_agent("seekara/1");
+  ASSERT_TRUE(h.call(configure).has_configure_reply());
+  auto state = h.assembly.clientStateManager->stateForClientIdentifier("com.norvel.seekara");
+  ASSERT_TRUE(state && state->queryCache());
+  state->queryCache()->set(
+      makeRef<CachedResultSet>("ca", nullptr, platform::Dictionary{{"query", "camera"}}, "u", "[1]", h.clock.now()));
+  // No bag controller here: once the wait is over the client hears why it has no bag.
+  h.advance(1);
+  auto loaded = h.receive();
+  ASSERT_TRUE(loaded.has_bag_did_load());
+  EXPECT_EQ(loaded.bag_did_load().error().reason(), "timeout");
+  h.advance(58);
   h.call(notify("a"));
   h.advance(59);
   EXPECT_EQ(h.transactions.openCount(), 1u) << "each message re-arms the idle timer";
+  EXPECT_EQ(state->queryCache()->count(), 1u);
   h.advance(2);
   EXPECT_EQ(h.transactions.openCount(), 0u);
+  EXPECT_EQ(state->queryCache()->count(), 0u) << "a silent client's cached replies go with its transaction";
   h.call(notify("b"));
   EXPECT_EQ(h.transactions.openCount(), 1u);
   h.client.reset();  // the client goes away: its transaction goes with it
