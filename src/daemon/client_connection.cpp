@@ -469,7 +469,7 @@ void ClientConnection::feedback(std::uint64_t callId) {
   trace(0x2b000024);
   ensureState();
   proto::Envelope out;
-  auto* reply = out.mutable_feedback_reply();
+  out.mutable_feedback_reply();
   auto manager = state_ ? state_->sessionManager() : nullptr;
   if (!manager) {
     if (callId != 0) send(callId, out);
@@ -483,7 +483,6 @@ void ClientConnection::feedback(std::uint64_t callId) {
     if (auto connection = weak.lock(); connection && callId != 0) connection->send(out.SerializeAsString());
     trace(0x2b000028);
   });
-  (void)reply;
 }
 
 void ClientConnection::engagedCompletionMessage(const proto::Envelope& in) {
