@@ -61,10 +61,10 @@ class QueryDaemonTest : public ::testing::Test {
       defaults.setObject("TVXBagURL", server.base + "/bag");
       ASSERT_TRUE(defaults.synchronize());
     }
-    tavixd.emplace(TAVIXD_BINARY, home, std::vector<std::string>{"--socket", socket()});
+    tavixd.emplace(TAVIXD_BINARY, home, std::vector<std::string>{"--socket", socket(), "--log-level", "debug"});
     ASSERT_TRUE(tavixd->waitForLog("tavixd started")) << tavixd->log();
     // With the bag in, no client waits for it (a wait counts as network use and delays warming).
-    ASSERT_TRUE(tavixd->waitForLog("Got bag")) << tavixd->log();
+    ASSERT_TRUE(tavixd->waitForLog("bag change notification received")) << tavixd->log();
     client::Client::Options options;
     options.socketPath = socket();
     options.configuration.set_identifier("com.norvel.seekara");
@@ -230,7 +230,7 @@ TEST_F(QueryDaemonTest, FeedbackIsTiedToItsQueryWarmsTheConnectionAndFeedsEngage
   report(appear, 1);
   report(appear, 2);
   ASSERT_TRUE(waitForRecord("search_view_appear", 2)) << dumpRecords();
-  EXPECT_TRUE(tavix::testing::waitFor([&] { return served("/warm") == 1; }));
+  EXPECT_TRUE(tavix::testing::waitFor([&] { return served("/warm") == 1; })) << tavixd->log();
   EXPECT_EQ(served("/warm"), 1);
 
   // An engaged completion: the record takes the query id of its result, not the one sent beside

@@ -337,19 +337,19 @@ void ClientConnection::configure(std::uint64_t callId, const proto::Envelope& in
     connection_->invalidate();
     return;
   }
+  // The bag may take a fetch: it is handed over as bagDidLoad when it comes, without holding up
+  // the reply or the client's next calls.
+  if (!(previous && previous->identifier == state_->identifier() && bagObserver_)) {
+    std::weak_ptr<ClientConnection> weak = weak_from_this();
+    state_->bagAsync(userAgent_, [weak](const std::shared_ptr<const TVXBag>& bag, const std::optional<TVXError>& error) {
+      auto self = weak.lock();
+      if (!self) return;
+      self->connection_->queue().async([self, bag, error] { self->bagDidLoad(bag, error); });
+    });
+  }
   proto::Envelope out;
   out.mutable_configure_reply()->set_has_endpoint(false);
   if (callId != 0) send(callId, out);
-  if (previous && state_ && previous->identifier == state_->identifier() && bagObserver_) return;
-
-  // The bag may take a fetch: it is handed over as bagDidLoad when it comes, without holding up
-  // the client's next calls.
-  std::weak_ptr<ClientConnection> weak = weak_from_this();
-  state_->bagAsync(userAgent_, [weak](const std::shared_ptr<const TVXBag>& bag, const std::optional<TVXError>& error) {
-    auto self = weak.lock();
-    if (!self) return;
-    self->connection_->queue().async([self, bag, error] { self->bagDidLoad(bag, error); });
-  });
 }
 
 void ClientConnection::bagDidLoad(const std::shared_ptr<const TVXBag>& bag, const std::optional<TVXError>& error) {
