@@ -123,13 +123,7 @@ std::vector<const proto::CTSearchResultForFeedback*> listedResults(const proto::
 void ClientConnection::reportFeedbackPayloadData(const std::string& data, std::uint64_t argumentQueryId) {
   ensureState();
   auto reportError = [this](const std::string& reason) {
-    proto::CTErrorFeedback error;
-    error.set_code(500);
-    error.set_domain(kTVXErrorDomain);
-    error.set_reason(reason);
-    const std::string guid = assembly_.guidController ? assembly_.guidController->currentUserGUID() : std::string();
-    auto session = ClientSession::open(assembly_, makeTavixFeedbackWithCodable(error, 0, guid, tavixdUserAgent()));
-    if (session) session->sessionComplete();
+    ClientSession::createFeedbackSessionFromError(500, kTVXErrorDomain, reason, assembly_);
   };
   if (!state_) {
     reportError("client state nil");

@@ -24,14 +24,9 @@ platform::Logger& flusherLog() { return TavixLogForCategory(TavixLoggingCategory
 
 // An oversize item is reported as a session of its own whose only event is the error.
 void reportOversizeItem(Assembly& assembly, std::uint64_t size, const std::string& type) {
-  proto::CTErrorFeedback error;
-  error.set_code(4);
-  error.set_domain(kTVXErrorDomain);
   // The record has no user-info dictionary; its two entries travel in the reason.
-  error.set_reason("size=" + std::to_string(size) + " type=" + type);
-  const std::string guid = assembly.guidController ? assembly.guidController->currentUserGUID() : std::string();
-  auto session = ClientSession::open(assembly, makeTavixFeedbackWithCodable(error, 0, guid, tavixdUserAgent()));
-  if (session) session->sessionComplete();
+  ClientSession::createFeedbackSessionFromError(4, kTVXErrorDomain, "size=" + std::to_string(size) + " type=" + type,
+                                                assembly);
 }
 
 }  // namespace

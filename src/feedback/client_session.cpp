@@ -58,6 +58,21 @@ ClientSession::ClientSession(Assembly& assembly)
   backingStore_.set_version(tavixdUserAgent());
 }
 
+FeedbackRef makeDaemonErrorFeedback(std::int64_t code, const std::string& domain, const std::string& reason,
+                                    Assembly& assembly) {
+  proto::CTErrorFeedback error;
+  error.set_code(static_cast<std::int32_t>(code));
+  error.set_domain(domain);
+  error.set_reason(reason);
+  const std::string guid = assembly.guidController ? assembly.guidController->currentUserGUID() : std::string();
+  return makeTavixFeedbackWithCodable(error, 0, guid, tavixdUserAgent());
+}
+
+void ClientSession::createFeedbackSessionFromError(std::int64_t code, const std::string& domain,
+                                                   const std::string& reason, Assembly& assembly) {
+  if (auto session = open(assembly, makeDaemonErrorFeedback(code, domain, reason, assembly))) session->sessionComplete();
+}
+
 std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackRef first, int previousSessionEndReason) {
   auto session = std::make_shared<ClientSession>(assembly);
   auto& store = session->backingStore_;

@@ -27,6 +27,10 @@ class FileContainer;
 // vocly that the lower-cased agent contains; none otherwise.
 std::optional<std::string> firstUseKeyForAgent(std::string_view agent);
 
+// An error event of the daemon itself: query id 0, the current GUID, the daemon's user agent.
+FeedbackRef makeDaemonErrorFeedback(std::int64_t code, const std::string& domain, const std::string& reason,
+                                    Assembly& assembly);
+
 class ClientSession {
  public:
   // A bare session: sessionStart = now, version = the daemon's user agent. Used for read-back.
@@ -37,6 +41,11 @@ class ClientSession {
   // Opens a session: header from the first event, first-use bookkeeping, a new session file
   // with the header written, then the first event (when given) added.
   static std::shared_ptr<ClientSession> open(Assembly& assembly, FeedbackRef first, int previousSessionEndReason = 1);
+  // A session of its own whose first event is an error (query id 0, the current GUID, the
+  // daemon's user agent), completed at once: how a failure that belongs to no client's session
+  // is reported.
+  static void createFeedbackSessionFromError(std::int64_t code, const std::string& domain, const std::string& reason,
+                                             Assembly& assembly);
   // A session read back from a file.
   static std::shared_ptr<ClientSession> fromRecord(Assembly& assembly, proto::CTClientSession record);
 

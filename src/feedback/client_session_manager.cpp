@@ -141,12 +141,7 @@ void ClientSessionManager::flushSessionInvalidationWithAgent(const std::string& 
 void ClientSessionManager::reportErrorAsTavixdFeedback(int code, const std::string& domain, const std::string& reason,
                                                        Assembly& assembly) {
   if (!assembly.clientSessionManager) return;
-  proto::CTErrorFeedback error;
-  error.set_code(code);
-  error.set_domain(domain);
-  error.set_reason(reason);
-  const std::string guid = assembly.guidController ? assembly.guidController->currentUserGUID() : std::string();
-  assembly.clientSessionManager->addTavixFeedback(makeTavixFeedbackWithCodable(error, 0, guid, tavixdUserAgent()));
+  assembly.clientSessionManager->addTavixFeedback(makeDaemonErrorFeedback(code, domain, reason, assembly));
 }
 
 bool ClientSessionManager::feedbackEnabledFor(const std::string& userAgent) const {
