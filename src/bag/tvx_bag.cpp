@@ -5,6 +5,7 @@
 #include <fmt/core.h>
 
 #include "network/user_agent.h"
+#include "platform/notification_center.h"
 
 namespace tavix {
 
@@ -204,5 +205,12 @@ std::optional<std::string> TVXBag::bagURL() const {
 }
 
 bool TVXBag::refreshDisabled() const { return rawValueForKey("__refresh_disabled") != nullptr; }
+
+std::shared_ptr<const TVXBag> bagOfNotification(const platform::Notification& notification) {
+  if (auto* bag = std::any_cast<std::shared_ptr<const TVXBag>>(&notification.object)) return *bag;
+  if (auto* bag = std::any_cast<std::shared_ptr<TVXBag>>(&notification.object)) return *bag;
+  if (auto* bag = std::any_cast<TVXBag>(&notification.object)) return std::make_shared<const TVXBag>(*bag);
+  return nullptr;
+}
 
 }  // namespace tavix

@@ -21,6 +21,16 @@
 
 namespace tavix {
 
+namespace platform {
+struct Notification;
+}
+
+class TVXBag;
+
+// The bag a "TVXBagChangeNotification" carries as its object, whichever shared form the poster
+// used; none when it carries no bag.
+std::shared_ptr<const TVXBag> bagOfNotification(const platform::Notification& notification);
+
 class TVXBag {
  public:
   TVXBag(std::shared_ptr<const platform::Dictionary> rawBag, std::string userAgent);

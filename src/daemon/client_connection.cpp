@@ -377,8 +377,7 @@ void ClientConnection::bagDidLoad(const std::shared_ptr<const TVXBag>& bag, cons
 }
 
 void ClientConnection::bagChangeNotification(const platform::Notification& notification) {
-  std::shared_ptr<const TVXBag> bag;
-  if (auto* p = std::any_cast<std::shared_ptr<const TVXBag>>(&notification.object)) bag = *p;
+  auto bag = bagOfNotification(notification);
   bagLog().info("bag change notification: {}", bag ? bag->version().value_or("(no version)") : "(null)");
   if (!bag) return;
   // Labelled for this client, as its state holds it.

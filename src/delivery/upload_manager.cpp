@@ -141,8 +141,7 @@ void UploadManager::takeEndpointsFromBag(const TVXBag* bag) {
 
 void UploadManager::bagDidChange(const platform::Notification& notification) {
   TavixLogForCategory(TavixLoggingCategoryFlusher).notice("bag change notification received");
-  const auto* bag = std::any_cast<std::shared_ptr<const TVXBag>>(&notification.object);
-  if (bag && *bag) takeEndpointsFromBag(bag->get());
+  if (auto bag = bagOfNotification(notification)) takeEndpointsFromBag(bag.get());
 }
 
 std::optional<std::string> UploadManager::feedbackEndpoint() {

@@ -81,13 +81,6 @@ std::vector<TVXQueryItem> parseDebugParameters(const std::string& text, bool* ok
   return items;
 }
 
-std::shared_ptr<const TVXBag> bagFromNotification(const platform::Notification& n) {
-  if (auto p = std::any_cast<std::shared_ptr<const TVXBag>>(&n.object)) return *p;
-  if (auto p = std::any_cast<std::shared_ptr<TVXBag>>(&n.object)) return *p;
-  if (auto p = std::any_cast<TVXBag>(&n.object)) return std::make_shared<const TVXBag>(*p);
-  return nullptr;
-}
-
 }  // namespace
 
 // The snapshot. Every field below `queue` is touched only on it.
@@ -611,7 +604,7 @@ void TVXNetworkRequestFactory::start() {
   context_->bagRegistration = assembly_.notificationCenter->addObserver(
       kTVXBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
         auto self = weak.lock();
-        auto bag = bagFromNotification(n);
+        auto bag = bagOfNotification(n);
         if (self && bag) Builder::didGetBag(*self, std::move(bag));
       });
   // A new user identifier starts a new maps user session, so "X-Norvel-GeoSession" follows it.

@@ -25,14 +25,6 @@ namespace {
 platform::Logger& cachingLog() { return TavixLogForCategory(TavixLoggingCategoryCaching); }
 platform::Logger& sessionLog() { return TavixLogForCategory(TavixLoggingCategorySession); }
 
-// The bag a change notification carries, whichever shared form the poster used.
-std::shared_ptr<const TVXBag> bagOfNotification(const platform::Notification& notification) {
-  if (auto* bag = std::any_cast<std::shared_ptr<const TVXBag>>(&notification.object)) return *bag;
-  if (auto* bag = std::any_cast<std::shared_ptr<TVXBag>>(&notification.object)) return *bag;
-  if (auto* bag = std::any_cast<TVXBag>(&notification.object)) return std::make_shared<const TVXBag>(*bag);
-  return nullptr;
-}
-
 std::shared_ptr<const TVXBag> labelled(const TVXBag& bag, const std::string& userAgent) {
   return std::make_shared<const TVXBag>(bag.sharedRawBag(), userAgent);
 }
