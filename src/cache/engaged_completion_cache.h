@@ -6,9 +6,10 @@
 // Threading: every public operation is safe from any thread. The handle is opened in SQLite's
 // full-mutex mode, and every use of it, from preparing a statement to finalising it, holds the
 // cache's connection lock, so that a rebuild after corruption (which closes and reopens the
-// handle) never pulls it from under a statement. Adds and clears run on the caller's thread; searches and recency counts run on
-// the dispatch pool (the search queue), the caller waiting for a search at most its time-out;
-// parameter updates run synchronously on the serial update queue "com.norvel.tavixd.eccupdateq".
+// handle) never pulls it from under a statement. Adds and clears run on the caller's thread;
+// searches and recency counts run on the dispatch pool (the search queue), the caller waiting for
+// a search at most its time-out; parameter updates run synchronously on the serial update queue
+// "com.norvel.tavixd.eccupdateq".
 // Time: engagement dates come from the injected Clock; only the search time-out is a real wait.
 #pragma once
 

@@ -85,7 +85,9 @@ TEST(TavixUserGUIDController, ObserverMayReadTheNewIdentifier) {
   auto controller = std::make_shared<TavixUserGUIDController>(assembly);
   std::string seen;
   auto reg = assembly.notificationCenter->addObserver(kTVXUserGUIDChangeNotification, nullptr, nullptr,
-                                                      [&](const platform::Notification&) { seen = controller->currentUserGUID(); });
+                                                      [&](const platform::Notification&) {
+                                                        seen = controller->currentUserGUID();
+                                                      });
   controller->reset();
   pool.drain();
   EXPECT_EQ(seen, controller->currentUserGUID());

@@ -208,13 +208,15 @@ void ClientConnection::handleMessage(const std::string& payload) {
       if (!state_) return;  // no bound state, no reply: as for queries
       std::weak_ptr<platform::ipc::IpcConnection> weak = connection_;
       state_->bag(userAgent_, [weak, callId](const std::shared_ptr<const TVXBag>& bag,
-                                                  const std::optional<TVXError>& error) {
+                                             const std::optional<TVXError>& error) {
         proto::Envelope reply;
         reply.set_call_id(callId);
         if (bag) bagToWire(*bag, reply.mutable_bag_reply()->mutable_bag());
         if (error) errorToWire(*error, reply.mutable_bag_reply()->mutable_error());
         if (!bag && !error) reply.mutable_bag_reply();
-        if (auto connection = weak.lock(); connection && callId != 0) sendToClient(*connection, reply.SerializeAsString());
+        if (auto connection = weak.lock(); connection && callId != 0) {
+          sendToClient(*connection, reply.SerializeAsString());
+        }
       });
       return;
     }
@@ -316,11 +318,11 @@ void ClientConnection::ensureState() {
   std::string fullUserAgent;
   if (!configuration_->userAgent.empty()) {
     // The factory's device answers are the process's: the system's version is read once.
+    const auto& agent = configuration_->userAgent;
     fullUserAgent = (assembly_.requestFactory
-                         ? createUserAgentString(configuration_->userAgent, assembly_.requestFactory->deviceInformation())
-                         : createUserAgentString(configuration_->userAgent,
-                                                 DeviceInformation(assembly_.userDefaults.get())))
-                        .value_or(configuration_->userAgent);
+                         ? createUserAgentString(agent, assembly_.requestFactory->deviceInformation())
+                         : createUserAgentString(agent, DeviceInformation(assembly_.userDefaults.get())))
+                        .value_or(agent);
   }
   // The tool re-labels its state with each connection's agent; other clients keep the state's
   // first one on purpose.

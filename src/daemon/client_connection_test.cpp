@@ -97,6 +97,13 @@ struct Harness {
   }
 };
 
+proto::Envelope configure(const std::string& identifier, const std::string& userAgent) {
+  proto::Envelope e;
+  e.mutable_configure()->mutable_configuration()->set_identifier(identifier);
+  e.mutable_configure()->mutable_configuration()->set_user_agent(userAgent);
+  return e;
+}
+
 proto::Envelope notify(const std::string& name, const std::string& stream = "") {
   proto::Envelope e;
   e.mutable_notify()->set_name(name);
@@ -107,10 +114,7 @@ proto::Envelope notify(const std::string& name, const std::string& stream = "") 
 TEST(ClientConnection, SilenceEndsTheKeepAliveTransactionAndTheNextMessageOpensOne) {
   Harness h;
   EXPECT_EQ(h.transactions.openCount(), 1u);
-  proto::Envelope configure;
-  configure.mutable_configure()->mutable_configuration()->set_identifier("com.norvel.seekara");
-  configure.mutable_configure()->mutable_configuration()->set_user_agent("seekara/1");
-  ASSERT_TRUE(h.call(configure).has_configure_reply());
+  ASSERT_TRUE(h.call(configure("com.norvel.seekara", "seekara/1")).has_configure_reply());
   auto state = h.assembly.clientStateManager->stateForClientIdentifier("com.norvel.seekara");
   ASSERT_TRUE(state && state->queryCache());
   state->queryCache()->set(
@@ -144,11 +148,9 @@ TEST(ClientConnection, SilenceEndsTheKeepAliveTransactionAndTheNextMessageOpensO
 TEST(ClientConnection, OneBagPerClientHoweverOftenItConfiguresAndLateRepliesAreLogged) {
   Harness h;
   platform::LogCapture capture;
-  proto::Envelope configure;
-  configure.mutable_configure()->mutable_configuration()->set_identifier("com.norvel.seekara");
-  configure.mutable_configure()->mutable_configuration()->set_user_agent("seekara/1");
-  ASSERT_TRUE(h.call(configure).has_configure_reply());
-  ASSERT_TRUE(h.call(configure, 2).has_configure_reply()) << "the first bag has not come yet";
+  const auto seekara = configure("com.norvel.seekara", "seekara/1");
+  ASSERT_TRUE(h.call(seekara).has_configure_reply());
+  ASSERT_TRUE(h.call(seekara, 2).has_configure_reply()) << "the first bag has not come yet";
   h.advance(1);
   auto loaded = h.receive();
   ASSERT_TRUE(loaded.has_bag_did_load());
@@ -238,12 +240,8 @@ TEST(ClientConnection, QueriesBeforeAValidConfigurationAndOfUnknownKindAreNotAns
 TEST(ClientConnection, KeepsItsFirstIdentifierAndBuildsTheFullUserAgent) {
   Harness h;
   platform::LogCapture capture;
-  proto::Envelope configure;
-  configure.mutable_configure()->mutable_configuration()->set_identifier("first");
-  configure.mutable_configure()->mutable_configuration()->set_user_agent("client/2");
-  EXPECT_TRUE(h.call(configure).has_configure_reply());
-  configure.mutable_configure()->mutable_configuration()->set_identifier("second");
-  EXPECT_TRUE(h.call(configure).has_configure_reply());
+  EXPECT_TRUE(h.call(configure("first", "client/2")).has_configure_reply());
+  EXPECT_TRUE(h.call(configure("second", "client/2")).has_configure_reply());
   EXPECT_TRUE(capture.contains("session identifier must match"));
   h.connection->queue().sync([&] {
     ASSERT_TRUE(h.subject->configuration());

@@ -252,7 +252,8 @@ TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
     proxies.emplace_back(configuration);
   };
   make();
-  center->post("TVXBagChangeNotification", nullptr, {}, bagChangeUserInfo(bag(R"({"supported_geo_location_sources":["gps"]})")));
+  center->post("TVXBagChangeNotification", nullptr, {},
+               bagChangeUserInfo(bag(R"({"supported_geo_location_sources":["gps"]})")));
   factory->flushContextAccessQueue();
   ASSERT_GE(location->starts.load(), 1);
 
@@ -309,7 +310,8 @@ TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
   auto download = factory->fileDownloadRequest("https://r.example/f", "etag1", true);
   EXPECT_EQ(download->headers.get("X-Norvel-FuzzedLatLong"), "-33.900000,151.200000");
 
-  center->post("TVXBagChangeNotification", nullptr, {}, bagChangeUserInfo(bag(R"({"marvola_configuration":{"enabled":true}})")));
+  center->post("TVXBagChangeNotification", nullptr, {},
+               bagChangeUserInfo(bag(R"({"marvola_configuration":{"enabled":true}})")));
   factory->flushContextAccessQueue();
   EXPECT_EQ(factory->geoLocationSource(), "bagno.all");
   ASSERT_EQ(proxies.size(), 2u);
@@ -321,7 +323,8 @@ TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
 
 TEST_F(RequestFactoryTest, NewsWithoutAuthorisationAndDeniedUsersSendUserno) {
   make();
-  center->post("TVXBagChangeNotification", nullptr, {}, bagChangeUserInfo(bag(R"({"supported_geo_location_sources":"all"})")));
+  center->post("TVXBagChangeNotification", nullptr, {},
+               bagChangeUserInfo(bag(R"({"supported_geo_location_sources":"all"})")));
   factory->flushContextAccessQueue();
   location->deliver({1.5, 2.5, 100, 6, clock.now()});
   factory->flushContextAccessQueue();
@@ -445,13 +448,15 @@ TEST_F(RequestFactoryTest, BagSwitchesForNewsAndMessagesReachManagedConfiguratio
     return v && v->array() ? platform::toJson(*v) : std::string("absent");
   };
 
-  center->post("TVXBagChangeNotification", nullptr, {}, bagChangeUserInfo(bag(R"({"clients":{"news":{"enabled":false}}})")));
+  center->post("TVXBagChangeNotification", nullptr, {},
+               bagChangeUserInfo(bag(R"({"clients":{"news":{"enabled":false}}})")));
   pool.drain();
   managed.synchronize();
   EXPECT_EQ(managed.objectForKey(kTVXFeatureSeekaraNewsAllowed), PropertyValue(false));
   EXPECT_EQ(blacklisted(), "[]");
 
-  center->post("TVXBagChangeNotification", nullptr, {}, bagChangeUserInfo(bag(R"({"enabled":false,"clients":{"news":{"enabled":true}}})")));
+  center->post("TVXBagChangeNotification", nullptr, {},
+               bagChangeUserInfo(bag(R"({"enabled":false,"clients":{"news":{"enabled":true}}})")));
   pool.drain();
   managed.synchronize();
   EXPECT_EQ(managed.objectForKey(kTVXFeatureSeekaraNewsAllowed), PropertyValue(true));
@@ -462,7 +467,8 @@ TEST_F(RequestFactoryTest, TheBagsProxyConfigurationDecidesEveryTasksProxy) {
   defaults->setObject("TVXUseMarvola", true);
   make();
   auto configure = [&](const char* json) {
-    center->post("TVXBagChangeNotification", nullptr, {}, bagChangeUserInfo(bag(json)));
+    center->post("TVXBagChangeNotification", nullptr, {},
+               bagChangeUserInfo(bag(json)));
     return std::pair{factory->proxyGetStatus(), factory->proxyURL()};
   };
   EXPECT_EQ(configure(R"({})"), std::pair(0, std::optional<std::string>()));

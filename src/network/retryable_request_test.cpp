@@ -137,13 +137,4 @@ TEST_F(RetryableRequestTest, APassedDeadlineReportsTheFirstErrorAtOnce) {
   EXPECT_EQ(attemptsOnTheWire(), 1u);
 }
 
-TEST_F(RetryableRequestTest, FeedbackCountRidesOnTheTask) {
-  auto task = session->dataTask(request("/bag"), [](auto, auto, auto) {});
-  EXPECT_FALSE(numberOfFeedbacks(*task));
-  setNumberOfFeedbacks(*task, 12);
-  EXPECT_EQ(numberOfFeedbacks(*task), 12);
-  setNumberOfFeedbacks(*task, std::nullopt);
-  EXPECT_FALSE(numberOfFeedbacks(*task));
-}
-
 }  // namespace

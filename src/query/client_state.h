@@ -6,8 +6,9 @@
 //
 // Threading: any method may be called from any thread; the fields below are guarded by one mutex.
 // ensureBag() (the query paths' wait) may block the caller for up to
-// kTVXFirstLaunchBagSemaphoreWait while the bag controller fetches; bag() never blocks. The query methods run their synchronous part on the caller's queue and
-// finish on the URL session's queue; their reply block is called exactly once.
+// kTVXFirstLaunchBagSemaphoreWait while the bag controller fetches; bag() never blocks. The query
+// methods run their synchronous part on the caller's queue and finish on the URL session's queue;
+// their reply block is called exactly once.
 #pragma once
 
 #include <condition_variable>

@@ -198,8 +198,8 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
         log.error("{}", fmt::format(fmt::runtime(kind.fetchFailed), status,
                                     error ? error->description : std::string("none")));
         // The server's status is not one of the daemon's own codes: it travels in a domain of its own.
-        reply(queryId, std::nullopt,
-              transport ? transport : TVXError{kTVXHTTPStatusErrorDomain, status, fmt::format("statusCode {}", status)});
+        const TVXError statusError{kTVXHTTPStatusErrorDomain, status, fmt::format("statusCode {}", status)};
+        reply(queryId, std::nullopt, transport ? *transport : statusError);
         self->failSearchFeedback(transport, *request, start, data.size(), status, timing);
         return;
       }

@@ -65,11 +65,11 @@ TEST_F(SearchTest, ABagWithoutASearchURLFailsAsTheTransportWouldAndRecordsIt) {
   auto state = make("com.norvel.seekara", "Seekara/1.0");
   Replies failed;
   state->search(request<TVXSearchRequest>(12, "weather"), failed.block());
-  auto call = failed.first();
-  EXPECT_FALSE(call.reply);
-  ASSERT_TRUE(call.error);
-  EXPECT_EQ(call.error->domain, platform::http::kURLErrorDomain);
-  EXPECT_EQ(call.error->code, platform::http::URLErrorUnsupportedURL);
+  const auto error = failed.first().error;
+  ASSERT_TRUE(error);
+  EXPECT_EQ(std::pair(error->domain, error->code),
+            std::pair(std::string(platform::http::kURLErrorDomain),
+                      std::int64_t{platform::http::URLErrorUnsupportedURL}));
   auto errors = recordsOfType(*state, 18);
   ASSERT_EQ(errors.size(), 1u);
   EXPECT_EQ(errors[0].query_id(), 12);
