@@ -98,9 +98,9 @@ TEST_F(RetryableRequestTest, UndelayedRetriesStopAtTheFirstResponseWhateverItsSt
   // that answered.
   fault({{"path", "http://search.invalid/search"}, {"drop", true}, {"times", 2}});
   Result recovered;
-  send(TVXRetryableNetworkRequest(URLRequest{"http://search.invalid/search?q=w"}, clock.now() + seconds(10), false,
-                                  server.baseURL()),
-       3, recovered)
+  URLRequest absent;
+  absent.url = "http://search.invalid/search?q=w";
+  send(TVXRetryableNetworkRequest(absent, clock.now() + seconds(10), false, server.baseURL()), 3, recovered)
       ->resume();
   ASSERT_TRUE(tavix::testing::waitFor([&] { return recovered.calls == 1; }));
   EXPECT_FALSE(recovered.error);

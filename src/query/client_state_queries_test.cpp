@@ -90,7 +90,9 @@ TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
   for (std::size_t i = 0; i < kinds.size(); ++i) {
     const auto call = outcomes[i].replies->first();
     EXPECT_TRUE(call.reply && !call.error) << outcomes[i].what;
-    if (call.reply) EXPECT_FALSE(call.reply->data.empty()) << outcomes[i].what;
+    if (call.reply) {
+      EXPECT_FALSE(call.reply->data.empty()) << outcomes[i].what;
+    }
   }
 
   onEveryPath({{"hang", true}});
