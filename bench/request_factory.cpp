@@ -41,7 +41,7 @@ void BM_SearchRequest(benchmark::State& state) {
   auto raw = platform::parseJson(R"({"search_url":"https://search.example/search?v=2","request_timeout_s":3,
       "supported_geo_location_sources":"all","send_geo_environment_header":true})");
   auto bag = std::make_shared<const TVXBag>(*raw->dictionary(), "Seekara/1 (bench)");
-  center->post("TVXBagChangeNotification", nullptr, bag);
+  center->post("TVXBagChangeNotification", nullptr, {}, bagChangeUserInfo(*bag));
   factory->setSilhouetteTopics(R"({"sil":"s","pv":1,"all":{"a":0.5,"b":0.25}})");
   factory->setStoreFrontIdentifier("143441-1,29");
 

@@ -59,6 +59,13 @@ TEST(DaemonStartup, ExitsByItselfWhenIdleAndRejectsBadFlags) {
   EXPECT_EQ(idle.waitExit(12000), 0) << idle.log();
   EXPECT_NE(idle.log().find("exiting"), std::string::npos);
 
+  // A socket it cannot make ends the daemon the orderly way: services stopped, counters saved.
+  std::ofstream(home.root() / "plain-file") << "not a folder";
+  Daemon deaf(home, {"--socket", (home.root() / "plain-file" / "socket").string()}, "deaf.log");
+  EXPECT_EQ(deaf.waitExit(12000), 1) << deaf.log();
+  EXPECT_NE(deaf.log().find("cannot listen on"), std::string::npos) << deaf.log();
+  EXPECT_NE(deaf.log().find("tavixd stopped"), std::string::npos) << deaf.log();
+
   Daemon bad(home, {"--log-level", "loud"}, "bad.log");
   EXPECT_EQ(bad.waitExit(3000), 2);
   EXPECT_NE(bad.log().find("unknown log level 'loud'"), std::string::npos);

@@ -13,7 +13,6 @@
 #include <future>
 #include <sstream>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "cache/engaged_completion_cache.h"
@@ -265,20 +264,6 @@ TEST(IpcDaemon, ClientFailsCallsInFlightOnceAndReconnectsToTheNextDaemon) {
   EXPECT_TRUE(next.waitForLog("client configuration {identifier: tests, userAgent: tests/1}")) << next.log();
   EXPECT_TRUE(next.waitForLog("launch event for again")) << next.log();
   EXPECT_EQ(calls, 1);
-}
-
-TEST(IpcDaemon, IdleExitComesOnceTheLastClientHasLeft) {
-  tavix::testing::TempHome home;
-  Daemon d(home, "idle.log", {"--exit-when-idle", "0.3"});
-  {
-    Client client(options(d));
-    ASSERT_FALSE(client.connect()) << d.log();
-    std::this_thread::sleep_for(std::chrono::milliseconds(1500));
-    EXPECT_TRUE(d.alive()) << d.log();
-  }
-  // The start-up bag fetch fails and is retried for about 8 s; its transaction holds the daemon.
-  EXPECT_TRUE(tavix::testing::waitFor([&] { return !d.alive(); }, 12000)) << d.log();
-  EXPECT_TRUE(d.waitForLog("exiting"));
 }
 
 TEST(IpcDaemon, ServesTheSocketHandedOverBySystemd) {

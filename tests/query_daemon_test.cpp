@@ -4,7 +4,9 @@
 
 #include <filesystem>
 #include <fstream>
+#include <condition_variable>
 #include <future>
+#include <mutex>
 #include <optional>
 
 #include <nlohmann/json.hpp>
@@ -136,6 +138,55 @@ class QueryDaemonTest : public ::testing::Test {
   std::optional<client::Client> app;
   std::uint64_t queryId = 100;
 };
+
+TEST_F(QueryDaemonTest, ClientsHearTheBagWhenTheyConfigureWhenTheyAskAndWhenItChanges) {
+  ASSERT_FALSE(server.base.empty());
+  startDaemon();
+  // A second client of the same identifier hears the bag in its own right.
+  std::mutex lock;
+  std::condition_variable arrived;
+  std::vector<proto::BagDidLoad> loads;
+  client::Client::Options options;
+  options.socketPath = socket();
+  options.configuration.set_identifier("com.norvel.seekara");
+  options.configuration.set_user_agent("seekara/1.0");
+  client::Client second(options);
+  second.setBagDidLoadHandler([&](const proto::BagDidLoad& load) {
+    std::lock_guard hold(lock);
+    loads.push_back(load);
+    arrived.notify_all();
+  });
+  auto waitForLoads = [&](std::size_t n) {
+    std::unique_lock hold(lock);
+    return arrived.wait_for(hold, std::chrono::seconds(15), [&] { return loads.size() >= n; });
+  };
+  ASSERT_FALSE(second.connect());
+  ASSERT_TRUE(waitForLoads(1)) << tavixd->log();
+  {
+    std::lock_guard hold(lock);
+    ASSERT_EQ(loads.size(), 1u);
+    EXPECT_FALSE(loads[0].has_error());
+    EXPECT_EQ(loads[0].bag().version(), "1");
+    EXPECT_NE(loads[0].bag().user_agent().find(") seekara/1.0"), std::string::npos) << loads[0].bag().user_agent();
+    EXPECT_EQ(json::parse(loads[0].bag().json())["search_url"], server.base + "/search");
+  }
+
+  // Asked for, the bag comes back as the reply.
+  std::promise<std::optional<proto::TVXBagData>> asked;
+  second.bag([&](auto bag, auto error) { asked.set_value(error ? std::nullopt : bag); });
+  auto bag = asked.get_future().get();
+  ASSERT_TRUE(bag);
+  EXPECT_EQ(bag->version(), "1");
+
+  // The server asks for a newer bag: it reaches the client as a new bagDidLoad.
+  serveBag({{"version", "2"}});
+  fault({{"path", "/search"}, {"headers", {{"X-Norvel-ForceFetch", R"({"bag": 2})"}}}, {"times", 1}});
+  EXPECT_TRUE(send(request("weather")).reply);
+  ASSERT_TRUE(waitForLoads(2)) << tavixd->log();
+  std::lock_guard hold(lock);
+  EXPECT_EQ(loads.back().bag().version(), "2");
+  EXPECT_NE(loads.back().bag().user_agent().find(") seekara/1.0"), std::string::npos);
+}
 
 TEST_F(QueryDaemonTest, DisabledBagAnswersNothingAndNeverAsksTheServer) {
   ASSERT_FALSE(server.base.empty());

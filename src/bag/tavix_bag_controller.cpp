@@ -418,20 +418,17 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
   const auto start = bagFetchStartRecord(*request, hostTicks(*assembly_.clock));
   auto session = ClientSession::open(assembly_, wrapFetchRecord(start));
 
-  auto retryable = std::make_shared<const TVXRetryableNetworkRequest>(*request, std::nullopt, true);
+  // Through the network-service proxy when the last bag asked for one, on every attempt.
+  auto retryable = std::make_shared<const TVXRetryableNetworkRequest>(*request, std::nullopt, true,
+                                                                      assembly_.requestFactory->proxyURL());
   std::weak_ptr<TavixBagController> weak = weak_from_this();
   auto retryClock = retryClock_;
-  // The completion reads the timing of the task, which exists only once the call returns. The
-  // completion lets go of the task, which breaks the cycle task -> completion -> holder -> task.
-  auto taskHolder = std::make_shared<std::shared_ptr<platform::http::URLSessionDataTask>>();
   auto task = dataTaskWithRetryableRequest(
       assembly_.bagSession(), retryable, 1, kFetchRetries, *retryClock, retryQueue_,
-      [weak, retryClock, session, start, taskHolder, completion = std::move(completion)](
+      [weak, retryClock, session, start, completion = std::move(completion)](
           std::string data, std::optional<platform::http::HTTPURLResponse> response,
-          std::optional<platform::http::URLError> error) {
+          std::optional<platform::http::URLError> error, const platform::http::URLSessionTaskMetrics& metrics) {
         bagLog().debug("resp: {}", describeResponse(response));
-        platform::http::URLSessionTaskMetrics metrics;
-        if (auto task = std::exchange(*taskHolder, nullptr)) metrics = task->metrics();
         auto self = weak.lock();
         if (!self) {
           bagLog().error("Error fetching bag, bag fetch task completed after BagFetchController was cleaned up");
@@ -482,7 +479,6 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
         if (completion) completion(outcome ? nullptr : bag, outcome);
         self->fetchInProgress_.store(false);
       });
-  *taskHolder = task;
   task->resume();
 }
 
@@ -571,7 +567,7 @@ void TavixBagController::cacheBagState(std::shared_ptr<const TVXBag> bag, bool f
     const unsigned long newNews = newsAvailability(bag);
     inMemoryBag_ = bag;
     auto& center = *assembly_.notificationCenter;
-    center.post(kTVXBagChangeNotification, this, bag);
+    center.post(kTVXBagChangeNotification, nullptr, {}, bagChangeUserInfo(*bag));
     if (oldNews != newNews && !fromDisk) {
       bagLog().notice("setting Tavix News Available status to {}", newNews);
       center.post(newNews == 1 ? kTVXNotifyEnabled : kTVXNotifyDisabled, this);

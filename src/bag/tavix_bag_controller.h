@@ -4,7 +4,7 @@
 // in memory and as the binary property list "bag.plist" in the daemon's caches folder, treats it
 // as stale four hours after the fetch, refetches when it is stale, when the server asks for a
 // newer version or when the locale or country changes, and posts "TVXBagChangeNotification"
-// (object: the new bag as std::shared_ptr<const TVXBag>) each time the bag is replaced. Every
+// (no sender; user info {"bag": the new raw bag}) each time the bag is replaced. Every
 // fetch is written as a feedback session of its own: its start, its end and any failure.
 //
 // Threading: every public operation is safe from any thread. The in-memory bag sits behind a
@@ -42,7 +42,6 @@ class Message;
 }
 namespace tavix {
 
-inline constexpr const char* kTVXNotificationBagKey = "bag";
 // News availability, posted on the assembly's notification centre when a fetched bag turns the
 // news reader's feature on or off.
 inline constexpr const char* kTVXNotifyEnabled = "com.norvel.tavix.news.enabled";

@@ -45,8 +45,8 @@ class BagControllerTest : public ::testing::Test {
     assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
     changes = center->addObserver(kTVXBagChangeNotification, nullptr, nullptr, [this](const platform::Notification& n) {
       std::lock_guard hold(lock);
-      auto p = std::any_cast<std::shared_ptr<const TVXBag>>(&n.object);
-      posted.push_back(p ? *p : nullptr);
+      EXPECT_EQ(n.sender, nullptr);
+      posted.push_back(bagOfNotification(n));
     });
     news = center->addObserver("", nullptr, nullptr, [this](const platform::Notification& n) {
       if (n.name != kTVXNotifyEnabled && n.name != kTVXNotifyDisabled) return;
@@ -158,7 +158,8 @@ TEST_F(BagControllerTest, FirstFetchStoresTheAugmentedBagAndAnnouncesIt) {
 
   auto bag = controller->currentBag();
   ASSERT_TRUE(bag);
-  EXPECT_EQ(posted.front(), bag) << "the notification carries the installed bag";
+  ASSERT_TRUE(posted.front());
+  EXPECT_EQ(posted.front()->rawBag(), bag->rawBag()) << "the notification carries the installed bag";
   EXPECT_EQ(bag->version(), "1");
   EXPECT_EQ(bag->warmURL(), server.baseURL() + "/warm");
   EXPECT_EQ(newsPosts, std::vector<std::string>{kTVXNotifyEnabled});
@@ -242,6 +243,24 @@ TEST_F(BagControllerTest, DiskBagServesAndIsRefetchedOnlyWhenDue) {
   settle();
   waitForIdle();
   EXPECT_EQ(bagRequests().size(), before + 1);
+  // A file that is not a property list, or whose top is not a dictionary, is reported and left:
+  // nothing is installed from it.
+  for (const std::string& bytes :
+       {std::string("bplist00 and then nothing"), platform::toBinaryPlist(PropertyValue(PropertyValue::Array{"a"}))}) {
+    controller.reset();
+    ASSERT_FALSE(platform::writeFileAtomically(bagFile(), bytes));
+    {
+      std::lock_guard hold(lock);
+      posted.clear();
+    }
+    platform::LogCapture logs;
+    make();
+    settle();
+    EXPECT_FALSE(controller->inMemoryBag());
+    EXPECT_EQ(postedCount(), 0u);
+    EXPECT_TRUE(logs.contains("Error reading from bag cache: not a property list.") ||
+                logs.contains("Unexpected class deserialized from bag cache: Array."));
+  }
 }
 
 TEST_F(BagControllerTest, FailedFetchesReportTheirReasonAndKeepTheOldBag) {

@@ -4,6 +4,7 @@
 
 #include <fmt/core.h>
 
+#include "core/names.h"
 #include "network/user_agent.h"
 #include "platform/notification_center.h"
 
@@ -206,11 +207,14 @@ std::optional<std::string> TVXBag::bagURL() const {
 
 bool TVXBag::refreshDisabled() const { return rawValueForKey("__refresh_disabled") != nullptr; }
 
-std::shared_ptr<const TVXBag> bagOfNotification(const platform::Notification& notification) {
-  if (auto* bag = std::any_cast<std::shared_ptr<const TVXBag>>(&notification.object)) return *bag;
-  if (auto* bag = std::any_cast<std::shared_ptr<TVXBag>>(&notification.object)) return *bag;
-  if (auto* bag = std::any_cast<TVXBag>(&notification.object)) return std::make_shared<const TVXBag>(*bag);
-  return nullptr;
+platform::Dictionary bagChangeUserInfo(const TVXBag& bag) {
+  return {{kTVXNotificationBagKey, PropertyValue(bag.rawBag())}};
+}
+
+std::shared_ptr<const TVXBag> bagOfNotification(const platform::Notification& notification, std::string userAgent) {
+  const auto it = notification.userInfo.find(kTVXNotificationBagKey);
+  if (it == notification.userInfo.end() || !it->second.dictionary()) return nullptr;
+  return std::make_shared<const TVXBag>(*it->second.dictionary(), std::move(userAgent));
 }
 
 }  // namespace tavix

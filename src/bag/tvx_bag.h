@@ -27,9 +27,12 @@ struct Notification;
 
 class TVXBag;
 
-// The bag a "TVXBagChangeNotification" carries as its object, whichever shared form the poster
-// used; none when it carries no bag.
-std::shared_ptr<const TVXBag> bagOfNotification(const platform::Notification& notification);
+// "TVXBagChangeNotification" has no sender and carries the new bag as its user info's "bag": the
+// raw dictionary, bookkeeping keys included, which each observer views with its own user agent.
+platform::Dictionary bagChangeUserInfo(const TVXBag& bag);
+// The bag of such a notification, as `userAgent` sees it; none when it carries no bag.
+std::shared_ptr<const TVXBag> bagOfNotification(const platform::Notification& notification,
+                                                std::string userAgent = {});
 
 class TVXBag {
  public:

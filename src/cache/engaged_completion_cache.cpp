@@ -13,6 +13,7 @@
 #include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
+#include <mutex>
 
 #include "core/assembly.h"
 #include "core/diagnostics.h"
@@ -209,13 +210,15 @@ bool EngagedCompletionCache::cacheEnabled() const {
   return !(env_.defaults && env_.defaults->boolForKey("TVXDisableLocalCompletions"));
 }
 
-sqlite3* EngagedCompletionCache::handle() const {
-  std::lock_guard<std::mutex> guard(dbLock_);
-  return completionsDB_;
+sqlite3* EngagedCompletionCache::handle() const { return completionsDB_; }
+
+bool EngagedCompletionCache::hasDatabase() const {
+  std::lock_guard hold(dbLock_);
+  return completionsDB_ != nullptr;
 }
 
 void EngagedCompletionCache::closeDBConnection() {
-  std::lock_guard<std::mutex> guard(dbLock_);
+  std::lock_guard hold(dbLock_);
   if (completionsDB_) sqlite3_close_v2(completionsDB_);
   completionsDB_ = nullptr;
 }
@@ -223,6 +226,7 @@ void EngagedCompletionCache::closeDBConnection() {
 // Schema upkeep
 
 void EngagedCompletionCache::createOrUpdateDatabaseIfNeeded() {
+  std::lock_guard hold(dbLock_);
   std::error_code ec;
   if (platform::fs::exists(databasePath_, ec)) {
     openDatabaseConnection();
@@ -240,7 +244,7 @@ void EngagedCompletionCache::createOrUpdateDatabaseIfNeeded() {
 }
 
 void EngagedCompletionCache::openDatabaseConnection() {
-  std::lock_guard<std::mutex> guard(dbLock_);
+  std::lock_guard hold(dbLock_);
   if (completionsDB_) {
     eccLog().notice("Closing existing Completions database connection");
     sqlite3_close_v2(completionsDB_);
@@ -338,6 +342,7 @@ void EngagedCompletionCache::setDBSchema() {
 }
 
 void EngagedCompletionCache::deleteDatabase() {
+  std::lock_guard hold(dbLock_);
   closeDBConnection();
   std::error_code ec;
   for (const char* suffix : {"", "-journal", "-wal", "-shm"}) platform::fs::remove(databasePath_ + suffix, ec);
@@ -345,6 +350,7 @@ void EngagedCompletionCache::deleteDatabase() {
 }
 
 void EngagedCompletionCache::rebuildCorruptDatabase() {
+  std::lock_guard hold(dbLock_);
   // The rows are lost either way; a fresh file is the only rebuild that works whatever the damage.
   deleteDatabase();
   createOrUpdateDatabaseIfNeeded();
@@ -383,6 +389,7 @@ std::int64_t EngagedCompletionCache::countRows(const std::string& sql, bool* ok)
 }
 
 std::int64_t EngagedCompletionCache::rowCountForClient(unsigned long client) {
+  std::lock_guard hold(dbLock_);
   bool ok = false;
   std::int64_t n =
       countRows("SELECT Count(*) FROM completion_cache_engagement WHERE client == " + std::to_string(client) + ";", &ok);
@@ -405,6 +412,7 @@ void EngagedCompletionCache::deleteOldestEngagements(unsigned long limit, unsign
 
 void EngagedCompletionCache::addCompletion(const std::string& completion, const std::string& input, int origin,
                                            unsigned long client, unsigned long maxRows) {
+  std::lock_guard hold(dbLock_);
   if (!cacheEnabled() || completion.empty() || !handle()) return;
 
   const platform::TimePoint now = env_.clock->now();
@@ -465,13 +473,18 @@ void EngagedCompletionCache::addCompletion(const std::string& completion, const 
 
 std::vector<TVXSearchSuggestion> EngagedCompletionCache::runSearch(const std::string& input, unsigned long client,
                                                                    unsigned long count) {
+  std::lock_guard hold(dbLock_);
   std::vector<TVXSearchSuggestion> found;
   const auto started = std::chrono::steady_clock::now();
   const EngagedCompletionParameters p = parameters();
-  char formatted[1024];
-  std::snprintf(formatted, sizeof formatted, kSelectFormat, p.last1hour, p.last1day, p.last1week, p.last1month, p.all,
-                p.mostRecent, "%q", "%q", "%q", "%q", count);
-  const std::string sql = positional(formatted);
+  // Sized to what the weights print to: a bag may send weights of hundreds of digits.
+  const int length = std::snprintf(nullptr, 0, kSelectFormat, p.last1hour, p.last1day, p.last1week, p.last1month,
+                                   p.all, p.mostRecent, "%q", "%q", "%q", "%q", count);
+  if (length < 0) return found;
+  std::string formatted(static_cast<std::size_t>(length) + 1, '\0');
+  std::snprintf(formatted.data(), formatted.size(), kSelectFormat, p.last1hour, p.last1day, p.last1week,
+                p.last1month, p.all, p.mostRecent, "%q", "%q", "%q", "%q", count);
+  const std::string sql = positional(formatted.c_str());
   sqlite3* db = handle();
   if (!db) return found;
   Statement s;
@@ -512,7 +525,7 @@ std::optional<std::vector<TVXSearchSuggestion>> EngagedCompletionCache::completi
                                                                                            unsigned long client,
                                                                                            unsigned long count,
                                                                                            unsigned long timeoutMs) {
-  if (!cacheEnabled() || !handle()) return std::nullopt;
+  if (!cacheEnabled() || !hasDatabase()) return std::nullopt;
 
   // Shared with the search block, which may finish after we stopped waiting for it.
   struct Wait {
@@ -554,12 +567,13 @@ std::optional<TVXSearchSuggestion> EngagedCompletionCache::completionForInput(co
 
 void EngagedCompletionCache::featureCountsForInput(const std::string& input, unsigned long client,
                                                    std::function<void(std::map<std::string, std::int64_t>)> completion) {
-  if (!cacheEnabled() || !handle()) return;
+  if (!cacheEnabled() || !hasDatabase()) return;
   std::weak_ptr<EngagedCompletionCache> weak = weak_from_this();
   env_.pool->post([weak, input, client, completion = std::move(completion)] {
     auto self = weak.lock();
     if (!self) return;
     std::map<std::string, std::int64_t> counts;
+    std::unique_lock hold(self->dbLock_);
     sqlite3* db = self->handle();
     Statement s;
     const std::string sql = positional(kFeatureCountFormat);
@@ -577,6 +591,9 @@ void EngagedCompletionCache::featureCountsForInput(const std::string& input, uns
         counts[letter ? letter : ""] = sqlite3_column_int64(s.stmt, 1);
       }
     }
+    sqlite3_finalize(s.stmt);
+    s.stmt = nullptr;
+    hold.unlock();
     if (completion) completion(std::move(counts));
   });
 }
@@ -602,6 +619,7 @@ void widenIfEqual(platform::TimePoint& from, platform::TimePoint& to) {
 
 void EngagedCompletionCache::clearCompletionsFromDate(platform::TimePoint from, platform::TimePoint to,
                                                       unsigned long client) {
+  std::lock_guard hold(dbLock_);
   sqlite3* db = handle();
   if (!db) return;
   widenIfEqual(from, to);
@@ -615,6 +633,7 @@ void EngagedCompletionCache::clearCompletionsFromDate(platform::TimePoint from, 
 }
 
 void EngagedCompletionCache::clearAllClientCompletionsFromDate(platform::TimePoint from, platform::TimePoint to) {
+  std::lock_guard hold(dbLock_);
   sqlite3* db = handle();
   if (!db) return;
   widenIfEqual(from, to);
@@ -628,6 +647,7 @@ void EngagedCompletionCache::clearAllClientCompletionsFromDate(platform::TimePoi
 }
 
 void EngagedCompletionCache::clearAllCompletionsForClient(unsigned long client) {
+  std::lock_guard hold(dbLock_);
   sqlite3* db = handle();
   if (!db) return;
   if (runToDone(db,
@@ -639,6 +659,7 @@ void EngagedCompletionCache::clearAllCompletionsForClient(unsigned long client) 
 }
 
 void EngagedCompletionCache::clearAllCompletions() {
+  std::lock_guard hold(dbLock_);
   sqlite3* db = handle();
   if (!db) return;
   if (runToDone(db, "DELETE FROM completion_cache_engagement;")) {
@@ -656,6 +677,7 @@ void EngagedCompletionCache::seekaraDidClearSuggestions() {
 // Statistics
 
 void EngagedCompletionCache::performCounterLogging() {
+  std::lock_guard hold(dbLock_);
   if (!handle()) return;
   bool ok = false;
   std::int64_t entries = countRows("SELECT Count(*) FROM completion_cache_engagement;", &ok);

@@ -4,12 +4,16 @@
 // Database: "<caches>/com.norvel.tavixd/EngagedCompletions/Cache.db", schema version 6.
 //
 // Threading: every public operation is safe from any thread. The handle is opened in SQLite's
-// full-mutex mode. Adds and clears run on the caller's thread; searches and recency counts run on
-// the dispatch pool (the search queue), the caller waiting for a search at most its time-out;
-// parameter updates run synchronously on the serial update queue "com.norvel.tavixd.eccupdateq".
+// full-mutex mode, and every use of it, from preparing a statement to finalising it, holds the
+// cache's connection lock, so that a rebuild after corruption (which closes and reopens the
+// handle) never pulls it from under a statement. Adds and clears run on the caller's thread;
+// searches and recency counts run on the dispatch pool (the search queue), the caller waiting for
+// a search at most its time-out; parameter updates run synchronously on the serial update queue
+// "com.norvel.tavixd.eccupdateq".
 // Time: engagement dates come from the injected Clock; only the search time-out is a real wait.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -132,7 +136,9 @@ class EngagedCompletionCache : public std::enable_shared_from_this<EngagedComple
   explicit EngagedCompletionCache(Environment env);
 
   bool cacheEnabled() const;
+  // The open handle, or null; the caller holds dbLock_ while it uses it.
   sqlite3* handle() const;
+  bool hasDatabase() const;
   void createOrUpdateDatabaseIfNeeded();
   void openDatabaseConnection();
   bool isSchemaCurrent();
@@ -148,9 +154,11 @@ class EngagedCompletionCache : public std::enable_shared_from_this<EngagedComple
   Environment env_;
   std::string databaseDirPath_;
   std::string databasePath_;
-  mutable std::mutex dbLock_;  // guards the handle pointer (SQLite guards the connection)
-  sqlite3* completionsDB_ = nullptr;
-  int schemaVersion_ = 0;
+  // Held across each use of the handle and across opening, closing and rebuilding it. Recursive:
+  // an add runs clears and counts of its own, and a corrupt insert rebuilds, all under one hold.
+  mutable std::recursive_mutex dbLock_;
+  sqlite3* completionsDB_ = nullptr;  // guarded by dbLock_
+  std::atomic<int> schemaVersion_{0};
   platform::SerialQueue updateQueue_;
   mutable std::mutex parametersLock_;
   EngagedCompletionParameters parameters_;

@@ -144,6 +144,12 @@ TEST_F(EngagedCompletionCacheTest, ScoresByRecencyBucketsAndDropsBelowThreshold)
   p.last1hour = 0;
   cache->updateParameters(p);
   EXPECT_TRUE(find(*cache, "tw").empty());
+
+  // Weights as large as a bag may send still make a whole statement.
+  p.last1hour = p.last1day = p.last1week = p.last1month = p.all = p.mostRecent = 1e300;
+  p.minThresholdToSend = 0;
+  cache->updateParameters(p);
+  EXPECT_EQ(find(*cache, "tw").size(), 2u);
 }
 
 TEST_F(EngagedCompletionCacheTest, AgesOutOldRowsAndTrimsEachClientToItsLimit) {

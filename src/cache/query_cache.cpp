@@ -56,6 +56,12 @@ std::string describe(const std::optional<std::string>& s) { return s ? *s : "(nu
 
 }  // namespace
 
+std::size_t queryLength(std::string_view utf8) {
+  std::size_t count = 0;
+  for (unsigned char c : utf8) count += (c & 0xC0) != 0x80;  // continuation bytes add nothing
+  return count;
+}
+
 QueryItems queryItemsOfURL(const std::string& url) {
   QueryItems items;
   std::size_t q = url.find('?');
@@ -142,7 +148,7 @@ void QueryCache::registerNotifications() {
 
 void QueryCache::set(const Ref<CachedResultSet>& entry) {
   if (!entry || entry->data().empty() || entry->query().empty()) return;
-  if (entry->input().size() > entry->query().size()) {
+  if (queryLength(entry->input()) > queryLength(entry->query())) {
     // The placeholders take the query first, then the input: the message has always read so.
     cachingLog().error("BUG: NOT caching '{}' because input is longer than completed query '{}'", entry->query(),
                        entry->input());
@@ -180,6 +186,7 @@ Ref<CachedResultSet> QueryCache::getRequest(const CacheSearchRequest& request,
   }
   cachingLog().debug("cache lookup: '{}' qtype {} suggest {}", input, describe(qtype), describe(suggest));
 
+  const std::size_t inputLength = queryLength(input);
   Ref<CachedResultSet> choice;
   queue_.sync([&] {
     const platform::TimePoint now = assembly_.clock->now();
@@ -193,17 +200,18 @@ Ref<CachedResultSet> QueryCache::getRequest(const CacheSearchRequest& request,
         return;
       }
       if (scale > 0 && scale != entry->uiScale()) return;
-      if (entry->input().size() > input.size()) return;
+      if (queryLength(entry->input()) > inputLength) return;
       if (entry->qtype() != qtype || entry->suggest_queries() != suggest || entry->localCompletion() != lc) return;
       candidates.push_back(entry);
     });
     for (const auto& key : expired) tree_.removeObjectForKey(key);
 
+    // Every candidate's key begins with the input, so none is shorter than it.
     std::size_t shortest = SIZE_MAX;
-    for (const auto& c : candidates) shortest = std::min(shortest, c->query().size() - input.size());
+    for (const auto& c : candidates) shortest = std::min(shortest, queryLength(c->query()) - inputLength);
     float best = 0;
     for (const auto& c : candidates) {
-      if (c->query().size() - input.size() != shortest) continue;
+      if (queryLength(c->query()) - inputLength != shortest) continue;
       cachingLog().debug("entry {} prefix: {} input: {} score: {:f}", static_cast<const void*>(c.get()), c->query(),
                          c->input(), c->completionScore());
       if (!choice) {

@@ -11,6 +11,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -32,6 +33,10 @@ struct URLRequest;
 }  // namespace platform
 
 using QueryItems = std::vector<std::pair<std::string, std::optional<std::string>>>;
+
+// The length of a query as the user typed it: its characters (code points), not its UTF-8 bytes,
+// so that "café" is as long as "cafe".
+std::size_t queryLength(std::string_view utf8);
 
 // The query items of an absolute URL, percent-decoded, in order. An item without "=" has no value.
 QueryItems queryItemsOfURL(const std::string& url);

@@ -110,6 +110,15 @@ TEST_F(QueryCacheTest, PrefersTheShortestCompletionThenTheHighestPositiveScore) 
   store(entry("c", "cab", {{"completion_score", -1.0}}));
   store(entry("c", "cat", {{"completion_score", -0.5}}));
   EXPECT_EQ(hit("c"), "uuid-cab");  // a negative score never displaces the first
+
+  // Lengths are characters: "caé" is one longer than "ca", though two bytes longer.
+  store(entry("ca", "cabb", {{"completion_score", 0.9}}));
+  store(entry("ca", "caé", {{"completion_score", 0.1}}));
+  EXPECT_EQ(hit("ca"), "uuid-caé");
+  // An input no longer than its completed query in characters is cached and served, though it
+  // takes more bytes.
+  store(entry("ññ", "gnu"));
+  EXPECT_EQ(hit("gnu"), "uuid-gnu");
 }
 
 TEST_F(QueryCacheTest, ExpiresEntriesOnLookUp) {

@@ -59,7 +59,10 @@ std::string TavixUserGUIDController::currentUserGUID() {
 }
 
 void TavixUserGUIDController::reset() {
-  queue_.async([this] { rollGUID(); });
+  // Queued work outlives the queue's owner: hold the controller weakly.
+  queue_.async([weak = weak_from_this()] {
+    if (auto self = weak.lock()) self->rollGUID();
+  });
 }
 
 void TavixUserGUIDController::rollGUID() {

@@ -8,6 +8,7 @@
 // so an observer may call currentUserGUID() from its callback.
 #pragma once
 
+#include <memory>
 #include <string>
 
 #include "core/names.h"
@@ -25,10 +26,11 @@ std::string makeRandomUUIDString();
 // True for the 36-character textual UUID form (either case).
 bool isValidUUIDString(const std::string& text);
 
-class TavixUserGUIDController {
+class TavixUserGUIDController : public std::enable_shared_from_this<TavixUserGUIDController> {
  public:
   // Needs assembly.dispatchPool and assembly.clock; the notification centre may be absent (then
-  // nothing is posted). Creation posts nothing.
+  // nothing is posted). Creation posts nothing. Own it with a std::shared_ptr: a reset queued
+  // before the controller goes finds it gone and does nothing.
   explicit TavixUserGUIDController(Assembly& assembly);
   TavixUserGUIDController(const TavixUserGUIDController&) = delete;
   TavixUserGUIDController& operator=(const TavixUserGUIDController&) = delete;

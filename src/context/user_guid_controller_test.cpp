@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <latch>
 
 #include "core/assembly.h"
 #include "core/diagnostics.h"
@@ -30,18 +31,18 @@ struct GuidFixture {
 TEST(TavixUserGUIDController, IdentifierLivesExactly900Seconds) {
   GuidFixture f;
   const auto counterBefore = TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.userguid");
-  TavixUserGUIDController controller(f.assembly);
-  const std::string first = controller.currentUserGUID();
+  auto controller = std::make_shared<TavixUserGUIDController>(f.assembly);
+  const std::string first = controller->currentUserGUID();
   EXPECT_TRUE(isValidUUIDString(first));
   EXPECT_EQ(first.find_first_of("abcdef"), std::string::npos);
   f.clock.advance(platform::seconds(899));
-  EXPECT_EQ(controller.currentUserGUID(), first);
+  EXPECT_EQ(controller->currentUserGUID(), first);
   f.pool.drain();
   EXPECT_EQ(f.posts, 0);  // creation and plain reads post nothing
   f.clock.advance(platform::seconds(1));
-  const std::string second = controller.currentUserGUID();
+  const std::string second = controller->currentUserGUID();
   EXPECT_NE(second, first);
-  EXPECT_EQ(controller.currentUserGUID(), second);
+  EXPECT_EQ(controller->currentUserGUID(), second);
   f.pool.drain();
   EXPECT_EQ(f.posts, 1);
   EXPECT_EQ(TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.userguid"), counterBefore + 1);
@@ -49,19 +50,29 @@ TEST(TavixUserGUIDController, IdentifierLivesExactly900Seconds) {
 
 TEST(TavixUserGUIDController, EachResetRollsAndAnnounces) {
   GuidFixture f;
-  TavixUserGUIDController controller(f.assembly);
-  const std::string first = controller.currentUserGUID();
-  controller.reset();
-  const std::string second = controller.currentUserGUID();
-  controller.reset();
-  const std::string third = controller.currentUserGUID();
+  auto controller = std::make_shared<TavixUserGUIDController>(f.assembly);
+  const std::string first = controller->currentUserGUID();
+  controller->reset();
+  const std::string second = controller->currentUserGUID();
+  controller->reset();
+  const std::string third = controller->currentUserGUID();
   EXPECT_NE(first, second);
   EXPECT_NE(second, third);
   f.pool.drain();
   EXPECT_EQ(f.posts, 2);
   // A reset restarts the lifetime.
   f.clock.advance(platform::seconds(899));
-  EXPECT_EQ(controller.currentUserGUID(), third);
+  EXPECT_EQ(controller->currentUserGUID(), third);
+
+  // A reset still queued when its controller goes does nothing: every worker is held until the
+  // controller is gone.
+  std::latch held(1);
+  for (unsigned i = 0; i < f.pool.threadCount(); ++i) f.pool.post([&] { held.wait(); });
+  controller->reset();
+  controller.reset();
+  held.count_down();
+  f.pool.drain();
+  EXPECT_EQ(f.posts, 2);
 }
 
 TEST(TavixUserGUIDController, ObserverMayReadTheNewIdentifier) {
@@ -71,13 +82,15 @@ TEST(TavixUserGUIDController, ObserverMayReadTheNewIdentifier) {
   assembly.dispatchPool = &pool;
   assembly.clock = &clock;
   assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
-  TavixUserGUIDController controller(assembly);
+  auto controller = std::make_shared<TavixUserGUIDController>(assembly);
   std::string seen;
   auto reg = assembly.notificationCenter->addObserver(kTVXUserGUIDChangeNotification, nullptr, nullptr,
-                                                      [&](const platform::Notification&) { seen = controller.currentUserGUID(); });
-  controller.reset();
+                                                      [&](const platform::Notification&) {
+                                                        seen = controller->currentUserGUID();
+                                                      });
+  controller->reset();
   pool.drain();
-  EXPECT_EQ(seen, controller.currentUserGUID());
+  EXPECT_EQ(seen, controller->currentUserGUID());
   EXPECT_FALSE(isValidUUIDString("not-a-uuid"));
 }
 

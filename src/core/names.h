@@ -7,8 +7,9 @@ namespace tavix {
 inline constexpr const char* kTVXErrorDomain = "kTVXErrorDomain";
 
 inline constexpr const char* kTVXStartupNotification = "TVXStartup";
-// Object: the new bag (std::shared_ptr<const TVXBag>).
+// No sender; user info {kTVXNotificationBagKey: the new raw bag} (see bagChangeUserInfo()).
 inline constexpr const char* kTVXBagChangeNotification = "TVXBagChangeNotification";
+inline constexpr const char* kTVXNotificationBagKey = "bag";
 inline constexpr const char* kTVXBagRefreshRequiredNotification = "TVXBagRefreshRequired";
 inline constexpr const char* kTVXUserGUIDChangeNotification = "TVXUserGUIDChangeNotification";
 inline constexpr const char* kTVXSessionSoftLimitNotification = "TVXSessionSoftLimitNotification";

@@ -11,6 +11,7 @@
 #include "feedback/client_session.h"
 #include "feedback/client_session_manager.h"
 #include "network/locale_context.h"
+#include "network/request_factory.h"
 #include "network/tracing.h"
 #include "network/user_agent.h"
 #include "platform/activity.h"
@@ -75,6 +76,15 @@ unsigned long completionClientNumber(const std::optional<std::string>& shortName
   return 0;
 }
 
+// Sends one frame to the client; a frame that cannot go (the client has gone, or it is over the
+// size limit) is the remote proxy's error, logged and otherwise dropped.
+void sendToClient(platform::ipc::IpcConnection& connection, std::string bytes,
+                  std::vector<platform::ipc::UniqueFd> fds = {}) {
+  if (connection.send(std::move(bytes), std::move(fds))) return;
+  connectionLog().error("(pid:{}) remote proxy error: {}", connection.peer().pid,
+                        connection.isValid() ? "message too large" : "connection invalidated");
+}
+
 void setError(proto::TVXError* error, std::int64_t code, const std::string& reason) {
   error->set_domain(kTVXErrorDomain);
   error->set_code(code);
@@ -89,7 +99,7 @@ ClientConnection::ClientConnection(Assembly& assembly, std::shared_ptr<platform:
 
 ClientConnection::~ClientConnection() {
   idleTimer_.cancel();
-  closeTransaction();
+  closeTransaction(false);
 }
 
 void ClientConnection::start() {
@@ -119,7 +129,7 @@ void ClientConnection::relayResourceNotification(const platform::Notification& n
   // Off the poster's thread; the connection is held weakly, so a client gone meanwhile is skipped.
   std::weak_ptr<platform::ipc::IpcConnection> weak = connection_;
   assembly_.dispatchPool->post([weak, bytes = out.SerializeAsString()]() mutable {
-    if (auto connection = weak.lock()) connection->send(std::move(bytes));
+    if (auto connection = weak.lock()) sendToClient(*connection, std::move(bytes));
   });
 }
 
@@ -128,7 +138,7 @@ void ClientConnection::invalidated() {
   deleteObserver_.reset();
   bagObserver_.reset();
   idleTimer_.cancel();
-  closeTransaction();
+  closeTransaction(false);
 }
 
 void ClientConnection::openOrExtendTransaction() {
@@ -139,7 +149,7 @@ void ClientConnection::openOrExtendTransaction() {
       auto self = weak.lock();
       if (!self) return;
       connectionLog().debug("timing out idle ipc transaction");
-      self->closeTransaction();
+      self->closeTransaction(true);
     });
   }
   if (!transactionOpen_.exchange(true) && assembly_.transactions) {
@@ -148,12 +158,20 @@ void ClientConnection::openOrExtendTransaction() {
   }
 }
 
-void ClientConnection::closeTransaction() {
+void ClientConnection::closeTransaction(bool now) {
   if (!transactionOpen_.exchange(false)) return;
   // A client silent for a minute has left its typing session: its cached replies go with it.
   if (state_ && state_->queryCache()) state_->queryCache()->removeAllObjects();
-  std::lock_guard lock(transactionLock_);
-  transaction_.reset();
+  platform::TransactionTracker::Transaction transaction;
+  {
+    std::lock_guard lock(transactionLock_);
+    transaction = std::move(transaction_);
+  }
+  if (now || !assembly_.clock) return;  // ends here
+  // The timer holds the IPC connection, whose queue it runs on, until it fires.
+  auto held = std::make_shared<platform::TransactionTracker::Transaction>(std::move(transaction));
+  assembly_.clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(),
+                         [held, connection = connection_] { held->reset(); });
 }
 
 void ClientConnection::send(std::uint64_t callId, proto::Envelope& out) {
@@ -163,7 +181,7 @@ void ClientConnection::send(std::uint64_t callId, proto::Envelope& out) {
     connectionLog().error("cannot serialise reply to call {}", callId);
     return;
   }
-  connection_->send(std::move(bytes));
+  sendToClient(*connection_, std::move(bytes));
 }
 
 void ClientConnection::handleMessage(const std::string& payload) {
@@ -189,14 +207,16 @@ void ClientConnection::handleMessage(const std::string& payload) {
       ensureState();
       if (!state_) return;  // no bound state, no reply: as for queries
       std::weak_ptr<platform::ipc::IpcConnection> weak = connection_;
-      state_->bagAsync(userAgent_, [weak, callId](const std::shared_ptr<const TVXBag>& bag,
-                                                  const std::optional<TVXError>& error) {
+      state_->bag(userAgent_, [weak, callId](const std::shared_ptr<const TVXBag>& bag,
+                                             const std::optional<TVXError>& error) {
         proto::Envelope reply;
         reply.set_call_id(callId);
         if (bag) bagToWire(*bag, reply.mutable_bag_reply()->mutable_bag());
         if (error) errorToWire(*error, reply.mutable_bag_reply()->mutable_error());
         if (!bag && !error) reply.mutable_bag_reply();
-        if (auto connection = weak.lock(); connection && callId != 0) connection->send(reply.SerializeAsString());
+        if (auto connection = weak.lock(); connection && callId != 0) {
+          sendToClient(*connection, reply.SerializeAsString());
+        }
       });
       return;
     }
@@ -222,7 +242,7 @@ void ClientConnection::handleMessage(const std::string& payload) {
       out.set_call_id(callId);
       std::vector<platform::ipc::UniqueFd> fds;
       fds.push_back(std::move(endpoint));
-      connection_->send(out.SerializeAsString(), std::move(fds));
+      sendToClient(*connection_, out.SerializeAsString(), std::move(fds));
       return;
     }
     case proto::Envelope::kListSessions: {
@@ -297,8 +317,12 @@ void ClientConnection::ensureState() {
   if (!state) return;
   std::string fullUserAgent;
   if (!configuration_->userAgent.empty()) {
-    fullUserAgent = createUserAgentString(configuration_->userAgent, DeviceInformation(assembly_.userDefaults.get()))
-                        .value_or(configuration_->userAgent);
+    // The factory's device answers are the process's: the system's version is read once.
+    const auto& agent = configuration_->userAgent;
+    fullUserAgent = (assembly_.requestFactory
+                         ? createUserAgentString(agent, assembly_.requestFactory->deviceInformation())
+                         : createUserAgentString(agent, DeviceInformation(assembly_.userDefaults.get())))
+                        .value_or(agent);
   }
   // The tool re-labels its state with each connection's agent; other clients keep the state's
   // first one on purpose.
@@ -338,10 +362,12 @@ void ClientConnection::configure(std::uint64_t callId, const proto::Envelope& in
     return;
   }
   // The bag may take a fetch: it is handed over as bagDidLoad when it comes, without holding up
-  // the reply or the client's next calls.
-  if (!(previous && previous->identifier == state_->identifier() && bagObserver_)) {
+  // the reply or the client's next calls. A second configure of the same client waits for the
+  // same bag (and later ones follow through bag changes) rather than asking again.
+  if (!bagRequested_) {
+    bagRequested_ = true;
     std::weak_ptr<ClientConnection> weak = weak_from_this();
-    state_->bagAsync(userAgent_, [weak](const std::shared_ptr<const TVXBag>& bag, const std::optional<TVXError>& error) {
+    state_->bag(userAgent_, [weak](const std::shared_ptr<const TVXBag>& bag, const std::optional<TVXError>& error) {
       auto self = weak.lock();
       if (!self) return;
       self->connection_->queue().async([self, bag, error] { self->bagDidLoad(bag, error); });
@@ -437,7 +463,9 @@ void ClientConnection::request(std::uint64_t callId, const proto::Envelope& in) 
     wireReply->set_query_id(queryId);
     if (r) replyToWire(*r, wireReply->mutable_reply());
     if (error) errorToWire(*error, wireReply->mutable_error());
-    if (auto connection = weakConnection.lock(); connection && callId != 0) connection->send(out.SerializeAsString());
+    if (auto connection = weakConnection.lock(); connection && callId != 0) {
+      sendToClient(*connection, out.SerializeAsString());
+    }
     if (endCode) trace(endCode);
   };
   switch (wire.kind_case()) {
@@ -479,7 +507,7 @@ void ClientConnection::feedback(std::uint64_t callId) {
   manager->currentSessionFeedbacks([weak, callId, out](std::vector<std::string> feedbacks) mutable {
     for (auto& feedback : feedbacks) out.mutable_feedback_reply()->add_feedbacks(std::move(feedback));
     out.set_call_id(callId);
-    if (auto connection = weak.lock(); connection && callId != 0) connection->send(out.SerializeAsString());
+    if (auto connection = weak.lock(); connection && callId != 0) sendToClient(*connection, out.SerializeAsString());
     trace(0x2b000028);
   });
 }

@@ -61,7 +61,9 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   // answered with `call_failed`. Never throws, never ends the daemon.
   void handleMessage(const std::string& payload);
 
-  // The connection has ended: closes the transaction and stops the timer.
+  // The connection has ended: stops the timer and closes the transaction, whose keep-alive lasts
+  // another kIdleTransactionSeconds so that the daemon does not leave while the client may come
+  // back.
   void invalidated();
 
   const std::shared_ptr<platform::ipc::IpcConnection>& connection() const { return connection_; }
@@ -77,7 +79,9 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
 
  private:
   void openOrExtendTransaction();
-  void closeTransaction();
+  // Empties the state's query cache and ends the keep-alive: at once (`now`, the idle timer) or
+  // kIdleTransactionSeconds later (invalidation, destruction).
+  void closeTransaction(bool now);
   void configure(std::uint64_t callId, const proto::Envelope& in);
   // Binds the state for the configuration when it can; logs why not otherwise.
   void ensureState();
@@ -97,6 +101,8 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   std::optional<Configuration> configuration_;
   std::string userAgent_;
   std::shared_ptr<ClientState> state_;
+  // A bag was asked for on the client's behalf (configure); it arrives as bagDidLoad once.
+  bool bagRequested_ = false;
 
   std::atomic<bool> transactionOpen_{false};
   std::mutex transactionLock_;

@@ -29,9 +29,10 @@ namespace ipc = platform::ipc;
 
 // A ClientConnection on one end of a socket pair; the test plays the client on the other.
 struct Harness {
+  // First: transactions still held by pending timers end when the clock goes.
+  platform::TransactionTracker transactions;
   platform::DispatchPool pool{2};
   platform::VirtualClock clock;
-  platform::TransactionTracker transactions;
   platform::SerialQueue activityQueue{pool, "test.activities"};
   platform::ActivityScheduler activities{clock, activityQueue, transactions};
   platform::SerialQueue eventQueue{pool, "test.events"};
@@ -96,6 +97,13 @@ struct Harness {
   }
 };
 
+proto::Envelope configure(const std::string& identifier, const std::string& userAgent) {
+  proto::Envelope e;
+  e.mutable_configure()->mutable_configuration()->set_identifier(identifier);
+  e.mutable_configure()->mutable_configuration()->set_user_agent(userAgent);
+  return e;
+}
+
 proto::Envelope notify(const std::string& name, const std::string& stream = "") {
   proto::Envelope e;
   e.mutable_notify()->set_name(name);
@@ -106,10 +114,7 @@ proto::Envelope notify(const std::string& name, const std::string& stream = "") 
 TEST(ClientConnection, SilenceEndsTheKeepAliveTransactionAndTheNextMessageOpensOne) {
   Harness h;
   EXPECT_EQ(h.transactions.openCount(), 1u);
-  proto::Envelope configure;
-  configure.mutable_configure()->mutable_configuration()->set_identifier("com.norvel.seekara");
-  configure.mutable_configure()->mutable_configuration()->set_user_agent("seekara/1");
-  ASSERT_TRUE(h.call(configure).has_configure_reply());
+  ASSERT_TRUE(h.call(configure("com.norvel.seekara", "seekara/1")).has_configure_reply());
   auto state = h.assembly.clientStateManager->stateForClientIdentifier("com.norvel.seekara");
   ASSERT_TRUE(state && state->queryCache());
   state->queryCache()->set(
@@ -129,8 +134,42 @@ TEST(ClientConnection, SilenceEndsTheKeepAliveTransactionAndTheNextMessageOpensO
   EXPECT_EQ(state->queryCache()->count(), 0u) << "a silent client's cached replies go with its transaction";
   h.call(notify("b"));
   EXPECT_EQ(h.transactions.openCount(), 1u);
-  h.client.reset();  // the client goes away: its transaction goes with it
-  EXPECT_TRUE(tavix::testing::waitFor([&] { return h.transactions.openCount() == 0; }));
+
+  // The client goes away: its transaction stays a minute more, in case it comes back.
+  h.client.reset();
+  ASSERT_TRUE(tavix::testing::waitFor([&] { return !h.connection->isValid(); }));
+  h.pool.drain();
+  h.advance(59);
+  EXPECT_EQ(h.transactions.openCount(), 1u);
+  h.advance(1);
+  EXPECT_EQ(h.transactions.openCount(), 0u);
+}
+
+TEST(ClientConnection, OneBagPerClientHoweverOftenItConfiguresAndLateRepliesAreLogged) {
+  Harness h;
+  platform::LogCapture capture;
+  const auto seekara = configure("com.norvel.seekara", "seekara/1");
+  ASSERT_TRUE(h.call(seekara).has_configure_reply());
+  ASSERT_TRUE(h.call(seekara, 2).has_configure_reply()) << "the first bag has not come yet";
+  h.advance(1);
+  auto loaded = h.receive();
+  ASSERT_TRUE(loaded.has_bag_did_load());
+  EXPECT_EQ(loaded.bag_did_load().error().reason(), "timeout");
+  EXPECT_EQ(h.call(notify("next"), 3).call_id(), 3u) << "no second bagDidLoad came before this reply";
+
+  // The client asks again and leaves before the answer: what the daemon still sends is logged,
+  // not dropped silently.
+  proto::Envelope ask;
+  ask.mutable_bag();
+  ask.set_call_id(5);
+  auto frame = ipc::encodeFrame(ask.SerializeAsString());
+  std::size_t sent = 0;
+  ASSERT_FALSE(ipc::sendWithFds(h.client.get(), frame, {}, true, &sent));
+  h.pool.drain();
+  h.client.reset();
+  ASSERT_TRUE(tavix::testing::waitFor([&] { return !h.connection->isValid(); }));
+  h.advance(1);
+  EXPECT_TRUE(capture.contains("(pid:" + std::to_string(::getpid()) + ") remote proxy error: connection invalidated"));
 }
 
 TEST(ClientConnection, DeliversLaunchEventsAndRunsActivitiesOrSaysWhyNot) {
@@ -201,12 +240,8 @@ TEST(ClientConnection, QueriesBeforeAValidConfigurationAndOfUnknownKindAreNotAns
 TEST(ClientConnection, KeepsItsFirstIdentifierAndBuildsTheFullUserAgent) {
   Harness h;
   platform::LogCapture capture;
-  proto::Envelope configure;
-  configure.mutable_configure()->mutable_configuration()->set_identifier("first");
-  configure.mutable_configure()->mutable_configuration()->set_user_agent("client/2");
-  EXPECT_TRUE(h.call(configure).has_configure_reply());
-  configure.mutable_configure()->mutable_configuration()->set_identifier("second");
-  EXPECT_TRUE(h.call(configure).has_configure_reply());
+  EXPECT_TRUE(h.call(configure("first", "client/2")).has_configure_reply());
+  EXPECT_TRUE(h.call(configure("second", "client/2")).has_configure_reply());
   EXPECT_TRUE(capture.contains("session identifier must match"));
   h.connection->queue().sync([&] {
     ASSERT_TRUE(h.subject->configuration());

@@ -171,6 +171,19 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
     });
   }
 
+  // The orderly end, on every way out once the services exist.
+  auto shutDown = [&] {
+    assembly.flusherIPCListener.reset();  // its dumps reach the service, which goes next
+    pool.drain();  // let queued work finish while everything it may touch is still alive
+    // A bag fetch may still be on the wire; its completion must not reach the services going next.
+    assembly.bagController->invalidate();
+    // Work that arrived since (a last feedback event, a closing connection) must not run while the
+    // assembly's objects are being destroyed: stop the workers first.
+    pool.shutdown();
+    if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
+    log.info("tavixd stopped");
+  };
+
   // Socket activation hands the listening socket over; otherwise we make our own.
   auto& connectionLog = TavixLogForCategory(TavixLoggingCategoryConnection);
   std::error_code listenError;
@@ -186,6 +199,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   if (!listener) {
     log.fault("cannot listen on {}: {}", activated.empty() ? socketPath : "the activated socket",
               listenError.message());
+    shutDown();
     return 1;
   }
 
@@ -264,20 +278,12 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   runLoop.run();
 
   listener.reset();  // no new clients while shutting down
-  assembly.flusherIPCListener.reset();  // its dumps reach the service, which goes next
   housekeeping.sync([&] {
     saveCounters.stop();
     idleCheck.stop();
     memoryPressure.stop();
   });
-  pool.drain();  // let queued work finish while everything it may touch is still alive
-  // A bag fetch may still be on the wire; its completion must not reach the services going next.
-  assembly.bagController->invalidate();
-  // Work that arrived since (a last feedback event, a closing connection) must not run while the
-  // assembly's objects are being destroyed: stop the workers first.
-  pool.shutdown();
-  if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
-  log.info("tavixd stopped");
+  shutDown();
   return 0;
 }
 

@@ -14,6 +14,7 @@
 #include "platform/defaults.h"
 #include "platform/http/url_session.h"
 #include "platform/ipc/server.h"
+#include "query/client_state.h"
 
 namespace tavix {
 
@@ -80,6 +81,10 @@ bool TavixService::shouldAcceptNewConnection(const std::shared_ptr<platform::ipc
         if (!service || !c) return;
         connectionLog().notice("connection from {} ({}) invalidated", clientID, pid);
         (*service)->connectionInvalidated(c);
+        // On the connection's queue, where its bound state may be read.
+        if (const auto& state = c->state(); state && state->clientShortName()) {
+          TavixDiagnosticDataReporter::addValue(1, createCounterKey(*state->clientShortName(), "ipcinvalidation"));
+        }
       });
 
   TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.clientconnection");

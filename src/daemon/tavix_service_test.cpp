@@ -3,12 +3,17 @@
 #include <gtest/gtest.h>
 
 #include "core/assembly.h"
+#include "core/diagnostics.h"
 #include "daemon/client_connection.h"
+#include "platform/counters.h"
 #include "platform/defaults.h"
+#include "platform/ipc/frame.h"
 #include "platform/ipc/server.h"
 #include "platform/log.h"
 #include "platform/transactions.h"
+#include "query/client_state_manager.h"
 #include "support/temp_home.h"
+#include "tavix_proto/ipc.pb.h"
 
 namespace tavix {
 namespace {
@@ -17,9 +22,10 @@ namespace ipc = platform::ipc;
 
 TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
   testing::TempHome home;
-  platform::DispatchPool pool(2);
-  platform::SystemClock clock(pool);
+  // First: transactions still held by pending timers end when the clock and the pool go.
   platform::TransactionTracker transactions;
+  platform::DispatchPool pool(2);
+  platform::VirtualClock clock;
   platform::LogCapture capture;
   Assembly assembly;
   assembly.dispatchPool = &pool;
@@ -32,6 +38,7 @@ TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
   {
     TavixService service(assembly);
     EXPECT_TRUE(assembly.sharedSession);
+    assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
     std::error_code ec;
     auto listener = ipc::IpcListener::listen(pool, (home.runtime() / "socket").string(), log, &ec);
     ASSERT_TRUE(listener);
@@ -47,16 +54,35 @@ TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
     EXPECT_EQ(capture.count("too many connections 1"), 0u);
     EXPECT_EQ(transactions.openCount(), 2u) << "each new client holds the daemon up";
 
+    // The first says who it is; its leaving is counted against its client.
+    proto::Envelope configure;
+    configure.set_call_id(1);
+    configure.mutable_configure()->mutable_configuration()->set_identifier("com.norvel.seekara");
+    configure.mutable_configure()->mutable_configuration()->set_user_agent("seekara/1");
+    std::size_t sent = 0;
+    ASSERT_FALSE(ipc::sendWithFds(first.get(), ipc::encodeFrame(configure.SerializeAsString()), {}, true, &sent));
+    ASSERT_TRUE(testing::waitFor([&] { return capture.contains("using client state"); }));
+    const std::string invalidations = createCounterKey("seekara", "ipcinvalidation");
+    const auto before = TavixDiagnosticDataReporter::store().value(invalidations);
+
     first.reset();
     EXPECT_TRUE(testing::waitFor([&] { return service.getClientConnections().size() == 1; }));
     EXPECT_EQ(capture.count("purging url cache"), 0u) << "a client is still connected";
     second.reset();
     EXPECT_TRUE(testing::waitFor([&] { return service.getClientConnections().empty(); }));
     EXPECT_TRUE(testing::waitFor([&] { return capture.count("purging url cache") == 1; }));
-    // These peers never sent a configuration: no session of theirs to close.
-    EXPECT_EQ(capture.count("session not flushed on invalidation"), 2u);
+    // The second never sent a configuration: no session of its own to close.
+    EXPECT_TRUE(testing::waitFor([&] { return capture.count(" on invalidation") == 2; }));
+    EXPECT_GE(capture.count("session not flushed on invalidation"), 1u);
     EXPECT_EQ(capture.count("connection from daemon_tests (" + pid + ") invalidated"), 2u);
-    EXPECT_TRUE(testing::waitFor([&] { return transactions.openCount() == 0; }));
+    EXPECT_EQ(TavixDiagnosticDataReporter::store().value(invalidations), before + 1);
+    // A client that leaves holds the daemon up a minute more, in case it comes back.
+    auto held = [&] { return transactions.open()["com.norvel.tavixd.ipc"]; };
+    EXPECT_EQ(held(), 2u);
+    clock.advance(platform::seconds(59));
+    EXPECT_EQ(held(), 2u);
+    clock.advance(platform::seconds(1));
+    EXPECT_EQ(held(), 0u);
     listener.reset();
     pool.drain();
   }

@@ -89,7 +89,7 @@ class UploadManagerTest : public ::testing::Test {
 
   void postBag(json raw) {
     auto bag = std::make_shared<const TVXBag>(*platform::parseJson(raw.dump())->dictionary(), "tavixd/1");
-    assembly.notificationCenter->post(kTVXBagChangeNotification, nullptr, std::shared_ptr<const TVXBag>(bag));
+    assembly.notificationCenter->post(kTVXBagChangeNotification, nullptr, {}, bagChangeUserInfo(*bag));
   }
   json devserverBag(const std::string& base) {
     return {{"feedback_enabled", true}, {"feedback_url", base + "/feedback"}, {"crowdsourcing_url", base + "/crowdsourcing"}};

@@ -6,8 +6,6 @@
 #include <unicode/timezone.h>
 #include <unicode/uloc.h>
 #include <unicode/ulocdata.h>
-#include <unicode/uscript.h>
-#include <unicode/utf8.h>
 
 #include <cstdlib>
 #include <memory>
@@ -139,45 +137,6 @@ TVXLocaleContext TVXComputeLocaleContext(const TVXLocaleSettings& settings) {
     if (!name.empty() && name != "Etc/Unknown") context.localTimeZoneName = name;
   }
   return context;
-}
-
-std::optional<std::string> TVXLanguageForString(std::optional<std::string_view> text) {
-  if (!text) return std::nullopt;
-  std::string_view s = *text;
-  if (auto blank = s.find(' '); blank != std::string_view::npos) {
-    std::string_view rest = s;
-    while (!rest.empty() && rest.front() == ' ') rest.remove_prefix(1);
-    s = rest.substr(0, rest.find(' '));
-  }
-  bool han = false;
-  std::int32_t i = 0;
-  const auto* bytes = reinterpret_cast<const std::uint8_t*>(s.data());
-  auto length = static_cast<std::int32_t>(s.size());
-  while (i < length) {
-    UChar32 c;
-    U8_NEXT(bytes, i, length, c);
-    if (c < 0) continue;
-    UErrorCode status = U_ZERO_ERROR;
-    UScriptCode script = uscript_getScript(c, &status);
-    if (U_FAILURE(status)) continue;
-    switch (script) {
-      case USCRIPT_HIRAGANA:
-      case USCRIPT_KATAKANA:
-        return "ja";  // kana settle it even after Han characters
-      case USCRIPT_HANGUL: return "ko";
-      case USCRIPT_HAN: han = true; break;
-      case USCRIPT_THAI: return "th";
-      case USCRIPT_GREEK: return "el";
-      case USCRIPT_HEBREW: return "he";
-      case USCRIPT_ARMENIAN: return "hy";
-      case USCRIPT_GEORGIAN: return "ka";
-      case USCRIPT_DEVANAGARI: return "hi";
-      case USCRIPT_ARABIC: return "ar";
-      default: break;
-    }
-  }
-  if (han) return "zh";
-  return std::nullopt;
 }
 
 }  // namespace tavix

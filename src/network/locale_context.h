@@ -46,11 +46,4 @@ struct TVXLocaleContext {
 
 TVXLocaleContext TVXComputeLocaleContext(const TVXLocaleSettings& settings);
 
-// A guess at the language of a text, as a BCP 47 language code, for the scripts that name one
-// language (kana → "ja", Hangul → "ko", Han → "zh", Thai, Greek, Hebrew, Armenian, Georgian,
-// Devanagari → "hi", Arabic → "ar"). Latin, Cyrillic and other shared scripts give no guess: there
-// is no statistical language identifier on this system. A text with a blank is judged by its
-// first word.
-std::optional<std::string> TVXLanguageForString(std::optional<std::string_view> text);
-
 }  // namespace tavix

@@ -58,17 +58,5 @@ TEST(LocaleContext, IcuAnswersForSeveralLocales) {
   EXPECT_FALSE(us.effectiveSystemLanguage);
 }
 
-TEST(LocaleContext, LanguageGuessUsesScriptsThatNameOneLanguage) {
-  EXPECT_FALSE(TVXLanguageForString(std::nullopt));
-  EXPECT_FALSE(TVXLanguageForString("hello world"));
-  EXPECT_EQ(TVXLanguageForString("東京タワー"), "ja");  // kana after Han settle it
-  EXPECT_EQ(TVXLanguageForString("北京"), "zh");
-  EXPECT_EQ(TVXLanguageForString("서울"), "ko");
-  EXPECT_EQ(TVXLanguageForString("Αθήνα"), "el");
-  EXPECT_EQ(TVXLanguageForString("  שלום world"), "he");  // the first word decides
-  EXPECT_FALSE(TVXLanguageForString("world שלום"));
-  EXPECT_FALSE(TVXLanguageForString(std::string("\xff\xfe")));  // invalid UTF-8 is skipped
-}
-
 }  // namespace
 }  // namespace tavix

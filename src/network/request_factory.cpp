@@ -11,12 +11,14 @@
 #include "core/assembly.h"
 #include "core/logging.h"
 #include "core/names.h"
+#include "network/language_identifier.h"
 #include "network/locale_context.h"
 #include "network/url_request_builder.h"
 #include "network/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
+#include "platform/files.h"
 #include "platform/json_value.h"
 #include "platform/notification_center.h"
 
@@ -111,11 +113,14 @@ struct TVXNetworkRequestFactory::Context {
   std::optional<std::string> geoLocationSource;
   std::optional<std::string> lookupGeoLocationLatLng;
   std::vector<std::string> supportedGeoLocationSources;
+  // The bag's "marvola_configuration" as the network-service proxy holds it.
+  Dictionary proxyConfiguration;
 
   std::shared_ptr<Delegate> delegate;
   platform::UserDefaults::Subscription defaultsSubscription;
   platform::NotificationCenter::Registration bagRegistration;
   platform::NotificationCenter::Registration guidRegistration;
+  platform::NotificationCenter::Registration downloadRegistration;
 };
 
 // Hears the location and motion services and hops onto the context queue.
@@ -455,13 +460,45 @@ class TVXNetworkRequestFactory::Builder {
     f.assembly_.dispatchPool->post([weak, bag] {
       if (auto self = weak.lock()) updateVisibility(*self, *bag);
     });
-    if (f.providers_.proxySetCurrentConfiguration) {
-      auto configuration = bag->marvolaConfiguration();
-      if (!configuration) {
-        configuration = Dictionary{{"appRule", Dictionary{{"enable", Dictionary{{"Enabled", false}}}}}};
-      }
-      f.providers_.proxySetCurrentConfiguration(*configuration, "tavixd");
+    auto configuration = bag->marvolaConfiguration();
+    if (!configuration) {
+      configuration = Dictionary{{"appRule", Dictionary{{"enable", Dictionary{{"Enabled", false}}}}}};
     }
+    f.context_->queue.async([weak, configuration = *configuration] {
+      if (auto self = weak.lock()) self->context_->proxyConfiguration = configuration;
+    });
+    if (f.providers_.proxySetCurrentConfiguration) f.providers_.proxySetCurrentConfiguration(*configuration, "tavixd");
+  }
+
+  // The installed subset of the known dictionaries, as "dicts" sends it: their identifiers, in the
+  // list's order, joined by commas. `quietWhenMissing` at start, when no list has come yet.
+  static void loadInstalledDictionaries(Self& f, bool quietWhenMissing) {
+    const auto path = f.assembly_.cachesFolder() / kTVXKnownDictionariesList;
+    std::string text;
+    if (auto ec = platform::readFile(path, &text)) {
+      if (!(quietWhenMissing && ec == std::errc::no_such_file_or_directory)) {
+        requestLog().error("Error getting file handle for dictionary_resources_url: {}", ec.message());
+      }
+      return;
+    }
+    const auto parsed = platform::parseJson(text);
+    const auto* known = parsed ? parsed->array() : nullptr;
+    if (!known) {
+      requestLog().error("contents of dictionary_resource_url is invalid");
+      return;
+    }
+    std::string installed;
+    for (const auto& entry : *known) {
+      const std::string* identifier = entry.string();
+      if (!identifier) {
+        requestLog().error("contents of dictionary_resource_url is invalid");
+        return;
+      }
+      if (identifier->empty() || !f.providers_.isDictionaryInstalled(*identifier)) continue;
+      if (!installed.empty()) installed += ',';
+      installed += *identifier;
+    }
+    f.setInstalledDictionaries(installed.empty() ? std::nullopt : std::optional<std::string>(installed));
   }
 
   // The news reader and the messages app's hashtag images follow the bag's switch for their
@@ -574,6 +611,17 @@ TVXNetworkRequestFactory::TVXNetworkRequestFactory(Assembly& assembly, TVXReques
   if (!providers_.deviceInformation) {
     providers_.deviceInformation = std::make_shared<DeviceInformation>(assembly.userDefaults.get());
   }
+  if (!providers_.isDictionaryInstalled) {
+    providers_.isDictionaryInstalled = [](const std::string& identifier) {
+      // A name that could leave the folder is no dictionary of ours.
+      if (identifier.find('/') != std::string::npos || identifier.front() == '.') return false;
+      std::error_code ec;
+      for (const char* folder : {"/usr/share/dictd/", "/usr/local/share/dictd/"}) {
+        if (platform::fs::exists(std::string(folder) + identifier + ".index", ec)) return true;
+      }
+      return false;
+    };
+  }
   userAgent_ = createUserAgentString(std::nullopt, *providers_.deviceInformation);
 }
 
@@ -581,6 +629,7 @@ TVXNetworkRequestFactory::~TVXNetworkRequestFactory() {
   // Stop hearing the world before the snapshot goes.
   context_->bagRegistration.reset();
   context_->guidRegistration.reset();
+  context_->downloadRegistration.reset();
   context_->defaultsSubscription.reset();
 }
 
@@ -593,6 +642,8 @@ void TVXNetworkRequestFactory::start() {
     Builder::readDefaults(*this);
     Builder::setupDebuggingQueryItems(*this);
   });
+  // The list a past run downloaded still says what is installed.
+  Builder::loadInstalledDictionaries(*this, true);
   std::weak_ptr<TVXNetworkRequestFactory> weak = weak_from_this();
   context_->defaultsSubscription = assembly_.userDefaults->addObserver([weak](const std::string& key) {
     auto self = weak.lock();
@@ -604,8 +655,15 @@ void TVXNetworkRequestFactory::start() {
   context_->bagRegistration = assembly_.notificationCenter->addObserver(
       kTVXBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
         auto self = weak.lock();
-        auto bag = bagOfNotification(n);
-        if (self && bag) Builder::didGetBag(*self, std::move(bag));
+        if (!self) return;
+        // The daemon's own view: the proxy and the location sources are not a client's to choose.
+        if (auto bag = bagOfNotification(n, self->userAgent_.value_or(""))) Builder::didGetBag(*self, std::move(bag));
+      });
+  context_->downloadRegistration = assembly_.notificationCenter->addObserver(
+      kTVXFileDownloadCompletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
+        const auto it = n.userInfo.find("identifier");
+        if (it == n.userInfo.end() || it->second != PropertyValue(kTVXKnownDictionariesList)) return;
+        if (auto self = weak.lock()) Builder::loadInstalledDictionaries(*self, false);
       });
   // A new user identifier starts a new maps user session, so "X-Norvel-GeoSession" follows it.
   context_->guidRegistration = assembly_.notificationCenter->addObserver(
@@ -880,6 +938,29 @@ void TVXNetworkRequestFactory::setInstalledDictionaries(std::optional<std::strin
 }
 
 void TVXNetworkRequestFactory::flushContextAccessQueue() { context_->queue.sync([] {}); }
+
+int TVXNetworkRequestFactory::proxyGetStatus() {
+  if (!assembly_.useMarvola()) return 0;
+  bool on = false;
+  context_->queue.sync([&] {
+    const Dictionary& c = context_->proxyConfiguration;
+    const auto enabled = c.find("enabled");
+    const auto proxy = c.find("proxy");
+    on = enabled != c.end() && enabled->second.asBool().value_or(false) && proxy != c.end() && proxy->second.string();
+  });
+  return on ? 1 : 0;
+}
+
+std::optional<std::string> TVXNetworkRequestFactory::proxyURL() {
+  if (proxyGetStatus() != 1) return std::nullopt;
+  std::optional<std::string> url;
+  context_->queue.sync([&] {
+    const auto proxy = context_->proxyConfiguration.find("proxy");
+    if (proxy != context_->proxyConfiguration.end() && proxy->second.string()) url = *proxy->second.string();
+  });
+  if (!url || url->find("://") == std::string::npos) return std::nullopt;
+  return url;
+}
 
 std::optional<std::string> TVXNetworkRequestFactory::geoLocationLatLng() {
   std::optional<std::string> out;

@@ -8,10 +8,13 @@
 // reads enter it synchronously (never call them from that queue); observers and setters update it
 // asynchronously; flushContextAccessQueue() waits for the updates queued so far.
 //
-// Observed: "TVXBagChangeNotification" on the assembly's notification centre (the notification's
-// object is the new bag, a std::shared_ptr<const TVXBag>, std::shared_ptr<TVXBag> or TVXBag) and
-// the defaults keys it reads. Posted: "TVXBagRefreshRequired" (sender: the factory, from a pool
+// Observed: "TVXBagChangeNotification" on the assembly's notification centre (its user info's
+// "bag"), "TVXFileDownloadCompletedNotification" for the known-dictionaries list, and the
+// defaults keys it reads. Posted: "TVXBagRefreshRequired" (sender: the factory, from a pool
 // thread) when the locale context or the device country code changes.
+//
+// The factory also stands in for the platform's network-service proxy: it keeps the bag's proxy
+// configuration and answers the proxy status and URL that every request's task is given.
 //
 // Defaults read here: "TVXDebugParameters", "TVXAlwaysOnTophit", "TVXLookupDisabled",
 // "TVXManagedAccount" and "TVXDeviceRestricted" (booleans standing in for the account and
@@ -71,6 +74,10 @@ inline constexpr const char* kTVXFeatureSeekaraNewsAllowed = "TVXFeatureSeekaraN
 inline constexpr const char* kTVXBlacklistedAppBundleIDsKey = "blacklistedAppBundleIDs";
 inline constexpr const char* kTVXSTSAppBundleIdentifier = "com.norvel.messages.hashtagimages";
 
+// The resource that lists the dictionaries the server knows: a JSON array of dictionary
+// identifiers, kept by the download manager as a file of that name in the caches folder.
+inline constexpr const char* kTVXKnownDictionariesList = "dictionary_resources_url";
+
 // The collaborators the factory reads. Empty members are taken from the assembly (location and
 // motion managers) or made from its defaults (device information, routine); the rest stay absent,
 // and what they would feed is then not sent.
@@ -83,6 +90,9 @@ struct TVXRequestFactoryProviders {
   std::function<std::optional<std::string>()> appWhitelistSignature;
   // The network-service proxy: receives the bag's proxy configuration under the name "tavixd".
   std::function<void(const platform::Dictionary& configuration, const std::string& name)> proxySetCurrentConfiguration;
+  // Whether a dictionary of the known-dictionaries list is installed. Empty: a dictd database of
+  // that name in /usr/share/dictd or /usr/local/share/dictd.
+  std::function<bool(const std::string& identifier)> isDictionaryInstalled;
 };
 
 class TVXNetworkRequestFactory : public std::enable_shared_from_this<TVXNetworkRequestFactory> {
@@ -128,6 +138,17 @@ class TVXNetworkRequestFactory : public std::enable_shared_from_this<TVXNetworkR
   void setSubscriptionInfo(std::optional<std::string> info);
   // The installed dictionaries, as sent in "dicts". Asynchronous.
   void setInstalledDictionaries(std::optional<std::string> dictionaries);
+
+  // The network-service proxy: 1 while requests go through the bag's proxy ("TVXUseMarvola" on
+  // and the bag's "marvola_configuration" enabled with a "proxy"), else 0. Synchronous.
+  int proxyGetStatus();
+  // The proxy every task is pointed at while the status is 1; none otherwise, or when the
+  // configured proxy is not a URL. Synchronous.
+  std::optional<std::string> proxyURL();
+
+  // The device answers the factory's requests carry; one for the process, so that the operating
+  // system's version is read once.
+  const DeviceInformation& deviceInformation() const { return *providers_.deviceInformation; }
 
   // Waits until every update queued so far has run. Not from the context queue.
   void flushContextAccessQueue();

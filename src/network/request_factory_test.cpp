@@ -13,7 +13,9 @@
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
+#include "platform/files.h"
 #include "platform/json_value.h"
+#include "platform/log.h"
 #include "platform/notification_center.h"
 #include "support/temp_home.h"
 
@@ -100,6 +102,7 @@ class RequestFactoryTest : public ::testing::Test {
     defaults->setObject("TVXTimeZone", "Europe/Paris");
     assembly.dispatchPool = &pool;
     assembly.clock = &clock;
+    assembly.paths = platform::Paths{home.cache(), home.config(), home.runtime()};
     assembly.userDefaults = defaults;
     assembly.notificationCenter = center;
     providers.locationManager = location;
@@ -174,7 +177,7 @@ TEST_F(RequestFactoryTest, SearchRequestCarriesTheContextInNameOrder) {
   EXPECT_EQ(q["geosrc"], "slow");  // authorised, but the first request came before any fix
   EXPECT_EQ(q.count("latlng"), 0u);
   EXPECT_EQ(q.count("rm"), 0u);
-  EXPECT_EQ(q.count("mode"), 0u);
+  EXPECT_EQ(q.count("mode") + q.count("du_enabled"), 0u);
 
   const auto& h = built->headers;
   EXPECT_EQ(h.get("X-Norvel-Languages"), R"(["fr-FR","en-GB","de"])");
@@ -196,6 +199,14 @@ TEST_F(RequestFactoryTest, SearchRequestCarriesTheContextInNameOrder) {
   request.triggerEvent = 24;
   q = queryOf(factory->searchRequest(request, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
   EXPECT_EQ(q["qtype"], "suggest_with_results");
+
+  // A managed account, and a user who allows diagnostics to be sent.
+  defaults->setObject("TVXManagedAccount", true);
+  defaults->setObject("TVXDiagnosticsSubmissionAllowed", true);
+  factory->flushContextAccessQueue();
+  q = queryOf(factory->searchRequest(request, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
+  EXPECT_EQ(q["mode"], "managed");
+  EXPECT_EQ(q["du_enabled"], "1");
 }
 
 TEST_F(RequestFactoryTest, DebugParametersAreAllOrNothingAndForced) {
@@ -233,14 +244,16 @@ TEST_F(RequestFactoryTest, MissingURLsBuildNothingAndLeaveLocationAlone) {
 }
 
 TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
+  defaults->setObject("TVXMotionActivity", "walking");
+  providers.motionManager = std::make_shared<DefaultsMotionManager>(*defaults, pool);
   std::vector<PropertyValue> proxies;
   providers.proxySetCurrentConfiguration = [&](const Dictionary& configuration, const std::string& name) {
     EXPECT_EQ(name, "tavixd");
     proxies.emplace_back(configuration);
   };
   make();
-  center->post("TVXBagChangeNotification", nullptr,
-               std::make_shared<const TVXBag>(bag(R"({"supported_geo_location_sources":["gps"]})")));
+  center->post("TVXBagChangeNotification", nullptr, {},
+               bagChangeUserInfo(bag(R"({"supported_geo_location_sources":["gps"]})")));
   factory->flushContextAccessQueue();
   ASSERT_GE(location->starts.load(), 1);
 
@@ -261,6 +274,7 @@ TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
   TVXSearchRequest request;
   routine->mode = 0;
   location->deliver(gps);  // the routine mode is read with each fix
+  pool.drain();  // and the motion activity came with the bag
   factory->flushContextAccessQueue();
   int starts = location->starts.load();
   clock.advance(platform::seconds(299));
@@ -269,8 +283,9 @@ TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
   EXPECT_EQ(q["latlng"], "-33.900000,151.200000");
   EXPECT_EQ(q["geosrc"], "gps,10.000000");
   EXPECT_EQ(q["rm"], "2");
+  EXPECT_EQ(q["tm"], "3");  // walking
   q = queryOf(factory->searchRequest(request, searchBag, "G", TVXFieldMaskNoLocation)->url);
-  EXPECT_EQ(q.count("latlng") + q.count("geosrc") + q.count("rm"), 0u);
+  EXPECT_EQ(q.count("latlng") + q.count("geosrc") + q.count("rm") + q.count("tm"), 0u);
 
   clock.advance(platform::seconds(2));
   factory->searchRequest(request, searchBag, "G");
@@ -287,7 +302,7 @@ TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
   EXPECT_EQ(q.count("latlng"), 0u);
   EXPECT_EQ(q["ltype"], "hint");
   EXPECT_EQ(q["qlang"], "zh");
-  EXPECT_EQ(q.count("lctxlang"), 0u);  // Latin script names no language
+  EXPECT_EQ(q["lctxlang"], "en");  // a phrase: the identifier judges it whole
   EXPECT_EQ(q["context"], "org.example.reader");
 
   factory->setPerformedSearch();
@@ -295,8 +310,8 @@ TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
   auto download = factory->fileDownloadRequest("https://r.example/f", "etag1", true);
   EXPECT_EQ(download->headers.get("X-Norvel-FuzzedLatLong"), "-33.900000,151.200000");
 
-  center->post("TVXBagChangeNotification", nullptr,
-               std::make_shared<const TVXBag>(bag(R"({"marvola_configuration":{"enabled":true}})")));
+  center->post("TVXBagChangeNotification", nullptr, {},
+               bagChangeUserInfo(bag(R"({"marvola_configuration":{"enabled":true}})")));
   factory->flushContextAccessQueue();
   EXPECT_EQ(factory->geoLocationSource(), "bagno.all");
   ASSERT_EQ(proxies.size(), 2u);
@@ -308,8 +323,8 @@ TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
 
 TEST_F(RequestFactoryTest, NewsWithoutAuthorisationAndDeniedUsersSendUserno) {
   make();
-  center->post("TVXBagChangeNotification", nullptr,
-               std::make_shared<const TVXBag>(bag(R"({"supported_geo_location_sources":"all"})")));
+  center->post("TVXBagChangeNotification", nullptr, {},
+               bagChangeUserInfo(bag(R"({"supported_geo_location_sources":"all"})")));
   factory->flushContextAccessQueue();
   location->deliver({1.5, 2.5, 100, 6, clock.now()});
   factory->flushContextAccessQueue();
@@ -350,6 +365,7 @@ TEST_F(RequestFactoryTest, FailuresAndAuthorisationChangesSetTheReason) {
 }
 
 TEST_F(RequestFactoryTest, OtherKindsAndBagRequests) {
+  providers.isDictionaryInstalled = [](const std::string& id) { return id != "de-duden"; };
   make();
   struct Source : TVXBagURLSource {
     std::string country;
@@ -394,7 +410,21 @@ TEST_F(RequestFactoryTest, OtherKindsAndBagRequests) {
   EXPECT_EQ(std::stod(q["timestamp"]), platform::toUnixSeconds(clock.now()));
   EXPECT_EQ(queryOf(factory->cardRequest(TVXCardRequest{}, kinds, "G")->url)["key"], "tapirowl3860");
 
-  factory->setInstalledDictionaries("en-oxford,fr-larousse");
+  // The known dictionaries arrive as a resource; "dicts" names those installed, in its order.
+  const auto list = home.cache() / "com.norvel.tavixd" / kTVXKnownDictionariesList;
+  auto downloaded = [&](const std::string& contents) {
+    ASSERT_FALSE(platform::createDirectory(list.parent_path(), true));
+    ASSERT_FALSE(platform::writeFileAtomically(list, contents));
+    center->post("TVXFileDownloadCompletedNotification", nullptr, {},
+                 {{"identifier", PropertyValue(kTVXKnownDictionariesList)}});
+    factory->flushContextAccessQueue();
+  };
+  EXPECT_EQ(queryOf(factory->lookupRequest(TVXLookupRequest{}, kinds, "G")->url).count("dicts"), 0u);
+  downloaded(R"(["en-oxford", "de-duden", "fr-larousse"])");
+  EXPECT_EQ(queryOf(factory->lookupRequest(TVXLookupRequest{}, kinds, "G")->url)["dicts"], "en-oxford,fr-larousse");
+  platform::LogCapture logs;
+  downloaded(R"({"en-oxford": true})");
+  EXPECT_TRUE(logs.contains("contents of dictionary_resource_url is invalid"));
   EXPECT_EQ(queryOf(factory->lookupRequest(TVXLookupRequest{}, kinds, "G")->url)["dicts"], "en-oxford,fr-larousse");
   defaults->setObject("TVXLookupDisabled", true);
   EXPECT_EQ(queryOf(factory->lookupRequest(TVXLookupRequest{}, kinds, "G")->url)["dicts"], "off");
@@ -418,19 +448,40 @@ TEST_F(RequestFactoryTest, BagSwitchesForNewsAndMessagesReachManagedConfiguratio
     return v && v->array() ? platform::toJson(*v) : std::string("absent");
   };
 
-  center->post("TVXBagChangeNotification", nullptr,
-               std::make_shared<const TVXBag>(bag(R"({"clients":{"news":{"enabled":false}}})")));
+  center->post("TVXBagChangeNotification", nullptr, {},
+               bagChangeUserInfo(bag(R"({"clients":{"news":{"enabled":false}}})")));
   pool.drain();
   managed.synchronize();
   EXPECT_EQ(managed.objectForKey(kTVXFeatureSeekaraNewsAllowed), PropertyValue(false));
   EXPECT_EQ(blacklisted(), "[]");
 
-  center->post("TVXBagChangeNotification", nullptr,
-               std::make_shared<const TVXBag>(bag(R"({"enabled":false,"clients":{"news":{"enabled":true}}})")));
+  center->post("TVXBagChangeNotification", nullptr, {},
+               bagChangeUserInfo(bag(R"({"enabled":false,"clients":{"news":{"enabled":true}}})")));
   pool.drain();
   managed.synchronize();
   EXPECT_EQ(managed.objectForKey(kTVXFeatureSeekaraNewsAllowed), PropertyValue(true));
   EXPECT_EQ(blacklisted(), std::string("[\"") + kTVXSTSAppBundleIdentifier + "\"]");
+}
+
+TEST_F(RequestFactoryTest, TheBagsProxyConfigurationDecidesEveryTasksProxy) {
+  defaults->setObject("TVXUseMarvola", true);
+  make();
+  auto configure = [&](const char* json) {
+    center->post("TVXBagChangeNotification", nullptr, {},
+               bagChangeUserInfo(bag(json)));
+    return std::pair{factory->proxyGetStatus(), factory->proxyURL()};
+  };
+  EXPECT_EQ(configure(R"({})"), std::pair(0, std::optional<std::string>()));
+  EXPECT_EQ(configure(R"({"marvola_configuration":{"enabled":true}})"), std::pair(0, std::optional<std::string>()));
+  EXPECT_EQ(configure(R"({"marvola_configuration":{"enabled":true,"proxy":"http://proxy.example:8080"}})"),
+            std::pair(1, std::optional<std::string>("http://proxy.example:8080")));
+  // On, but not a URL a task can use: the status stays, the task goes without.
+  EXPECT_EQ(configure(R"({"marvola_configuration":{"enabled":true,"proxy":"proxy.example"}})"),
+            std::pair(1, std::optional<std::string>()));
+  configure(R"({"marvola_configuration":{"enabled":true,"proxy":"http://proxy.example:8080"}})");
+  defaults->setObject("TVXUseMarvola", false);
+  EXPECT_EQ(factory->proxyGetStatus(), 0);
+  EXPECT_FALSE(factory->proxyURL());
 }
 
 TEST_F(RequestFactoryTest, ANewUserIdentifierStartsANewMapsSession) {

@@ -117,26 +117,7 @@ std::optional<TVXError> ClientState::adoptUserAgentLocked(const std::string& use
   return std::nullopt;
 }
 
-void ClientState::bag(const std::string& userAgent, const BagReply& reply) {
-  bool relabelled = false;
-  std::optional<TVXError> noAgent;
-  {
-    std::lock_guard lock(mutex_);
-    noAgent = adoptUserAgentLocked(userAgent, &relabelled);
-  }
-  // Replies cached for the old user agent were made for another client identity.
-  if (relabelled && queryCache_) queryCache_->removeAllObjects();
-  if (noAgent) {
-    reply(nullptr, noAgent);
-    return;
-  }
-  const bool ok = ensureBag();
-  std::optional<TVXError> error;
-  if (!ok) error = TVXError{kTVXErrorDomain, 1, "timeout"};
-  reply(currentBag(), std::move(error));
-}
-
-void ClientState::bagAsync(const std::string& userAgent, BagReply reply) {
+void ClientState::bag(const std::string& userAgent, BagReply reply) {
   bool relabelled = false;
   std::optional<TVXError> noAgent;
   std::string agent;
@@ -171,9 +152,16 @@ void ClientState::bagAsync(const std::string& userAgent, BagReply reply) {
   }
   markNetworkRequest();
   auto waiter = std::make_shared<BagReply>(std::move(reply));
+  std::shared_ptr<const TVXBag> arrived;
   {
     std::lock_guard lock(mutex_);
-    bagWaiters_.push_back(waiter);
+    // A bag that came since the look-up above found no waiter to hand itself to.
+    arrived = bag_;
+    if (!arrived) bagWaiters_.push_back(waiter);
+  }
+  if (arrived) {
+    (*waiter)(arrived, std::nullopt);
+    return;
   }
   // The waiter is answered once: by the bag's arrival or by this timer, whichever takes it first.
   std::weak_ptr<ClientState> weak = weak_from_this();
@@ -235,12 +223,12 @@ bool ClientState::ensureBag() {
 }
 
 void ClientState::bagChangeNotification(const platform::Notification& notification) {
-  auto bag = bagOfNotification(notification);
+  auto bag = bagOfNotification(notification, userAgent().value_or(""));
   std::vector<std::shared_ptr<BagReply>> waiters;
   std::shared_ptr<const TVXBag> held;
   {
     std::lock_guard lock(mutex_);
-    if (bag) bag_ = labelled(*bag, userAgent_.value_or(bag->userAgent()));
+    if (bag) bag_ = userAgent_ && *userAgent_ != bag->userAgent() ? labelled(*bag, *userAgent_) : bag;
     ++bagSignals_;
     held = bag_;
     if (held) waiters.swap(bagWaiters_);
@@ -253,11 +241,14 @@ void ClientState::bagChangeNotification(const platform::Notification& notificati
 }
 
 void ClientState::updateClient(const std::string& userAgent) {
+  // An empty agent is no agent: the state then answers "no UserAgent" and is not persisted.
+  std::optional<std::string> agent;
+  if (!userAgent.empty()) agent = userAgent;
   std::lock_guard lock(mutex_);
-  if (userAgent_ == userAgent) return;
-  userAgent_ = userAgent;
+  if (userAgent_ == agent) return;
+  userAgent_ = std::move(agent);
   relabelBagLocked();
-  sessionLog().notice("userAgent changed to {}", userAgent);
+  sessionLog().notice("userAgent changed to {}", userAgent_.value_or("(null)"));
 }
 
 }  // namespace tavix

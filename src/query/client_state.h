@@ -5,9 +5,10 @@
 // flight) with the feedback records around their network requests.
 //
 // Threading: any method may be called from any thread; the fields below are guarded by one mutex.
-// bag() and ensureBag() may block the caller for up to kTVXFirstLaunchBagSemaphoreWait while the
-// bag controller fetches. The query methods run their synchronous part on the caller's queue and
-// finish on the URL session's queue; their reply block is called exactly once.
+// ensureBag() (the query paths' wait) may block the caller for up to
+// kTVXFirstLaunchBagSemaphoreWait while the bag controller fetches; bag() never blocks. The query
+// methods run their synchronous part on the caller's queue and finish on the URL session's queue;
+// their reply block is called exactly once.
 #pragma once
 
 #include <condition_variable>
@@ -40,6 +41,7 @@ namespace proto {
 class CTStartNetworkSearchFeedback;
 }
 namespace platform {
+class Logger;
 class SerialQueue;
 namespace http {
 class URLSessionDataTask;
@@ -49,6 +51,9 @@ struct URLSessionTaskMetrics;
 
 // The domain of the error that comes with a reply body that is not JSON.
 inline constexpr const char* kTVXJSONErrorDomain = "TavixJSONErrorDomain";
+// The domain of a server's HTTP status that failed a request (the code is the status), kept apart
+// from kTVXErrorDomain, whose codes are the daemon's own.
+inline constexpr const char* kTVXHTTPStatusErrorDomain = "TavixHTTPStatusErrorDomain";
 
 // How long a query waits for a bag that is being fetched, in milliseconds: longer on a device that
 // has never recorded resources (first launch), where the bag is certainly on its way.
@@ -70,14 +75,13 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
 
   // Adopts `userAgent` when non-empty and new (re-labelling the bag, emptying the query cache),
   // then answers the bag: error code 1 "no UserAgent" without a user agent, "timeout" when none
-  // came in time. Blocks the caller for at most the bag wait.
-  void bag(const std::string& userAgent, const BagReply& reply);
-  // The same without blocking: `reply` runs at once when the bag is held, else on the state's
-  // queue when a bag arrives or the wait is over. For callers that must not hold a thread.
-  void bagAsync(const std::string& userAgent, BagReply reply);
+  // came within the bag wait. Never blocks: `reply` runs at once when the bag is held (or there
+  // is no user agent), else on the state's queue when a bag arrives or the wait is over.
+  void bag(const std::string& userAgent, BagReply reply);
   // Whether a bag is held, fetching and waiting for one when not.
   bool ensureBag();
-  // The tool's connections re-label the state with their user agent.
+  // The tool's connections re-label the state with their user agent; an empty one leaves the
+  // state without.
   void updateClient(const std::string& userAgent);
 
   // ---- Connection warming: a warm-up request when the bag names one and no request went out in
@@ -146,10 +150,13 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   // Counts the server's HTTP status per user agent.
   void recordSearchResult(long statusCode);
   void setPerformedSearch();
-  // 1 when requests go through the bag's proxy, else 0.
-  int marvolaStatus() const;
-  // Points the task at the bag's proxy; false when there is none to use.
-  bool proxyEnableForTask(platform::http::URLSessionDataTask& task) const;
+  // The proxy a task goes through: the network-service proxy's while its status is 1 (logged
+  // when its URL cannot be used), else none.
+  std::optional<std::string> proxyForTask() const;
+  // A request the factory could not build (no bag, or the bag lacks the URL): the client hears it
+  // as the transport would say it, and the failure is recorded like any other.
+  void failUnbuiltRequest(const TVXRequest& request, const std::string& input, const TVXReplyBlock& reply,
+                          platform::Logger& log);
   // Wraps `codable` with this client's user agent (and the current GUID when asked) and adds it.
   void addCodable(const google::protobuf::Message& codable, std::uint64_t queryId, bool withUserGuid);
   void recordSkipSearch(int reason, const std::string& input, std::uint64_t queryId);
@@ -177,7 +184,7 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   std::optional<platform::TimePoint> lastNetworkRequest_;
   std::vector<std::string> completionCacheSuggestions_;  // found for the previous keystroke
   platform::NotificationCenter::Registration bagObserver_;
-  // Callers of bagAsync() waiting for a bag; answered on waitQueue_.
+  // Callers of bag() waiting for a bag; answered on waitQueue_.
   std::vector<std::shared_ptr<BagReply>> bagWaiters_;
   std::unique_ptr<platform::SerialQueue> waitQueue_;
   // Where retried attempts of the retryable kinds are started.

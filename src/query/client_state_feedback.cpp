@@ -16,6 +16,7 @@
 #include "feedback/tavix_feedback.h"
 #include "feedback/vocabulary.h"
 #include "network/request_factory.h"
+#include "network/retryable_request.h"
 #include "network/user_agent.h"
 #include "platform/clock.h"
 #include "platform/http/url_session.h"
@@ -176,26 +177,19 @@ void ClientState::setPerformedSearch() {
   if (assembly_.requestFactory) assembly_.requestFactory->setPerformedSearch();
 }
 
-int ClientState::marvolaStatus() const {
-  if (!assembly_.useMarvola()) return 0;
-  const auto bag = currentBag();
-  const auto configuration = bag ? bag->marvolaConfiguration() : std::nullopt;
-  if (!configuration) return 0;
-  const auto enabled = configuration->find("enabled");
-  const auto proxy = configuration->find("proxy");
-  const bool on = enabled != configuration->end() && enabled->second.asBool().value_or(false);
-  return on && proxy != configuration->end() && proxy->second.string() ? 1 : 0;
+std::optional<std::string> ClientState::proxyForTask() const {
+  if (!assembly_.requestFactory || assembly_.requestFactory->proxyGetStatus() != 1) return std::nullopt;
+  auto proxy = assembly_.requestFactory->proxyURL();
+  if (!proxy) TavixLogForCategory(TavixLoggingCategoryConnection).error("Enabling Marvola for request failed.");
+  return proxy;
 }
 
-bool ClientState::proxyEnableForTask(URLSessionDataTask& task) const {
-  const auto bag = currentBag();
-  const auto configuration = bag ? bag->marvolaConfiguration() : std::nullopt;
-  if (!configuration) return false;
-  const auto proxy = configuration->find("proxy");
-  const std::string* url = proxy == configuration->end() ? nullptr : proxy->second.string();
-  if (!url || url->find("://") == std::string::npos) return false;
-  task.setProxy(*url);
-  return true;
+void ClientState::failUnbuiltRequest(const TVXRequest& request, const std::string& input, const TVXReplyBlock& reply,
+                                     platform::Logger& log) {
+  log.error("error with request {}", input);
+  const TVXError error{platform::http::kURLErrorDomain, platform::http::URLErrorUnsupportedURL, "unsupported URL"};
+  reply(request.queryId, std::nullopt, error);
+  failSearchFeedback(error, request, nullptr, 0, 0, {});
 }
 
 void ClientState::warm() {
@@ -211,40 +205,39 @@ void ClientState::warm() {
       searchLog().debug("warm not required, connection still warm");
       return;
     }
-    // Taken now, under the lock, so that a second warm racing this one stays home.
-    lastNetworkRequest_ = now;
   }
   auto request = assembly_.requestFactory ? assembly_.requestFactory->warmRequest(*warmURL) : std::nullopt;
   if (!request) return;
+  {
+    // Taken now that a request exists, and checked again, so that of two warms racing one goes.
+    std::lock_guard lock(mutex_);
+    if (lastNetworkRequest_ && now - *lastNetworkRequest_ < platform::seconds(30)) return;
+    lastNetworkRequest_ = now;
+  }
   auto start = startSearchEventForRequest(*request);
   start->set_input("");
   start->set_trigger_event(proto::TriggerSearchRequestEvent::warm);
   start->set_endpoint_type(proto::EndpointType::tavix_warm);
   const std::string agent = userAgent().value_or("");
-  // The state's manager is the assembly's when sessions are shared; otherwise it is the one the
-  // end record goes to, and the two records stay in one session.
-  if (sessionManager_) sessionManager_->addTavixFeedback(makeTavixFeedbackWithCodable(*start, 0, "", agent));
-  auto holder = std::make_shared<std::shared_ptr<URLSessionDataTask>>();
+  // The start of a warm-up is the daemon's own record and goes to the daemon's session manager;
+  // its end, like every end record, to the client's (the same one when sessions are shared).
+  if (assembly_.clientSessionManager) {
+    assembly_.clientSessionManager->addTavixFeedback(makeTavixFeedbackWithCodable(*start, 0, "", agent));
+  }
   std::weak_ptr<ClientState> weak = weak_from_this();
-  auto task = assembly_.urlSession()->dataTask(
-      *request, [weak, start, holder, agent](std::string data, std::optional<platform::http::HTTPURLResponse> response,
-                                             std::optional<platform::http::URLError> error) {
-        auto task = std::move(*holder);
-        auto self = weak.lock();
+  auto task = dataTaskWithTiming(
+      assembly_.urlSession(), *request,
+      [weak, start, agent](std::string data, std::optional<platform::http::HTTPURLResponse> response,
+                           std::optional<platform::http::URLError> error, const URLSessionTaskMetrics& timing) {
         const long status = response ? response->statusCode : 0;
         searchLog().notice("Status for warm request: ({}) error: ({})", status,
                            error ? error->description : std::string("none"));
-        if (!self || !task) return;
-        self->endNetworkFeedback(start, data, data.size(), status, task->metrics(), 0, agent);
+        if (auto self = weak.lock()) self->endNetworkFeedback(start, data, data.size(), status, timing, 0, agent);
       });
-  *holder = task;
   // A pre-connect task: only the connection matters, so no cached answer may stand in for it.
   task->setValue("preconnect", true);
-  if (marvolaStatus() == 1 && !proxyEnableForTask(*task)) {
-    TavixLogForCategory(TavixLoggingCategoryConnection).error("Enabling Marvola for request failed.");
-  }
+  if (auto proxy = proxyForTask()) task->setProxy(*proxy);
   task->resume();
-  markNetworkRequest();
 }
 
 }  // namespace tavix

@@ -50,8 +50,10 @@ struct ClientStateQueryKind {
   int endpoint;
   // The zero-keyword start record is made from the request alone, without an identifier.
   bool startWithoutUUID = false;
-  bool retryable = false;
-  bool renderDeadline = false;
+  // Look-ups and flights are retried on transport errors until the bag's render deadline. Cards
+  // and more results go out once: they have no deadline, and a request without one is never
+  // retried (only the bag fetch, which has no client waiting on it, retries without a deadline).
+  bool retriedUntilRenderDeadline = false;
   // More results and card: success is status 200 with a JSON list.
   bool requiresListWith200 = false;
   bool setsPerformedSearch = false;
@@ -142,21 +144,16 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
       return;
     }
   } else {
-    // These kinds follow a result the client already has, so a bag was had before; a state that
-    // never loaded one (a new connection opening a card) takes the controller's.
+    // These kinds follow a result the client already has, so they never wait for a bag: without
+    // one there is no URL to ask.
     bag = currentBag();
-    if (!bag && ensureBag()) bag = currentBag();
-    if (!bag) {
-      reply(queryId, std::nullopt, TVXError{kTVXErrorDomain, 1, "no bag"});
-      return;
-    }
   }
 
-  auto built = assembly_.requestFactory ? kind.build(*assembly_.requestFactory, *request, *bag, currentUserGuid())
-                                        : std::nullopt;
+  auto built = assembly_.requestFactory && bag
+                   ? kind.build(*assembly_.requestFactory, *request, *bag, currentUserGuid())
+                   : std::nullopt;
   if (!built) {
-    log.error("error with request {}", request->queryString);
-    reply(queryId, std::nullopt, TVXError{kTVXErrorDomain, 500, "no request URL"});
+    failUnbuiltRequest(*request, kind.input(*request, URLRequest{}), reply, log);
     return;
   }
   const auto httpRequest = std::make_shared<const URLRequest>(std::move(*built));
@@ -181,13 +178,11 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
   addCodable(*start, queryId, false);
   if (kind.dispatching[0] != '\0') log.notice(fmt::runtime(kind.dispatching));
 
-  auto holder = std::make_shared<std::shared_ptr<platform::http::URLSessionDataTask>>();
   auto self = shared_from_this();
-  auto completion = [self, &kind, request, reply, httpRequest, start, holder](
-                        std::string data, std::optional<HTTPURLResponse> response, std::optional<URLError> error) {
+  auto completion = [self, &kind, request, reply, httpRequest, start](
+                        std::string data, std::optional<HTTPURLResponse> response, std::optional<URLError> error,
+                        const platform::http::URLSessionTaskMetrics& timing) {
     auto& log = TavixLogForCategory(kind.category);
-    auto task = std::move(*holder);
-    const auto timing = task ? task->metrics() : platform::http::URLSessionTaskMetrics{};
     const std::uint64_t queryId = request->queryId;
     const long status = response ? response->statusCode : 0;
     if (response) self->recordSearchResult(status);
@@ -202,7 +197,9 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
       if (error || status != 200) {
         log.error("{}", fmt::format(fmt::runtime(kind.fetchFailed), status,
                                     error ? error->description : std::string("none")));
-        reply(queryId, std::nullopt, transport ? transport : TVXError{kTVXErrorDomain, status, "HTTP status"});
+        // The server's status is not one of the daemon's own codes: it travels in a domain of its own.
+        const TVXError statusError{kTVXHTTPStatusErrorDomain, status, fmt::format("statusCode {}", status)};
+        reply(queryId, std::nullopt, transport ? *transport : statusError);
         self->failSearchFeedback(transport, *request, start, data.size(), status, timing);
         return;
       }
@@ -252,22 +249,18 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
     reply(queryId, std::move(answer), jsonError);
   };
 
+  const auto proxy = proxyForTask();
   std::shared_ptr<platform::http::URLSessionDataTask> task;
-  if (kind.retryable) {
-    std::optional<platform::TimePoint> expire;
-    if (kind.renderDeadline) {
-      expire = assembly_.clock->now() + platform::seconds(static_cast<double>(bag->searchRenderTimeout()) / 1000.0) -
-               platform::seconds(0.5);
-    }
-    auto retryable = std::make_shared<const TVXRetryableNetworkRequest>(*httpRequest, expire, false);
-    task = dataTaskWithRetryableRequest(assembly_.urlSession(), retryable, 0, 3, *assembly_.clock, *retryQueue_,
+  if (kind.retriedUntilRenderDeadline) {
+    const auto expire = assembly_.clock->now() +
+                        platform::seconds(static_cast<double>(bag->searchRenderTimeout()) / 1000.0) -
+                        platform::seconds(0.5);
+    auto retryable = std::make_shared<const TVXRetryableNetworkRequest>(*httpRequest, expire, false, proxy);
+    task = dataTaskWithRetryableRequest(assembly_.urlSession(), retryable, 1, 3, *assembly_.clock, *retryQueue_,
                                         std::move(completion));
   } else {
-    task = assembly_.urlSession()->dataTask(*httpRequest, std::move(completion));
-  }
-  *holder = task;
-  if (marvolaStatus() == 1 && !proxyEnableForTask(*task)) {
-    TavixLogForCategory(TavixLoggingCategoryConnection).error("Enabling Marvola for request failed.");
+    task = dataTaskWithTiming(assembly_.urlSession(), *httpRequest, std::move(completion));
+    if (proxy) task->setProxy(*proxy);
   }
   task->resume();
   if (kind.setsPerformedSearch) setPerformedSearch();
@@ -375,7 +368,6 @@ const ClientStateQueryKind& moreResultsKind() {
       },
       .triggerEvent = std::nullopt,
       .endpoint = proto::EndpointType::tavix_search,
-      .retryable = true,
       .requiresListWith200 = true,
       .messagesRule = true,
   };
@@ -399,7 +391,6 @@ const ClientStateQueryKind& cardKind() {
       },
       .triggerEvent = std::nullopt,
       .endpoint = proto::EndpointType::tavix_card,
-      .retryable = true,
       .requiresListWith200 = true,
   };
   return kind;
@@ -421,8 +412,7 @@ const ClientStateQueryKind& lookupKind() {
       },
       .triggerEvent = proto::TriggerSearchRequestEvent::lookup,
       .endpoint = proto::EndpointType::tavix_search,
-      .retryable = true,
-      .renderDeadline = true,
+      .retriedUntilRenderDeadline = true,
       .setsPerformedSearch = true,
   };
   return kind;
@@ -446,8 +436,7 @@ const ClientStateQueryKind& flightKind() {
       },
       .triggerEvent = proto::TriggerSearchRequestEvent::flight,
       .endpoint = proto::EndpointType::tavix_flight,
-      .retryable = true,
-      .renderDeadline = true,
+      .retriedUntilRenderDeadline = true,
       .setsPerformedSearch = true,
   };
   return kind;

@@ -13,6 +13,7 @@
 #include "feedback/client_session_manager.h"
 #include "feedback/tavix_feedback.h"
 #include "feedback/vocabulary.h"
+#include "network/retryable_request.h"
 #include "platform/clock.h"
 #include "platform/http/url_session.h"
 #include "platform/json_value.h"
@@ -30,13 +31,6 @@ namespace {
 
 platform::Logger& searchLog() { return TavixLogForCategory(TavixLoggingCategorySearch); }
 platform::Logger& protocolLog() { return TavixLogForCategory(TavixLoggingCategoryProtocol); }
-
-// Lengths are counted in characters, as the user typed them, not in UTF-8 bytes.
-std::int64_t characterCount(const std::string& text) {
-  std::int64_t count = 0;
-  for (unsigned char c : text) count += (c & 0xC0) != 0x80;
-  return count;
-}
 
 }  // namespace
 
@@ -71,7 +65,7 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
   // Local completions: the browser's and, for suggestion-bearing keystrokes, the search screen's.
   std::vector<std::string> localSuggestions;
   std::vector<std::string> kept;
-  const std::int64_t length = characterCount(input);
+  const auto length = static_cast<std::int64_t>(queryLength(input));
   const std::int64_t smartMinimum = bag->smartHistoryMinimumQueryLength();
   const std::string clientName = bag->clientName().value_or("");
   const bool seekaraTrigger = request->triggerEvent == proto::TriggerSearchRequestEvent::suggest_queries ||
@@ -123,9 +117,7 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
   auto built = assembly_.requestFactory ? assembly_.requestFactory->searchRequest(*request, *bag, guid)
                                         : std::nullopt;
   if (!built) {
-    // A bag without a search URL: nothing to send.
-    searchLog().error("error with request {}", input);
-    reply(queryId, std::nullopt, TVXError{kTVXErrorDomain, 500, "no search URL"});
+    failUnbuiltRequest(*request, input, reply, searchLog());
     return;
   }
   const auto httpRequest = std::make_shared<const URLRequest>(std::move(*built));
@@ -161,13 +153,12 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
   addCodable(*start, queryId, false);
   searchLog().notice("Dispatching network request for (id, query): ({}, {})", queryId, input);
 
-  auto holder = std::make_shared<std::shared_ptr<platform::http::URLSessionDataTask>>();
   auto self = shared_from_this();
-  auto task = assembly_.urlSession()->dataTask(
-      *httpRequest, [self, request, reply, httpRequest, start, holder, localSuggestions](
-                        std::string data, std::optional<HTTPURLResponse> response, std::optional<URLError> error) {
-        auto task = std::move(*holder);
-        const auto timing = task ? task->metrics() : platform::http::URLSessionTaskMetrics{};
+  auto task = dataTaskWithTiming(
+      assembly_.urlSession(), *httpRequest,
+      [self, request, reply, httpRequest, start, localSuggestions](
+          std::string data, std::optional<HTTPURLResponse> response, std::optional<URLError> error,
+          const platform::http::URLSessionTaskMetrics& timing) {
         const std::uint64_t queryId = request->queryId;
         const std::string& input = request->queryString;
         const long status = response ? response->statusCode : 0;
@@ -229,10 +220,7 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
           }
         }
       });
-  *holder = task;
-  if (assembly_.requestFactory && marvolaStatus() == 1 && !proxyEnableForTask(*task)) {
-    TavixLogForCategory(TavixLoggingCategoryConnection).error("Enabling Marvola for request failed.");
-  }
+  if (auto proxy = proxyForTask()) task->setProxy(*proxy);
   task->resume();
   TavixDiagnosticDataReporter::addValue(1, TavixSearchCounterKey);
   setPerformedSearch();

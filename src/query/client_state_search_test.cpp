@@ -58,6 +58,24 @@ TEST_F(SearchTest, ADisabledBagAnswersWithNothingAndSendsNothing) {
   EXPECT_EQ(none.count(), 1u);
 }
 
+TEST_F(SearchTest, ABagWithoutASearchURLFailsAsTheTransportWouldAndRecordsIt) {
+  platform::Dictionary bag = bagWith();
+  bag.erase("search_url");
+  serveBag(bag);
+  auto state = make("com.norvel.seekara", "Seekara/1.0");
+  Replies failed;
+  state->search(request<TVXSearchRequest>(12, "weather"), failed.block());
+  const auto error = failed.first().error;
+  ASSERT_TRUE(error);
+  EXPECT_EQ(std::pair(error->domain, error->code),
+            std::pair(std::string(platform::http::kURLErrorDomain),
+                      std::int64_t{platform::http::URLErrorUnsupportedURL}));
+  auto errors = recordsOfType(*state, 18);
+  ASSERT_EQ(errors.size(), 1u);
+  EXPECT_EQ(errors[0].query_id(), 12);
+  EXPECT_EQ(errors[0].payload().error().code(), platform::http::URLErrorUnsupportedURL);
+}
+
 TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
   serveBag(bagWith({{"min_query_length", 3},
                     {"smart_history_enabled", true},
@@ -229,6 +247,18 @@ TEST_F(SearchTest, TheServerCanAskForANewerBagAndTheBagCanRouteThroughItsProxy) 
   proxied.first();
   EXPECT_EQ(received("/search").size(), 1u);
   EXPECT_EQ(received(server.baseURL() + "/search", &proxy).size(), 1u);
+
+  // A retried look-up goes through the proxy on every attempt.
+  send("POST", "/_faults",
+       platform::toJson(platform::PropertyValue(
+           platform::Dictionary{{"path", server.baseURL() + "/search"}, {"reset", true}, {"times", 1}})),
+       &proxy);
+  auto lookup = request<TVXLookupRequest>(42, "lens");
+  Replies lookedUp;
+  state->lookup(lookup, lookedUp.block());
+  lookedUp.first();
+  EXPECT_EQ(received(server.baseURL() + "/search", &proxy).size(), 3u);
+  EXPECT_EQ(received("/search").size(), 1u);
 }
 
 }  // namespace

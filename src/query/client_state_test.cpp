@@ -4,8 +4,8 @@
 
 #include <gtest/gtest.h>
 
-#include <chrono>
 #include <future>
+#include <mutex>
 #include <thread>
 
 #include "bag/tavix_bag_controller.h"
@@ -25,9 +25,29 @@
 namespace tavix {
 namespace {
 
-using Clock = std::chrono::steady_clock;
 using tavix::testing::waitFor;
 
+// What one bag() call answered.
+struct BagAnswer {
+  std::mutex lock;
+  int calls = 0;
+  std::shared_ptr<const TVXBag> bag;
+  std::optional<TVXError> error;
+  ClientState::BagReply reply() {
+    return [this](std::shared_ptr<const TVXBag> b, std::optional<TVXError> e) {
+      std::lock_guard hold(lock);
+      ++calls;
+      bag = std::move(b);
+      error = std::move(e);
+    };
+  }
+  int count() {
+    std::lock_guard hold(lock);
+    return calls;
+  }
+};
+
+// The bag wait runs on virtual time; the bag itself comes from the development server.
 class ClientStateTest : public ::testing::Test {
  protected:
   ClientStateTest() {
@@ -51,127 +71,120 @@ class ClientStateTest : public ::testing::Test {
     assembly.requestFactory.reset();
   }
 
-  void post(const std::string& path, const std::string& body) {
+  void failBag() {
     platform::http::URLRequest r;
-    r.url = server.baseURL() + path;
+    r.url = server.baseURL() + "/_faults";
     r.method = "POST";
-    r.body = body;
+    r.body = R"({"path": "/bag", "status": 500})";
     std::promise<void> done;
     assembly.urlSession()->dataTask(r, [&](auto, auto, auto) { done.set_value(); })->resume();
     done.get_future().wait();
   }
-  void delayBag(int ms) { post("/_faults", R"({"path": "/bag", "delay_ms": )" + std::to_string(ms) + "}"); }
+  void advance(double seconds) {
+    clock.advance(platform::seconds(seconds));
+    pool.drain();
+  }
 
   std::shared_ptr<ClientState> make(const std::string& identifier = "com.norvel.seekara") {
     states.push_back(ClientState::create(assembly, identifier));
     return states.back();
   }
 
-  // Asks for the bag and answers (bag, error, milliseconds taken).
-  std::tuple<std::shared_ptr<const TVXBag>, std::optional<TVXError>, long> askBag(ClientState& state,
-                                                                                  const std::string& agent) {
-    std::shared_ptr<const TVXBag> bag;
-    std::optional<TVXError> error;
-    int calls = 0;
-    const auto start = Clock::now();
-    state.bag(agent, [&](auto b, auto e) {
-      ++calls;
-      bag = b;
-      error = e;
-    });
-    const long ms = std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - start).count();
-    EXPECT_EQ(calls, 1);
-    return {bag, error, ms};
-  }
-
   testing::TempHome home;
   devserver::DevServer server;
-  platform::DispatchPool pool{8};
-  platform::SystemClock clock{pool};
+  platform::DispatchPool pool{4};
+  platform::VirtualClock clock;
   std::shared_ptr<platform::UserDefaults> defaults;
   Assembly assembly;
   std::vector<std::shared_ptr<ClientState>> states;
 };
 
-TEST_F(ClientStateTest, AnswersErrorsWithoutUserAgentOrInTimeAndRecovers) {
-  delayBag(1500);
+TEST_F(ClientStateTest, WaitsForTheBagWithoutBlockingAndGivesUpOnTime) {
+  failBag();
   startController();
   auto state = make();
-  auto [noBag, noAgent, _] = askBag(*state, "");
-  EXPECT_FALSE(noBag);
-  ASSERT_TRUE(noAgent);
-  EXPECT_EQ(noAgent->code, 1);
-  EXPECT_EQ(noAgent->reason, "no UserAgent");
+  BagAnswer noAgent;
+  state->bag("", noAgent.reply());
+  ASSERT_EQ(noAgent.count(), 1) << "answered at once";
+  EXPECT_FALSE(noAgent.bag);
+  ASSERT_TRUE(noAgent.error);
+  EXPECT_EQ(noAgent.error->code, 1);
+  EXPECT_EQ(noAgent.error->reason, "no UserAgent");
 
-  // First launch ever: the query waits the long wait, then gives up.
-  auto [late, timeout, waited] = askBag(*state, "seekara/1");
-  EXPECT_FALSE(late);
-  ASSERT_TRUE(timeout);
-  EXPECT_EQ(timeout->reason, "timeout");
-  EXPECT_GE(waited, kTVXFirstLaunchBagSemaphoreWait - 20);
-  EXPECT_LT(waited, 1400);
+  // First launch ever: the long wait, then "timeout".
+  BagAnswer late;
+  state->bag("seekara/1", late.reply());
+  advance(kTVXFirstLaunchBagSemaphoreWait / 1000.0 - 0.001);
+  EXPECT_EQ(late.count(), 0);
+  advance(0.002);
+  ASSERT_EQ(late.count(), 1);
+  EXPECT_FALSE(late.bag);
+  ASSERT_TRUE(late.error);
+  EXPECT_EQ(late.error->reason, "timeout");
 
-  // The fetch still lands; the state then has the bag, labelled with its own user agent, at once.
-  ASSERT_TRUE(waitFor([&] { return state->currentBag() != nullptr; }, 5000));
-  auto [bag, error, quick] = askBag(*state, "seekara/1");
-  ASSERT_TRUE(bag);
-  EXPECT_FALSE(error);
-  EXPECT_EQ(bag->userAgent(), "seekara/1");
-  EXPECT_LT(quick, 100);
-}
-
-TEST_F(ClientStateTest, ABagArrivingEndsTheWaitAndAKnownDeviceWaitsLess) {
+  // A device that has recorded resources waits the short wait.
   defaults->setObject("download_resources", platform::PropertyValue::Array{});
-  delayBag(1500);
-  startController();
+  BagAnswer shorter;
+  make("com.norvel.brovane")->bag("brovane/1", shorter.reply());
+  advance(kTVXDefaultBagSemaphoreWait / 1000.0 + 0.001);
+  ASSERT_EQ(shorter.count(), 1);
+  EXPECT_EQ(shorter.error->reason, "timeout");
 
-  // A bag change that comes during the wait ends it at once; the query goes on with that bag.
-  auto waiting = make("com.norvel.news");
-  auto raw = std::make_shared<const platform::Dictionary>(platform::Dictionary{{"enabled", true}});
-  std::thread poster([&] {
-    std::this_thread::sleep_for(std::chrono::milliseconds(100));
-    assembly.notificationCenter->post(kTVXBagChangeNotification, nullptr,
-                                      std::make_shared<const TVXBag>(raw, "controller"));
-  });
-  auto [bag, noError, ms] = askBag(*waiting, "news/1");
-  poster.join();
-  ASSERT_TRUE(bag);
-  EXPECT_FALSE(noError);
-  EXPECT_LT(ms, kTVXDefaultBagSemaphoreWait);
-  EXPECT_EQ(bag->userAgent(), "news/1");
+  // A bag change during the wait ends it at once, with the bag labelled for the waiting client;
+  // the timer that would have ended it later stays silent.
+  BagAnswer waiting;
+  auto news = make("com.norvel.news");
+  news->bag("news/1", waiting.reply());
+  assembly.notificationCenter->post(kTVXBagChangeNotification, nullptr, {},
+                                    bagChangeUserInfo(TVXBag(platform::Dictionary{{"enabled", true}}, "controller")));
+  pool.drain();
+  ASSERT_EQ(waiting.count(), 1);
+  ASSERT_TRUE(waiting.bag);
+  EXPECT_FALSE(waiting.error);
+  EXPECT_EQ(waiting.bag->userAgent(), "news/1");
+  advance(1);
+  EXPECT_EQ(waiting.count(), 1);
 
-  // The controller's fetch is still on its way: a state that missed the change waits the short
-  // wait (resources were recorded, so this is not a first launch) and gives up.
-  auto slow = make("com.norvel.brovane");
-  auto [none, error, waited] = askBag(*slow, "brovane/1");
-  EXPECT_FALSE(none);
-  ASSERT_TRUE(error);
-  EXPECT_EQ(error->reason, "timeout");
-  EXPECT_GE(waited, kTVXDefaultBagSemaphoreWait - 20);
-  EXPECT_LT(waited, kTVXFirstLaunchBagSemaphoreWait - 50);
+  // Held now: answered at once.
+  BagAnswer held;
+  news->bag("news/1", held.reply());
+  EXPECT_EQ(held.count(), 1);
+  EXPECT_EQ(held.bag, waiting.bag);
 }
 
 TEST_F(ClientStateTest, NewUserAgentRelabelsTheBagAndEmptiesTheQueryCache) {
   startController();
+  ASSERT_TRUE(waitFor([&] { return assembly.bagController->currentBag() != nullptr; }, 5000));
   auto state = make();
-  auto [bag, error, _] = askBag(*state, "seekara/1");
-  ASSERT_TRUE(bag) << (error ? error->reason : "");
+  BagAnswer first;
+  state->bag("seekara/1", first.reply());
+  ASSERT_EQ(first.count(), 1);
+  auto bag = first.bag;
+  ASSERT_TRUE(bag) << (first.error ? first.error->reason : "");
   ASSERT_TRUE(state->queryCache());
   platform::Dictionary reply{{"query", "camera"}};
   state->queryCache()->set(makeRef<CachedResultSet>("ca", nullptr, reply, "u", "[1]", clock.now()));
   ASSERT_TRUE(waitFor([&] { return state->queryCache()->count() == 1; }));
 
-  auto [relabelled, none, ms] = askBag(*state, "seekara/2");
-  ASSERT_TRUE(relabelled);
-  EXPECT_EQ(relabelled->userAgent(), "seekara/2");
-  EXPECT_EQ(relabelled->sharedRawBag(), bag->sharedRawBag()) << "re-labelled, not fetched again";
+  BagAnswer second;
+  state->bag("seekara/2", second.reply());
+  ASSERT_TRUE(second.bag);
+  EXPECT_EQ(second.bag->userAgent(), "seekara/2");
+  EXPECT_EQ(second.bag->sharedRawBag(), bag->sharedRawBag()) << "re-labelled, not fetched again";
   EXPECT_EQ(state->queryCache()->count(), 0u);
 
-  // The tool's path: same user agent again changes nothing, a new one re-labels.
+  // The tool's path: same user agent again changes nothing, a new one re-labels, an empty one
+  // leaves the state without one.
   state->updateClient("seekara/2");
-  EXPECT_EQ(state->currentBag(), relabelled);
+  EXPECT_EQ(state->currentBag(), second.bag);
   state->updateClient("tool/3");
   EXPECT_EQ(state->currentBag()->userAgent(), "tool/3");
+  state->updateClient("");
+  EXPECT_FALSE(state->userAgent());
+  BagAnswer none;
+  state->bag("", none.reply());
+  ASSERT_TRUE(none.error);
+  EXPECT_EQ(none.error->reason, "no UserAgent");
 }
 
 TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {

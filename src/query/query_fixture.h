@@ -87,6 +87,10 @@ class QueryFixture : public ::testing::Test {
     assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
     assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
     assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+    // The daemon's own session manager (warm-up records); clients keep sessions of their own.
+    assembly.guidController = std::make_shared<TavixUserGUIDController>(assembly);
+    assembly.clientSessionManager =
+        std::make_shared<ClientSessionManager>(assembly, assembly.guidController, "tavix");
   }
   ~QueryFixture() override {
     states.clear();
@@ -157,12 +161,15 @@ class QueryFixture : public ::testing::Test {
   }
 
   // Every event the client's sessions have recorded so far (session ends left out), oldest first.
-  // The state's records are written asynchronously; flushing the session waits for those queued.
+  // The state's records are written asynchronously; flushing the sessions (the client's and the
+  // daemon's own) waits for those queued.
   // Sessions of all states share the storage: events are told apart by their user agent.
   std::vector<proto::CTTavixFeedback> records(ClientState& state) {
-    std::promise<void> flushed;
-    state.sessionManager()->flushSession([&] { flushed.set_value(); });
-    flushed.get_future().wait();
+    for (const auto& manager : {state.sessionManager(), assembly.clientSessionManager}) {
+      std::promise<void> flushed;
+      manager->flushSession([&] { flushed.set_value(); });
+      flushed.get_future().wait();
+    }
     for (auto& handle : assembly.persistentStorage->getAvailableSessionHandles()) {
       if (auto record = handle->readRecord()) {
         for (const auto& event : record->feedbacks()) {
