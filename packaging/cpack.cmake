@@ -28,20 +28,23 @@ set(CPACK_DEBIAN_TAVIXD_PACKAGE_RECOMMENDS "xdg-utils")
 set(CPACK_COMPONENT_TAVIXD_DEPENDS libtavix0)
 set(CPACK_COMPONENT_TAVIXD_DESCRIPTION
   "device-side search and suggestion daemon
- tavixd answers the search-as-you-type, zero-keyword, card, look-up and flight
- queries of local applications, caches their replies, and gathers and uploads
- their engagement feedback. It runs as a systemd user service started by its
- socket. The package also holds tavix_tool, its command-line client, and
- tavix-search-provider, which offers its results to the desktop's search.")
+tavixd answers the search-as-you-type, zero-keyword, card, look-up and flight
+queries of local applications, caches their replies, and gathers and uploads
+their engagement feedback. It runs as a systemd user service started by its
+socket. The package also holds tavix_tool, its command-line client, and
+tavix-search-provider, which offers its results to the desktop's search.")
 
 set(CPACK_DEBIAN_LIBTAVIX0_PACKAGE_NAME libtavix0)
 set(CPACK_DEBIAN_LIBTAVIX0_PACKAGE_SECTION libs)
-set(CPACK_DEBIAN_LIBTAVIX0_PACKAGE_GENERATE_SHLIBS ON)
+# The library's shlibs file, and the loader cache refreshed by trigger.
+set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS ON)
+set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS_POLICY ">=")
+set(CPACK_DEBIAN_LIBTAVIX0_PACKAGE_CONTROL_EXTRA ${CMAKE_CURRENT_LIST_DIR}/debian/triggers)
 set(CPACK_COMPONENT_LIBTAVIX0_DESCRIPTION
   "client library of the tavixd search daemon
- libtavix speaks the IPC protocol of tavixd, the device-side search and
- suggestion daemon, over its Unix socket. This package holds the shared
- library.")
+libtavix speaks the IPC protocol of tavixd, the device-side search and
+suggestion daemon, over its Unix socket. This package holds the shared
+library.")
 
 set(CPACK_DEBIAN_LIBTAVIX-DEV_PACKAGE_NAME libtavix-dev)
 set(CPACK_DEBIAN_LIBTAVIX-DEV_PACKAGE_SECTION libdevel)
@@ -49,8 +52,8 @@ set(CPACK_DEBIAN_LIBTAVIX-DEV_PACKAGE_DEPENDS "libprotobuf-dev")
 set(CPACK_COMPONENT_LIBTAVIX-DEV_DEPENDS libtavix0)
 set(CPACK_COMPONENT_LIBTAVIX-DEV_DESCRIPTION
   "client library of the tavixd search daemon (development files)
- libtavix speaks the IPC protocol of tavixd, the device-side search and
- suggestion daemon, over its Unix socket. This package holds the headers,
- the pkg-config file and the CMake package.")
+libtavix speaks the IPC protocol of tavixd, the device-side search and
+suggestion daemon, over its Unix socket. This package holds the headers,
+the pkg-config file and the CMake package.")
 
 include(CPack)

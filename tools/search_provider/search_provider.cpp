@@ -60,8 +60,8 @@ std::string text(const json& object, const char* key) {
 }
 
 std::uint64_t nowNanoseconds() {
-  return static_cast<std::uint64_t>(
-      std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::system_clock::now().time_since_epoch()).count());
+  const auto since = std::chrono::system_clock::now().time_since_epoch();
+  return static_cast<std::uint64_t>(std::chrono::duration_cast<std::chrono::nanoseconds>(since).count());
 }
 
 }  // namespace
@@ -164,7 +164,8 @@ int SearchProvider::search(sd_bus_message* call, const std::vector<std::string>&
   request.set_trigger_event(kTriggerNewCharacter);
   request.mutable_search();
   ++pendingSearches_;
-  client_->request(request, [this, call = keep(call), input](std::uint64_t queryId, std::optional<proto::TVXReply> reply,
+  client_->request(request, [this, call = keep(call), input](std::uint64_t queryId,
+                                                              std::optional<proto::TVXReply> reply,
                                                               std::optional<client::Error> error) {
     std::vector<Result> results;
     if (error) {
@@ -221,7 +222,9 @@ int SearchProvider::onActivateResult(sd_bus_message* m, void* self, sd_bus_error
   auto* provider = static_cast<SearchProvider*>(self);
   provider->touch();
   const char* id = nullptr;
-  if (sd_bus_message_read(m, "s", &id) < 0) return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS, "expected an identifier");
+  if (sd_bus_message_read(m, "s", &id) < 0) {
+    return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS, "expected an identifier");
+  }
   const Result* result = provider->find(id);
   if (!result) return sd_bus_error_setf(error, SD_BUS_ERROR_INVALID_ARGS, "no result '%s'", id);
   provider->activate(*result, proto::TriggerEngagementEvent::click);
