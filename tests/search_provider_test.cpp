@@ -1,7 +1,6 @@
 // The desktop search provider as the shell drives it: a private session bus, the real daemon
 // against the devserver, and tavix-search-provider, called over D-Bus.
 #include <signal.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -39,38 +38,6 @@ std::optional<std::string> findProgram(const std::string& name) {
   return std::nullopt;
 }
 
-// A private session bus: `dbus-daemon --session`, its address read from its first line.
-class SessionBus {
- public:
-  explicit SessionBus(const std::string& program) {
-    int out[2];
-    if (::pipe(out) != 0) return;
-    pid_ = ::fork();
-    if (pid_ == 0) {
-      ::dup2(out[1], 1);
-      ::close(out[0]);
-      ::execl(program.c_str(), program.c_str(), "--session", "--print-address=1", "--nofork", "--nopidfile",
-              static_cast<char*>(nullptr));
-      ::_exit(127);
-    }
-    ::close(out[1]);
-    FILE* in = ::fdopen(out[0], "r");
-    char line[1024];
-    if (std::fgets(line, sizeof line, in)) address = std::string(line, std::strcspn(line, "\n"));
-    std::fclose(in);
-  }
-  ~SessionBus() {
-    if (pid_ > 0) {
-      ::kill(pid_, SIGTERM);
-      ::waitpid(pid_, nullptr, 0);
-    }
-  }
-  std::string address;
-
- private:
-  pid_t pid_ = -1;
-};
-
 class SearchProviderTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -87,11 +54,16 @@ class SearchProviderTest : public ::testing::Test {
     tavixd.emplace(TAVIXD_BINARY, home, std::vector<std::string>{"--log-level", "debug"});
     ASSERT_TRUE(tavixd->waitForLog("bag change notification received", 10000)) << tavixd->log();
 
-    bus.emplace(*dbusDaemon);
-    ASSERT_FALSE(bus->address.empty());
-    ::setenv("DBUS_SESSION_BUS_ADDRESS", bus->address.c_str(), 1);
+    // A private session bus; it prints its address first.
+    bus.emplace(*dbusDaemon, home,
+                std::vector<std::string>{"--session", "--print-address=2", "--nofork", "--nopidfile"}, "bus.log");
+    ASSERT_TRUE(bus->waitForLog("unix:")) << bus->log();
+    const std::string log = bus->log();
+    const auto start = log.find("unix:");
+    const std::string address = log.substr(start, log.find('\n', start) - start);
+    ::setenv("DBUS_SESSION_BUS_ADDRESS", address.c_str(), 1);
     ASSERT_GE(sd_bus_new(&shell), 0);
-    ASSERT_GE(sd_bus_set_address(shell, bus->address.c_str()), 0);
+    ASSERT_GE(sd_bus_set_address(shell, address.c_str()), 0);
     ASSERT_GE(sd_bus_set_bus_client(shell, 1), 0);
     ASSERT_GE(sd_bus_start(shell), 0);
 
@@ -198,7 +170,7 @@ class SearchProviderTest : public ::testing::Test {
   tavix::testing::TempHome home;
   tavix::testing::DevServerProcess server{DEVSERVER_BINARY};
   std::optional<tavix::testing::DaemonProcess> tavixd;
-  std::optional<SessionBus> bus;
+  std::optional<tavix::testing::DaemonProcess> bus;
   std::optional<tavix::testing::DaemonProcess> provider;
   std::filesystem::path opener;
   sd_bus* shell = nullptr;
