@@ -2,7 +2,6 @@
 
 #include <fstream>
 
-#include "core/custom_feedback_dirs.h"
 #include "core/logging.h"
 #include "daemon/options.h"
 #include "daemon/startup.h"
@@ -13,25 +12,6 @@ namespace {
 
 platform::Paths pathsIn(const testing::TempHome& home) {
   return platform::Paths{home.cache(), home.config(), home.runtime()};
-}
-
-TEST(CustomFeedbackDirectories, MakesSixTypeFoldersAndASecondRunLogsNothing) {
-  testing::TempHome home;
-  platform::LogCapture capture;
-  createCustomFeedbackDirectories(pathsIn(home));
-  const auto root = home.cache() / "com.norvel.tavixd" / "CustomFeedback";
-  int folders = 0;
-  for (int type = 0; type <= 8; ++type) {
-    if (auto name = customFeedbackDirectoryForType(type)) {
-      EXPECT_TRUE(std::filesystem::is_directory(root / *name)) << type;
-      folders++;
-    }
-  }
-  EXPECT_EQ(folders, 6);
-  EXPECT_FALSE(customFeedbackDirectoryForType(0));
-  EXPECT_FALSE(customFeedbackDirectoryForType(2));
-  createCustomFeedbackDirectories(pathsIn(home));
-  EXPECT_EQ(capture.count("failed"), 0u);
 }
 
 TEST(CustomFeedbackDirectories, EachFailedTypeFolderIsLoggedAndTheLoopGoesOn) {
@@ -53,17 +33,6 @@ TEST(CustomFeedbackDirectories, AnUnusableCachesFolderIsLoggedNotFatal) {
   platform::LogCapture capture;
   createCustomFeedbackDirectories(paths);
   EXPECT_EQ(capture.count("failed getting a caches dir:"), 1u);
-}
-
-TEST(RegisteredDefaults, AreTheSixSettingsWithTheirValues) {
-  auto d = tavixdRegisteredDefaults();
-  ASSERT_EQ(d.size(), 6u);
-  EXPECT_EQ(*d.at("TVXSharedSession").boolean(), true);
-  EXPECT_EQ(*d.at("TVXSessionSizeLimit").integer(), 2097152);
-  EXPECT_EQ(*d.at("TVXSessionMaxAge").integer(), 172800);
-  EXPECT_EQ(*d.at("TVXUseMarvola").boolean(), true);
-  EXPECT_EQ(*d.at("TVXSessionSoftLimitOverride").integer(), 600);
-  EXPECT_EQ(*d.at("TVXSessionIdleTimeOverride").integer(), 180);
 }
 
 TEST(DaemonOptions, ParsesFlagsAndRejectsBadOnesWithAReason) {

@@ -37,6 +37,7 @@
 #include "platform/memory_pressure.h"
 #include "platform/notification_center.h"
 #include "platform/run_loop.h"
+#include "platform/service_manager.h"
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
 #include "platform/transactions.h"
@@ -56,6 +57,24 @@ constexpr double kCounterSaveIntervalSeconds = 300;
 
 std::string describe(const platform::fs::path& path, const std::error_code& ec) {
   return path.string() + ": " + ec.message();
+}
+
+// The listening socket the service manager handed over: the one named after the IPC service
+// (FileDescriptorName= of the socket unit), or a lone unnamed one. Other descriptors are closed.
+// -1 when there is none to serve on, or when --socket names a path of its own.
+int adoptActivatedSocket(const DaemonOptions& options, platform::Logger& log) {
+  int chosen = -1;
+  const auto sockets = platform::activatedSockets();
+  for (const auto& socket : sockets) {
+    const bool ours = socket.name == kTavixdDomain || (sockets.size() == 1 && socket.name == "unknown");
+    if (chosen < 0 && ours && options.socketPath.empty() && platform::isListeningUnixStreamSocket(socket.fd)) {
+      chosen = socket.fd;
+      continue;
+    }
+    log.error("ignoring the activated socket {} ({})", socket.fd, socket.name);
+    ::close(socket.fd);
+  }
+  return chosen;
 }
 
 }  // namespace
@@ -94,6 +113,8 @@ void createCustomFeedbackDirectories(const platform::Paths& paths) {
 int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   platform::setLogLevel(options.logLevel);
   auto& log = TavixLogForCategory(TavixLoggingCategoryDefault);
+  // Before any thread: taking the sockets changes the environment.
+  const int activated = adoptActivatedSocket(options, log);
 
   // Before the pool: tasks dropped when the pool goes still end their transactions.
   platform::TransactionTracker transactions;
@@ -188,17 +209,15 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   auto& connectionLog = TavixLogForCategory(TavixLoggingCategoryConnection);
   std::error_code listenError;
   std::unique_ptr<platform::ipc::IpcListener> listener;
-  const auto activated = options.socketPath.empty() ? platform::ipc::socketActivationFds() : std::vector<int>{};
   const std::string socketPath =
       options.socketPath.empty() ? (paths.runtimeFolder(kTavixdDomain) / "socket").string() : options.socketPath;
-  if (!activated.empty()) {
-    listener = platform::ipc::IpcListener::adopt(pool, activated.front(), connectionLog, &listenError);
+  if (activated >= 0) {
+    listener = platform::ipc::IpcListener::adopt(pool, activated, connectionLog, &listenError);
   } else {
     listener = platform::ipc::IpcListener::listen(pool, socketPath, connectionLog, &listenError);
   }
   if (!listener) {
-    log.fault("cannot listen on {}: {}", activated.empty() ? socketPath : "the activated socket",
-              listenError.message());
+    log.fault("cannot listen on {}: {}", activated < 0 ? socketPath : "the activated socket", listenError.message());
     shutDown();
     return 1;
   }
@@ -247,9 +266,14 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   platform::SerialQueue housekeeping(pool, "com.norvel.tavixd.housekeeping");
   platform::RepeatingTimer saveCounters(clock, housekeeping);
   platform::RepeatingTimer idleCheck(clock, housekeeping);
+  platform::RepeatingTimer watchdog(clock, housekeeping);
   platform::PressureStallMonitor memoryPressure(clock, housekeeping);
   housekeeping.sync([&] {
     if (!memoryPressure.start()) log.info("no memory pressure information; caches shrink only when told");
+    // Pings from a pool queue: a pool wedged for the whole interval gets the daemon restarted.
+    if (const auto interval = platform::watchdogInterval(); interval > platform::Duration::zero()) {
+      watchdog.start(interval / 3, [] { platform::notifyServiceManager("WATCHDOG=1"); });
+    }
     saveCounters.start(platform::seconds(kCounterSaveIntervalSeconds), [&] {
       if (!counters.dirty()) return;
       if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
@@ -273,14 +297,17 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   // (launch events, activities) is in place, as a launch service holds messages for a starting job.
   listener->resume([&service](const auto& connection) { service.shouldAcceptNewConnection(connection); },
                    "com.norvel.tavixd.connection");
-  log.info("listening on {}", activated.empty() ? socketPath : "the socket handed over by systemd");
+  log.info("listening on {}", activated < 0 ? socketPath : "the socket handed over by systemd");
   log.info("tavixd started (pid {}), caches in {}", getpid(), assembly.cachesFolder().string());
+  platform::notifyServiceManager("READY=1\nSTATUS=Serving clients");
   runLoop.run();
+  platform::notifyServiceManager("STOPPING=1\nSTATUS=Stopping");
 
   listener.reset();  // no new clients while shutting down
   housekeeping.sync([&] {
     saveCounters.stop();
     idleCheck.stop();
+    watchdog.stop();
     memoryPressure.stop();
   });
   shutDown();

@@ -2,8 +2,10 @@
 // source that logs pays only for fmt's core).
 //
 // Levels follow the daemon's vocabulary: debug, info, default, error, fault. They map onto spdlog
-// as debug→debug, info→info, default→info, error→error, fault→critical. Output goes to stderr
-// (which journald collects under systemd). Threading: everything here is safe from any thread.
+// as debug→debug, info→info, default→info, error→error, fault→critical. Output goes to stderr,
+// except when stderr is the journal's stream (a systemd service): then each line becomes a
+// journal entry with its priority (default is "notice", fault "crit") and the fields SUBSYSTEM
+// and CATEGORY. Threading: everything here is safe from any thread.
 #pragma once
 
 #include <memory>

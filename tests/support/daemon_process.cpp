@@ -22,7 +22,7 @@ void keepBagFetchesLocal(const TempHome& home) {
 }
 
 DaemonProcess::DaemonProcess(const std::string& binary, const TempHome& home, std::vector<std::string> args,
-                             const std::string& logName)
+                             const std::string& logName, const std::function<void()>& inChild)
     : logFile_(home.root() / logName) {
   keepBagFetchesLocal(home);
   pid_ = fork();
@@ -30,6 +30,7 @@ DaemonProcess::DaemonProcess(const std::string& binary, const TempHome& home, st
     home.exportEnvironment();
     int fd = open(logFile_.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
     dup2(fd, 2);
+    if (inChild) inChild();
     std::vector<std::string> all{binary};
     all.insert(all.end(), args.begin(), args.end());
     std::vector<char*> argv;

@@ -3,6 +3,7 @@
 
 #include <sys/types.h>
 
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -18,8 +19,9 @@ void keepBagFetchesLocal(const TempHome& home);
 class DaemonProcess {
  public:
   // Starts `binary` with `args`, the XDG homes pointed into `home`, stderr into home/`logName`.
+  // `inChild` runs in the child just before exec, to hand over descriptors or set variables.
   DaemonProcess(const std::string& binary, const TempHome& home, std::vector<std::string> args,
-                const std::string& logName = "tavixd.log");
+                const std::string& logName = "tavixd.log", const std::function<void()>& inChild = {});
   // Kills a child still running.
   ~DaemonProcess();
   DaemonProcess(const DaemonProcess&) = delete;

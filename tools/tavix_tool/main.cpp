@@ -19,7 +19,8 @@ namespace {
 
 constexpr const char* kDomain = "com.norvel.tavixd";
 
-int usage() {
+// On --help the text is the answer (stdout, success); after a wrong command it is the error.
+int usage(std::FILE* out = stderr, int status = 2) {
   std::fputs(
       "usage: tavix_tool [--socket PATH] COMMAND\n"
       "\n"
@@ -38,13 +39,13 @@ int usage() {
       "                                           type on a terminal and see each keystroke's\n"
       "                                           suggestions; without one, type TEXT and print\n"
       "  (no command, on a terminal)              the same as type\n",
-      stderr);
-  std::fputs(tavix::tool::flushCommandsUsage(), stderr);
+      out);
+  std::fputs(tavix::tool::flushCommandsUsage(), out);
   std::fputs(
       "\n"
       "counters and defaults work with the daemon stopped.\n",
-      stderr);
-  return 2;
+      out);
+  return status;
 }
 
 int counters(const tavix::platform::Paths& paths) {
@@ -147,7 +148,8 @@ int main(int argc, char** argv) {
   if (args.empty() && isatty(STDIN_FILENO) && isatty(STDOUT_FILENO)) {
     return tavix::tool::interactiveCommand(options.socketPath, {});
   }
-  if (args.empty() || args[0] == "--help" || args[0] == "-h") return usage();
+  if (!args.empty() && (args[0] == "--help" || args[0] == "-h")) return usage(stdout, 0);
+  if (args.empty()) return usage();
   const auto paths = tavix::platform::Paths::fromEnvironment();
   const std::string command = args[0];
   args.erase(args.begin());

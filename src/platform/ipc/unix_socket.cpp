@@ -109,24 +109,6 @@ std::error_code connectTo(const std::string& path, UniqueFd* out) {
   return {};
 }
 
-std::vector<int> socketActivationFds() {
-  std::vector<int> fds;
-  const char* pidText = ::getenv("LISTEN_PID");
-  const char* countText = ::getenv("LISTEN_FDS");
-  if (pidText && countText && std::strtol(pidText, nullptr, 10) == ::getpid()) {
-    const long count = std::strtol(countText, nullptr, 10);
-    for (long i = 0; i < count && i < 64; ++i) {
-      const int fd = 3 + static_cast<int>(i);
-      ::fcntl(fd, F_SETFD, FD_CLOEXEC);
-      fds.push_back(fd);
-    }
-  }
-  ::unsetenv("LISTEN_PID");
-  ::unsetenv("LISTEN_FDS");
-  ::unsetenv("LISTEN_FDNAMES");
-  return fds;
-}
-
 std::error_code sendWithFds(int fd, std::string_view bytes, const std::vector<int>& fds, bool blocking,
                             std::size_t* sent) {
   *sent = 0;

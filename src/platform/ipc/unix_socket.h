@@ -60,10 +60,6 @@ std::error_code listenAt(const std::string& path, UniqueFd* out);
 // A blocking connection to the socket at `path`.
 std::error_code connectTo(const std::string& path, UniqueFd* out);
 
-// Descriptors handed over by systemd socket activation (LISTEN_PID / LISTEN_FDS), starting at 3.
-// The variables are removed so that children do not inherit them. Empty when not activated.
-std::vector<int> socketActivationFds();
-
 // Sends as much of `bytes` as the socket takes without blocking (MSG_DONTWAIT) or, with
 // `blocking`, all of it. `fds` ride with the first byte sent. Returns the bytes sent through
 // `sent`; EAGAIN is not an error (sent may be short), anything else is.
