@@ -11,6 +11,7 @@
 #include "platform/clock.h"
 #include "platform/dispatch.h"
 #include "platform/http/url_session.h"
+#include "platform/log.h"
 #include "support/temp_home.h"
 
 namespace {
@@ -132,6 +133,57 @@ TEST_F(HTTPSessionTest, TransportFailuresBecomeURLErrors) {
   Outcome unsupported = run(session, {"ftp://127.0.0.1/x"});
   ASSERT_TRUE(unsupported.error);
   EXPECT_EQ(unsupported.error->code, URLErrorUnsupportedURL);
+}
+
+TEST_F(HTTPSessionTest, HostileAnswersEndAtTheSessionsLimits) {
+  Logger log("test", "http");
+  LogCapture capture;
+  URLSession session{URLSessionConfiguration{
+      .requestTimeoutIsDeadline = true, .maximumResponseBodySize = 1 << 20, .logger = &log, .delegatePool = &pool}};
+
+  // A body streamed without a length is cut where it passes the limit, with a log line.
+  fault({{"path", "/search"}, {"huge", 64 << 20}, {"times", 1}});
+  Outcome huge = run(session, {url("/search?q=a")});
+  ASSERT_TRUE(huge.error);
+  EXPECT_EQ(huge.error->code, URLErrorDataLengthExceedsMaximum);
+  EXPECT_TRUE(huge.data.empty());
+  EXPECT_TRUE(capture.contains("response body over the limit of 1048576 bytes"));
+
+  // A gzip body nobody asked for is refused on its head; one that was asked for is decoded and
+  // counted after decoding.
+  fault({{"path", "/search"}, {"inflate", 16 << 20}});
+  Outcome unasked = run(session, {url("/search?q=b")});
+  ASSERT_TRUE(unasked.error);
+  EXPECT_EQ(unasked.error->code, URLErrorBadServerResponse);
+  EXPECT_NE(unasked.error->description.find("Content-Encoding gzip"), std::string::npos);
+  URLRequest asking{url("/search?q=c")};
+  asking.headers.set("Accept-Encoding", "gzip");
+  Outcome bomb = run(session, asking);
+  ASSERT_TRUE(bomb.error);
+  EXPECT_EQ(bomb.error->code, URLErrorDataLengthExceedsMaximum);
+  fault({{"path", "/search"}, {"inflate", 5000}});
+  Outcome inflated = run(session, asking);
+  ASSERT_FALSE(inflated.error) << inflated.error->description;
+  EXPECT_EQ(inflated.data, std::string(5000, ' '));
+
+  // A server that sends a byte every 20 ms is never idle for the request's 0.3 s, yet the task
+  // ends then.
+  fault({{"path", "/bag"}, {"trickle_ms", 20}});
+  URLRequest trickled{url("/bag")};
+  trickled.timeoutInterval = 0.3;
+  Outcome slow = run(session, trickled);
+  ASSERT_TRUE(slow.error);
+  EXPECT_EQ(slow.error->code, URLErrorTimedOut);
+
+  // A header value that would end its field early never goes out.
+  const auto before = recorded().size();
+  URLRequest injected{url("/bag")};
+  injected.headers.set("User-Agent", "seekara/1.0\r\nX-Injected: agent");
+  Outcome refused = run(session, injected);
+  ASSERT_TRUE(refused.error);
+  EXPECT_EQ(refused.error->code, URLErrorBadURL);
+  EXPECT_EQ(recorded().size(), before);
+  EXPECT_TRUE(capture.contains("header field User-Agent carries a control character"));
 }
 
 TEST_F(HTTPSessionTest, CancelCompletesOnceWithCancelled) {
