@@ -76,6 +76,8 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void flushSessionInvalidation(std::function<void(bool flushed)> callback);
 
  private:
+  class PendingCall;
+
   void openOrExtendTransaction();
   void closeTransaction();
   void configure(std::uint64_t callId, const proto::Envelope& in);

@@ -10,9 +10,7 @@ double toUnixSeconds(TimePoint t) {
   return std::chrono::duration<double>(t.time_since_epoch()).count();
 }
 
-TimePoint fromUnixSeconds(double s) {
-  return TimePoint(std::chrono::duration_cast<Duration>(std::chrono::duration<double>(s)));
-}
+TimePoint fromUnixSeconds(double s) { return TimePoint(seconds(s)); }
 
 void TimerHandle::cancel() {
   if (cancelled_) cancelled_->store(true);

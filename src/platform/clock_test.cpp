@@ -2,6 +2,9 @@
 
 #include <gtest/gtest.h>
 
+#include <cmath>
+#include <limits>
+
 #include <atomic>
 #include <chrono>
 #include <vector>
@@ -72,6 +75,15 @@ TEST_F(VirtualClockTest, RepeatingTimerRunsEveryIntervalUntilStopped) {
   queue.sync([&] { timer.stop(); });
   clock.advance(seconds(600));
   EXPECT_EQ(at.size(), 3u);
+}
+
+TEST(Seconds, ValuesFromOutsideSaturateInsteadOfOverflowing) {
+  EXPECT_EQ(seconds(std::nan("")), Duration::zero());
+  EXPECT_GT(seconds(1e300), seconds(9e9));
+  EXPECT_LT(seconds(-std::numeric_limits<double>::infinity()), seconds(-9e9));
+  EXPECT_EQ(fromUnixSeconds(std::nan("")), fromUnixSeconds(0));
+  EXPECT_GT(fromUnixSeconds(1e300), fromUnixSeconds(4102444800));  // 2100
+  EXPECT_EQ(toUnixSeconds(fromUnixSeconds(1767225600.5)), 1767225600.5);
 }
 
 TEST(SystemClock, TimerFiresOnItsQueueAfterTheDelay) {
