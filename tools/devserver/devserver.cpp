@@ -1,5 +1,6 @@
 #include "devserver/devserver.h"
 #include "devserver/feedback_routes.h"
+#include "platform/json_value.h"
 
 #include <httplib.h>
 #include <sys/socket.h>
@@ -405,7 +406,7 @@ struct DevServer::Impl {
       replyJSON(res, json::object());
     });
     server.Post("/_faults", [this](const httplib::Request& req, httplib::Response& res) {
-      const json body = json::parse(req.body, nullptr, false);
+      const json body = platform::isJsonWithinLimits(req.body) ? json::parse(req.body) : json();
       if (!body.is_object() || !body.contains("path") || !body["path"].is_string()) {
         res.status = 400;
         replyJSON(res, {{"error", "expected {\"path\": ...}"}});
