@@ -368,7 +368,11 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
     curl_easy_setopt(easy, CURLOPT_MAXREDIRS, 10L);
     curl_easy_setopt(easy, CURLOPT_NOSIGNAL, 1L);
     curl_easy_setopt(easy, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_2TLS));
-    curl_easy_setopt(easy, CURLOPT_PIPEWAIT, config.multiplexing ? 1L : 0L);
+    // Waiting for a connection that may multiplex pays only where the TLS handshake (ALPN) says
+    // soon whether it will. Over plain HTTP it is said by the first response, so one slow or hung
+    // answer would hold every other request to its host.
+    const bool tls = request.url.size() >= 8 && equalsIgnoringCase(std::string_view(request.url).substr(0, 8), "https://");
+    curl_easy_setopt(easy, CURLOPT_PIPEWAIT, config.multiplexing && tls ? 1L : 0L);
     if (auto asked = request.headers.get("Accept-Encoding"); asked && !asked->empty()) {
       // curl sends the field from this option and decodes what it names.
       curl_easy_setopt(easy, CURLOPT_ACCEPT_ENCODING, asked->c_str());
