@@ -12,7 +12,9 @@
 #include <atomic>
 #include <cctype>
 #include <chrono>
+#include <cstdlib>
 #include <condition_variable>
+#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <map>
@@ -132,9 +134,11 @@ struct DevServer::Impl {
     }
   }
 
-  // httplib does not hand out the socket: find it by its two ports.
+  // httplib does not hand out the socket: find it by its two ports among the open descriptors.
   int socketOf(const httplib::Request& req) const {
-    for (int fd = 0; fd < 4096; ++fd) {
+    std::error_code ec;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd", ec)) {
+      const int fd = std::atoi(entry.path().filename().c_str());
       sockaddr_in local{}, peer{};
       socklen_t localSize = sizeof local, peerSize = sizeof peer;
       if (::getsockname(fd, reinterpret_cast<sockaddr*>(&local), &localSize) != 0) continue;
@@ -143,6 +147,24 @@ struct DevServer::Impl {
       if (ntohs(local.sin_port) == port && ntohs(peer.sin_port) == req.remote_port) return fd;
     }
     return -1;
+  }
+
+  // The library listens with a backlog of five: a burst of connections (a daemon with many queries
+  // on the wire) would see its SYNs dropped and retried a second later. Listening again widens it.
+  void widenBacklog() const {
+    std::error_code ec;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd", ec)) {
+      const int fd = std::atoi(entry.path().filename().c_str());
+      sockaddr_in local{};
+      socklen_t size = sizeof local;
+      int listening = 0;
+      socklen_t flagSize = sizeof listening;
+      if (::getsockname(fd, reinterpret_cast<sockaddr*>(&local), &size) != 0 || local.sin_family != AF_INET) continue;
+      if (ntohs(local.sin_port) != port) continue;
+      if (::getsockopt(fd, SOL_SOCKET, SO_ACCEPTCONN, &listening, &flagSize) == 0 && listening) {
+        ::listen(fd, SOMAXCONN);
+      }
+    }
   }
 
   // Disconnecting a connected TCP socket (connect to AF_UNSPEC) resets it: the peer gets a RST at
@@ -497,6 +519,7 @@ bool DevServer::start(const Options& options, std::string* error) {
   impl_->port = options.port == 0 ? impl_->server.bind_to_any_port("127.0.0.1")
                                   : (impl_->server.bind_to_port("127.0.0.1", options.port) ? options.port : -1);
   if (impl_->port <= 0) return fail("cannot bind 127.0.0.1:" + std::to_string(options.port));
+  impl_->widenBacklog();
   impl_->thread = std::thread([this] { impl_->server.listen_after_bind(); });
   // stop() is lost on a server that has not begun listening, so start() returns only once it has.
   for (int i = 0; i < 5000 && !impl_->server.is_running(); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(1));
