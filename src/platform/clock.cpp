@@ -1,5 +1,7 @@
 #include "platform/clock.h"
 
+#include <cmath>
+
 #include <asio/steady_timer.hpp>
 
 #include "platform/asio_context.h"
@@ -11,6 +13,12 @@ double toUnixSeconds(TimePoint t) {
 }
 
 TimePoint fromUnixSeconds(double s) { return TimePoint(seconds(s)); }
+
+TimePoint addSeconds(TimePoint t, double s) {
+  // Within a century either way the sum cannot overflow, and stays exact to the nanosecond.
+  if (std::abs(s) < 3.2e9) return t + seconds(s);
+  return fromUnixSeconds(toUnixSeconds(t) + s);
+}
 
 void TimerHandle::cancel() {
   if (cancelled_) cancelled_->store(true);

@@ -84,6 +84,10 @@ TEST(Seconds, ValuesFromOutsideSaturateInsteadOfOverflowing) {
   EXPECT_EQ(fromUnixSeconds(std::nan("")), fromUnixSeconds(0));
   EXPECT_GT(fromUnixSeconds(1e300), fromUnixSeconds(4102444800));  // 2100
   EXPECT_EQ(toUnixSeconds(fromUnixSeconds(1767225600.5)), 1767225600.5);
+  const TimePoint now = fromUnixSeconds(1767225600);
+  EXPECT_EQ(addSeconds(now, 30), now + seconds(30));
+  EXPECT_GT(addSeconds(now, 1e300), addSeconds(now, 1e9));
+  EXPECT_LT(addSeconds(now, -1e300), fromUnixSeconds(0));
 }
 
 TEST(SystemClock, TimerFiresOnItsQueueAfterTheDelay) {

@@ -19,6 +19,10 @@ constexpr Duration seconds(double s) {
   if (s < -most) s = -most;
   return std::chrono::duration_cast<Duration>(std::chrono::duration<double>(s));
 }
+// `t` moved by `s` seconds, saturating at the ends of what a TimePoint holds: expiries that come
+// from a server ("max_age") may be anything.
+TimePoint addSeconds(TimePoint t, double s);
+
 // Seconds since the Unix epoch, and back; the way back saturates as seconds() does.
 double toUnixSeconds(TimePoint t);
 TimePoint fromUnixSeconds(double s);
