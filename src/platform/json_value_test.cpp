@@ -22,20 +22,15 @@ TEST(JsonValue, ParsesEveryTypeAndDropsNull) {
   EXPECT_EQ(d.count("z"), 0u);
 }
 
-TEST(JsonValue, RejectsMalformedAndNullDocuments) {
+TEST(JsonValue, RefusesMalformedNullAndOverLimitDocumentsWithoutRecursing) {
   std::string error;
   EXPECT_FALSE(parseJson("{\"a\":", &error).has_value());
-  EXPECT_FALSE(error.empty());
+  EXPECT_NE(error.find("not well-formed"), std::string::npos) << error;
   EXPECT_FALSE(parseJson("null").has_value());
   EXPECT_FALSE(parseJson("").has_value());
   EXPECT_FALSE(parseJson("{} trailing").has_value());
-  ASSERT_TRUE(parseJson("[1]").has_value());
-  EXPECT_NE(parseJson("[1]")->array(), nullptr);
-}
 
-TEST(JsonValue, RefusesDocumentsPastTheirLimitsWithoutRecursing) {
   auto nested = [](std::size_t depth) { return std::string(depth, '[') + std::string(depth, ']'); };
-  std::string error;
   // 200,000 levels would overflow any recursive walk; it is refused at the first level too many.
   EXPECT_FALSE(parseJson(nested(200000), &error).has_value());
   EXPECT_EQ(error, "nested deeper than 64 levels");
@@ -50,7 +45,6 @@ TEST(JsonValue, RefusesDocumentsPastTheirLimitsWithoutRecursing) {
   EXPECT_EQ(error, "more than 4 values");
   EXPECT_TRUE(parseJson("[1,2,3]", &error, small).has_value());
   EXPECT_FALSE(isJsonWithinLimits("{\"a\":", &error, small));
-  EXPECT_NE(error.find("not well-formed"), std::string::npos) << error;
 }
 
 TEST(JsonValue, WritesCompactSortedTextThatReadsBack) {
