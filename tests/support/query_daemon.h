@@ -17,6 +17,7 @@
 #include "platform/dispatch.h"
 #include "platform/http/url_session.h"
 #include "support/daemon_process.h"
+#include "support/devserver_control.h"
 #include "support/devserver_process.h"
 #include "support/temp_home.h"
 #include "tavix/client.h"
@@ -36,13 +37,7 @@ struct Answer {
 class QueryDaemonTest : public ::testing::Test {
  protected:
   std::string call(const std::string& path, const std::string& method = "GET", std::string body = {}) {
-    platform::http::URLRequest r;
-    r.url = server.base + path;
-    r.method = method;
-    r.body = std::move(body);
-    std::promise<std::string> done;
-    session.dataTask(r, [&](std::string data, auto, auto) { done.set_value(std::move(data)); })->resume();
-    return done.get_future().get();
+    return devserverCall(session, server.base, path, method, std::move(body));
   }
   void fault(const json& f) { call("/_faults", "POST", f.dump()); }
   int served(const std::string& path) {
