@@ -2,7 +2,7 @@
 // parse, every property of the views that clients see (with and without a client override), the
 // binary property list of the disk cache and its reading back.
 //
-// Run: UBSAN_OPTIONS=halt_on_error=1 <build>/bin/bag_fuzzer -runs=1000000 [corpus-dir]
+// Run: UBSAN_OPTIONS=halt_on_error=1 <build>/bin/bag_fuzzer -runs=1000000 -dict=fuzz/json.dict [corpus-dir]
 #include <cstddef>
 #include <cstdint>
 #include <string>

@@ -2,7 +2,7 @@
 // person may edit while the daemon runs: the XML or binary reading, the lenient typed readings
 // every key answers, and the file written back.
 //
-// Run: UBSAN_OPTIONS=halt_on_error=1 <build>/bin/defaults_plist_fuzzer -runs=1000000 [corpus-dir]
+// Run: UBSAN_OPTIONS=halt_on_error=1 <build>/bin/defaults_plist_fuzzer -runs=1000000 -dict=fuzz/plist.dict [corpus-dir]
 #include <cstddef>
 #include <cstdint>
 #include <string>

@@ -3,7 +3,7 @@
 // the query-cache entry made from it (completed query, score, expiry, request items). A parsed
 // value must also come back unchanged from its own JSON text.
 //
-// Run: UBSAN_OPTIONS=halt_on_error=1 <build>/bin/search_reply_fuzzer -runs=1000000 [corpus-dir]
+// Run: UBSAN_OPTIONS=halt_on_error=1 <build>/bin/search_reply_fuzzer -runs=1000000 -dict=fuzz/json.dict [corpus-dir]
 #include <cmath>
 #include <cstddef>
 #include <cstdint>
