@@ -1,8 +1,13 @@
 #include "tavix/client.h"
 
+#include <poll.h>
+#include <sys/eventfd.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <cerrno>
+#include <chrono>
 #include <condition_variable>
 #include <deque>
 #include <cstdlib>
@@ -25,6 +30,8 @@ Error clientError(ClientErrorCode code, std::string reason) { return {kClientErr
 // The Impl whose reader runs on this thread, so that blocking from a callback is caught.
 thread_local const void* tCurrentReader = nullptr;
 
+using Steady = std::chrono::steady_clock;
+
 }  // namespace
 
 std::string Error::describe() const { return domain + " " + std::to_string(code) + ": " + reason; }
@@ -45,10 +52,14 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
   struct Link {
     ipc::UniqueFd fd;
     std::mutex writeLock;
+    // Wakes the reader when a call comes due before the time it sleeps until.
+    ipc::UniqueFd wake{::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)};
+    Steady::time_point sleepsUntil = Steady::time_point::max();  // guarded by Impl::lock
   };
   struct Pending {
     std::shared_ptr<Link> link;
     DescriptorReply reply;
+    Steady::time_point deadline;
   };
 
   Options options;
@@ -79,14 +90,21 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
     if (auto ec = ipc::sendWithFds(fresh->fd.get(), bytes, {}, true, &sent)) {
       return clientError(kCannotConnect, "sending the configuration: " + ec.message());
     }
-    pending[id] = {fresh, [](const proto::Envelope*, std::vector<int> fds, std::optional<Error>) {
+    pending[id] = {fresh,
+                   [](const proto::Envelope*, std::vector<int> fds, std::optional<Error>) {
                      for (int fd : fds) ::close(fd);
-                   }};
+                   },
+                   deadlineFromNow()};
     link = fresh;
     everConnected = true;
     ++readers;
     std::thread([self = shared_from_this(), fresh] { self->readLoop(fresh); }).detach();
     return std::nullopt;
+  }
+
+  Steady::time_point deadlineFromNow() const {
+    return options.timeoutMs > 0 ? Steady::now() + std::chrono::milliseconds(options.timeoutMs)
+                                 : Steady::time_point::max();
   }
 
   void readLoop(const std::shared_ptr<Link>& l) {
@@ -97,10 +115,19 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
     // announces, oldest first.
     std::deque<ipc::UniqueFd> received;
     for (;;) {
-      std::vector<int> fds;
+      pollfd fds[2] = {{l->fd.get(), POLLIN, 0}, {l->wake.get(), POLLIN, 0}};
+      if (::poll(fds, 2, millisecondsToNextDeadline(l)) < 0 && errno != EINTR) break;
+      if (fds[1].revents & POLLIN) {
+        std::uint64_t ignored;
+        while (::read(l->wake.get(), &ignored, sizeof ignored) > 0) {
+        }
+      }
+      expireCalls(l);
+      if (!(fds[0].revents & (POLLIN | POLLHUP | POLLERR))) continue;
+      std::vector<int> passed;
       std::size_t n = 0;
-      auto ec = ipc::receiveWithFds(l->fd.get(), buffer.data(), buffer.size(), true, &fds, &n);
-      for (int fd : fds) received.emplace_back(fd);
+      auto ec = ipc::receiveWithFds(l->fd.get(), buffer.data(), buffer.size(), true, &passed, &n);
+      for (int fd : passed) received.emplace_back(fd);
       if (ec || n == 0) break;
       decoder.append(buffer.data(), n);
       while (auto payload = decoder.next()) dispatch(*payload, received);
@@ -108,6 +135,39 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
     }
     finishLink(l);
     tCurrentReader = nullptr;
+  }
+
+  // How long the reader may sleep before a call of `l` is due; -1 for as long as it likes.
+  int millisecondsToNextDeadline(const std::shared_ptr<Link>& l) {
+    std::lock_guard g(lock);
+    auto next = Steady::time_point::max();
+    for (const auto& [id, call] : pending) {
+      if (call.link == l) next = std::min(next, call.deadline);
+    }
+    l->sleepsUntil = next;
+    if (next == Steady::time_point::max()) return -1;
+    const auto left = std::chrono::ceil<std::chrono::milliseconds>(next - Steady::now()).count();
+    return static_cast<int>(std::clamp<std::int64_t>(left, 0, 60 * 60 * 1000));
+  }
+
+  // Fails the calls of `l` whose deadline has passed; a reply that comes later finds nothing.
+  void expireCalls(const std::shared_ptr<Link>& l) {
+    std::vector<DescriptorReply> expired;
+    {
+      std::lock_guard g(lock);
+      const auto now = Steady::now();
+      for (auto it = pending.begin(); it != pending.end();) {
+        if (it->second.link == l && it->second.deadline <= now) {
+          expired.push_back(std::move(it->second.reply));
+          it = pending.erase(it);
+        } else {
+          ++it;
+        }
+      }
+    }
+    for (auto& reply : expired) {
+      reply(nullptr, {}, clientError(kTimedOut, "no reply from tavixd in " + std::to_string(options.timeoutMs) + " ms"));
+    }
   }
 
   void dispatch(const std::string& payload, std::deque<ipc::UniqueFd>& received) {
@@ -193,8 +253,14 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
     const std::uint64_t id = nextId++;
     message.set_call_id(id);
     auto target = link;
-    pending[id] = {target, std::move(reply)};
+    const auto deadline = deadlineFromNow();
+    pending[id] = {target, std::move(reply), deadline};
+    const bool sooner = deadline < target->sleepsUntil;
     l.unlock();
+    if (sooner) {
+      const std::uint64_t one = 1;
+      [[maybe_unused]] auto ignored = ::write(target->wake.get(), &one, sizeof one);
+    }
     if (!write(target, message)) {
       DescriptorReply failed;
       {
@@ -230,9 +296,7 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
       if (reply) result->reply = *reply;
       result->done.set_value(std::move(error));
     });
-    if (future.wait_for(std::chrono::milliseconds(options.timeoutMs)) != std::future_status::ready) {
-      return clientError(kTimedOut, "no reply from tavixd");
-    }
+    // The call's own deadline answers it if the daemon does not.
     auto error = future.get();
     if (!error && out) *out = result->reply;
     return error;
@@ -362,24 +426,21 @@ void Client::runActivity(const std::string& name, std::function<void(std::option
 
 namespace {
 template <typename Start>
-std::optional<Error> waitFor(const void* impl, int timeoutMs, Start start) {
+std::optional<Error> waitFor(const void* impl, Start start) {
   if (tCurrentReader == impl) return clientError(kProtocol, "blocking call from a reply callback");
   auto done = std::make_shared<std::promise<std::optional<Error>>>();
   auto future = done->get_future();
   start([done](std::optional<Error> error) { done->set_value(std::move(error)); });
-  if (future.wait_for(std::chrono::milliseconds(timeoutMs)) != std::future_status::ready) {
-    return clientError(kTimedOut, "no reply from tavixd");
-  }
-  return future.get();
+  return future.get();  // the call's deadline answers it if the daemon does not
 }
 }  // namespace
 
 std::optional<Error> Client::notifySync(const std::string& eventName) {
-  return waitFor(impl_.get(), impl_->options.timeoutMs, [&](auto cb) { notify(eventName, cb); });
+  return waitFor(impl_.get(), [&](auto cb) { notify(eventName, cb); });
 }
 
 std::optional<Error> Client::runActivitySync(const std::string& name) {
-  return waitFor(impl_.get(), impl_->options.timeoutMs, [&](auto cb) { runActivity(name, cb); });
+  return waitFor(impl_.get(), [&](auto cb) { runActivity(name, cb); });
 }
 
 void Client::setBagDidLoadHandler(std::function<void(const proto::BagDidLoad&)> handler) {

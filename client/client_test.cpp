@@ -19,7 +19,8 @@ namespace {
 namespace ipc = platform::ipc;
 
 // Answers configure; answers listen_to_flusher twice (the duplicate must be ignored) with one
-// end of a socket pair; answers everything else with call_failed; greets with a one-way message.
+// end of a socket pair; keeps a notify named "late" until answerLate(); answers everything else
+// with call_failed; greets with a one-way message.
 struct ScriptedServer {
   platform::DispatchPool pool{2};
   platform::Logger log{"test", "server"};
@@ -29,6 +30,20 @@ struct ScriptedServer {
   std::vector<std::shared_ptr<ipc::IpcConnection>> connections;
   ipc::UniqueFd flusherPeer;  // the end the server keeps
   std::atomic<int> configures{0};
+  std::vector<std::pair<std::shared_ptr<ipc::IpcConnection>, std::uint64_t>> late;  // under lock
+
+  bool answerLate() {
+    std::lock_guard l(lock);
+    for (auto& [c, id] : late) {
+      proto::Envelope out;
+      out.set_call_id(id);
+      out.mutable_notify_reply()->set_delivered(true);
+      c->send(out.SerializeAsString());
+    }
+    const bool any = !late.empty();
+    late.clear();
+    return any;
+  }
 
   explicit ScriptedServer(const testing::TempHome& home) : path((home.runtime() / "s.sock").string()) {
     std::error_code ec;
@@ -59,6 +74,9 @@ struct ScriptedServer {
         proto::Envelope hello;
         hello.mutable_did_download_resource()->set_identifier("hello");
         c->send(hello.SerializeAsString());
+      } else if (in.has_notify() && in.notify().name() == "late") {
+        std::lock_guard l(lock);
+        late.emplace_back(c, in.call_id());
       } else if (in.has_listen_to_flusher()) {
         for (int copy = 0; copy < 2; ++copy) {
           int pair[2];
@@ -140,6 +158,28 @@ TEST(Client, HandsOverDescriptorsAndCallsEachReplyOnce) {
   EXPECT_EQ(error->reason, "not available");
   EXPECT_EQ(calls, 1);
   EXPECT_EQ(server.configures, 1) << "configured once per connection";
+}
+
+TEST(Client, ACallWithoutAnAnswerFailsAtItsDeadlineOnceAndTheLateAnswerIsDropped) {
+  testing::TempHome home;
+  ScriptedServer server(home);
+  auto options = optionsFor(server);
+  options.timeoutMs = 100;
+  Client client(options);
+  ASSERT_FALSE(client.connect());
+  std::atomic<int> calls{0};
+  std::promise<std::optional<Error>> first;
+  client.notify("late", [&](std::optional<Error> error) {
+    if (calls++ == 0) first.set_value(error);
+  });
+  auto error = first.get_future().get();
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->domain, kClientErrorDomain);
+  EXPECT_EQ(error->code, kTimedOut);
+  ASSERT_TRUE(server.answerLate());
+  // A later call's answer comes after the late one on the same stream: by then it has been read.
+  EXPECT_TRUE(client.callSync(proto::Envelope(), nullptr));
+  EXPECT_EQ(calls, 1);
 }
 
 TEST(Client, FailsPendingCallsOnceWhenTheServerDropsThemAndWithoutReconnectStaysDown) {

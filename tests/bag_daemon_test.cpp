@@ -8,7 +8,6 @@
 
 #include <gtest/gtest.h>
 
-#include <future>
 #include <thread>
 
 #include "platform/clock.h"
@@ -19,6 +18,7 @@
 #include "platform/json_value.h"
 #include "platform/property_value.h"
 #include "support/daemon_process.h"
+#include "support/devserver_control.h"
 #include "support/devserver_process.h"
 
 namespace {
@@ -29,13 +29,7 @@ using namespace tavix::platform;
 class BagDaemonTest : public ::testing::Test {
  protected:
   std::string call(const std::string& path, const std::string& method = "GET", std::string body = {}) {
-    http::URLRequest r;
-    r.url = server.base + path;
-    r.method = method;
-    r.body = std::move(body);
-    std::promise<std::string> done;
-    session.dataTask(r, [&](std::string data, auto, auto) { done.set_value(std::move(data)); })->resume();
-    return done.get_future().get();
+    return tavix::testing::devserverCall(session, server.base, path, method, std::move(body));
   }
   std::size_t bagFetches() {
     auto recorded = parseJson(call("/_recorded"));

@@ -101,7 +101,7 @@ CachedResultSet::CachedResultSet(const std::string& input, const platform::http:
   }
   if (auto it = reply.find("max_age"); it != reply.end() && (it->second.real() || it->second.integer())) {
     double maxAge = *it->second.asReal();
-    if (maxAge != 0) expireTime_ = now + platform::seconds(maxAge);
+    if (maxAge != 0) expireTime_ = platform::addSeconds(now, maxAge);
   }
   if (request) {
     if (auto scale = request->headers.get("X-Norvel-UI-Scale")) uiScale_ = std::strtod(scale->c_str(), nullptr);

@@ -1,9 +1,12 @@
 #include "context/user_guid_controller.h"
 
+#include <sys/random.h>
+
 #include <cctype>
+#include <cerrno>
 #include <cstdio>
-#include <mutex>
-#include <random>
+#include <cstdlib>
+#include <cstring>
 
 #include "core/assembly.h"
 #include "core/diagnostics.h"
@@ -11,21 +14,34 @@
 
 namespace tavix {
 
-std::string makeRandomUUIDString() {
-  static std::mutex lock;
-  static std::mt19937_64 engine{std::random_device{}()};
-  std::uint64_t hi, lo;
-  {
-    std::lock_guard guard(lock);
-    hi = engine();
-    lo = engine();
+namespace {
+
+// Bytes from the kernel's random source. The identifiers made from them must not let whoever sees
+// one predict or link the others, which a seeded generator would.
+void kernelRandomBytes(std::uint8_t* out, std::size_t size) {
+  std::size_t filled = 0;
+  while (filled < size) {
+    const ssize_t n = ::getrandom(out + filled, size - filled, 0);
+    if (n > 0) {
+      filled += static_cast<std::size_t>(n);
+    } else if (errno != EINTR) {
+      // No identifier is better than a guessable one.
+      std::fprintf(stderr, "getrandom failed: %s\n", std::strerror(errno));
+      std::abort();
+    }
   }
-  hi = (hi & 0xFFFFFFFFFFFF0FFFull) | 0x0000000000004000ull;  // version 4
-  lo = (lo & 0x3FFFFFFFFFFFFFFFull) | 0x8000000000000000ull;  // RFC 4122 variant
+}
+
+}  // namespace
+
+std::string makeRandomUUIDString() {
+  std::uint8_t b[16];
+  kernelRandomBytes(b, sizeof b);
+  b[6] = static_cast<std::uint8_t>((b[6] & 0x0F) | 0x40);  // version 4
+  b[8] = static_cast<std::uint8_t>((b[8] & 0x3F) | 0x80);  // RFC 4122 variant
   char text[37];
-  std::snprintf(text, sizeof text, "%08X-%04X-%04X-%04X-%012llX", static_cast<unsigned>(hi >> 32),
-                static_cast<unsigned>((hi >> 16) & 0xFFFF), static_cast<unsigned>(hi & 0xFFFF),
-                static_cast<unsigned>(lo >> 48), static_cast<unsigned long long>(lo & 0xFFFFFFFFFFFFull));
+  std::snprintf(text, sizeof text, "%02X%02X%02X%02X-%02X%02X-%02X%02X-%02X%02X-%02X%02X%02X%02X%02X%02X", b[0], b[1],
+                b[2], b[3], b[4], b[5], b[6], b[7], b[8], b[9], b[10], b[11], b[12], b[13], b[14], b[15]);
   return text;
 }
 

@@ -21,7 +21,7 @@ class Assembly;
 
 inline constexpr double kTavixUserGUIDLifetimeSeconds = 900;
 
-// A fresh random (version 4) UUID in its upper-case textual form.
+// A fresh random (version 4) UUID in its upper-case textual form, from the kernel's random source.
 std::string makeRandomUUIDString();
 // True for the 36-character textual UUID form (either case).
 bool isValidUUIDString(const std::string& text);

@@ -35,6 +35,8 @@ TEST(TavixUserGUIDController, IdentifierLivesExactly900Seconds) {
   const std::string first = controller->currentUserGUID();
   EXPECT_TRUE(isValidUUIDString(first));
   EXPECT_EQ(first.find_first_of("abcdef"), std::string::npos);
+  EXPECT_EQ(first[14], '4') << first;  // a random (version 4) UUID
+  EXPECT_NE(std::string("89AB").find(first[19]), std::string::npos) << first;
   f.clock.advance(platform::seconds(899));
   EXPECT_EQ(controller->currentUserGUID(), first);
   f.pool.drain();

@@ -3,6 +3,7 @@
 #include <functional>
 #include <mutex>
 
+#include "core/logging.h"
 #include "platform/defaults.h"
 #include "platform/http/url_session.h"
 
@@ -14,6 +15,13 @@ namespace {
 
 using platform::http::URLSession;
 using platform::http::URLSessionConfiguration;
+
+// Response bodies each session takes: search-family answers are a few kilobytes, the bag tens;
+// resources are files the bag names; upload answers are acknowledgements.
+constexpr std::size_t kQueryBodyLimit = 4 * 1024 * 1024;
+constexpr std::size_t kBagBodyLimit = 2 * 1024 * 1024;
+constexpr std::size_t kResourceBodyLimit = 64 * 1024 * 1024;
+constexpr std::size_t kUploadReplyBodyLimit = 1024 * 1024;
 
 // Made once and never released: the sessions outlive every Assembly and run until the process
 // ends, so each keeps a delegate queue of its own rather than one on a pool that may go first.
@@ -37,6 +45,10 @@ std::shared_ptr<URLSession> Assembly::urlSession() const {
     c.tcpFastOpen = !noParallax;
     c.tlsSessionReuse = !noParallax;
     c.multiplexing = true;
+    // A client waits on every query: the bag's request time-out bounds each one in all.
+    c.requestTimeoutIsDeadline = true;
+    c.maximumResponseBodySize = kQueryBodyLimit;
+    c.logger = &TavixLogForCategory(TavixLoggingCategoryConnection);
     return c;
   });
 }
@@ -47,6 +59,9 @@ std::shared_ptr<URLSession> Assembly::bagSession() const {
   return makeOnce(once, session, [] {
     URLSessionConfiguration c;
     c.connectionIdleTimeout = std::chrono::seconds(10);
+    c.requestTimeoutIsDeadline = true;
+    c.maximumResponseBodySize = kBagBodyLimit;
+    c.logger = &TavixLogForCategory(TavixLoggingCategoryBag);
     return c;
   });
 }
@@ -57,6 +72,8 @@ std::shared_ptr<URLSession> Assembly::downloadURLSession() const {
   return makeOnce(once, session, [] {
     URLSessionConfiguration c;
     c.identifier = "com.norvel.tavixd";
+    c.maximumResponseBodySize = kResourceBodyLimit;
+    c.logger = &TavixLogForCategory(TavixLoggingCategoryDownloadManager);
     return c;
   });
 }
@@ -69,6 +86,8 @@ std::shared_ptr<URLSession> Assembly::uploadURLSession() const {
     c.identifier = "com.norvel.tavixd.flusher.urlsession";
     c.timeoutIntervalForRequest = 300;
     c.timeoutIntervalForResource = 604800;
+    c.maximumResponseBodySize = kUploadReplyBodyLimit;
+    c.logger = &TavixLogForCategory(TavixLoggingCategoryUploadManager);
     return c;
   });
 }

@@ -1,5 +1,9 @@
 #include "daemon/client_connection.h"
 
+#include <fmt/format.h>
+
+#include <cmath>
+
 #include "bag/tvx_bag.h"
 #include "cache/query_cache.h"
 #include "cache/engaged_completion_cache.h"
@@ -16,6 +20,7 @@
 #include "network/user_agent.h"
 #include "platform/activity.h"
 #include "platform/defaults.h"
+#include "platform/http/url_request.h"
 #include "platform/ipc/launch_events.h"
 #include "platform/ipc/server.h"
 #include "platform/json_value.h"
@@ -91,7 +96,75 @@ void setError(proto::TVXError* error, std::int64_t code, const std::string& reas
   error->set_reason(reason);
 }
 
+// A client's string as a log line may carry it: control characters as \xNN, so that a value
+// cannot forge lines of its own.
+std::string printable(std::string_view text) {
+  std::string out;
+  for (char c : text) {
+    const auto u = static_cast<unsigned char>(c);
+    if (u < 0x20 || u == 0x7f) {
+      out += fmt::format("\\x{:02x}", u);
+    } else {
+      out += c;
+    }
+  }
+  return out;
+}
+
+// The answer to `callId` as a frame the connection will take: an answer too large for a frame
+// becomes a call_failed that says so, so that the caller still hears back once.
+std::string answerBytes(const platform::ipc::IpcConnection& connection, std::uint64_t callId, proto::Envelope& out) {
+  out.set_call_id(callId);
+  std::string bytes = out.SerializeAsString();
+  if (bytes.size() <= connection.maxFrameSize()) return bytes;
+  const std::string reason =
+      fmt::format("reply of {} bytes is over the frame limit of {} bytes", bytes.size(), connection.maxFrameSize());
+  connectionLog().error("answering call {} from pid {} with an error: {}", callId, connection.peer().pid, reason);
+  proto::Envelope failed;
+  failed.set_call_id(callId);
+  setError(failed.mutable_call_failed(), 500, reason);
+  return failed.SerializeAsString();
+}
+
 }  // namespace
+
+// A call answered later, off the connection's queue. It is answered once: a second answer is
+// dropped, and a call whose last reference goes without an answer gets an error, so no caller
+// waits for ever. Until then it counts among the connection's unanswered calls, which bound how
+// much a client can have the daemon hold for it.
+class ClientConnection::PendingCall {
+ public:
+  // On the connection's queue, inside the handler of the call.
+  PendingCall(const std::shared_ptr<platform::ipc::IpcConnection>& connection, std::uint64_t callId)
+      : connection_(connection), callId_(callId), hold_(connection->holdCurrentCall()) {}
+  ~PendingCall() {
+    if (answered_.load() || callId_ == 0) return;
+    connectionLog().fault("call {} ended without an answer", callId_);
+    proto::Envelope failed;
+    setError(failed.mutable_call_failed(), 500, "no answer");
+    if (auto connection = connection_.lock()) sendToClient(*connection, answerBytes(*connection, callId_, failed));
+  }
+  PendingCall(const PendingCall&) = delete;
+  PendingCall& operator=(const PendingCall&) = delete;
+
+  // Safe from any thread.
+  void answer(proto::Envelope& out) {
+    if (answered_.exchange(true)) {
+      connectionLog().fault("second answer to call {} dropped", callId_);
+      return;
+    }
+    if (auto connection = connection_.lock(); connection && callId_ != 0) {
+      sendToClient(*connection, answerBytes(*connection, callId_, out));
+    }
+    hold_.reset();
+  }
+
+ private:
+  std::weak_ptr<platform::ipc::IpcConnection> connection_;
+  const std::uint64_t callId_;
+  std::atomic<bool> answered_{false};
+  platform::ipc::IpcConnection::CallHold hold_;
+};
 
 ClientConnection::ClientConnection(Assembly& assembly, std::shared_ptr<platform::ipc::IpcConnection> connection,
                                    platform::ipc::LaunchEventRegistry* launchEvents)
@@ -175,13 +248,7 @@ void ClientConnection::closeTransaction(bool now) {
 }
 
 void ClientConnection::send(std::uint64_t callId, proto::Envelope& out) {
-  out.set_call_id(callId);
-  std::string bytes;
-  if (!out.SerializeToString(&bytes)) {
-    connectionLog().error("cannot serialise reply to call {}", callId);
-    return;
-  }
-  sendToClient(*connection_, std::move(bytes));
+  sendToClient(*connection_, answerBytes(*connection_, callId, out));
 }
 
 void ClientConnection::handleMessage(const std::string& payload) {
@@ -206,17 +273,14 @@ void ClientConnection::handleMessage(const std::string& payload) {
     case proto::Envelope::kBag: {
       ensureState();
       if (!state_) return;  // no bound state, no reply: as for queries
-      std::weak_ptr<platform::ipc::IpcConnection> weak = connection_;
-      state_->bag(userAgent_, [weak, callId](const std::shared_ptr<const TVXBag>& bag,
+      auto pending = std::make_shared<PendingCall>(connection_, callId);
+      state_->bag(userAgent_, [pending](const std::shared_ptr<const TVXBag>& bag,
                                              const std::optional<TVXError>& error) {
         proto::Envelope reply;
-        reply.set_call_id(callId);
         if (bag) bagToWire(*bag, reply.mutable_bag_reply()->mutable_bag());
         if (error) errorToWire(*error, reply.mutable_bag_reply()->mutable_error());
         if (!bag && !error) reply.mutable_bag_reply();
-        if (auto connection = weak.lock(); connection && callId != 0) {
-          sendToClient(*connection, reply.SerializeAsString());
-        }
+        pending->answer(reply);
       });
       return;
     }
@@ -313,8 +377,6 @@ void ClientConnection::ensureState() {
     return;
   }
   if (!assembly_.clientStateManager) return;
-  auto state = assembly_.clientStateManager->stateForClientIdentifier(configuration_->identifier);
-  if (!state) return;
   std::string fullUserAgent;
   if (!configuration_->userAgent.empty()) {
     // The factory's device answers are the process's: the system's version is read once.
@@ -324,6 +386,15 @@ void ClientConnection::ensureState() {
                          : createUserAgentString(agent, DeviceInformation(assembly_.userDefaults.get())))
                         .value_or(agent);
   }
+  // The identifier and the full user agent (the client's part and the device's, which defaults
+  // may override) go out as header values: a CR LF in either would add a header of its own.
+  for (const std::string* value : {&configuration_->identifier, &fullUserAgent}) {
+    if (platform::http::isValidHeaderValue(*value)) continue;
+    sessionLog().fault("configuration carries a control character: {}", printable(*value));
+    return;
+  }
+  auto state = assembly_.clientStateManager->stateForClientIdentifier(configuration_->identifier);
+  if (!state) return;
   // The tool re-labels its state with each connection's agent; other clients keep the state's
   // first one on purpose.
   if (configuration_->identifier == "tavix_tool") state->updateClient(fullUserAgent);
@@ -342,8 +413,8 @@ void ClientConnection::ensureState() {
 
 void ClientConnection::configure(std::uint64_t callId, const proto::Envelope& in) {
   const auto& config = in.configure().configuration();
-  sessionLog().notice("client configuration {{identifier: {}, userAgent: {}}}", config.identifier(),
-                      config.user_agent());
+  sessionLog().notice("client configuration {{identifier: {}, userAgent: {}}}", printable(config.identifier()),
+                      printable(config.user_agent()));
   const auto previous = configuration_;
   if (!previous || previous->identifier == config.identifier()) {
     configuration_ = Configuration{config.identifier(), config.user_agent()};
@@ -454,18 +525,15 @@ void ClientConnection::request(std::uint64_t callId, const proto::Envelope& in) 
 
   const TraceCodes codes = traceCodesFor(wire.kind_case());
   if (codes.start) trace(codes.start);
-  std::weak_ptr<platform::ipc::IpcConnection> weakConnection = connection_;
-  TVXReplyBlock reply = [weakConnection, callId, endCode = codes.end](std::uint64_t queryId, std::optional<TVXReply> r,
-                                                                         std::optional<TVXError> error) {
+  auto pending = std::make_shared<PendingCall>(connection_, callId);
+  TVXReplyBlock reply = [pending, endCode = codes.end](std::uint64_t queryId, std::optional<TVXReply> r,
+                                                       std::optional<TVXError> error) {
     proto::Envelope out;
-    out.set_call_id(callId);
     auto* wireReply = out.mutable_request_reply();
     wireReply->set_query_id(queryId);
     if (r) replyToWire(*r, wireReply->mutable_reply());
     if (error) errorToWire(*error, wireReply->mutable_error());
-    if (auto connection = weakConnection.lock(); connection && callId != 0) {
-      sendToClient(*connection, out.SerializeAsString());
-    }
+    pending->answer(out);
     if (endCode) trace(endCode);
   };
   switch (wire.kind_case()) {
@@ -503,11 +571,10 @@ void ClientConnection::feedback(std::uint64_t callId) {
     trace(0x2b000028);
     return;
   }
-  std::weak_ptr<platform::ipc::IpcConnection> weak = connection_;
-  manager->currentSessionFeedbacks([weak, callId, out](std::vector<std::string> feedbacks) mutable {
+  auto pending = std::make_shared<PendingCall>(connection_, callId);
+  manager->currentSessionFeedbacks([pending, out](std::vector<std::string> feedbacks) mutable {
     for (auto& feedback : feedbacks) out.mutable_feedback_reply()->add_feedbacks(std::move(feedback));
-    out.set_call_id(callId);
-    if (auto connection = weak.lock(); connection && callId != 0) sendToClient(*connection, out.SerializeAsString());
+    pending->answer(out);
     trace(0x2b000028);
   });
 }
@@ -517,9 +584,15 @@ void ClientConnection::engagedCompletionMessage(const proto::Envelope& in) {
   auto cache = EngagedCompletionCache::sharedInstance(assembly_);
   switch (in.message_case()) {
     case proto::Envelope::kClearEngagedCompletions: {
+      const auto& dates = in.clear_engaged_completions();
+      if (!std::isfinite(dates.from_date()) || !std::isfinite(dates.to_date())) {
+        connectionLog().error("clearEngagedCompletions from pid {}: the dates {} and {} are not both numbers",
+                              connection_->peer().pid, dates.from_date(), dates.to_date());
+        break;
+      }
       const auto client = completionClientNumber(state_ ? state_->clientShortName() : std::nullopt);
-      cache->clearCompletionsFromDate(platform::fromUnixSeconds(in.clear_engaged_completions().from_date()),
-                                      platform::fromUnixSeconds(in.clear_engaged_completions().to_date()), client);
+      cache->clearCompletionsFromDate(platform::fromUnixSeconds(dates.from_date()),
+                                      platform::fromUnixSeconds(dates.to_date()), client);
       break;
     }
     case proto::Envelope::kAddCompletion:

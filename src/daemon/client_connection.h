@@ -78,6 +78,8 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void flushSessionInvalidation(std::function<void(bool flushed)> callback);
 
  private:
+  class PendingCall;
+
   void openOrExtendTransaction();
   // Empties the state's query cache and ends the keep-alive: at once (`now`, the idle timer) or
   // kIdleTransactionSeconds later (invalidation, destruction).

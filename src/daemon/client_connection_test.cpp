@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <cmath>
 
 #include "core/assembly.h"
 #include "platform/activity.h"
@@ -45,7 +46,7 @@ struct Harness {
   std::shared_ptr<ClientConnection> subject;
   ipc::FrameDecoder decoder;
 
-  Harness() {
+  explicit Harness(std::size_t maxFrame = ipc::kMaxFrameSize) {
     assembly.dispatchPool = &pool;
     assembly.clock = &clock;
     assembly.transactions = &transactions;
@@ -58,7 +59,7 @@ struct Harness {
     EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
     client.reset(fds[1]);
     connection = ipc::IpcConnection::make(pool, ipc::UniqueFd(fds[0]), {::getpid(), ::getuid(), ::getgid()},
-                                          "test.connection", log);
+                                          "test.connection", log, maxFrame);
     subject = std::make_shared<ClientConnection>(assembly, connection, &events);
     subject->start();
     std::weak_ptr<ClientConnection> weak = subject;
@@ -70,11 +71,14 @@ struct Harness {
     pool.drain();
   }
 
-  proto::Envelope call(proto::Envelope e, std::uint64_t id = 1) {
+  void post(proto::Envelope e, std::uint64_t id = 0) {
     e.set_call_id(id);
     auto frame = ipc::encodeFrame(e.SerializeAsString());
     std::size_t sent = 0;
     EXPECT_FALSE(ipc::sendWithFds(client.get(), frame, {}, true, &sent));
+  }
+  proto::Envelope call(proto::Envelope e, std::uint64_t id = 1) {
+    post(std::move(e), id);
     return receive();
   }
   proto::Envelope receive() {
@@ -221,20 +225,52 @@ TEST(ClientConnection, RelaysResourceNotificationsThatNameAResource) {
 
 TEST(ClientConnection, QueriesBeforeAValidConfigurationAndOfUnknownKindAreNotAnswered) {
   Harness h;
-  auto post = [&](const proto::Envelope& e, std::uint64_t id) {
-    proto::Envelope copy = e;
-    copy.set_call_id(id);
-    auto frame = ipc::encodeFrame(copy.SerializeAsString());
-    std::size_t sent = 0;
-    ASSERT_FALSE(ipc::sendWithFds(h.client.get(), frame, {}, true, &sent));
-  };
   proto::Envelope request;
   request.mutable_request()->mutable_request()->set_query_id(9);
   request.mutable_request()->mutable_request()->mutable_flight_search()->set_flight_query("NV 12");
-  post(request, 3);  // no state bound yet
+  h.post(request, 3);  // no state bound yet
   request.mutable_request()->mutable_request()->clear_kind();
-  post(request, 4);  // no kind
+  h.post(request, 4);  // no kind
   EXPECT_EQ(h.call(notify("after"), 5).call_id(), 5u) << "neither request got a reply";
+}
+
+TEST(ClientConnection, RefusesConfigurationsThatWouldInjectHeaders) {
+  platform::LogCapture capture;
+  proto::Envelope configure;
+  configure.mutable_configure()->mutable_configuration()->set_identifier("com.norvel.seekara");
+  configure.mutable_configure()->mutable_configuration()->set_user_agent("seekara/1.0\r\nX-Injected: agent");
+  {
+    Harness h;
+    EXPECT_FALSE(h.call(configure).has_configure_reply()) << "closed without a reply";
+    EXPECT_TRUE(capture.contains("configuration carries a control character"));
+    EXPECT_TRUE(capture.contains("seekara/1.0\\x0d\\x0aX-Injected: agent")) << "logged, escaped";
+    EXPECT_TRUE(capture.contains("invalid configuration, closing connection"));
+    EXPECT_TRUE(h.assembly.clientStateManager->sessions().empty()) << "no state for a refused client";
+  }
+  // The device's part of the agent comes from defaults, and is held to the same rule.
+  capture.clear();
+  Harness h;
+  h.assembly.userDefaults->setObject("TVXDeviceProductType", "Desk\nX-Injected: model");
+  configure.mutable_configure()->mutable_configuration()->set_user_agent("seekara/1.0");
+  EXPECT_FALSE(h.call(configure).has_configure_reply());
+  EXPECT_TRUE(capture.contains("configuration carries a control character"));
+}
+
+TEST(ClientConnection, AnswersTooLargeForAFrameAndDatesThatAreNotNumbersAreRefused) {
+  Harness h(300);
+  platform::LogCapture capture;
+  // The answer names the stream, which makes it larger than the connection's frames.
+  auto reply = h.call(notify("x", std::string(250, 's')), 7);
+  EXPECT_EQ(reply.call_id(), 7u);
+  ASSERT_TRUE(reply.has_call_failed());
+  EXPECT_NE(reply.call_failed().reason().find("over the frame limit of 300 bytes"), std::string::npos);
+
+  proto::Envelope clear;
+  clear.mutable_clear_engaged_completions()->set_from_date(std::nan(""));
+  clear.mutable_clear_engaged_completions()->set_to_date(1e300);
+  h.post(clear);
+  EXPECT_EQ(h.call(notify("after"), 8).call_id(), 8u);
+  EXPECT_TRUE(capture.contains("are not both numbers"));
 }
 
 TEST(ClientConnection, KeepsItsFirstIdentifierAndBuildsTheFullUserAgent) {

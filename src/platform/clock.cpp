@@ -1,5 +1,7 @@
 #include "platform/clock.h"
 
+#include <cmath>
+
 #include <asio/steady_timer.hpp>
 
 #include "platform/asio_context.h"
@@ -10,8 +12,12 @@ double toUnixSeconds(TimePoint t) {
   return std::chrono::duration<double>(t.time_since_epoch()).count();
 }
 
-TimePoint fromUnixSeconds(double s) {
-  return TimePoint(std::chrono::duration_cast<Duration>(std::chrono::duration<double>(s)));
+TimePoint fromUnixSeconds(double s) { return TimePoint(seconds(s)); }
+
+TimePoint addSeconds(TimePoint t, double s) {
+  // Within a century either way the sum cannot overflow, and stays exact to the nanosecond.
+  if (std::abs(s) < 3.2e9) return t + seconds(s);
+  return fromUnixSeconds(toUnixSeconds(t) + s);
 }
 
 void TimerHandle::cancel() {

@@ -8,56 +8,102 @@ namespace {
 
 using nlohmann::json;
 
-// Walks the parsed document; false for null, which the caller drops.
-bool fromJson(const json& j, PropertyValue* out) {
-  switch (j.type()) {
-    case json::value_t::null:
-    case json::value_t::discarded:
-      return false;
-    case json::value_t::boolean:
-      *out = j.get<bool>();
-      return true;
-    case json::value_t::number_integer:
-      *out = j.get<std::int64_t>();
-      return true;
-    case json::value_t::number_unsigned: {
-      auto u = j.get<std::uint64_t>();
-      if (u <= static_cast<std::uint64_t>(INT64_MAX)) {
-        *out = static_cast<std::int64_t>(u);
-      } else {
-        *out = static_cast<double>(u);
-      }
-      return true;
-    }
-    case json::value_t::number_float:
-      *out = j.get<double>();
-      return true;
-    case json::value_t::string:
-      *out = j.get<std::string>();
-      return true;
-    case json::value_t::array: {
-      PropertyValue::Array array;
-      array.reserve(j.size());
-      for (const auto& element : j) {
-        PropertyValue v;
-        if (fromJson(element, &v)) array.push_back(std::move(v));
-      }
-      *out = std::move(array);
-      return true;
-    }
-    case json::value_t::object: {
-      Dictionary dict;
-      for (auto it = j.begin(); it != j.end(); ++it) {
-        PropertyValue v;
-        if (fromJson(it.value(), &v)) dict.emplace(it.key(), std::move(v));
-      }
-      *out = std::move(dict);
-      return true;
-    }
-    case json::value_t::binary:
-      return false;
+// Builds the value straight from the parser's events (no intermediate tree, no recursion) and
+// stops at the first event that passes a limit. With `build` false it only checks.
+class LimitedBuilder {
+ public:
+  LimitedBuilder(const JsonLimits& limits, bool build) : limits_(limits), build_(build) {}
+
+  bool null() { return counted() && place(std::nullopt); }
+  bool boolean(bool v) { return counted() && place(PropertyValue(v)); }
+  bool number_integer(json::number_integer_t v) { return counted() && place(PropertyValue(std::int64_t{v})); }
+  bool number_unsigned(json::number_unsigned_t v) {
+    if (!counted()) return false;
+    // Beyond int64: kept as a real rather than wrapped around.
+    if (v <= static_cast<std::uint64_t>(INT64_MAX)) return place(PropertyValue(static_cast<std::int64_t>(v)));
+    return place(PropertyValue(static_cast<double>(v)));
   }
-  return false;
+  bool number_float(json::number_float_t v, const std::string&) { return counted() && place(PropertyValue(v)); }
+  bool string(std::string& v) { return counted() && place(PropertyValue(std::move(v))); }
+  bool binary(json::binary_t&) { return fail("binary values are not JSON"); }
+  bool key(std::string& k) {
+    if (build_) stack_.back().key = std::move(k);
+    return true;
+  }
+  bool start_object(std::size_t) { return open(true); }
+  bool start_array(std::size_t) { return open(false); }
+  bool end_object() { return close(); }
+  bool end_array() { return close(); }
+  bool parse_error(std::size_t position, const std::string&, const nlohmann::detail::exception&) {
+    if (error_.empty()) error_ = "not well-formed JSON (at byte " + std::to_string(position) + ")";
+    return false;
+  }
+
+  const std::string& error() const { return error_; }
+  std::optional<PropertyValue>& root() { return root_; }
+
+ private:
+  struct Frame {
+    bool object = false;
+    PropertyValue::Array array;
+    Dictionary dictionary;
+    std::string key;
+  };
+
+  bool fail(std::string why) {
+    error_ = std::move(why);
+    return false;
+  }
+  bool counted() {
+    if (++values_ <= limits_.maxValues) return true;
+    return fail("more than " + std::to_string(limits_.maxValues) + " values");
+  }
+  bool open(bool object) {
+    if (!counted()) return false;
+    if (depth_ >= limits_.maxDepth) return fail("nested deeper than " + std::to_string(limits_.maxDepth) + " levels");
+    ++depth_;
+    if (build_) stack_.push_back(Frame{object, {}, {}, {}});
+    return true;
+  }
+  bool close() {
+    --depth_;
+    if (!build_) return true;
+    Frame done = std::move(stack_.back());
+    stack_.pop_back();
+    return place(done.object ? PropertyValue(std::move(done.dictionary)) : PropertyValue(std::move(done.array)));
+  }
+  // A null member or element is left out; a null document stays empty.
+  bool place(std::optional<PropertyValue> v) {
+    if (!build_ || !v) return true;
+    if (stack_.empty()) {
+      root_ = std::move(v);
+    } else if (Frame& top = stack_.back(); top.object) {
+      top.dictionary.insert_or_assign(std::move(top.key), std::move(*v));
+    } else {
+      top.array.push_back(std::move(*v));
+    }
+    return true;
+  }
+
+  const JsonLimits& limits_;
+  const bool build_;
+  std::size_t depth_ = 0;
+  std::size_t values_ = 0;
+  std::vector<Frame> stack_;
+  std::optional<PropertyValue> root_;
+  std::string error_;
+};
+
+bool runLimited(std::string_view text, LimitedBuilder& builder, const JsonLimits& limits, std::string* error) {
+  if (text.size() > limits.maxBytes) {
+    if (error) *error = "larger than " + std::to_string(limits.maxBytes) + " bytes";
+    return false;
+  }
+  if (!json::sax_parse(text.begin(), text.end(), &builder)) {
+    if (error) *error = builder.error().empty() ? "not well-formed JSON" : builder.error();
+    return false;
+  }
+  return true;
 }
 
 json toJsonValue(const PropertyValue& value) {
@@ -94,18 +140,19 @@ constexpr char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwx
 
 }  // namespace
 
-std::optional<PropertyValue> parseJson(std::string_view text, std::string* error) {
-  json j = json::parse(text.begin(), text.end(), nullptr, /*allow_exceptions=*/false);
-  if (j.is_discarded()) {
-    if (error) *error = "not well-formed JSON";
-    return std::nullopt;
-  }
-  PropertyValue value;
-  if (!fromJson(j, &value)) {
+std::optional<PropertyValue> parseJson(std::string_view text, std::string* error, JsonLimits limits) {
+  LimitedBuilder builder(limits, true);
+  if (!runLimited(text, builder, limits, error)) return std::nullopt;
+  if (!builder.root()) {
     if (error) *error = "the document is null";
     return std::nullopt;
   }
-  return value;
+  return std::move(builder.root());
+}
+
+bool isJsonWithinLimits(std::string_view text, std::string* error, JsonLimits limits) {
+  LimitedBuilder checker(limits, false);
+  return runLimited(text, checker, limits, error);
 }
 
 std::string toJson(const PropertyValue& value) {

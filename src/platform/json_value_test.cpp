@@ -22,15 +22,29 @@ TEST(JsonValue, ParsesEveryTypeAndDropsNull) {
   EXPECT_EQ(d.count("z"), 0u);
 }
 
-TEST(JsonValue, RejectsMalformedAndNullDocuments) {
+TEST(JsonValue, RefusesMalformedNullAndOverLimitDocumentsWithoutRecursing) {
   std::string error;
   EXPECT_FALSE(parseJson("{\"a\":", &error).has_value());
-  EXPECT_FALSE(error.empty());
+  EXPECT_NE(error.find("not well-formed"), std::string::npos) << error;
   EXPECT_FALSE(parseJson("null").has_value());
   EXPECT_FALSE(parseJson("").has_value());
   EXPECT_FALSE(parseJson("{} trailing").has_value());
-  ASSERT_TRUE(parseJson("[1]").has_value());
-  EXPECT_NE(parseJson("[1]")->array(), nullptr);
+
+  auto nested = [](std::size_t depth) { return std::string(depth, '[') + std::string(depth, ']'); };
+  // 200,000 levels would overflow any recursive walk; it is refused at the first level too many.
+  EXPECT_FALSE(parseJson(nested(200000), &error).has_value());
+  EXPECT_EQ(error, "nested deeper than 64 levels");
+  EXPECT_FALSE(isJsonWithinLimits(nested(65)));
+  ASSERT_TRUE(parseJson(nested(64)).has_value());
+  EXPECT_TRUE(isJsonWithinLimits(nested(64)));
+
+  const JsonLimits small{.maxBytes = 10, .maxDepth = 3, .maxValues = 4};
+  EXPECT_FALSE(parseJson("[1,2,3,4,5]", &error, small).has_value());
+  EXPECT_EQ(error, "larger than 10 bytes");
+  EXPECT_FALSE(parseJson("[1,2,3,4]", &error, small).has_value());
+  EXPECT_EQ(error, "more than 4 values");
+  EXPECT_TRUE(parseJson("[1,2,3]", &error, small).has_value());
+  EXPECT_FALSE(isJsonWithinLimits("{\"a\":", &error, small));
 }
 
 TEST(JsonValue, WritesCompactSortedTextThatReadsBack) {

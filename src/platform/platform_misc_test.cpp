@@ -34,10 +34,31 @@ TEST(PropertyList, BinaryAndXmlRoundTripEveryType) {
   EXPECT_EQ(*fromBinary, value);
 }
 
-TEST(PropertyList, GarbageIsRejected) {
+TEST(PropertyList, GarbageDeepNestingAndNulsAreRejectedWithoutAborting) {
   EXPECT_FALSE(parsePlist(""));
   EXPECT_FALSE(parsePlist("not a plist"));
   EXPECT_FALSE(parsePlist("bplist00\x01\x02"));
+
+  // libplist would recurse through each level (and overflow its stack long before 200,000).
+  auto nested = [](int depth) {
+    PropertyValue value = PropertyValue::Array{};
+    for (int i = 0; i < depth; ++i) value = PropertyValue::Array{value};
+    return value;
+  };
+  EXPECT_TRUE(parsePlist(toXmlPlist(nested(64))));
+  EXPECT_TRUE(parsePlist(toBinaryPlist(nested(64))));
+  EXPECT_FALSE(parsePlist(toBinaryPlist(nested(66))));
+  std::string deepXml = "<?xml version=\"1.0\"?><plist version=\"1.0\">";
+  for (int i = 0; i < 200000; ++i) deepXml += "<array>";
+  EXPECT_FALSE(parsePlist(deepXml));
+
+  // libplist asserts (aborts) when it hands out a string or key with a NUL in it.
+  std::string binary = toBinaryPlist(PropertyValue(Dictionary{{"key", PropertyValue("value")}}));
+  binary.replace(binary.find("key"), 3, std::string("k\0y", 3));
+  EXPECT_FALSE(parsePlist(binary));
+  std::string xml = toXmlPlist(PropertyValue(Dictionary{{"key", PropertyValue("value")}}));
+  EXPECT_FALSE(parsePlist(std::string(xml).replace(xml.find("<key>key"), 8, "<key>k&#0;y")));
+  EXPECT_FALSE(parsePlist(std::string(xml).replace(xml.find("value"), 5, std::string("va\0ue", 6))));
 }
 
 TEST(PropertyValue, LenientReadingsFollowTheDefaultsRules) {
@@ -49,6 +70,8 @@ TEST(PropertyValue, LenientReadingsFollowTheDefaultsRules) {
   EXPECT_EQ(PropertyValue("1.5").asReal(), 1.5);
   EXPECT_FALSE(PropertyValue("abc").asInteger());
   EXPECT_FALSE(PropertyValue(PropertyValue::Array{}).asBool());
+  EXPECT_EQ(PropertyValue(1e300).asInteger(), INT64_MAX) << "saturated, not undefined";
+  EXPECT_EQ(PropertyValue("-1e300").asInteger(), INT64_MIN);
 }
 
 TEST(Files, CreateDirectoryReportsExistingEntriesOnlyWithoutIntermediates) {

@@ -11,6 +11,22 @@
 
 namespace tavix::platform {
 
+namespace {
+
+// Levels of arrays and dictionaries a property list may nest.
+constexpr int kMaxPlistDepth = 64;
+
+// A real as an integer, truncated; past the range of int64 it saturates (the plain conversion is
+// undefined there), and NaN or an infinity has no integer reading.
+std::optional<std::int64_t> integerOfReal(double r) {
+  if (!std::isfinite(r)) return std::nullopt;
+  if (r >= 9223372036854775808.0) return INT64_MAX;
+  if (r < -9223372036854775808.0) return INT64_MIN;
+  return static_cast<std::int64_t>(r);
+}
+
+}  // namespace
+
 std::optional<bool> PropertyValue::asBool() const {
   if (auto b = boolean()) return *b;
   if (auto i = integer()) return *i != 0;
@@ -26,15 +42,12 @@ std::optional<bool> PropertyValue::asBool() const {
 std::optional<std::int64_t> PropertyValue::asInteger() const {
   if (auto i = integer()) return *i;
   if (auto b = boolean()) return *b ? 1 : 0;
-  if (auto r = real()) {
-    if (!std::isfinite(*r)) return std::nullopt;
-    return static_cast<std::int64_t>(*r);
-  }
+  if (auto r = real()) return integerOfReal(*r);
   if (auto s = string()) {
     std::int64_t v = 0;
     auto [end, ec] = std::from_chars(s->data(), s->data() + s->size(), v);
     if (ec == std::errc() && end == s->data() + s->size()) return v;
-    if (auto r = PropertyValue(*s).asReal()) return static_cast<std::int64_t>(*r);
+    if (auto r = PropertyValue(*s).asReal()) return integerOfReal(*r);
   }
   return std::nullopt;
 }
@@ -169,7 +182,7 @@ plist_t toNode(const PropertyValue& v) {
 }
 
 std::optional<PropertyValue> fromNode(plist_t node, int depth) {
-  if (!node || depth > 64) return std::nullopt;  // deep nesting is hostile, not a preference
+  if (!node || depth > kMaxPlistDepth) return std::nullopt;  // deep nesting is hostile, not a preference
   switch (plist_get_node_type(node)) {
     case PLIST_BOOLEAN: {
       uint8_t b = 0;
@@ -188,10 +201,12 @@ std::optional<PropertyValue> fromNode(plist_t node, int depth) {
       return PropertyValue(d);
     }
     case PLIST_STRING: {
-      char* s = nullptr;
-      plist_get_string_val(node, &s);
-      std::string value = s ? s : "";
-      std::free(s);
+      // By pointer and length: the copying reader asserts that a string holds no NUL. One that
+      // does is refused, as the XML form could not write it back.
+      std::uint64_t length = 0;
+      const char* s = plist_get_string_ptr(node, &length);
+      std::string value = s ? std::string(s, length) : std::string();
+      if (value.find('\0') != std::string::npos) return std::nullopt;
       return PropertyValue(std::move(value));
     }
     case PLIST_DATE: {
@@ -267,8 +282,167 @@ std::string toBinaryPlist(const PropertyValue& value) {
   return out;
 }
 
+namespace {
+
+std::uint64_t bigEndian(std::string_view bytes, std::size_t at, std::size_t width) {
+  std::uint64_t v = 0;
+  for (std::size_t i = 0; i < width; ++i) v = (v << 8) | static_cast<std::uint8_t>(bytes[at + i]);
+  return v;
+}
+
+// libplist reads nested arrays and dictionaries recursively, and asserts (aborting the process)
+// when it hands out a string or key that holds a NUL. A file someone wrote may do either, so the
+// bytes are looked at first: deeper than we read, or with a NUL in a string, they are refused.
+// What these walks cannot make sense of is left to libplist to refuse.
+
+// A binary property list: the objects of its offset table, as libplist finds them.
+class BinaryPlistWalk {
+ public:
+  explicit BinaryPlistWalk(std::string_view bytes) : bytes_(bytes) {}
+
+  bool refused() {
+    constexpr std::size_t kHeader = 8, kTrailer = 32;
+    if (bytes_.size() < kHeader + kTrailer) return false;
+    const std::size_t trailer = bytes_.size() - kTrailer;
+    offsetSize_ = static_cast<std::uint8_t>(bytes_[trailer + 6]);
+    refSize_ = static_cast<std::uint8_t>(bytes_[trailer + 7]);
+    objects_ = bigEndian(bytes_, trailer + 8, 8);
+    const std::uint64_t top = bigEndian(bytes_, trailer + 16, 8);
+    table_ = bigEndian(bytes_, trailer + 24, 8);
+    if (offsetSize_ < 1 || offsetSize_ > 8 || refSize_ < 1 || refSize_ > 8 || table_ > trailer ||
+        objects_ > (trailer - table_) / offsetSize_) {
+      return false;
+    }
+    for (std::uint64_t i = 0; i < objects_; ++i) {
+      if (holdsNul(i)) return true;
+    }
+    return top < objects_ && tooDeep(top);
+  }
+
+ private:
+  struct Object {
+    unsigned kind = 0;
+    std::uint64_t count = 0;
+    std::uint64_t start = 0;  // of the payload
+  };
+
+  // Offsets and lengths are checked against the whole file, not the object table: whatever
+  // libplist may accept is looked at.
+  std::optional<Object> object(std::uint64_t index) const {
+    const std::size_t end = bytes_.size();
+    const std::uint64_t at = bigEndian(bytes_, table_ + index * offsetSize_, offsetSize_);
+    if (at >= end) return std::nullopt;
+    const auto marker = static_cast<std::uint8_t>(bytes_[at]);
+    Object o{static_cast<unsigned>(marker >> 4), static_cast<std::uint64_t>(marker & 0x0F), at + 1};
+    const bool sized = o.kind == 0x4 || o.kind == 0x5 || o.kind == 0x6 || o.kind == 0xA || o.kind == 0xC || o.kind == 0xD;
+    if (sized && o.count == 0x0F) {  // the count follows as an integer object
+      if (o.start >= end) return std::nullopt;
+      const auto intMarker = static_cast<std::uint8_t>(bytes_[o.start]);
+      const std::size_t width = std::size_t{1} << (intMarker & 0x0F);
+      if ((intMarker >> 4) != 0x1 || width > 8 || o.start + 1 + width > end) return std::nullopt;
+      o.count = bigEndian(bytes_, o.start + 1, width);
+      o.start += 1 + width;
+    }
+    return o;
+  }
+
+  bool holdsNul(std::uint64_t index) const {
+    const auto o = object(index);
+    if (!o || (o->kind != 0x5 && o->kind != 0x6)) return false;  // ASCII and UTF-16 strings; keys too
+    const std::size_t end = bytes_.size();
+    const std::uint64_t unit = o->kind == 0x5 ? 1 : 2;
+    if (o->start > end || o->count > (end - o->start) / unit) return false;
+    for (std::uint64_t c = 0; c < o->count; ++c) {
+      const std::size_t at = o->start + unit * c;
+      if (bytes_[at] == '\0' && (unit == 1 || bytes_[at + 1] == '\0')) return true;
+    }
+    return false;
+  }
+
+  // The references of an array, set or dictionary (keys and values).
+  std::vector<std::uint64_t> children(const Object& o) const {
+    std::vector<std::uint64_t> out;
+    if (o.kind != 0xA && o.kind != 0xC && o.kind != 0xD) return out;
+    const std::uint64_t refs = o.kind == 0xD ? 2 * o.count : o.count;
+    const std::size_t end = bytes_.size();
+    if (o.count > end || o.start > end || refs > (end - o.start) / refSize_) return out;
+    for (std::uint64_t r = 0; r < refs; ++r) out.push_back(bigEndian(bytes_, o.start + r * refSize_, refSize_));
+    return out;
+  }
+
+  // Depth first, without recursion, each object once: nesting past the limit, or a loop.
+  bool tooDeep(std::uint64_t top) const {
+    enum : std::uint8_t { kUnseen, kOpen, kDone };
+    std::vector<std::uint8_t> state(objects_, kUnseen);
+    struct Frame {
+      std::vector<std::uint64_t> children;
+      std::size_t next = 0;
+    };
+    std::vector<std::pair<std::uint64_t, Frame>> path;
+    auto enter = [&](std::uint64_t index) {
+      state[index] = kOpen;
+      const auto o = object(index);
+      path.push_back({index, Frame{o ? children(*o) : std::vector<std::uint64_t>{}}});
+    };
+    enter(top);
+    while (!path.empty()) {
+      if (path.size() > kMaxPlistDepth + 1) return true;
+      auto& [index, frame] = path.back();
+      if (frame.next == frame.children.size()) {
+        state[index] = kDone;
+        path.pop_back();
+        continue;
+      }
+      const std::uint64_t child = frame.children[frame.next++];
+      if (child >= objects_ || state[child] == kDone) continue;
+      if (state[child] == kOpen) return true;
+      enter(child);
+    }
+    return false;
+  }
+
+  std::string_view bytes_;
+  std::size_t offsetSize_ = 0;
+  std::size_t refSize_ = 0;
+  std::uint64_t objects_ = 0;
+  std::uint64_t table_ = 0;
+};
+
+// The XML form: a raw NUL or a character reference to one; arrays and dictionaries nested past the
+// limit (counted from the tags, so a tag inside a comment counts too: such files are not ours).
+bool xmlPlistRefused(std::string_view text) {
+  if (text.find('\0') != std::string_view::npos) return true;
+  for (std::size_t at = text.find("&#"); at != std::string_view::npos; at = text.find("&#", at + 2)) {
+    std::size_t i = at + 2;
+    if (i < text.size() && (text[i] == 'x' || text[i] == 'X')) ++i;
+    while (i < text.size() && text[i] == '0') ++i;
+    if (i < text.size() && text[i] == ';' && text[i - 1] == '0') return true;
+  }
+  int depth = 0;
+  for (std::size_t at = text.find('<'); at != std::string_view::npos; at = text.find('<', at + 1)) {
+    const std::string_view tag = text.substr(at + 1);
+    const bool closing = tag.starts_with('/');
+    const std::string_view name = tag.substr(closing ? 1 : 0);
+    std::size_t length = name.starts_with("array") ? 5 : name.starts_with("dict") ? 4 : 0;
+    if (length == 0 || length >= name.size()) continue;
+    const char after = name[length];
+    if (after != '>' && after != '/' && after != ' ' && after != '\t' && after != '\n' && after != '\r') continue;
+    const std::size_t close = name.find('>', length);
+    if (close == std::string_view::npos) continue;
+    if (closing) {
+      --depth;
+    } else if (name[close - 1] != '/' && ++depth > kMaxPlistDepth + 1) {
+      return true;
+    }
+  }
+  return false;
+}
+
+}  // namespace
+
 std::optional<PropertyValue> parsePlist(std::string_view bytes) {
   if (bytes.empty() || bytes.size() > UINT32_MAX) return std::nullopt;
+  if (bytes.starts_with("bplist00") ? BinaryPlistWalk(bytes).refused() : xmlPlistRefused(bytes)) return std::nullopt;
   plist_t node = nullptr;
   plist_from_memory(bytes.data(), static_cast<uint32_t>(bytes.size()), &node);
   PlistPtr root(node);

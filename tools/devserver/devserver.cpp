@@ -1,8 +1,10 @@
 #include "devserver/devserver.h"
 #include "devserver/feedback_routes.h"
+#include "platform/json_value.h"
 
 #include <httplib.h>
 #include <sys/socket.h>
+#include <zlib.h>
 #include <netinet/in.h>
 #include <unistd.h>
 
@@ -10,7 +12,9 @@
 #include <atomic>
 #include <cctype>
 #include <chrono>
+#include <cstdlib>
 #include <condition_variable>
+#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <map>
@@ -31,10 +35,45 @@ struct Fault {
   bool drop = false;
   int remaining = -1;  // -1: every request
   std::optional<std::string> body;  // served as it stands instead of the route's answer
-  bool hang = false;   // never answers (until the server stops)
+  bool hang = false;   // answers only once the faults are reset (or never, until the server stops)
   bool reset = false;  // the connection is reset (TCP RST) instead of answered
   std::vector<std::pair<std::string, std::string>> headers;  // added to the answer
+  // Hostile answers, each instead of the route's: arrays nested this deep; a JSON string of this
+  // many bytes, streamed without a length; a gzip stream that inflates to this many bytes;
+  // this many bytes of noise.
+  std::size_t nested = 0;
+  std::size_t huge = 0;
+  std::size_t inflate = 0;
+  std::size_t garbage = 0;
+  int trickleMs = 0;  // the route's answer, one byte every so many milliseconds
 };
+
+// A gzip member whose content is `size` blanks: a few hundred kilobytes that inflate to as many
+// megabytes as asked.
+std::string gzipOfBlanks(std::size_t size) {
+  z_stream z{};
+  deflateInit2(&z, Z_BEST_COMPRESSION, Z_DEFLATED, 15 + 16, 9, Z_DEFAULT_STRATEGY);
+  std::string in(1 << 20, ' ');
+  std::string out;
+  char buffer[1 << 16];
+  for (std::size_t left = size;;) {
+    const std::size_t n = std::min(left, in.size());
+    left -= n;
+    z.next_in = reinterpret_cast<Bytef*>(in.data());
+    z.avail_in = static_cast<uInt>(n);
+    const int flush = left == 0 ? Z_FINISH : Z_NO_FLUSH;
+    int result;
+    do {
+      z.next_out = reinterpret_cast<Bytef*>(buffer);
+      z.avail_out = sizeof buffer;
+      result = deflate(&z, flush);
+      out.append(buffer, sizeof buffer - z.avail_out);
+    } while (z.avail_out == 0);
+    if (result == Z_STREAM_END || (flush == Z_FINISH && result != Z_OK)) break;
+  }
+  deflateEnd(&z);
+  return out;
+}
 
 std::string lowercase(std::string s) {
   std::transform(s.begin(), s.end(), s.begin(), [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
@@ -82,20 +121,24 @@ struct DevServer::Impl {
   std::mutex hangLock;
   std::condition_variable hangWake;
   bool stopping = false;
+  std::uint64_t resets = 0;  // a reset of the faults lets hung requests go
 
   void hangUntilAbandoned(const httplib::Request& req) {
     const int fd = socketOf(req);
     std::unique_lock guard(hangLock);
-    while (!stopping) {
+    const std::uint64_t generation = resets;
+    while (!stopping && resets == generation) {
       hangWake.wait_for(guard, std::chrono::milliseconds(50));
       char byte;
       if (fd >= 0 && ::recv(fd, &byte, 1, MSG_PEEK | MSG_DONTWAIT) == 0) return;
     }
   }
 
-  // httplib does not hand out the socket: find it by its two ports.
+  // httplib does not hand out the socket: find it by its two ports among the open descriptors.
   int socketOf(const httplib::Request& req) const {
-    for (int fd = 0; fd < 4096; ++fd) {
+    std::error_code ec;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd", ec)) {
+      const int fd = std::atoi(entry.path().filename().c_str());
       sockaddr_in local{}, peer{};
       socklen_t localSize = sizeof local, peerSize = sizeof peer;
       if (::getsockname(fd, reinterpret_cast<sockaddr*>(&local), &localSize) != 0) continue;
@@ -104,6 +147,24 @@ struct DevServer::Impl {
       if (ntohs(local.sin_port) == port && ntohs(peer.sin_port) == req.remote_port) return fd;
     }
     return -1;
+  }
+
+  // The library listens with a backlog of five: a burst of connections (a daemon with many queries
+  // on the wire) would see its SYNs dropped and retried a second later. Listening again widens it.
+  void widenBacklog() const {
+    std::error_code ec;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd", ec)) {
+      const int fd = std::atoi(entry.path().filename().c_str());
+      sockaddr_in local{};
+      socklen_t size = sizeof local;
+      int listening = 0;
+      socklen_t flagSize = sizeof listening;
+      if (::getsockname(fd, reinterpret_cast<sockaddr*>(&local), &size) != 0 || local.sin_family != AF_INET) continue;
+      if (ntohs(local.sin_port) != port) continue;
+      if (::getsockopt(fd, SOL_SOCKET, SO_ACCEPTCONN, &listening, &flagSize) == 0 && listening) {
+        ::listen(fd, SOMAXCONN);
+      }
+    }
   }
 
   // Disconnecting a connected TCP socket (connect to AF_UNSPEC) resets it: the peer gets a RST at
@@ -153,6 +214,7 @@ struct DevServer::Impl {
       if (fault && fault->delayMs > 0) std::this_thread::sleep_for(std::chrono::milliseconds(fault->delayMs));
       if (fault && fault->hang) {
         hangUntilAbandoned(req);
+        if (!isStopping()) return handler(req, res);  // released by a reset of the faults
         res.set_content_provider(1024, "application/json", [](size_t, size_t, httplib::DataSink&) { return false; });
         return;
       }
@@ -170,6 +232,7 @@ struct DevServer::Impl {
       if (fault) {
         for (const auto& [name, value] : fault->headers) res.set_header(name, value);
       }
+      if (fault && hostile(*fault, req, res, handler)) return;
       if (fault && fault->body) {
         res.status = fault->status != 0 ? fault->status : 200;
         res.set_content(*fault->body, "application/json");
@@ -182,6 +245,60 @@ struct DevServer::Impl {
       }
       handler(req, res);
     };
+  }
+
+  bool isStopping() {
+    std::lock_guard guard(hangLock);
+    return stopping;
+  }
+
+  // Answers with the fault's hostile body, if it has one.
+  bool hostile(const Fault& fault, const httplib::Request& req, httplib::Response& res,
+               const std::function<void(const httplib::Request&, httplib::Response&)>& handler) {
+    if (fault.nested > 0) {
+      res.set_content(std::string(fault.nested, '[') + std::string(fault.nested, ']'), "application/json");
+    } else if (fault.huge > 0) {
+      // Chunked, so the size shows only as it arrives.
+      res.set_chunked_content_provider("application/json", [size = fault.huge](size_t offset, httplib::DataSink& sink) {
+        static const std::string block(1 << 16, 'x');
+        if (offset == 0) return sink.write("[\"", 2);
+        if (offset + 2 >= size) {
+          sink.write("\"]", 2);
+          sink.done();
+          return true;
+        }
+        return sink.write(block.data(), std::min(block.size(), size - 2 - offset));
+      });
+    } else if (fault.inflate > 0) {
+      // Not a compressible type, so the server does not wrap it in a second gzip.
+      res.set_header("Content-Encoding", "gzip");
+      res.set_content(gzipOfBlanks(fault.inflate), "application/octet-stream");
+    } else if (fault.garbage > 0) {
+      std::string noise(fault.garbage, '\0');
+      std::uint64_t x = 0x9e3779b97f4a7c15ull;
+      for (char& c : noise) {
+        x ^= x << 13, x ^= x >> 7, x ^= x << 17;
+        c = static_cast<char>(x);
+      }
+      res.set_content(noise, "application/json");
+    } else if (fault.trickleMs > 0) {
+      handler(req, res);
+      const std::string body = std::move(res.body);
+      const std::string type = res.get_header_value("Content-Type");
+      res.body.clear();
+      res.headers.erase("Content-Type");
+      res.set_chunked_content_provider(type, [this, body, ms = fault.trickleMs](size_t offset, httplib::DataSink& sink) {
+        if (offset >= body.size() || isStopping()) {
+          sink.done();
+          return true;
+        }
+        std::this_thread::sleep_for(std::chrono::milliseconds(ms));
+        return sink.is_writable() && sink.write(body.data() + offset, 1);
+      });
+    } else {
+      return false;
+    }
+    return true;
   }
 
   json bag() const {
@@ -297,14 +414,21 @@ struct DevServer::Impl {
       replyJSON(res, recorded);
     });
     server.Post("/_reset", [this](const httplib::Request&, httplib::Response& res) {
-      std::lock_guard guard(lock);
-      recorded = json::array();
-      faults.clear();
-      feedbackStore.reset();
+      {
+        std::lock_guard guard(lock);
+        recorded = json::array();
+        faults.clear();
+        feedbackStore.reset();
+      }
+      {
+        std::lock_guard guard(hangLock);
+        ++resets;
+      }
+      hangWake.notify_all();
       replyJSON(res, json::object());
     });
     server.Post("/_faults", [this](const httplib::Request& req, httplib::Response& res) {
-      const json body = json::parse(req.body, nullptr, false);
+      const json body = platform::isJsonWithinLimits(req.body) ? json::parse(req.body) : json();
       if (!body.is_object() || !body.contains("path") || !body["path"].is_string()) {
         res.status = 400;
         replyJSON(res, {{"error", "expected {\"path\": ...}"}});
@@ -317,6 +441,11 @@ struct DevServer::Impl {
       fault.remaining = body.value("times", -1);
       fault.hang = body.value("hang", false);
       fault.reset = body.value("reset", false);
+      fault.nested = body.value("nested", std::size_t{0});
+      fault.huge = body.value("huge", std::size_t{0});
+      fault.inflate = body.value("inflate", std::size_t{0});
+      fault.garbage = body.value("garbage", std::size_t{0});
+      fault.trickleMs = body.value("trickle_ms", 0);
       if (body.contains("headers") && body["headers"].is_object()) {
         for (const auto& [name, value] : body["headers"].items()) {
           if (value.is_string()) fault.headers.emplace_back(name, value.get<std::string>());
@@ -384,9 +513,13 @@ bool DevServer::start(const Options& options, std::string* error) {
   // stop() waits for idle keep-alive connections to time out; a second keeps reuse under load
   // without making every shutdown (one per test) wait five.
   impl_->server.set_keep_alive_timeout(1);
+  // Hung and trickling requests each hold a thread; enough for a client that floods its daemon
+  // to keep every one of its calls on the wire.
+  impl_->server.new_task_queue = [] { return new httplib::ThreadPool(128); };
   impl_->port = options.port == 0 ? impl_->server.bind_to_any_port("127.0.0.1")
                                   : (impl_->server.bind_to_port("127.0.0.1", options.port) ? options.port : -1);
   if (impl_->port <= 0) return fail("cannot bind 127.0.0.1:" + std::to_string(options.port));
+  impl_->widenBacklog();
   impl_->thread = std::thread([this] { impl_->server.listen_after_bind(); });
   // stop() is lost on a server that has not begun listening, so start() returns only once it has.
   for (int i = 0; i < 5000 && !impl_->server.is_running(); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(1));

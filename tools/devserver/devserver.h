@@ -9,9 +9,14 @@
 //   POST /_faults    {"path": "/search", "delay_ms": 500, "status": 500, "drop": true, "times": 2}
 //                    applies to requests of that path; "times" limits how many (absent: all);
 //                    "body": "[1]" answers that text (with "status", default 200) instead;
-//                    "hang": true never answers (until the client gives up or stop());
+//                    "hang": true never answers (until the client gives up, the faults are
+//                    reset, when it answers normally, or stop());
 //                    "reset": true resets the connection (TCP RST) instead of answering;
-//                    "headers": {"Name": "value"} adds header fields to the answer
+//                    "headers": {"Name": "value"} adds header fields to the answer;
+//                    hostile answers: "nested": N arrays nested N deep; "huge": N a JSON string
+//                    of N bytes streamed without a length; "inflate": N a gzip body (unasked)
+//                    that inflates to N bytes; "garbage": N bytes of noise; "trickle_ms": M
+//                    the normal answer one byte every M ms
 //   GET  /_feedback  JSON list of the feedback uploads accepted by POST /feedback and
 //                    POST /crowdsourcing: {"path","type","v","digest","compressed_size","size",
 //                    "json" (or "text" when the body is not JSON)}; also kept in feedback.jsonl

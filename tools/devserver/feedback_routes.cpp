@@ -6,6 +6,8 @@
 #include <fstream>
 #include <memory>
 
+#include "platform/json_value.h"
+
 namespace tavix::devserver {
 
 namespace {
@@ -110,11 +112,12 @@ void addFeedbackRoutes(httplib::Server& server, FeedbackStore& store, const Rout
                   {"digest", digest},
                   {"compressed_size", req.body.size()},
                   {"size", plain.size()}};
-    json parsed = json::parse(plain, nullptr, false);
-    if (parsed.is_discarded()) {
-      entry["text"] = plain;
+    // Kept as JSON only within the bounds the daemon holds documents to, so that writing it out
+    // again (a recursion) stays shallow.
+    if (platform::isJsonWithinLimits(plain)) {
+      entry["json"] = json::parse(plain);
     } else {
-      entry["json"] = std::move(parsed);
+      entry["text"] = plain;
     }
     store.add(std::move(entry));
     res.set_content("{}", "application/json");

@@ -22,9 +22,11 @@ enum Intent : std::uint64_t { kWatchUploads = 0, kWatchFeedback = 1, kStopFlushi
 
 // The channel's tool end, as the daemon hands it over.
 UniqueFd openChannel(client::Client& client) {
-  std::promise<std::pair<int, std::optional<client::Error>>> result;
-  client.listenToFlusher([&](int fd, std::optional<client::Error> error) { result.set_value({fd, std::move(error)}); });
-  auto [fd, error] = result.get_future().get();
+  auto result = std::make_shared<std::promise<std::pair<int, std::optional<client::Error>>>>();
+  auto answer = result->get_future();
+  client.listenToFlusher(
+      [result](int fd, std::optional<client::Error> error) { result->set_value({fd, std::move(error)}); });
+  auto [fd, error] = answer.get();
   if (error) {
     std::fprintf(stderr, "tavix_tool: %s\n", error->describe().c_str());
     return {};

@@ -13,6 +13,7 @@
 
 #include <nlohmann/json.hpp>
 
+#include "platform/json_value.h"
 #include "tavix/client.h"
 
 namespace tavix::tool {
@@ -51,12 +52,16 @@ bool takeIdentity(std::vector<std::string>& args, Identity& identity) {
   return true;
 }
 
+// How long the tool waits for any one answer.
+constexpr int kCallTimeoutMs = 30000;
+
 client::Client::Options optionsFor(const std::string& socketPath, const Identity& identity) {
   client::Client::Options options;
   options.socketPath = socketPath;
   options.configuration.set_identifier(identity.client);
   options.configuration.set_user_agent(identity.agent);
   options.reconnect = false;
+  options.timeoutMs = kCallTimeoutMs;
   return options;
 }
 
@@ -73,14 +78,19 @@ struct Outcome {
 };
 
 void readSuggestions(const std::string& data, Outcome& out) {
-  auto parsed = json::parse(data, nullptr, false);
-  if (!parsed.is_array() || parsed.empty() || !parsed[0].is_object()) return;
-  const auto& first = parsed[0];
-  if (first.contains("query") && first["query"].is_string()) out.completion = first["query"].get<std::string>();
-  if (!first.contains("results") || !first["results"].is_array()) return;
-  for (const auto& result : first["results"]) {
-    if (result.is_object() && result.contains("title") && result["title"].is_string()) {
-      out.suggestions.push_back(result["title"].get<std::string>());
+  // The server's answer, as the daemon passed it on: read with the same bounds as the daemon's.
+  const auto parsed = platform::parseJson(data);
+  const auto* list = parsed ? parsed->array() : nullptr;
+  const auto* first = list && !list->empty() ? list->front().dictionary() : nullptr;
+  if (!first) return;
+  if (auto it = first->find("query"); it != first->end() && it->second.string()) out.completion = *it->second.string();
+  const auto results = first->find("results");
+  if (results == first->end() || !results->second.array()) return;
+  for (const auto& result : *results->second.array()) {
+    const auto* fields = result.dictionary();
+    if (!fields) continue;
+    if (auto title = fields->find("title"); title != fields->end() && title->second.string()) {
+      out.suggestions.push_back(*title->second.string());
     }
   }
 }
@@ -93,12 +103,15 @@ Outcome query(client::Client& client, std::uint64_t queryId, const std::string& 
   // Verbose replies carry the HTTP exchange, which tells a network answer from a cached one.
   request.set_verbose_reply(true);
   request.mutable_search();
-  Outcome out;
-  out.queryId = queryId;
-  out.input = input;
-  std::promise<void> done;
+  // The callback owns what it fills in: it runs on the client's thread, and libtavix calls it
+  // exactly once, by the call's deadline at the latest.
+  auto done = std::make_shared<std::promise<Outcome>>();
+  auto future = done->get_future();
   const auto start = std::chrono::steady_clock::now();
-  client.request(request, [&](std::uint64_t id, std::optional<proto::TVXReply> reply, std::optional<client::Error> error) {
+  client.request(request, [done, start, input](std::uint64_t id, std::optional<proto::TVXReply> reply,
+                                               std::optional<client::Error> error) {
+    Outcome out;
+    out.input = input;
     out.ms = std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - start).count();
     out.queryId = id;
     out.error = std::move(error);
@@ -114,13 +127,9 @@ Outcome query(client::Client& client, std::uint64_t queryId, const std::string& 
       }
     }
     if (out.source.empty()) out.source = out.error ? "error" : "none";
-    done.set_value();
+    done->set_value(std::move(out));
   });
-  if (done.get_future().wait_for(std::chrono::seconds(30)) != std::future_status::ready) {
-    out.source = "error";
-    out.error = client::Error{client::kClientErrorDomain, client::kTimedOut, "no reply in 30 s"};
-  }
-  return out;
+  return future.get();
 }
 
 std::string jsonLine(const Outcome& o) {
@@ -244,17 +253,17 @@ int bagCommand(const std::string& socketPath, std::vector<std::string> args) {
   Identity identity;
   if (!takeIdentity(args, identity) || !args.empty()) return usageError("usage: bag [--client ID] [--agent UA]");
   client::Client client(optionsFor(socketPath, identity));
-  std::promise<int> done;
-  client.bag([&](std::optional<proto::TVXBagData> bag, std::optional<client::Error> error) {
+  auto done = std::make_shared<std::promise<int>>();
+  auto result = done->get_future();
+  client.bag([done](std::optional<proto::TVXBagData> bag, std::optional<client::Error> error) {
     if (error) std::fprintf(stderr, "tavix_tool: %s\n", error->describe().c_str());
     if (bag) {
-      auto parsed = json::parse(bag->json(), nullptr, false);
-      std::printf("%s\n", parsed.is_discarded() ? bag->json().c_str() : parsed.dump(2).c_str());
+      // Within the bounds, the document is shallow enough for the pretty printer's recursion.
+      const std::string& text = bag->json();
+      std::printf("%s\n", platform::isJsonWithinLimits(text) ? json::parse(text).dump(2).c_str() : text.c_str());
     }
-    done.set_value(bag ? 0 : 1);
+    done->set_value(bag ? 0 : 1);
   });
-  auto result = done.get_future();
-  if (result.wait_for(std::chrono::seconds(30)) != std::future_status::ready) return usageError("no bag in 30 s");
   return result.get();
 }
 

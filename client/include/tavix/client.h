@@ -3,7 +3,9 @@
 // A Client owns one connection to the daemon's socket. It connects lazily on the first call,
 // sends its session configuration first, and reconnects (configuring again) on the next call
 // after the daemon went away. Calls are asynchronous: each reply callback is called exactly once,
-// with the reply or with an error (domain "tavix.client" for transport failures). The blocking
+// with the reply or with an error (domain "tavix.client" for transport failures): when the
+// connection drops, every call pending on it fails with kConnectionLost, and a call that has no
+// reply by its deadline fails with kTimedOut (a reply that comes later is dropped). The blocking
 // helpers wait for that callback.
 //
 // Threading: every method is safe from any thread. Callbacks and handlers run on the client's
@@ -37,7 +39,7 @@ struct Error {
 enum ClientErrorCode : std::int64_t {
   kCannotConnect = 1,   // no daemon listening, or the socket refused us
   kConnectionLost = 2,  // the connection ended before the reply came
-  kTimedOut = 3,        // a blocking helper gave up waiting
+  kTimedOut = 3,        // no reply by the call's deadline
   kProtocol = 4,        // the daemon answered with something we did not ask for
   kClosed = 5,          // the client was destroyed
 };
@@ -51,7 +53,7 @@ class Client {
     std::string socketPath;  // empty: defaultSocketPath()
     proto::TVXSessionConfiguration configuration;
     bool reconnect = true;   // false: once the connection is lost every call fails
-    int timeoutMs = 10000;   // for the blocking helpers
+    int timeoutMs = 10000;   // each call's deadline, from when it is sent; 0: none
   };
 
   explicit Client(Options options);
@@ -84,7 +86,7 @@ class Client {
   // The flush command channel's endpoint: a connected socket (yours to close) or -1 with an error.
   void listenToFlusher(std::function<void(int fd, std::optional<Error>)> reply);
 
-  // Blocking helpers: the same calls, waiting up to the options' time-out.
+  // Blocking helpers: the same calls, waiting for their answer (at most their deadline).
   std::optional<Error> connect();  // connects and configures now
   std::optional<Error> notifySync(const std::string& eventName);
   std::optional<Error> runActivitySync(const std::string& name);

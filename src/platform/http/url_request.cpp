@@ -11,6 +11,20 @@ bool equalsIgnoringCase(std::string_view a, std::string_view b) {
          });
 }
 
+bool isValidHeaderValue(std::string_view value) {
+  return std::none_of(value.begin(), value.end(), [](char c) {
+    const auto u = static_cast<unsigned char>(c);
+    return (u < 0x20 && u != '\t') || u == 0x7f;
+  });
+}
+
+bool isValidHeaderName(std::string_view name) {
+  static constexpr std::string_view kTokenPunctuation = "!#$%&'*+-.^_`|~";
+  return !name.empty() && std::all_of(name.begin(), name.end(), [](char c) {
+    return std::isalnum(static_cast<unsigned char>(c)) || kTokenPunctuation.find(c) != std::string_view::npos;
+  });
+}
+
 void HeaderFields::set(std::string_view name, std::string value) {
   remove(name);
   fields_.emplace_back(std::string(name), std::move(value));

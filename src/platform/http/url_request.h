@@ -29,9 +29,18 @@ class HeaderFields {
 
 bool equalsIgnoringCase(std::string_view a, std::string_view b);
 
+// Whether `value` may stand as a header field's value: no control characters but the tab, so that
+// nothing can end the field early (CR LF) and smuggle in another. URL sessions refuse requests
+// that break this; components check strings that will become header values where they take them.
+bool isValidHeaderValue(std::string_view value);
+// Whether `name` is a header field name (an HTTP token).
+bool isValidHeaderName(std::string_view name);
+
 struct URLRequest {
   std::string url;  // absolute, already percent-encoded
   std::string method = "GET";
+  // An "Accept-Encoding" field names the content codings the response may use, and the session
+  // decodes those; without it the response may use none.
   HeaderFields headers;
   std::string body;
   double timeoutInterval = 60;  // seconds without progress before the task fails
@@ -66,6 +75,7 @@ enum URLErrorCode : long {
   URLErrorCannotConnectToHost = -1004,
   URLErrorNetworkConnectionLost = -1005,
   URLErrorBadServerResponse = -1011,
+  URLErrorDataLengthExceedsMaximum = -1103,
   URLErrorSecureConnectionFailed = -1200,
 };
 

@@ -2,8 +2,10 @@
 
 #include <curl/curl.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cctype>
+#include <cstdlib>
 #include <cstring>
 #include <deque>
 #include <map>
@@ -14,6 +16,7 @@
 #include "platform/clock.h"
 #include "platform/dispatch.h"
 #include "platform/http/response_cache.h"
+#include "platform/log.h"
 
 namespace tavix::platform::http {
 namespace {
@@ -46,6 +49,8 @@ long errorCodeFor(CURLcode result) {
     case CURLE_HTTP2:
     case CURLE_HTTP2_STREAM:
       return URLErrorNetworkConnectionLost;
+    case CURLE_FILESIZE_EXCEEDED:
+      return URLErrorDataLengthExceedsMaximum;
     case CURLE_WEIRD_SERVER_REPLY:
     case CURLE_BAD_CONTENT_ENCODING:
     case CURLE_TOO_MANY_REDIRECTS:
@@ -83,6 +88,27 @@ std::string protocolName(long version) {
   }
 }
 
+std::string lowercased(std::string_view text) {
+  std::string out(text);
+  for (char& c : out) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+  return out;
+}
+
+// The codings of an Accept-Encoding or Content-Encoding value, lower-case, without parameters.
+std::vector<std::string> codings(std::string_view value) {
+  std::vector<std::string> out;
+  while (!value.empty()) {
+    const auto comma = value.find(',');
+    std::string_view item = value.substr(0, comma);
+    value = comma == std::string_view::npos ? std::string_view{} : value.substr(comma + 1);
+    item = item.substr(0, item.find(';'));
+    while (!item.empty() && (item.front() == ' ' || item.front() == '\t')) item.remove_prefix(1);
+    while (!item.empty() && (item.back() == ' ' || item.back() == '\t')) item.remove_suffix(1);
+    if (!item.empty()) out.push_back(lowercased(item));
+  }
+  return out;
+}
+
 }  // namespace
 
 struct URLSessionDataTask::Impl {
@@ -104,6 +130,10 @@ struct URLSessionDataTask::Impl {
   CURL* easy = nullptr;
   curl_slist* headerList = nullptr;
   std::string body;
+  std::size_t maxBody = 0;  // 0: no limit
+  std::vector<std::string> acceptedEncodings;
+  long headStatus = 0;  // of the head being read
+  std::optional<URLError> refusal;  // why the session itself ended the transfer
   HeaderFields responseHeaders;
   Steady::time_point lastProgress;
   double idleTimeout = 0;
@@ -261,6 +291,11 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
 
   static size_t onBody(char* data, size_t size, size_t count, void* user) {
     auto* task = static_cast<TaskImpl*>(user);
+    if (task->maxBody > 0 && task->body.size() + size * count > task->maxBody) {
+      task->refusal = makeError(URLErrorDataLengthExceedsMaximum,
+                                "response body over the limit of " + std::to_string(task->maxBody) + " bytes");
+      return 0;  // ends the transfer
+    }
     task->body.append(data, size * count);
     task->lastProgress = Steady::now();
     return size * count;
@@ -274,10 +309,28 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
     if (line.starts_with("HTTP/")) {
       // A new head (after a redirect or an interim 1xx) replaces the one before.
       task->responseHeaders = HeaderFields{};
+      const auto blank = line.find(' ');
+      task->headStatus = blank == std::string_view::npos ? 0 : std::atol(std::string(line.substr(blank + 1, 3)).c_str());
     } else if (const auto colon = line.find(':'); colon != std::string_view::npos) {
       std::string_view value = line.substr(colon + 1);
       while (!value.empty() && (value.front() == ' ' || value.front() == '\t')) value.remove_prefix(1);
-      task->responseHeaders.add(std::string(line.substr(0, colon)), std::string(value));
+      const std::string_view name = line.substr(0, colon);
+      // Only the codings the request asked for are decoded; a body in any other (a small gzip
+      // stream that inflates to gigabytes, say) is refused before a byte of it is read.
+      const bool finalHead = task->headStatus >= 200 && (task->headStatus < 300 || task->headStatus >= 400);
+      if (finalHead && equalsIgnoringCase(name, "Content-Encoding")) {
+        for (const auto& coding : codings(value)) {
+          if (coding == "identity" ||
+              std::find(task->acceptedEncodings.begin(), task->acceptedEncodings.end(), coding) !=
+                  task->acceptedEncodings.end()) {
+            continue;
+          }
+          task->refusal = makeError(URLErrorBadServerResponse,
+                                    "response in Content-Encoding " + coding + ", which the request did not ask for");
+          return 0;
+        }
+      }
+      task->responseHeaders.add(std::string(name), std::string(value));
     }
     return size * count;
   }
@@ -293,6 +346,12 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
 
   void start(const std::shared_ptr<TaskImpl>& task) {
     if (task->finished) return;  // cancelled before it reached the wire
+    for (const auto& [name, value] : task->request.headers.all()) {
+      if (isValidHeaderName(name) && isValidHeaderValue(value)) continue;
+      // Sent as it stands, a CR LF in a value would end the field and begin one of the sender's.
+      refuse(task, makeError(URLErrorBadURL, "header field " + name + " carries a control character"));
+      return;
+    }
     CURL* easy = curl_easy_init();
     if (!easy) {
       deliver(task, {}, std::nullopt, makeError(URLErrorUnknown, "cannot create a transfer"));
@@ -309,8 +368,21 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
     curl_easy_setopt(easy, CURLOPT_MAXREDIRS, 10L);
     curl_easy_setopt(easy, CURLOPT_NOSIGNAL, 1L);
     curl_easy_setopt(easy, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_2TLS));
-    curl_easy_setopt(easy, CURLOPT_PIPEWAIT, config.multiplexing ? 1L : 0L);
-    curl_easy_setopt(easy, CURLOPT_ACCEPT_ENCODING, "");
+    // Waiting for a connection that may multiplex pays only where the TLS handshake (ALPN) says
+    // soon whether it will. Over plain HTTP it is said by the first response, so one slow or hung
+    // answer would hold every other request to its host.
+    const bool tls = request.url.size() >= 8 && equalsIgnoringCase(std::string_view(request.url).substr(0, 8), "https://");
+    curl_easy_setopt(easy, CURLOPT_PIPEWAIT, config.multiplexing && tls ? 1L : 0L);
+    if (auto asked = request.headers.get("Accept-Encoding"); asked && !asked->empty()) {
+      // curl sends the field from this option and decodes what it names.
+      curl_easy_setopt(easy, CURLOPT_ACCEPT_ENCODING, asked->c_str());
+      task->acceptedEncodings = codings(*asked);
+    }
+    task->maxBody = config.maximumResponseBodySize;
+    if (task->maxBody > 0) {
+      // A body announced larger than the limit is refused on its head alone.
+      curl_easy_setopt(easy, CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(task->maxBody));
+    }
     curl_easy_setopt(easy, CURLOPT_SSL_VERIFYPEER, 1L);
     curl_easy_setopt(easy, CURLOPT_SSL_VERIFYHOST, 2L);
     if (!config.trustedCertificatesFile.empty()) {
@@ -343,6 +415,7 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
     }
     for (const HeaderFields* fields : {&request.headers, static_cast<const HeaderFields*>(&task->conditionalHeaders)}) {
       for (const auto& [name, value] : fields->all()) {
+        if (equalsIgnoringCase(name, "Accept-Encoding")) continue;  // set above
         // "Name;" is curl's way to send a header with an empty value.
         const std::string line = value.empty() ? name + ";" : name + ": " + value;
         task->headerList = curl_slist_append(task->headerList, line.c_str());
@@ -363,9 +436,11 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
     if (task->idleTimeout > 0) {
       curl_easy_setopt(easy, CURLOPT_CONNECTTIMEOUT_MS, static_cast<long>(task->idleTimeout * 1000));
     }
-    if (config.timeoutIntervalForResource > 0) {
-      curl_easy_setopt(easy, CURLOPT_TIMEOUT_MS, static_cast<long>(config.timeoutIntervalForResource * 1000));
+    double total = config.timeoutIntervalForResource;
+    if (config.requestTimeoutIsDeadline && request.timeoutInterval > 0) {
+      total = total > 0 ? std::min(total, request.timeoutInterval) : request.timeoutInterval;
     }
+    if (total > 0) curl_easy_setopt(easy, CURLOPT_TIMEOUT_MS, std::max(1L, static_cast<long>(total * 1000)));
     task->lastProgress = Steady::now();
 
     if (curl_multi_add_handle(multi, easy) != CURLM_OK) {
@@ -374,6 +449,12 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
       return;
     }
     running.emplace(easy, task);
+  }
+
+  // Fails a task that the session will not send.
+  void refuse(const std::shared_ptr<TaskImpl>& task, URLError error) {
+    if (config.logger) config.logger->error("refused {}: {}", task->request.url, error.description);
+    deliver(task, {}, std::nullopt, std::move(error));
   }
 
   // Takes a cancelled task off the wire; its completion has been delivered already.
@@ -465,7 +546,14 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
     std::optional<URLError> error;
     long status = 0;
     curl_easy_getinfo(easy, CURLINFO_RESPONSE_CODE, &status);
-    if (result != CURLE_OK) {
+    if (result == CURLE_FILESIZE_EXCEEDED && !task->refusal) {
+      task->refusal = makeError(URLErrorDataLengthExceedsMaximum, "response body announced over the limit of " +
+                                                                       std::to_string(task->maxBody) + " bytes");
+    }
+    if (task->refusal) {
+      error = task->refusal;
+      if (config.logger) config.logger->error("cancelled {}: {}", task->request.url, error->description);
+    } else if (result != CURLE_OK) {
       const std::string text = task->errorBuffer[0] ? task->errorBuffer : curl_easy_strerror(result);
       error = makeError(errorCodeFor(result), text);
     } else if (status == 0) {

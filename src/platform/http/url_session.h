@@ -6,6 +6,10 @@
 // exactly once, on every path: success, HTTP error status (not an error here), transport failure,
 // timeout, cancel(), and the session's destruction (URLErrorCancelled).
 //
+// Hostile servers are bounded: a response body (counted after content decoding, which happens
+// only for the codings the request asked for) stops at the session's maximum, and an interactive
+// session holds each task to its request's time-out in all, not only between bytes.
+//
 // Threading: every method of URLSession and URLSessionDataTask is safe from any thread.
 //
 // Background sessions (resource downloads, feedback uploads) share this transport. Their
@@ -29,6 +33,7 @@
 namespace tavix::platform {
 class Clock;
 class DispatchPool;
+class Logger;
 class SerialQueue;
 }  // namespace tavix::platform
 
@@ -58,6 +63,18 @@ struct URLSessionConfiguration {
   double timeoutIntervalForRequest = 0;
   // Seconds a task may take in all; 0 for no limit.
   double timeoutIntervalForResource = 0;
+  // Interactive sessions (a client waits on each task): a request's timeoutInterval also bounds
+  // the whole task, so a server that trickles its answer a byte at a time ends in
+  // URLErrorTimedOut instead of holding the client.
+  bool requestTimeoutIsDeadline = false;
+
+  // Bytes of response body, after content decoding, that a task may receive; the task that passes
+  // them is cancelled there with URLErrorDataLengthExceedsMaximum. 0: no limit.
+  std::size_t maximumResponseBodySize = 0;
+
+  // Where the session logs what it refuses (bodies over the limit, unasked content codings,
+  // header values it will not send). Null: nowhere. Must outlive the session.
+  Logger* logger = nullptr;
 
   // Pool of the session's delegate queue. Null: the session makes a one-thread pool of its own.
   DispatchPool* delegatePool = nullptr;

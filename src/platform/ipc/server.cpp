@@ -34,8 +34,21 @@ constexpr std::size_t kMaxOutboxFrames = 4;
 // ---------------------------------------------------------------------------------------------
 
 struct IpcConnection::Impl {
-  Impl(DispatchPool& pool, int fd, std::size_t maxFrame)
-      : strand(asio::make_strand(asioContext(pool))), socket(strand, fd), decoder(maxFrame), maxFrame(maxFrame) {}
+  Impl(DispatchPool& pool, int fd, std::size_t maxFrame, std::size_t maxUnanswered)
+      : strand(asio::make_strand(asioContext(pool))),
+        socket(strand, fd),
+        decoder(maxFrame),
+        maxFrame(maxFrame),
+        calls(std::make_shared<Calls>(maxUnanswered)) {}
+
+  // The unanswered calls, shared with their holds, which may outlive the connection.
+  struct Calls {
+    explicit Calls(std::size_t max) : max(max) {}
+    const std::size_t max;
+    std::atomic<std::size_t> unanswered{0};
+    std::weak_ptr<IpcConnection> owner;
+  };
+  enum class Delivery { More, Paused, Failed };
 
   struct Outgoing {
     std::string bytes;
@@ -50,6 +63,8 @@ struct IpcConnection::Impl {
   std::deque<Outgoing> outbox;
   std::size_t outboxBytes = 0;
   bool writing = false;
+  std::shared_ptr<Calls> calls;
+  bool paused = false;  // not reading: too many calls unanswered
   // Set once by start(); cleared on the queue after the invalidation handler ran, which breaks
   // any reference cycle through the handlers.
   MessageHandler onMessage;
@@ -57,15 +72,19 @@ struct IpcConnection::Impl {
 
   static void armRead(const std::shared_ptr<IpcConnection>& self);
   static void onReadable(const std::shared_ptr<IpcConnection>& self);
+  static Delivery deliverFrames(const std::shared_ptr<IpcConnection>& self);
+  static void release(const std::shared_ptr<Calls>& calls);
+  static void resume(const std::shared_ptr<IpcConnection>& self);
   static void flush(const std::shared_ptr<IpcConnection>& self);
   static void close(const std::shared_ptr<IpcConnection>& self);
 };
 
 std::shared_ptr<IpcConnection> IpcConnection::make(DispatchPool& pool, UniqueFd fd, PeerCredentials peer,
                                                    std::string queueLabel, Logger& logger,
-                                                   std::size_t maxFrameSize) {
+                                                   std::size_t maxFrameSize, std::size_t maxUnansweredCalls) {
   std::shared_ptr<IpcConnection> c(new IpcConnection(pool, peer, std::move(queueLabel), logger));
-  c->impl_ = std::make_unique<Impl>(pool, fd.release(), maxFrameSize);
+  c->impl_ = std::make_unique<Impl>(pool, fd.release(), maxFrameSize, std::max<std::size_t>(1, maxUnansweredCalls));
+  c->impl_->calls->owner = c;
   asio::error_code ignored;
   c->impl_->socket.non_blocking(true, ignored);
   return c;
@@ -122,24 +141,64 @@ void IpcConnection::Impl::onReadable(const std::shared_ptr<IpcConnection>& self)
       return;
     }
     impl.decoder.append(buffer.data(), n);
-    while (auto payload = impl.decoder.next()) {
-      self->queue_.async([self, p = std::move(*payload)]() mutable {
-        if (self->impl_->onMessage) self->impl_->onMessage(std::move(p));
-      });
-    }
-    if (impl.decoder.failed()) {
-      self->logger_.error("closing connection from pid {}: frame of {} bytes is over the limit of {}",
-                          self->peer_.pid, impl.decoder.rejectedLength(), impl.maxFrame);
-      close(self);
-      return;
-    }
+    // Paused, the read is not armed again: the peer's further bytes wait in its socket until a
+    // call is answered.
+    if (deliverFrames(self) != Delivery::More) return;
     if (n < buffer.size()) break;  // drained for now
   }
   armRead(self);
 }
 
+IpcConnection::Impl::Delivery IpcConnection::Impl::deliverFrames(const std::shared_ptr<IpcConnection>& self) {
+  Impl& impl = *self->impl_;
+  while (impl.calls->unanswered.load() < impl.calls->max) {
+    auto payload = impl.decoder.next();
+    if (!payload) {
+      if (!impl.decoder.failed()) return Delivery::More;
+      self->logger_.error("closing connection from pid {}: frame of {} bytes is over the limit of {}",
+                          self->peer_.pid, impl.decoder.rejectedLength(), impl.maxFrame);
+      close(self);
+      return Delivery::Failed;
+    }
+    impl.calls->unanswered.fetch_add(1);
+    CallHold hold(impl.calls.get(), [calls = impl.calls](void*) { release(calls); });
+    self->queue_.async([self, hold = std::move(hold), p = std::move(*payload)]() mutable {
+      self->currentCall_ = std::move(hold);
+      if (self->impl_->onMessage) self->impl_->onMessage(std::move(p));
+      self->currentCall_.reset();
+    });
+  }
+  if (!impl.paused) {
+    impl.paused = true;
+    self->logger_.debug("not reading from pid {}: {} calls unanswered", self->peer_.pid, impl.calls->max);
+  }
+  return Delivery::Paused;
+}
+
+void IpcConnection::Impl::release(const std::shared_ptr<Calls>& calls) {
+  // Only the release that brings the count back under the limit can find the reader paused.
+  if (calls->unanswered.fetch_sub(1) != calls->max) return;
+  if (auto self = calls->owner.lock()) asio::post(self->impl_->strand, [self] { resume(self); });
+}
+
+void IpcConnection::Impl::resume(const std::shared_ptr<IpcConnection>& self) {
+  Impl& impl = *self->impl_;
+  if (!impl.paused || self->closed_) return;
+  impl.paused = false;
+  if (deliverFrames(self) == Delivery::More) armRead(self);
+}
+
+IpcConnection::CallHold IpcConnection::holdCurrentCall() { return currentCall_; }
+
+std::size_t IpcConnection::maxFrameSize() const { return impl_->maxFrame; }
+
 bool IpcConnection::send(std::string payload, std::vector<UniqueFd> fds) {
-  if (closed_ || payload.size() > impl_->maxFrame) return false;
+  if (closed_) return false;
+  if (payload.size() > impl_->maxFrame) {
+    logger_.error("not sending {} bytes to pid {}: over the frame limit of {}", payload.size(), peer_.pid,
+                  impl_->maxFrame);
+    return false;
+  }
   auto self = shared_from_this();
   asio::post(impl_->strand, [self, bytes = encodeFrame(payload), fds = std::move(fds)]() mutable {
     if (self->closed_) return;
