@@ -220,7 +220,10 @@ TEST_F(QueriesTest, LookupsAndZeroKeywordRecordWhatTheyAskedFor) {
   EXPECT_EQ(starts[0].payload().network_search_start().input(), "serendipity");
   EXPECT_EQ(starts[0].payload().network_search_start().trigger_event(), 11);
   EXPECT_EQ(starts[0].payload().network_search_start().endpoint_type(), 6);
+  EXPECT_EQ(starts[0].payload().network_search_start().lookup_selection_type(),
+            proto::LookupSelectionType::lookup_explicit);
   EXPECT_EQ(starts[1].payload().network_search_start().input(), "");
+  EXPECT_FALSE(starts[1].payload().network_search_start().has_lookup_selection_type());
   EXPECT_EQ(starts[1].payload().network_search_start().trigger_event(), 9);
   const auto sent = received("/search");
   ASSERT_EQ(sent.size(), 2u);
