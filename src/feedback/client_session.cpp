@@ -61,6 +61,7 @@ ClientSession::ClientSession(Assembly& assembly)
 FeedbackRef makeDaemonErrorFeedback(std::int64_t code, const std::string& domain, const std::string& reason,
                                     Assembly& assembly) {
   proto::CTErrorFeedback error;
+  error.set_timestamp(hostTicksNow(assembly.clock));
   error.set_code(static_cast<std::int32_t>(code));
   error.set_domain(domain);
   error.set_reason(reason);
@@ -142,6 +143,7 @@ void ClientSession::addFeedback(const FeedbackRef& feedback) {
   if (handle) handle->writeFeedback(*feedback);
   if (backingStore_.has_user_guid_string() && feedback->user_guid() != backingStore_.user_guid_string()) {
     proto::CTErrorFeedback error;
+    error.set_timestamp(hostTicksNow(assembly_.clock));
     error.set_domain(kTVXErrorDomain);
     error.set_code(500);
     error.set_reason("different guid in session");

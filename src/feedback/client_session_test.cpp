@@ -115,6 +115,21 @@ TEST(ClientSession, UploadRecordIsPrivacyFilteredWithMissingObjectsFirst) {
   EXPECT_EQ(upload.dump().find("device-result-7"), std::string::npos);
 }
 
+TEST(ClientSession, EventsWithoutTimeStampsAllSitAtZero) {
+  SessionFixture f;
+  auto appear = [](proto::AppearEvent::Value how) {
+    proto::CTSearchViewAppearFeedback record;
+    record.set_trigger_event(how);
+    return makeTavixFeedbackWithCodable(record, 0, kGuid, "news/1");
+  };
+  auto session = ClientSession::open(f.assembly, appear(proto::AppearEvent::swipe_down));
+  session->addFeedback(appear(proto::AppearEvent::orb));
+  session->addFeedback(appear(proto::AppearEvent::back));
+  auto upload = nlohmann::json::parse(ClientSession::fromRecord(f.assembly, f.readBack(*session))->getFeedbacksToSend());
+  ASSERT_EQ(upload["fb"].size(), 3u);
+  for (const auto& event : upload["fb"]) EXPECT_EQ(event["timestamp"], 0) << event;
+}
+
 TEST(ClientSession, BaseTimeIsTheTruncatedStartOrNothingForADamagedOne) {
   SessionFixture f;
   auto baseTime = [&](double start) {

@@ -9,6 +9,7 @@
 #include "core/diagnostics.h"
 #include "feedback/feedback_json.h"
 #include "feedback/vocabulary.h"
+#include "platform/clock.h"
 
 namespace tavix {
 
@@ -56,6 +57,12 @@ FeedbackRef makeTavixFeedbackWithCodable(const Message& codable, std::int64_t qu
     payload.GetReflection()->MutableMessage(&payload, field)->CopyFrom(codable);
   }
   return makeTavixFeedback(std::move(payload), queryId, userGuid, userAgent);
+}
+
+std::uint64_t hostTicksNow(const platform::Clock* clock) {
+  if (!clock) return 0;
+  const double seconds = platform::toUnixSeconds(clock->now());
+  return seconds > 0 ? static_cast<std::uint64_t>(seconds * 1e9) : 0;
 }
 
 int feedbackType(const proto::CTTavixFeedback& feedback) { return feedback.payload().type(); }
