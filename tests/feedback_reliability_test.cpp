@@ -106,7 +106,7 @@ Verdict checkFolder(const platform::fs::path& folder, platform::SerialQueue& que
   for (const auto& entry : platform::fs::directory_iterator(folder)) {
     const std::string name = entry.path().filename().string();
     if (name.rfind("session.", 0) != 0) continue;
-    FileContainer container(entry.path(), tavixdUserAgent(), queue, kMaxFileSize);
+    FileContainer container(entry.path(), tavixdSessionFileVersion(), queue, kMaxFileSize);
     auto record = container.readRecord();
     if (!record) {
       ++v.discarded;
@@ -115,7 +115,7 @@ Verdict checkFolder(const platform::fs::path& folder, platform::SerialQueue& que
     ++v.accepted;
     if (platform::fs::file_size(entry.path()) > record->ByteSizeLong()) ++v.cutShort;
     EXPECT_TRUE(known(record->agent())) << name << " header agent '" << record->agent() << "'";
-    EXPECT_EQ(record->version(), tavixdUserAgent()) << name;
+    EXPECT_EQ(record->version(), tavixdSessionFileVersion()) << name;
     for (const auto& f : record->feedbacks()) {
       ++v.events;
       EXPECT_TRUE(known(f.user_agent())) << name << " event agent '" << f.user_agent() << "'";
@@ -178,11 +178,11 @@ TEST(FeedbackReliability, SessionFilesSurviveAKillAtAnyPoint) {
       auto it = reported.begin();
       std::advance(it, std::uniform_int_distribution<std::size_t>(0, reported.size() - 1)(random));
       const platform::fs::path victim = it->second;
-      auto before = FileContainer(victim, tavixdUserAgent(), queue, kMaxFileSize).readRecord();
+      auto before = FileContainer(victim, tavixdSessionFileVersion(), queue, kMaxFileSize).readRecord();
       const auto size = platform::fs::file_size(victim);
       if (before && size > 0) {
         platform::fs::resize_file(victim, std::uniform_int_distribution<std::uintmax_t>(0, size - 1)(random));
-        auto after = FileContainer(victim, tavixdUserAgent(), queue, kMaxFileSize).readRecord();
+        auto after = FileContainer(victim, tavixdSessionFileVersion(), queue, kMaxFileSize).readRecord();
         if (after) {
           EXPECT_LE(after->feedbacks_size(), before->feedbacks_size());
           for (int i = 0; i < after->feedbacks_size(); ++i) {

@@ -55,7 +55,7 @@ std::optional<std::string> firstUseKeyForAgent(std::string_view agent) {
 ClientSession::ClientSession(Assembly& assembly)
     : assembly_(assembly), sessionQueue_(*assembly.dispatchPool, "com.norvel.tavixd.clientSessionQueue") {
   backingStore_.set_session_start(platform::toUnixSeconds(assembly.clock->now()));
-  backingStore_.set_version(tavixdUserAgent());
+  backingStore_.set_version(tavixdSessionFileVersion());
 }
 
 FeedbackRef makeDaemonErrorFeedback(std::int64_t code, const std::string& domain, const std::string& reason,

@@ -33,7 +33,7 @@ FeedbackRef makeDaemonErrorFeedback(std::int64_t code, const std::string& domain
 
 class ClientSession {
  public:
-  // A bare session: sessionStart = now, version = the daemon's user agent. Used for read-back.
+  // A bare session: sessionStart = now, version = tavixdSessionFileVersion(). Used for read-back.
   explicit ClientSession(Assembly& assembly);
   ClientSession(const ClientSession&) = delete;
   ClientSession& operator=(const ClientSession&) = delete;

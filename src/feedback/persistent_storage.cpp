@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <fmt/format.h>
 #include <google/protobuf/io/coded_stream.h>
 #include <google/protobuf/wire_format_lite.h>
 
@@ -114,6 +115,16 @@ std::optional<platform::TimePoint> creationDate(const fs::path& path, std::strin
 }
 
 }  // namespace
+
+std::string sessionFileVersion(const DeviceInformation& device) {
+  return fmt::format("{} ({}; {} {}) {}", kTVXTavixdNameVersion, device.answer("ProductType"),
+                     device.answer("ProductName"), device.answer("ProductVersion"), kTVXTavixdNameVersion);
+}
+
+const std::string& tavixdSessionFileVersion() {
+  static const std::string version = sessionFileVersion(DeviceInformation(nullptr));
+  return version;
+}
 
 // ---- FileContainer --------------------------------------------------------------------------
 
@@ -305,7 +316,7 @@ TavixPersistentStorage::TavixPersistentStorage(Assembly& assembly)
     : assembly_(assembly),
       queue_(*assembly.dispatchPool, "com.norvel.tavixd.persistentStorageQueue"),
       cachesUrl_(assembly.cachesFolder()),
-      version_(tavixdUserAgent()),
+      version_(tavixdSessionFileVersion()),
       maxFileSize_(static_cast<std::uint64_t>(assembly.userDefaults->integerForKey("TVXSessionSizeLimit"))),
       maxFileAge_(assembly.userDefaults->integerForKey("TVXSessionMaxAge")) {
   scanDirectory();
@@ -351,7 +362,7 @@ void TavixPersistentStorage::scanDirectory() {
     const auto parsed = std::from_chars(digits.data(), digits.data() + digits.size(), number);
     const bool numeric = !digits.empty() && parsed.ec == std::errc() && parsed.ptr == digits.data() + digits.size();
     fileContainers_.push_back(std::make_shared<FileContainer>(
-        url, version_.empty() ? tavixdUserAgent() : version_, queue_, maxFileSize_, assembly_.transactions));
+        url, version_.empty() ? tavixdSessionFileVersion() : version_, queue_, maxFileSize_, assembly_.transactions));
     if (numeric && number > largest && number < INT32_MAX) largest = number;
   }
   if (largest >= 0) {

@@ -33,6 +33,16 @@ namespace platform {
 class TransactionTracker;
 }
 
+class DeviceInformation;
+
+// What a session file carries as its version: the daemon's name and version and the device text
+// of its user agent without the kernel release, "<daemon> (<ProductType>; <ProductName>
+// <ProductVersion>) <daemon>". A kernel update keeps the files waiting to be sent; a daemon
+// upgrade (or a new OS release) discards them, since their records may differ.
+std::string sessionFileVersion(const DeviceInformation& device);
+// sessionFileVersion() of this machine, made once.
+const std::string& tavixdSessionFileVersion();
+
 // One session file. Shared (shared_ptr) by the session that writes it and the storage's list.
 class FileContainer : public std::enable_shared_from_this<FileContainer> {
  public:
@@ -105,7 +115,8 @@ class TavixPersistentStorage {
   // Asynchronously unlists the container, closes it and deletes its file.
   void deleteSessionWithFileContainer(std::shared_ptr<FileContainer> container);
 
-  // The version new and scanned containers must carry (default: tavixdUserAgent()). Any thread.
+  // The version new and scanned containers must carry (default: tavixdSessionFileVersion()).
+  // Any thread.
   std::string version();
   void setVersion(std::string version);
   platform::SerialQueue& queue() { return queue_; }

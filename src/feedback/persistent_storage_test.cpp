@@ -86,7 +86,23 @@ TEST(TavixPersistentStorage, ScanListsSessionsAndNumbersNewFilesAfterTheLargest)
   ASSERT_EQ(::stat(container->fileUrl().c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0600u);
   EXPECT_EQ(storage.createFileContainerForWriting()->fileUrl().filename(), "session.14");
-  EXPECT_EQ(storage.version(), tavixdUserAgent());
+  EXPECT_EQ(storage.version(), tavixdSessionFileVersion());
+}
+
+TEST(TavixPersistentStorage, AKernelUpdateKeepsTheFileVersionANewReleaseChangesIt) {
+  testing::TempHome root;
+  auto write = [&](const char* path, const std::string& text) {
+    fs::create_directories((root.root() / path).parent_path());
+    std::ofstream(root.root() / path) << text;
+  };
+  write("etc/os-release", "NAME=\"Debian GNU/Linux\"\nVERSION_ID=\"12\"\n");
+  write("proc/sys/kernel/osrelease", "6.1.0-27-amd64\n");
+  const std::string before = sessionFileVersion(DeviceInformation(nullptr, root.root()));
+  EXPECT_EQ(before.find("6.1.0"), std::string::npos) << before;
+  write("proc/sys/kernel/osrelease", "6.1.0-28-amd64\n");
+  EXPECT_EQ(sessionFileVersion(DeviceInformation(nullptr, root.root())), before);
+  write("etc/os-release", "NAME=\"Debian GNU/Linux\"\nVERSION_ID=\"13\"\n");
+  EXPECT_NE(sessionFileVersion(DeviceInformation(nullptr, root.root())), before);
 }
 
 TEST(TavixPersistentStorage, FilesPastTheAgeLimitAreDeletedAtStart) {
@@ -154,7 +170,7 @@ TEST(FileContainer, CutOffOrEmptyFilesKeepOnlyWhatIsWhole) {
 }
 
 TEST(FileContainer, SizeLimitRefusesReachingItButReadsAFileOfExactlyIt) {
-  const auto head = header(tavixdUserAgent());
+  const auto head = header(tavixdSessionFileVersion());
   const auto one = event(1);
   const std::uint64_t limit = head.ByteSizeLong() + encodedSize(*one);
 
