@@ -58,15 +58,23 @@ ClientSession::ClientSession(Assembly& assembly)
   backingStore_.set_version(tavixdSessionFileVersion());
 }
 
+FeedbackRef makeDaemonErrorFeedback(proto::CTErrorFeedback error, Assembly& assembly) {
+  error.set_timestamp(hostTicksNow(assembly.clock));
+  const std::string guid = assembly.guidController ? assembly.guidController->currentUserGUID() : std::string();
+  return makeTavixFeedbackWithCodable(error, 0, guid, tavixdUserAgent());
+}
+
 FeedbackRef makeDaemonErrorFeedback(std::int64_t code, const std::string& domain, const std::string& reason,
                                     Assembly& assembly) {
   proto::CTErrorFeedback error;
-  error.set_timestamp(hostTicksNow(assembly.clock));
   error.set_code(static_cast<std::int32_t>(code));
   error.set_domain(domain);
   error.set_reason(reason);
-  const std::string guid = assembly.guidController ? assembly.guidController->currentUserGUID() : std::string();
-  return makeTavixFeedbackWithCodable(error, 0, guid, tavixdUserAgent());
+  return makeDaemonErrorFeedback(std::move(error), assembly);
+}
+
+void ClientSession::createFeedbackSessionFromError(proto::CTErrorFeedback error, Assembly& assembly) {
+  if (auto session = open(assembly, makeDaemonErrorFeedback(std::move(error), assembly))) session->sessionComplete();
 }
 
 void ClientSession::createFeedbackSessionFromError(std::int64_t code, const std::string& domain,

@@ -27,7 +27,9 @@ class FileContainer;
 // vocly that the lower-cased agent contains; none otherwise.
 std::optional<std::string> firstUseKeyForAgent(std::string_view agent);
 
-// An error event of the daemon itself: query id 0, the current GUID, the daemon's user agent.
+// An error event of the daemon itself: query id 0, the current GUID, the daemon's user agent,
+// stamped now.
+FeedbackRef makeDaemonErrorFeedback(proto::CTErrorFeedback error, Assembly& assembly);
 FeedbackRef makeDaemonErrorFeedback(std::int64_t code, const std::string& domain, const std::string& reason,
                                     Assembly& assembly);
 
@@ -46,6 +48,7 @@ class ClientSession {
   // is reported.
   static void createFeedbackSessionFromError(std::int64_t code, const std::string& domain, const std::string& reason,
                                              Assembly& assembly);
+  static void createFeedbackSessionFromError(proto::CTErrorFeedback error, Assembly& assembly);
   // A session read back from a file.
   static std::shared_ptr<ClientSession> fromRecord(Assembly& assembly, proto::CTClientSession record);
 
@@ -73,6 +76,8 @@ class ClientSession {
   int previousSessionEndReason() const;
   const proto::CTClientSession& backingStore() const { return backingStore_; }
   std::shared_ptr<FileContainer> storageHandle() const { return std::atomic_load(&storageHandle_); }
+  // The file a session read back for sending came from.
+  void setStorageHandle(std::shared_ptr<FileContainer> handle) { std::atomic_store(&storageHandle_, std::move(handle)); }
 
  private:
   void recordFirstUse(platform::TimePoint time);

@@ -10,6 +10,7 @@
 #include <google/protobuf/wire_format_lite.h>
 
 #include <cerrno>
+#include <algorithm>
 #include <charconv>
 #include <cstring>
 
@@ -30,6 +31,8 @@ using google::protobuf::internal::WireFormatLite;
 namespace {
 
 constexpr const char* kSessionPrefix = "session.";
+// A session a flush has taken, until it is safely on its way: not a waiting session any more.
+constexpr const char* kClaimedPrefix = "claimed.";
 constexpr int kFeedbacksFieldNumber = 100;
 
 platform::Logger& log() { return TavixLogForCategory(TavixLoggingCategoryFeedbackStorage); }
@@ -126,19 +129,31 @@ const std::string& tavixdSessionFileVersion() {
   return version;
 }
 
+long SessionFileIO::write(int fd, const void* data, std::size_t size) { return ::write(fd, data, size); }
+int SessionFileIO::truncate(int fd, std::int64_t length) { return ::ftruncate(fd, static_cast<off_t>(length)); }
+int SessionFileIO::sync(int fd) { return ::fdatasync(fd); }
+
+SessionFileIO& SessionFileIO::system() {
+  static SessionFileIO io;
+  return io;
+}
+
 // ---- FileContainer --------------------------------------------------------------------------
 
 FileContainer::FileContainer(fs::path fileUrl, std::string version, platform::SerialQueue& queue,
-                             std::uint64_t maxFileSize, platform::TransactionTracker* transactions)
+                             std::uint64_t maxFileSize, platform::TransactionTracker* transactions,
+                             SessionFileIO* io)
     : fileUrl_(std::move(fileUrl)),
       version_(std::move(version)),
       queue_(queue),
       maxFileSize_(maxFileSize),
-      transactions_(transactions) {}
+      transactions_(transactions),
+      io_(io ? io : &SessionFileIO::system()) {}
 
 FileContainer::FileContainer(int fd, fs::path fileUrl, std::string version, platform::SerialQueue& queue,
-                             std::uint64_t maxFileSize, platform::TransactionTracker* transactions)
-    : FileContainer(std::move(fileUrl), std::move(version), queue, maxFileSize, transactions) {
+                             std::uint64_t maxFileSize, platform::TransactionTracker* transactions,
+                             SessionFileIO* io)
+    : FileContainer(std::move(fileUrl), std::move(version), queue, maxFileSize, transactions, io) {
   fd_ = fd;
 }
 
@@ -157,12 +172,12 @@ void FileContainer::writeSessionHeader(const proto::CTClientSession& header) {
   });
 }
 
-void FileContainer::writeFeedback(const proto::CTTavixFeedback& feedback, std::function<void()> done) {
+void FileContainer::writeFeedback(const proto::CTTavixFeedback& feedback, std::function<void(bool)> done) {
   std::string data = encodeFeedbackField(feedback);
   queue_.async([self = shared_from_this(), data = std::move(data), done = std::move(done)] {
     if (self->fd_ < 0) return;
-    self->appendData(data);
-    if (done) done();
+    const bool written = self->appendData(data);
+    if (done) done(written);
   });
 }
 
@@ -184,10 +199,20 @@ bool FileContainer::appendData(const std::string& data) {
   }
   std::size_t written = 0;
   while (written < data.size()) {
-    const ssize_t n = ::write(fd_, data.data() + written, data.size() - written);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      log().error("{}", errnoText(errno));
+    const long n = io_->write(fd_, data.data() + written, data.size() - written);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) {
+      // Disk full or an I/O error: whatever part of the record went out is cut off again, so the
+      // file ends on a whole record and the next event is not lost behind a broken one.
+      const std::string why = n < 0 ? errnoText(errno) : std::string("nothing written");
+      if (io_->truncate(fd_, offset) == 0) {
+        log().error("Could not append {} bytes to {}: {}; cut back to {} bytes", data.size(), fileUrl_.string(), why,
+                    static_cast<std::int64_t>(offset));
+      } else {
+        log().error("Could not append {} bytes to {}: {}; nor cut it back ({}), closing it", data.size(),
+                    fileUrl_.string(), why, errnoText(errno));
+        closeNow();
+      }
       return false;
     }
     written += static_cast<std::size_t>(n);
@@ -205,6 +230,11 @@ void FileContainer::close() {
 void FileContainer::closeNow() {
   if (fd_ >= 0) ::close(fd_);
   fd_ = -1;
+}
+
+void FileContainer::syncAndCloseNow() {
+  if (fd_ >= 0 && io_->sync(fd_) != 0) log().error("could not sync {}: {}", fileUrl_.string(), errnoText(errno));
+  closeNow();
 }
 
 bool FileContainer::isOpen() {
@@ -312,8 +342,9 @@ std::optional<proto::CTClientSession> FileContainer::unarchiveObject() {
 
 // ---- TavixPersistentStorage -----------------------------------------------------------------
 
-TavixPersistentStorage::TavixPersistentStorage(Assembly& assembly)
+TavixPersistentStorage::TavixPersistentStorage(Assembly& assembly, std::shared_ptr<SessionFileIO> io)
     : assembly_(assembly),
+      io_(std::move(io)),
       queue_(*assembly.dispatchPool, "com.norvel.tavixd.persistentStorageQueue"),
       cachesUrl_(assembly.cachesFolder()),
       version_(tavixdSessionFileVersion()),
@@ -337,6 +368,19 @@ void TavixPersistentStorage::scanDirectory() {
     if (ec != std::errc::no_such_file_or_directory) log().error("error scanning cache directory {}", ec.message());
     return;
   }
+  // A flush that stopped half-way left its claimed sessions: they wait again. Sent or not, they
+  // go out once more; the server knows a repeat by its digest.
+  std::vector<fs::path> claimed;
+  for (const auto& entry : it) {
+    if (entry.path().filename().string().rfind(std::string(kClaimedPrefix) + kSessionPrefix, 0) == 0) {
+      claimed.push_back(entry.path());
+    }
+  }
+  for (const auto& path : claimed) {
+    const fs::path waiting = path.parent_path() / path.filename().string().substr(std::strlen(kClaimedPrefix));
+    if (::rename(path.c_str(), waiting.c_str()) != 0) log().error("file renaming error {}", errnoText(errno));
+  }
+  it = fs::directory_iterator(cachesUrl_, ec);
   const platform::TimePoint now = assembly_.clock->now();
   std::int64_t largest = -1;
   for (const auto& entry : it) {
@@ -361,8 +405,7 @@ void TavixPersistentStorage::scanDirectory() {
     std::int64_t number = 0;
     const auto parsed = std::from_chars(digits.data(), digits.data() + digits.size(), number);
     const bool numeric = !digits.empty() && parsed.ec == std::errc() && parsed.ptr == digits.data() + digits.size();
-    fileContainers_.push_back(std::make_shared<FileContainer>(
-        url, version_.empty() ? tavixdSessionFileVersion() : version_, queue_, maxFileSize_, assembly_.transactions));
+    fileContainers_.push_back(makeContainer(url));
     if (numeric && number > largest && number < INT32_MAX) largest = number;
   }
   if (largest >= 0) {
@@ -382,15 +425,64 @@ std::shared_ptr<FileContainer> TavixPersistentStorage::createFileContainerForWri
   }
   ::fchmod(fd, 0600);  // the umask must not widen or narrow it
   log().debug("new file url {}", url.string());
-  return std::make_shared<FileContainer>(fd, url, version(), queue_, maxFileSize_, assembly_.transactions);
+  return std::make_shared<FileContainer>(fd, url, version(), queue_, maxFileSize_, assembly_.transactions, io_.get());
+}
+
+std::shared_ptr<FileContainer> TavixPersistentStorage::makeContainer(fs::path url) {
+  const std::string v = version();
+  return std::make_shared<FileContainer>(std::move(url), v.empty() ? tavixdSessionFileVersion() : v, queue_,
+                                         maxFileSize_, assembly_.transactions, io_.get());
+}
+
+void TavixPersistentStorage::syncDirectory() {
+  const int dir = ::open(cachesUrl_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  if (dir < 0 || ::fsync(dir) != 0) log().error("could not sync {}: {}", cachesUrl_.string(), errnoText(errno));
+  if (dir >= 0) ::close(dir);
 }
 
 void TavixPersistentStorage::closeSessionWithFileContainer(std::shared_ptr<FileContainer> container) {
   if (!container) return;
   queue_.async([this, container] {
-    fileContainers_.push_back(container);
     log().debug("close file url {}", container->fileUrl().string());
+    // Durable before it counts as closed: the file's data, and its name in the folder.
+    container->syncAndCloseNow();
+    syncDirectory();
+    fileContainers_.push_back(container);
+  });
+}
+
+std::shared_ptr<FileContainer> TavixPersistentStorage::claimSessionWithFileContainer(
+    const std::shared_ptr<FileContainer>& container) {
+  std::shared_ptr<FileContainer> claimed;
+  if (!container) return claimed;
+  queue_.sync([&] {
+    const auto it = std::find(fileContainers_.begin(), fileContainers_.end(), container);
+    if (it == fileContainers_.end()) return;  // taken by another flush, or deleted
+    const fs::path& from = container->fileUrl();
+    const fs::path to = from.parent_path() / (kClaimedPrefix + from.filename().string());
+    if (::rename(from.c_str(), to.c_str()) != 0) {
+      log().error("could not claim {}: {}", from.string(), errnoText(errno));
+      return;
+    }
+    fileContainers_.erase(it);
     container->closeNow();
+    claimed = makeContainer(to);
+  });
+  return claimed;
+}
+
+void TavixPersistentStorage::unclaimSessionWithFileContainer(std::shared_ptr<FileContainer> claimed) {
+  if (!claimed) return;
+  queue_.async([this, claimed] {
+    const fs::path& from = claimed->fileUrl();
+    const std::string name = from.filename().string();
+    if (name.rfind(kClaimedPrefix, 0) != 0) return;
+    const fs::path to = from.parent_path() / name.substr(std::strlen(kClaimedPrefix));
+    if (::rename(from.c_str(), to.c_str()) != 0) {
+      log().error("could not give back {}: {}", from.string(), errnoText(errno));
+      return;
+    }
+    fileContainers_.push_back(makeContainer(to));
   });
 }
 
