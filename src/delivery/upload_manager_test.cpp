@@ -191,20 +191,27 @@ TEST_F(UploadManagerTest, UploadsReachTheServerCompressedWithTheirDigestAndAreCo
   file.reset();
   EXPECT_FALSE(platform::fs::exists(temporary));
 
+  // The same body again (a session sent once more after a crash): the server answers it as
+  // accepted, keeps it once and counts the repeat.
+  manager->uploadJSONFeedback(record.dump(), kFeedbackEndpoint);
+  ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sentBefore + 14; }));
+  EXPECT_EQ(received().size(), 1u);
+  httplib::Client control("127.0.0.1", server.port());
+  EXPECT_EQ(json::parse(control.Get("/_feedback_repeats")->body)["repeats"], 1);
+
   // A file upload carries its type, goes out in one piece and counts as one.
   const auto item = home.root() / "autofill.bin";
   std::string content(50000, 'x');
   for (std::size_t i = 0; i < content.size(); i += 7) content[i] = static_cast<char>(i * 31);
   std::ofstream(item, std::ios::binary) << content;
   manager->uploadFeedback(item, "BrovaneAutoFill", kFeedbackEndpoint);
-  ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sentBefore + 8; }));
+  ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sentBefore + 15; }));
   got = received();
   ASSERT_EQ(got.size(), 2u);
   EXPECT_EQ(got[1]["type"], "BrovaneAutoFill");
   EXPECT_EQ(got[1]["size"], content.size());
 
   // The crowdsourcing endpoint takes no "v"; a server error is counted and not retried.
-  httplib::Client control("127.0.0.1", server.port());
   control.Post("/_faults", R"({"path": "/crowdsourcing", "status": 500, "times": 1})", "application/json");
   manager->uploadFeedback(item, "", kCrowdsourcingEndpoint);
   ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacknotsent") == notSentBefore + 1; }));
