@@ -11,6 +11,7 @@
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "core/names.h"
+#include "core/resource_versions.h"
 #include "feedback/cba_filter.h"
 #include "feedback/feedback_json.h"
 #include "feedback/persistent_storage.h"
@@ -109,8 +110,11 @@ std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackR
       session->recordFirstUse(now);
     }
   }
-  // The download manager supplies resource versions; until it is in the graph there are none.
-  store.clear_resource_versions();
+  if (assembly.resourceVersions) {
+    for (auto& [name, version] : assembly.resourceVersions->resourceVersions()) {
+      (*store.mutable_resource_versions())[name] = version;
+    }
+  }
 
   if (assembly.persistentStorage) {
     auto handle = assembly.persistentStorage->createFileContainerForWriting();

@@ -8,6 +8,7 @@
 
 #include "core/assembly.h"
 #include "core/diagnostics.h"
+#include "core/resource_versions.h"
 #include "feedback/persistent_storage.h"
 #include "platform/counters.h"
 #include "platform/defaults.h"
@@ -88,8 +89,13 @@ TEST(ClientSession, EventsReachTheFileAndAForeignGuidIsFlagged) {
   EXPECT_EQ(record.previous_session_end_reason(), 3);
 }
 
+struct FixedResourceVersions : ResourceVersionsProvider {
+  std::map<std::string, std::string> resourceVersions() const override { return {{"lookup_hints", "7"}}; }
+};
+
 TEST(ClientSession, UploadRecordIsPrivacyFilteredWithMissingObjectsFirst) {
   SessionFixture f;
+  f.assembly.resourceVersions = std::make_shared<FixedResourceVersions>();
   proto::CTSuggestionEngagementFeedback suggestion;
   suggestion.set_timestamp(5000000);
   suggestion.mutable_suggestion()->set_id("server-suggestion-42");
@@ -103,7 +109,7 @@ TEST(ClientSession, UploadRecordIsPrivacyFilteredWithMissingObjectsFirst) {
   EXPECT_EQ(upload["user_guid"], kGuid);
   EXPECT_EQ(upload["base_time"], 0);  // a session opened by a suggestion engagement
   EXPECT_EQ(upload["previous_session_end_reason"], "external_request");
-  EXPECT_EQ(upload["resource_versions"], nlohmann::json::object());
+  EXPECT_EQ(upload["resource_versions"], (nlohmann::json{{"lookup_hints", "7"}}));
   const auto& fb = upload["fb"];
   ASSERT_EQ(fb.size(), 4u);
   EXPECT_EQ(fb[0]["type"], "session_missing_suggestions");
