@@ -1,7 +1,7 @@
 // A daemon killed with SIGKILL while it writes feedback sessions: every session file it reported
 // is afterwards read back whole or cleanly discarded, never accepted torn, and the restarted
 // daemon recovers the files and goes on numbering after them. One file per round also loses a
-// random tail, as a torn write would leave it.
+// random tail, as a torn write would leave it. The test prints its seed; TAVIX_TEST_SEED replays it.
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -10,7 +10,6 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <chrono>
 #include <fstream>
 #include <map>
 #include <random>
@@ -134,7 +133,7 @@ TEST(FeedbackReliability, SessionFilesSurviveAKillAtAnyPoint) {
   platform::DispatchPool pool{1};
   platform::SerialQueue queue(pool, "com.norvel.tavixd.persistentStorageQueue");
   const platform::fs::path folder = home.cache() / "com.norvel.tavixd";
-  std::mt19937 random(std::random_device{}());
+  std::mt19937 random(testing::testSeed());
   int highest = -1;
   int totalAccepted = 0;
 
@@ -155,10 +154,11 @@ TEST(FeedbackReliability, SessionFilesSurviveAKillAtAnyPoint) {
         }
       });
     }
-    // The kill lands while sessions are being written, not before the first one exists.
+    // The kill lands while sessions are being written: after the first file exists and a random
+    // number of clients have come and gone.
     ASSERT_TRUE(daemon->waitForLog("new file url")) << daemon->log();
-    std::uniform_int_distribution<int> pause(0, 300);
-    std::this_thread::sleep_for(std::chrono::milliseconds(pause(random)));
+    const std::size_t nth = std::uniform_int_distribution<std::size_t>(1, 150)(random);
+    testing::waitFor([&] { return testing::occurrences(daemon->log(), "client configuration") >= nth; }, 10000);
     daemon->signal(SIGKILL);
     EXPECT_EQ(daemon->waitExit(5000), 128 + SIGKILL);
     stop.store(true);

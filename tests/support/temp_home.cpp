@@ -2,7 +2,12 @@
 
 #include <stdlib.h>
 
+#include <gtest/gtest.h>
+
 #include <chrono>
+#include <cstdlib>
+#include <iostream>
+#include <random>
 #include <stdexcept>
 #include <thread>
 
@@ -34,6 +39,20 @@ bool waitFor(const std::function<bool()>& condition, int timeoutMs) {
     std::this_thread::sleep_for(std::chrono::milliseconds(1));
   }
   return condition();
+}
+
+std::uint32_t testSeed() {
+  const char* given = std::getenv("TAVIX_TEST_SEED");
+  const std::uint32_t seed = given ? static_cast<std::uint32_t>(std::strtoul(given, nullptr, 10)) : std::random_device{}();
+  std::cout << "seed " << seed << " (replay with TAVIX_TEST_SEED=" << seed << ")" << std::endl;
+  ::testing::Test::RecordProperty("seed", std::to_string(seed));
+  return seed;
+}
+
+std::size_t occurrences(const std::string& text, const std::string& what) {
+  std::size_t n = 0;
+  for (auto at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++n;
+  return n;
 }
 
 }  // namespace tavix::testing
