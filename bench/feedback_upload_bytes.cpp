@@ -44,7 +44,7 @@ struct Day {
     r->set_id("web:" + std::to_string(search * 7919 % 100003) + ":" + std::to_string(n));
     r->set_section_bundle_id(n < 4 ? "com.norvel.tavix.web_index" : "com.norvel.tavix.news");
     r->set_result_type(n == 0 ? proto::ResultType::tavix : proto::ResultType::local);
-    r->set_ranking_score(0.91 - 0.07 * n);
+    r->set_ranking_score((91 - 7 * n) / 100.0);
     r->set_top_hit(n == 0 ? proto::TopHit::tophit_should_be : proto::TopHit::tophit_no);
     r->mutable_punchout()->set_name("Result " + std::to_string(n));
     r->mutable_punchout()->add_urls("https://www.example.com/articles/" + std::to_string(search) + "/" +
@@ -86,23 +86,24 @@ struct Day {
       end.set_status_code(200);
       end.set_response_size(4000 + 37 * s);
       auto& timing = *end.mutable_network_timing_data();
-      timing["domain_lookup"] = 0.000036;
-      timing["connect"] = 0.000177;
+      // The transport measures in microseconds.
+      timing["domain_lookup"] = 36 / 1e6;
+      timing["connect"] = 177 / 1e6;
       timing["secure_connection"] = 0;
-      timing["response_start"] = 0.005958 + s * 1e-6;
-      timing["total"] = 0.006125 + s * 1e-6;
+      timing["response_start"] = (5958 + s) / 1e6;
+      timing["total"] = (6125 + s) / 1e6;
       timing["request_body_bytes"] = 0;
       timing["response_body_bytes"] = 3900 + 37 * s;
       end.set_peer_address("203.0.113.7");
       end.set_tavix_status("ok");
-      end.set_tavix_duration(0.031 + (s % 11) * 0.001);
+      end.set_tavix_duration((31 + s % 11) / 1000.0);
       end.set_tavix_partial_client_ip("198.51.100");
       add(end, queryId + k - 1);
     }
 
     proto::CTRankingFeedback ranking;
     ranking.set_timestamp(tick(20));
-    ranking.set_blending_duration(0.002);
+    ranking.set_blending_duration(2 / 1000.0);
     ranking.set_l2("l2-2026.11");
     for (int sec = 0; sec < 2; ++sec) {
       auto* section = ranking.add_sections();

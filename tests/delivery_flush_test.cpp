@@ -27,6 +27,7 @@
 #include "support/daemon_process.h"
 #include "support/devserver_process.h"
 #include "support/temp_home.h"
+#include "support/test_seed.h"
 #include "tavix/client.h"
 #include "tavix_proto/feedback_records.pb.h"
 #include "tavix_proto/feedback_session.pb.h"

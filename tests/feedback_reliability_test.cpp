@@ -23,6 +23,7 @@
 #include "network/user_agent.h"
 #include "platform/dispatch.h"
 #include "support/daemon_process.h"
+#include "support/test_seed.h"
 #include "tavix_proto/feedback_session.pb.h"
 #include "tavix_proto/ipc.pb.h"
 

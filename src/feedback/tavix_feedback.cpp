@@ -111,6 +111,13 @@ namespace {
 
 nlohmann::json structValueToJson(const google::protobuf::Value& value);
 
+// Whole numbers go out without a fraction, as the platform's JSON writer writes them: 4085, not
+// 4085.0. Beyond 2^53 a double holds no exact integer any more and stays a double.
+nlohmann::json number(double value) {
+  if (std::trunc(value) == value && std::fabs(value) < 9007199254740992.0) return static_cast<std::int64_t>(value);
+  return value;
+}
+
 nlohmann::json structToJson(const google::protobuf::Struct& object) {
   nlohmann::json out = nlohmann::json::object();
   for (const auto& [key, value] : object.fields()) out[key] = structValueToJson(value);
@@ -119,12 +126,7 @@ nlohmann::json structToJson(const google::protobuf::Struct& object) {
 
 nlohmann::json structValueToJson(const google::protobuf::Value& value) {
   switch (value.kind_case()) {
-    case google::protobuf::Value::kNumberValue: {
-      // Struct numbers are doubles; whole ones go out as integers, as the vocabulary writes them.
-      const double number = value.number_value();
-      if (std::trunc(number) == number && std::fabs(number) < 9.0e15) return static_cast<std::int64_t>(number);
-      return number;
-    }
+    case google::protobuf::Value::kNumberValue: return number(value.number_value());
     case google::protobuf::Value::kStringValue: return value.string_value();
     case google::protobuf::Value::kBoolValue: return value.bool_value();
     case google::protobuf::Value::kStructValue: return structToJson(value.struct_value());
@@ -151,9 +153,9 @@ nlohmann::json fieldValueToJson(const Message& message, const FieldDescriptor* f
     case FieldDescriptor::CPPTYPE_UINT64:
       return repeated ? r->GetRepeatedUInt64(message, field, index) : r->GetUInt64(message, field);
     case FieldDescriptor::CPPTYPE_DOUBLE:
-      return repeated ? r->GetRepeatedDouble(message, field, index) : r->GetDouble(message, field);
+      return number(repeated ? r->GetRepeatedDouble(message, field, index) : r->GetDouble(message, field));
     case FieldDescriptor::CPPTYPE_FLOAT:
-      return repeated ? r->GetRepeatedFloat(message, field, index) : r->GetFloat(message, field);
+      return number(repeated ? r->GetRepeatedFloat(message, field, index) : r->GetFloat(message, field));
     case FieldDescriptor::CPPTYPE_BOOL:
       return repeated ? r->GetRepeatedBool(message, field, index) : r->GetBool(message, field);
     case FieldDescriptor::CPPTYPE_STRING:

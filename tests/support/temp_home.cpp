@@ -2,12 +2,7 @@
 
 #include <stdlib.h>
 
-#include <gtest/gtest.h>
-
 #include <chrono>
-#include <cstdlib>
-#include <iostream>
-#include <random>
 #include <stdexcept>
 #include <thread>
 
@@ -39,14 +34,6 @@ bool waitFor(const std::function<bool()>& condition, int timeoutMs) {
     std::this_thread::sleep_for(std::chrono::milliseconds(1));
   }
   return condition();
-}
-
-std::uint32_t testSeed() {
-  const char* given = std::getenv("TAVIX_TEST_SEED");
-  const std::uint32_t seed = given ? static_cast<std::uint32_t>(std::strtoul(given, nullptr, 10)) : std::random_device{}();
-  std::cout << "seed " << seed << " (replay with TAVIX_TEST_SEED=" << seed << ")" << std::endl;
-  ::testing::Test::RecordProperty("seed", std::to_string(seed));
-  return seed;
 }
 
 std::size_t occurrences(const std::string& text, const std::string& what) {

@@ -1,7 +1,6 @@
 // A temporary home for one test: XDG folders inside a fresh directory, removed afterwards.
 #pragma once
 
-#include <cstdint>
 #include <filesystem>
 #include <functional>
 #include <string>
@@ -30,10 +29,6 @@ class TempHome {
 // Polls `condition` every millisecond for up to `timeoutMs`; true once it holds. For tests that
 // wait on real threads (inotify, child processes); virtual-time tests never need it.
 bool waitFor(const std::function<bool()>& condition, int timeoutMs = 5000);
-
-// The seed of a randomised test: TAVIX_TEST_SEED when set (to replay a failure), else a fresh
-// one. Printed, and recorded as the test's property "seed".
-std::uint32_t testSeed();
 
 // How often `what` occurs in `text` (log lines, for tests that wait on the n-th one).
 std::size_t occurrences(const std::string& text, const std::string& what);
