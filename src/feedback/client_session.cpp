@@ -88,6 +88,7 @@ std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackR
   auto& store = session->backingStore_;
   if (first && !first->user_agent().empty()) store.set_agent(first->user_agent());
   if (first && !first->user_guid().empty()) store.set_user_guid_string(first->user_guid());
+  session->takeUserGuid();
   store.set_previous_session_end_reason(static_cast<proto::SessionEndReason::Value>(previousSessionEndReason));
   // Suggestion sessions are sent without their base time.
   if (first && feedbackType(*first) == kFeedbackTypeSuggestionEngagement) store.set_remove_timestamps(true);
@@ -128,6 +129,7 @@ std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackR
 std::shared_ptr<ClientSession> ClientSession::fromRecord(Assembly& assembly, proto::CTClientSession record) {
   auto session = std::make_shared<ClientSession>(assembly);
   session->backingStore_ = std::move(record);
+  session->takeUserGuid();
   return session;
 }
 
@@ -275,12 +277,13 @@ std::string ClientSession::getFeedbacksToSend() {
 
 std::string ClientSession::agent() const { return backingStore_.agent(); }
 
-std::string ClientSession::userGuid() const {
+void ClientSession::takeUserGuid() {
+  // Asked for every event the session takes: worked out once.
   const std::string& text = backingStore_.user_guid_string();
-  if (!isValidUUIDString(text)) return {};
-  std::string upper = text;
-  std::transform(upper.begin(), upper.end(), upper.begin(), [](unsigned char c) { return std::toupper(c); });
-  return upper;
+  userGuid_.clear();
+  if (!isValidUUIDString(text)) return;
+  userGuid_ = text;
+  std::transform(userGuid_.begin(), userGuid_.end(), userGuid_.begin(), [](unsigned char c) { return std::toupper(c); });
 }
 
 bool ClientSession::firstUseOfTheDay() const { return backingStore_.first_use_of_the_day(); }

@@ -71,7 +71,7 @@ class ClientSession {
   std::vector<std::string> feedbacksWithRelativeTimestamp();
 
   std::string agent() const;
-  std::string userGuid() const;  // empty unless the stored string is a valid UUID
+  const std::string& userGuid() const { return userGuid_; }  // empty unless the stored string is a valid UUID
   bool firstUseOfTheDay() const;
   int previousSessionEndReason() const;
   const proto::CTClientSession& backingStore() const { return backingStore_; }
@@ -81,9 +81,11 @@ class ClientSession {
 
  private:
   void recordFirstUse(platform::TimePoint time);
+  void takeUserGuid();
 
   Assembly& assembly_;
   proto::CTClientSession backingStore_;
+  std::string userGuid_;
   std::shared_ptr<FileContainer> storageHandle_;
   platform::SerialQueue sessionQueue_;
 };

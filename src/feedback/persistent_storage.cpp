@@ -12,7 +12,10 @@
 #include <cerrno>
 #include <algorithm>
 #include <charconv>
+#include <condition_variable>
 #include <cstring>
+#include <deque>
+#include <thread>
 
 #include "core/assembly.h"
 #include "core/diagnostics.h"
@@ -82,22 +85,22 @@ std::vector<std::size_t> completeFieldEnds(const char* data, std::size_t size) {
 }
 
 std::string encodeFeedbackField(const proto::CTTavixFeedback& feedback) {
-  std::string body = feedback.SerializeAsString();
+  const std::size_t size = feedback.ByteSizeLong();
   std::string out;
-  out.reserve(body.size() + 8);
-  std::uint32_t tag = WireFormatLite::MakeTag(kFeedbacksFieldNumber, WireFormatLite::WIRETYPE_LENGTH_DELIMITED);
-  while (tag >= 0x80) {
-    out.push_back(static_cast<char>((tag & 0x7F) | 0x80));
-    tag >>= 7;
-  }
-  out.push_back(static_cast<char>(tag));
-  std::uint64_t length = body.size();
-  while (length >= 0x80) {
-    out.push_back(static_cast<char>((length & 0x7F) | 0x80));
-    length >>= 7;
-  }
-  out.push_back(static_cast<char>(length));
-  out += body;
+  out.reserve(size + 12);
+  auto varint = [&out](std::uint64_t value) {
+    while (value >= 0x80) {
+      out.push_back(static_cast<char>((value & 0x7F) | 0x80));
+      value >>= 7;
+    }
+    out.push_back(static_cast<char>(value));
+  };
+  varint(WireFormatLite::MakeTag(kFeedbacksFieldNumber, WireFormatLite::WIRETYPE_LENGTH_DELIMITED));
+  varint(size);
+  const std::size_t head = out.size();
+  out.resize(head + size);
+  // The size was just computed: serialise into place without a second copy.
+  feedback.SerializeWithCachedSizesToArray(reinterpret_cast<std::uint8_t*>(out.data() + head));
   return out;
 }
 
@@ -129,7 +132,9 @@ const std::string& tavixdSessionFileVersion() {
   return version;
 }
 
-long SessionFileIO::write(int fd, const void* data, std::size_t size) { return ::write(fd, data, size); }
+long SessionFileIO::write(int fd, const void* data, std::size_t size, std::int64_t offset) {
+  return ::pwrite(fd, data, size, static_cast<off_t>(offset));
+}
 int SessionFileIO::truncate(int fd, std::int64_t length) { return ::ftruncate(fd, static_cast<off_t>(length)); }
 int SessionFileIO::sync(int fd) { return ::fdatasync(fd); }
 
@@ -185,11 +190,16 @@ bool FileContainer::appendData(const std::string& data) {
   queue_.assertCurrent("FileContainer::appendData");
   platform::TransactionTracker::Transaction transaction;
   if (transactions_) transaction = transactions_->begin("archiveObject");
-  const off_t offset = ::lseek(fd_, 0, SEEK_END);
-  if (offset < 0) {
-    log().error("{}", errnoText(errno));
-    return false;
+  // Appends go where the last whole record ended; the container is the file's only writer.
+  if (written_ < 0) {
+    struct stat st {};
+    if (::fstat(fd_, &st) != 0) {
+      log().error("{}", errnoText(errno));
+      return false;
+    }
+    written_ = st.st_size;
   }
+  const std::int64_t offset = written_;
   if (static_cast<std::uint64_t>(offset) + data.size() >= maxFileSize_) {
     TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.filesizeexceeded");
     log().error("bytes written ({}) + feedback ({}) exceeds max session size ({})", static_cast<std::uint64_t>(offset),
@@ -199,7 +209,7 @@ bool FileContainer::appendData(const std::string& data) {
   }
   std::size_t written = 0;
   while (written < data.size()) {
-    const long n = io_->write(fd_, data.data() + written, data.size() - written);
+    const long n = io_->write(fd_, data.data() + written, data.size() - written, offset + static_cast<std::int64_t>(written));
     if (n < 0 && errno == EINTR) continue;
     if (n <= 0) {
       // Disk full or an I/O error: whatever part of the record went out is cut off again, so the
@@ -207,7 +217,7 @@ bool FileContainer::appendData(const std::string& data) {
       const std::string why = n < 0 ? errnoText(errno) : std::string("nothing written");
       if (io_->truncate(fd_, offset) == 0) {
         log().error("Could not append {} bytes to {}: {}; cut back to {} bytes", data.size(), fileUrl_.string(), why,
-                    static_cast<std::int64_t>(offset));
+                    offset);
       } else {
         log().error("Could not append {} bytes to {}: {}; nor cut it back ({}), closing it", data.size(),
                     fileUrl_.string(), why, errnoText(errno));
@@ -217,6 +227,7 @@ bool FileContainer::appendData(const std::string& data) {
     }
     written += static_cast<std::size_t>(n);
   }
+  written_ = offset + static_cast<std::int64_t>(data.size());
   return true;
 }
 
@@ -230,11 +241,14 @@ void FileContainer::close() {
 void FileContainer::closeNow() {
   if (fd_ >= 0) ::close(fd_);
   fd_ = -1;
+  written_ = -1;
 }
 
-void FileContainer::syncAndCloseNow() {
-  if (fd_ >= 0 && io_->sync(fd_) != 0) log().error("could not sync {}: {}", fileUrl_.string(), errnoText(errno));
-  closeNow();
+int FileContainer::detachDescriptor() {
+  const int fd = fd_;
+  fd_ = -1;
+  written_ = -1;
+  return fd;
 }
 
 bool FileContainer::isOpen() {
@@ -342,6 +356,55 @@ std::optional<proto::CTClientSession> FileContainer::unarchiveObject() {
 
 // ---- TavixPersistentStorage -----------------------------------------------------------------
 
+// One thread and its job list. Jobs run in order; the thread drains them before it stops.
+struct TavixPersistentStorage::Syncer {
+  std::mutex lock;
+  std::condition_variable changed;
+  std::deque<std::function<void()>> jobs;
+  bool busy = false;
+  bool stopping = false;
+  std::thread thread{[this] { run(); }};
+
+  ~Syncer() {
+    {
+      std::lock_guard guard(lock);
+      stopping = true;
+    }
+    changed.notify_all();
+    thread.join();
+  }
+  void post(std::function<void()> job) {
+    {
+      std::lock_guard guard(lock);
+      jobs.push_back(std::move(job));
+    }
+    changed.notify_all();
+  }
+  bool morePending() {
+    std::lock_guard guard(lock);
+    return !jobs.empty();
+  }
+  void waitIdle() {
+    std::unique_lock guard(lock);
+    changed.wait(guard, [this] { return jobs.empty() && !busy; });
+  }
+  void run() {
+    std::unique_lock guard(lock);
+    for (;;) {
+      changed.wait(guard, [this] { return stopping || !jobs.empty(); });
+      if (jobs.empty()) return;
+      auto job = std::move(jobs.front());
+      jobs.pop_front();
+      busy = true;
+      guard.unlock();
+      job();
+      guard.lock();
+      busy = false;
+      changed.notify_all();
+    }
+  }
+};
+
 TavixPersistentStorage::TavixPersistentStorage(Assembly& assembly, std::shared_ptr<SessionFileIO> io)
     : assembly_(assembly),
       io_(std::move(io)),
@@ -349,12 +412,15 @@ TavixPersistentStorage::TavixPersistentStorage(Assembly& assembly, std::shared_p
       cachesUrl_(assembly.cachesFolder()),
       version_(tavixdSessionFileVersion()),
       maxFileSize_(static_cast<std::uint64_t>(assembly.userDefaults->integerForKey("TVXSessionSizeLimit"))),
-      maxFileAge_(assembly.userDefaults->integerForKey("TVXSessionMaxAge")) {
+      maxFileAge_(assembly.userDefaults->integerForKey("TVXSessionMaxAge")),
+      syncer_(std::make_unique<Syncer>()) {
   scanDirectory();
 }
 
 TavixPersistentStorage::~TavixPersistentStorage() {
-  queue_.sync([] {});  // let queued appends and deletions finish
+  queue_.sync([] {});   // let queued appends, closes and deletions finish
+  syncer_->waitIdle();  // ... and the closed files be synced (their jobs use the syncer)
+  syncer_.reset();
 }
 
 void TavixPersistentStorage::scanDirectory() {
@@ -444,10 +510,23 @@ void TavixPersistentStorage::closeSessionWithFileContainer(std::shared_ptr<FileC
   if (!container) return;
   queue_.async([this, container] {
     log().debug("close file url {}", container->fileUrl().string());
-    // Durable before it counts as closed: the file's data, and its name in the folder.
-    container->syncAndCloseNow();
-    syncDirectory();
-    fileContainers_.push_back(container);
+    const int fd = container->detachDescriptor();
+    // Durable before it counts as closed: the file's data, and its name in the folder. A file
+    // already closed (full) is opened again to be synced.
+    syncer_->post([this, container, fd] {
+      const int target = fd >= 0 ? fd : ::open(container->fileUrl().c_str(), O_RDONLY | O_CLOEXEC);
+      if (target < 0 || io().sync(target) != 0) {
+        log().error("could not sync {}: {}", container->fileUrl().string(), errnoText(errno));
+      }
+      if (target >= 0) ::close(target);
+      synced_.push_back(container);
+      // Files closed together (a shared session's members) share one sync of the folder.
+      if (syncer_->morePending()) return;
+      syncDirectory();
+      std::lock_guard guard(listLock_);
+      fileContainers_.insert(fileContainers_.end(), synced_.begin(), synced_.end());
+      synced_.clear();
+    });
   });
 }
 
@@ -456,6 +535,7 @@ std::shared_ptr<FileContainer> TavixPersistentStorage::claimSessionWithFileConta
   std::shared_ptr<FileContainer> claimed;
   if (!container) return claimed;
   queue_.sync([&] {
+    std::lock_guard guard(listLock_);
     const auto it = std::find(fileContainers_.begin(), fileContainers_.end(), container);
     if (it == fileContainers_.end()) return;  // taken by another flush, or deleted
     const fs::path& from = container->fileUrl();
@@ -482,20 +562,25 @@ void TavixPersistentStorage::unclaimSessionWithFileContainer(std::shared_ptr<Fil
       log().error("could not give back {}: {}", from.string(), errnoText(errno));
       return;
     }
+    std::lock_guard guard(listLock_);
     fileContainers_.push_back(makeContainer(to));
   });
 }
 
 std::vector<std::shared_ptr<FileContainer>> TavixPersistentStorage::getAvailableSessionHandles() {
-  std::vector<std::shared_ptr<FileContainer>> copy;
-  queue_.sync([&] { copy = fileContainers_; });
-  return copy;
+  queue_.sync([] {});   // closes asked for before have reached the syncer
+  syncer_->waitIdle();  // ... and are listed
+  std::lock_guard guard(listLock_);
+  return fileContainers_;
 }
 
 void TavixPersistentStorage::deleteSessionWithFileContainer(std::shared_ptr<FileContainer> container) {
   if (!container) return;
   queue_.async([this, container] {
-    std::erase(fileContainers_, container);
+    {
+      std::lock_guard guard(listLock_);
+      std::erase(fileContainers_, container);
+    }
     container->closeNow();
     if (container->fileUrl().empty()) {
       log().fault("Handle {} does not have a File URL", static_cast<const void*>(container.get()));

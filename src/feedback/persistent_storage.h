@@ -40,7 +40,8 @@ class DeviceInformation;
 class SessionFileIO {
  public:
   virtual ~SessionFileIO() = default;
-  virtual long write(int fd, const void* data, std::size_t size);
+  // Writes at `offset` (pwrite).
+  virtual long write(int fd, const void* data, std::size_t size, std::int64_t offset);
   virtual int truncate(int fd, std::int64_t length);
   // Makes the file's data durable (fdatasync).
   virtual int sync(int fd);
@@ -103,11 +104,12 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   friend class TavixPersistentStorage;
   bool appendData(const std::string& data);  // on queue
   void closeNow();                           // on queue
-  void syncAndCloseNow();                    // on queue
+  int detachDescriptor();                    // on queue: the file takes no more appends
   std::optional<proto::CTClientSession> unarchiveObject();  // on queue
 
   platform::fs::path fileUrl_;
   int fd_ = -1;
+  std::int64_t written_ = -1;  // on queue: where the next record goes; -1 until known
   std::string version_;
   platform::SerialQueue& queue_;
   std::uint64_t maxFileSize_;
@@ -131,9 +133,10 @@ class TavixPersistentStorage {
   std::shared_ptr<FileContainer> createFileContainerForWriting();
 
   // Asynchronously closes the file, makes it and the folder durable, then lists the container
-  // as waiting to be sent.
+  // as waiting to be sent. The syncing runs on a thread of the storage's own, so that a slow
+  // device flush holds up neither the queue's appends nor the dispatch pool.
   void closeSessionWithFileContainer(std::shared_ptr<FileContainer> container);
-  // Synchronously: a copy of the waiting list.
+  // Synchronously: a copy of the waiting list, once every close asked for before is listed.
   std::vector<std::shared_ptr<FileContainer>> getAvailableSessionHandles();
   // Asynchronously unlists the container, closes it and deletes its file.
   void deleteSessionWithFileContainer(std::shared_ptr<FileContainer> container);
@@ -163,13 +166,19 @@ class TavixPersistentStorage {
   void scanDirectory();
 
   std::shared_ptr<FileContainer> makeContainer(platform::fs::path url);
-  void syncDirectory();  // on queue_
+  void syncDirectory();
+  SessionFileIO& io() { return io_ ? *io_ : SessionFileIO::system(); }
+
+  struct Syncer;  // the thread closed files are made durable on
 
   Assembly& assembly_;
   std::shared_ptr<SessionFileIO> io_;
   platform::SerialQueue queue_;
   platform::fs::path cachesUrl_;
-  std::vector<std::shared_ptr<FileContainer>> fileContainers_;  // on queue_ (and the scan)
+  // Changed on queue_ and by the syncer, which lists closed files.
+  std::mutex listLock_;
+  std::vector<std::shared_ptr<FileContainer>> fileContainers_;
+  std::vector<std::shared_ptr<FileContainer>> synced_;  // the syncer's: durable, folder not yet
   // A lock rather than the queue: new files are made from other queues, and a synchronous hop
   // from a pool thread onto a busy pool could starve it.
   std::mutex versionLock_;
@@ -177,6 +186,7 @@ class TavixPersistentStorage {
   std::uint64_t maxFileSize_;
   std::int64_t maxFileAge_;
   std::atomic<std::int32_t> handleId_{0};
+  std::unique_ptr<Syncer> syncer_;
 };
 
 }  // namespace tavix

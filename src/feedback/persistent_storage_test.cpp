@@ -219,14 +219,14 @@ class FillingDisk : public SessionFileIO {
   std::atomic<bool> truncateFails{false};
   std::atomic<int> syncs{0};
 
-  long write(int fd, const void* data, std::size_t size) override {
+  long write(int fd, const void* data, std::size_t size, std::int64_t offset) override {
     if (room.load() <= 0) {
       errno = ENOSPC;
       return -1;
     }
     const long n = std::min<long>(static_cast<long>(size), room.load());
     room -= n;
-    return SessionFileIO::write(fd, data, static_cast<std::size_t>(n));
+    return SessionFileIO::write(fd, data, static_cast<std::size_t>(n), offset);
   }
   int truncate(int fd, std::int64_t length) override {
     if (truncateFails) {
