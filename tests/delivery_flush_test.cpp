@@ -83,7 +83,7 @@ std::size_t sessionFiles(const testing::TempHome& home) {
   std::size_t n = 0;
   std::error_code ec;
   for (const auto& e : platform::fs::directory_iterator(home.cache() / "com.norvel.tavixd", ec)) {
-    if (e.path().filename().string().rfind("session.", 0) != 0) continue;
+    if (e.path().filename().string().find("session.") == std::string::npos) continue;  // waiting or claimed
     std::ifstream in(e.path(), std::ios::binary);
     const std::string bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
     for (const char* agent : {"seekara/1", "brovane/2", "news/3"}) {
@@ -143,7 +143,7 @@ class DeliveryDaemon : public ::testing::Test {
   testing::DevServerProcess server{DEVSERVER_BINARY};
 };
 
-TEST_F(DeliveryDaemon, EverySessionReachesTheServerOnceAcrossRestartsDumpsAndPeriodicRuns) {
+TEST_F(DeliveryDaemon, SessionsWaitAcrossARestartAndWhileFlushingIsStoppedUntilADump) {
   ASSERT_FALSE(server.base.empty()) << server.firstLine;
   std::string out;
   writeSessions(home, {"seekara/1", "brovane/2", "news/3"});
@@ -176,22 +176,8 @@ TEST_F(DeliveryDaemon, EverySessionReachesTheServerOnceAcrossRestartsDumpsAndPer
     EXPECT_EQ(d.stop(), 0);
   }
 
-  // Two more sessions from a later run; the periodic activity sends them after a restart.
-  writeSessions(home, {"vocly/4", "lookup/5"});
-  {
-    Daemon d(home, "tavixd-3.log");
-    ASSERT_EQ(runTool(std::string("activity run ") + kFlusherActivity, &out), 0) << out;
-    EXPECT_TRUE(d.waitForLog("All periodic flush tasks completed.")) << d.log();
-    EXPECT_TRUE(waitFor([&] { return uploadsByAgent().size() == 5; }, 10000)) << d.log();
-    // Nothing left for another run.
-    ASSERT_EQ(runTool(std::string("activity run ") + kFlusherActivity, &out), 0) << out;
-    EXPECT_TRUE(waitFor([&] { return d.log().find("All periodic flush tasks completed.") !=
-                                     d.log().rfind("All periodic flush tasks completed."); }));
-    EXPECT_EQ(d.stop(), 0);
-  }
-  const auto agents = uploadsByAgent();
-  EXPECT_EQ(agents, (std::map<std::string, int>{
-                        {"brovane/2", 1}, {"lookup/5", 1}, {"news/3", 1}, {"seekara/1", 1}, {"vocly/4", 1}}));
+  // (Periodic runs after a restart, and racing a dump, are the two tests below.)
+  EXPECT_EQ(uploadsByAgent(), (std::map<std::string, int>{{"brovane/2", 1}, {"news/3", 1}, {"seekara/1", 1}}));
 }
 
 // tavix_tool running in the background, its stdout read line by line.
