@@ -8,26 +8,36 @@
 #include <unistd.h>
 
 #include <cstdio>
+#include <cstdlib>
 #include <fstream>
+#include <iostream>
 #include <map>
 #include <nlohmann/json.hpp>
+#include <random>
+#include <thread>
 
 #include "core/assembly.h"
 #include "feedback/client_session.h"
 #include "feedback/persistent_storage.h"
 #include "feedback/tavix_feedback.h"
+#include "feedback/vocabulary.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
 #include "support/daemon_process.h"
 #include "support/devserver_process.h"
 #include "support/temp_home.h"
+#include "support/test_seed.h"
+#include "tavix/client.h"
 #include "tavix_proto/feedback_records.pb.h"
+#include "tavix_proto/feedback_session.pb.h"
 
 namespace tavix {
 namespace {
 
 using json = nlohmann::json;
+using testing::occurrences;
+using testing::testSeed;
 using testing::waitFor;
 
 constexpr const char* kFlusherActivity = "com.norvel.tavixd.flusher.background";
@@ -73,7 +83,7 @@ std::size_t sessionFiles(const testing::TempHome& home) {
   std::size_t n = 0;
   std::error_code ec;
   for (const auto& e : platform::fs::directory_iterator(home.cache() / "com.norvel.tavixd", ec)) {
-    if (e.path().filename().string().rfind("session.", 0) != 0) continue;
+    if (e.path().filename().string().find("session.") == std::string::npos) continue;  // waiting or claimed
     std::ifstream in(e.path(), std::ios::binary);
     const std::string bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
     for (const char* agent : {"seekara/1", "brovane/2", "news/3"}) {
@@ -103,14 +113,19 @@ class DeliveryDaemon : public ::testing::Test {
     platform::UserDefaults defaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
     defaults.setObject("TVXBagURL", server.base + "/bag");
   }
-  // Agent → number of uploads that carried its session.
-  std::map<std::string, int> uploadsByAgent() {
+  json serverGet(const std::string& path) {
     const auto port = std::stoi(server.base.substr(server.base.rfind(':') + 1));
     httplib::Client client("127.0.0.1", port);
-    auto res = client.Get("/_feedback");
+    auto res = client.Get(path);
+    return res ? json::parse(res->body, nullptr, false) : json();
+  }
+  std::size_t repeats() { return serverGet("/_feedback_repeats").value("repeats", std::size_t{0}); }
+  // Agent → number of uploads the server kept of its session.
+  std::map<std::string, int> uploadsByAgent() {
     std::map<std::string, int> agents;
-    if (!res) return agents;
-    for (const auto& upload : json::parse(res->body)) {
+    const json uploads = serverGet("/_feedback");
+    if (!uploads.is_array()) return agents;
+    for (const auto& upload : uploads) {
       // The tool's own comings and goings are feedback too; only the written sessions count here.
       const std::string agent = upload["json"]["agent"].get<std::string>();
       if (agent.find("tavix_tool") != std::string::npos) continue;
@@ -128,7 +143,7 @@ class DeliveryDaemon : public ::testing::Test {
   testing::DevServerProcess server{DEVSERVER_BINARY};
 };
 
-TEST_F(DeliveryDaemon, EverySessionReachesTheServerOnceAcrossRestartsDumpsAndPeriodicRuns) {
+TEST_F(DeliveryDaemon, SessionsWaitAcrossARestartAndWhileFlushingIsStoppedUntilADump) {
   ASSERT_FALSE(server.base.empty()) << server.firstLine;
   std::string out;
   writeSessions(home, {"seekara/1", "brovane/2", "news/3"});
@@ -161,22 +176,8 @@ TEST_F(DeliveryDaemon, EverySessionReachesTheServerOnceAcrossRestartsDumpsAndPer
     EXPECT_EQ(d.stop(), 0);
   }
 
-  // Two more sessions from a later run; the periodic activity sends them after a restart.
-  writeSessions(home, {"vocly/4", "lookup/5"});
-  {
-    Daemon d(home, "tavixd-3.log");
-    ASSERT_EQ(runTool(std::string("activity run ") + kFlusherActivity, &out), 0) << out;
-    EXPECT_TRUE(d.waitForLog("All periodic flush tasks completed.")) << d.log();
-    EXPECT_TRUE(waitFor([&] { return uploadsByAgent().size() == 5; }, 10000)) << d.log();
-    // Nothing left for another run.
-    ASSERT_EQ(runTool(std::string("activity run ") + kFlusherActivity, &out), 0) << out;
-    EXPECT_TRUE(waitFor([&] { return d.log().find("All periodic flush tasks completed.") !=
-                                     d.log().rfind("All periodic flush tasks completed."); }));
-    EXPECT_EQ(d.stop(), 0);
-  }
-  const auto agents = uploadsByAgent();
-  EXPECT_EQ(agents, (std::map<std::string, int>{
-                        {"brovane/2", 1}, {"lookup/5", 1}, {"news/3", 1}, {"seekara/1", 1}, {"vocly/4", 1}}));
+  // (Periodic runs after a restart, and racing a dump, are the two tests below.)
+  EXPECT_EQ(uploadsByAgent(), (std::map<std::string, int>{{"brovane/2", 1}, {"news/3", 1}, {"seekara/1", 1}}));
 }
 
 // tavix_tool running in the background, its stdout read line by line.
@@ -232,6 +233,206 @@ TEST_F(DeliveryDaemon, WatchUploadsShowsEachBodyAsItIsSent) {
   }
   EXPECT_TRUE(seen);
   EXPECT_TRUE(waitFor([&] { return uploadsByAgent().count("messages/7") == 1; }, 10000));
+  EXPECT_EQ(d.stop(), 0);
+}
+
+TEST_F(DeliveryDaemon, DumpsRacingAPeriodicFlushSendEachSessionOnce) {
+  ASSERT_FALSE(server.base.empty()) << server.firstLine;
+  std::vector<std::string> agents;
+  for (int i = 0; i < 24; ++i) agents.push_back("seekara/race-" + std::to_string(i));
+  writeSessions(home, agents);
+  Daemon d(home, "tavixd-race.log");
+  // Two dumps, one after the other (the flush channel answers the newest tool), each racing a
+  // periodic run.
+  std::thread periodic([] {
+    std::string out;
+    for (int i = 0; i < 2; ++i) runTool(std::string("activity run ") + kFlusherActivity, &out);
+  });
+  std::string out;
+  for (int i = 0; i < 2; ++i) EXPECT_EQ(runTool("dump", &out), 0) << out;
+  periodic.join();
+  EXPECT_TRUE(waitFor([&] { return uploadsByAgent().size() == agents.size(); }, 20000)) << d.log();
+  for (const auto& [agent, uploads] : uploadsByAgent()) EXPECT_EQ(uploads, 1) << agent;
+  EXPECT_EQ(repeats(), 0u) << "no session was sent twice, not even one the server would drop";
+  EXPECT_EQ(d.stop(), 0);
+}
+
+// The daemon killed at a random step of a flush, again and again: every session reaches the
+// server, at most resent with the same digest (which the server drops and counts).
+TEST_F(DeliveryDaemon, ASessionIsNeverLostWhereverAFlushIsKilled) {
+  ASSERT_FALSE(server.base.empty()) << server.firstLine;
+  std::mt19937 random(testSeed());
+  // Kill points along a session's way: claimed and read, compressed, journalled, file deleted.
+  const std::vector<std::string> steps = {"reading file url", "Compressing data for upload to",
+                                          "Enqueuing for upload", "delete file url"};
+  std::vector<std::string> agents;
+  for (int round = 0; round < 4; ++round) {
+    std::vector<std::string> fresh;
+    for (int i = 0; i < 6; ++i) fresh.push_back("seekara/kill-" + std::to_string(round) + "-" + std::to_string(i));
+    writeSessions(home, fresh);
+    agents.insert(agents.end(), fresh.begin(), fresh.end());
+
+    Daemon d(home, "tavixd-kill-" + std::to_string(round) + ".log");
+    const std::string step = steps[random() % steps.size()];
+    const std::size_t nth = 1 + random() % fresh.size();
+    const std::size_t before = occurrences(d.log(), step);
+    std::thread tool([] {
+      std::string out;
+      runTool("dump", &out);
+    });
+    waitFor([&] { return occurrences(d.log(), step) >= before + nth || !d.alive(); }, 10000);
+    d.signal(SIGKILL);
+    EXPECT_EQ(d.waitExit(5000), 128 + SIGKILL);
+    tool.join();
+    RecordProperty("round" + std::to_string(round), "killed at " + step + " #" + std::to_string(nth));
+  }
+
+  Daemon last(home, "tavixd-kill-last.log");
+  std::string out;
+  ASSERT_EQ(runTool("dump", &out), 0) << out << last.log();
+  EXPECT_TRUE(waitFor([&] { return uploadsByAgent().size() == agents.size(); }, 20000)) << last.log();
+  const auto uploads = uploadsByAgent();
+  for (const auto& agent : agents) EXPECT_EQ(uploads.count(agent) ? uploads.at(agent) : 0, 1) << agent;
+  RecordProperty("repeats", std::to_string(repeats()));
+  EXPECT_EQ(sessionFiles(home), 0u);
+  EXPECT_EQ(last.stop(), 0);
+}
+
+// One event of every type through a client's real session: each reaches the server with its own
+// fields, numbers as numbers and unset fields left out.
+TEST_F(DeliveryDaemon, EveryEventTypeReachesTheServerWithItsOwnFields) {
+  ASSERT_FALSE(server.base.empty()) << server.firstLine;
+  using Payload = proto::CTFeedbackPayload;
+  struct Case {
+    int type;
+    std::function<void(Payload&)> fill;
+    const char* pointer;  // where the event's own value shows in its JSON
+    json expected;
+  };
+  const std::vector<Case> cases = {
+      {1, [](Payload& p) { p.mutable_search_view_appear()->set_trigger_event(proto::AppearEvent::swipe_down); },
+       "/trigger_event", "swipe_down"},
+      {2, [](Payload& p) { p.mutable_search_view_disappear()->set_trigger_event(proto::DisappearEvent::home_button); },
+       "/trigger_event", "home_button"},
+      {3, [](Payload& p) { p.mutable_rank_sections()->set_l2("l2-3"); }, "/l2", "l2-3"},
+      {4, [](Payload& p) { p.mutable_rank_sections()->set_l2("l2-4"); }, "/l2", "l2-4"},
+      {5, [](Payload& p) { p.mutable_result_ranking()->set_local_result_position(5); }, "/local_result_position", 5},
+      {6, [](Payload& p) { p.mutable_result()->mutable_result()->set_section_bundle_id("bundle-6"); },
+       "/result/section_bundle_id", "bundle-6"},
+      {7, [](Payload& p) { p.mutable_result_engagement()->set_input("engaged-7"); }, "/input", "engaged-7"},
+      {8, [](Payload& p) { p.mutable_visible_results()->set_trigger_event(proto::TriggerVisibleResultsEvent::scroll); },
+       "/trigger_event", "scroll"},
+      {9, [](Payload& p) { p.mutable_card_section()->set_card_section_id("card-9"); }, "/card_section_id", "card-9"},
+      {10, [](Payload& p) { p.mutable_card_engagement()->set_card_section_id("card-10"); }, "/card_section_id", "card-10"},
+      {11, [](Payload& p) { p.mutable_card_engagement()->set_card_section_id("card-11"); }, "/card_section_id", "card-11"},
+      {12, [](Payload& p) { p.mutable_search_start()->set_input("start-12"); }, "/input", "start-12"},
+      {13, [](Payload& p) { p.mutable_search_end()->set_input("end-13"); }, "/input", "end-13"},
+      {14, [](Payload& p) { p.mutable_network_search_start()->set_url("https://example.com/14"); }, "/url",
+       "https://example.com/14"},
+      {15, [](Payload& p) { p.mutable_network_search_end()->set_fbq("fbq-15"); }, "/fbq", "fbq-15"},
+      {16, [](Payload& p) { p.mutable_local_search_start()->set_index_type(proto::IndexType::seekara); }, "/index_type",
+       "seekara"},
+      {17, [](Payload& p) { p.mutable_local_search_end()->set_index_type(proto::IndexType::calculator); }, "/index_type",
+       "calculator"},
+      {18, [](Payload& p) { p.mutable_error()->set_reason("reason-18"); }, "/reason", "reason-18"},
+      {19, [](Payload& p) { p.mutable_custom_unknown()->set_name("custom-19"); }, "/name", "custom-19"},
+      {20, [](Payload& p) { p.mutable_suggestion_engagement()->mutable_suggestion()->set_suggestion("suggestion-20"); },
+       "/suggestion/suggestion", "suggestion-20"},
+      {21, [](Payload& p) { p.mutable_card_view_disappear()->set_trigger_event(proto::CardViewDisappearEvent::replaced); },
+       "/trigger_event", "replaced"},
+      {22, [](Payload& p) { p.mutable_visible_suggestions()->set_trigger_event(proto::TriggerVisibleResultsEvent::peek); },
+       "/trigger_event", "peek"},
+      {23, [](Payload& p) { p.mutable_results_received_after_timeout()->add_results()->set_fbr("fbr-23"); },
+       "/results/0/fbr", "fbr-23"},
+      {24, [](Payload& p) { p.mutable_late_sections_appended()->add_sections()->set_section_id("section-24"); },
+       "/sections/0/section_id", "section-24"},
+      {25, [](Payload& p) { p.mutable_clear_input()->set_trigger_event(proto::ClearInputTriggerEvent::cut); },
+       "/trigger_event", "cut"},
+      {26, [](Payload& p) { p.mutable_section_engagement()->set_trigger_event(proto::SectionEngagementTriggerEvent::show_less); },
+       "/trigger_event", "show_less"},
+      {27, [](Payload& p) { p.mutable_visible_section_header()->set_section_id("header-27"); }, "/section_id", "header-27"},
+      {28, [](Payload& p) { p.mutable_did_go_to_site()->set_url("https://site.example/28"); }, "/url",
+       "https://site.example/28"},
+      {29, [](Payload& p) { p.mutable_did_go_to_search()->set_input("search-29"); }, "/input", "search-29"},
+      {30, [](Payload& p) { p.mutable_session_missing_results()->add_results()->set_fbr("fbr-30"); }, "/results/0/fbr",
+       "fbr-30"},
+      {31, [](Payload& p) { p.mutable_session_missing_suggestions()->add_suggestions()->set_suggestion("suggestion-31"); },
+       "/suggestions/0/suggestion", "suggestion-31"},
+      {32, [](Payload& p) { p.mutable_result_grade()->set_grade(proto::ResultGrade::excellent); }, "/grade", "excellent"},
+      {33, [](Payload& p) { p.mutable_lookup_hint_graded()->set_grade(proto::LookupHintRelevanceType::good); }, "/grade",
+       "good"},
+      {34, [](Payload& p) { p.mutable_connection_invalidated()->set_timestamp(34'000'000); }, "/type",
+       "connection_invalidated"},
+      {35, [](Payload& p) {
+         p.mutable_card_section_engagement()->set_place_view_feedback_type(proto::PlaceViewFeedbackType::website);
+       },
+       "/place_view_feedback_type", "website"},
+      {36, [](Payload& p) { p.mutable_session_end()->set_reason(proto::SessionEndReason::guid_changed); }, "/reason",
+       "guid_changed"},
+      {37, [](Payload& p) { p.mutable_card_view_appear()->set_card_section_id("card-37"); }, "/card_section_id", "card-37"},
+      {38, [](Payload& p) { p.mutable_skip_tavix_search()->set_input("skip-38"); }, "/input", "skip-38"},
+      {39, [](Payload& p) { p.mutable_cache_hit()->set_input("hit-39"); }, "/input", "hit-39"},
+      {40, [](Payload& p) { p.mutable_cba_engagement()->set_url("https://cba.example/40"); }, "/url",
+       "https://cba.example/40"},
+      {41, [](Payload& p) { p.mutable_client_timing()->set_event_name("timing-41"); }, "/event_name", "timing-41"},
+      {100, [](Payload& p) { p.mutable_custom_unknown()->set_name("crowd-100"); }, "/name", "crowd-100"},
+      {101, [](Payload& p) { p.mutable_custom_unknown()->set_name("autofill-101"); }, "/name", "autofill-101"},
+      {102, [](Payload& p) { p.mutable_custom_unknown()->set_name("features-102"); }, "/name", "features-102"},
+  };
+  Daemon d(home, "tavixd-types.log");
+  client::Client::Options options;
+  options.socketPath = (home.runtime() / "com.norvel.tavixd" / "socket").string();
+  options.configuration.set_identifier("com.norvel.seekara");
+  options.configuration.set_user_agent("seekara/types");
+  client::Client app(options);
+  ASSERT_FALSE(app.connect()) << d.log();
+  for (const auto& c : cases) {
+    Payload payload;
+    payload.set_type(c.type);
+    c.fill(payload);
+    // Event time stamps in the order of the table, one millisecond apart.
+    auto* codable = mutableFeedbackCodable(&payload);
+    const auto* stamp = codable->GetDescriptor()->FindFieldByName("timestamp");
+    if (stamp && c.type != 34) codable->GetReflection()->SetUInt64(codable, stamp, 1'000'000ull * c.type);
+    proto::Envelope message;
+    message.mutable_report_feedback_payload_data()->set_data(payload.SerializeAsString());
+    message.mutable_report_feedback_payload_data()->set_query_id(1000 + c.type);
+    ASSERT_TRUE(app.post(std::move(message)));
+  }
+  // The client's own view of its session is the barrier: every event is in it.
+  ASSERT_TRUE(waitFor([&] {
+    proto::Envelope call, reply;
+    call.mutable_feedback();
+    return !app.callSync(call, &reply) && reply.feedback_reply().feedbacks_size() >= static_cast<int>(cases.size());
+  }, 10000)) << d.log();
+  std::string out;
+  ASSERT_EQ(runTool("dump", &out), 0) << out << d.log();
+
+  json fb;
+  ASSERT_TRUE(waitFor([&] {
+    const json uploads = serverGet("/_feedback");
+    for (const auto& upload : uploads.is_array() ? uploads : json::array()) {
+      if (upload["json"].value("agent", "").ends_with(" seekara/types")) fb = upload["json"]["fb"];
+    }
+    return fb.is_array();
+  }, 10000)) << d.log();
+  for (const auto& c : cases) {
+    const std::string name = feedbackTypeName(c.type);
+    bool found = false;
+    for (const auto& event : fb) {
+      if (event.value("type", "") != name || !event.contains(json::json_pointer(c.pointer))) continue;
+      if (event[json::json_pointer(c.pointer)] != c.expected) continue;
+      found = true;
+      if (c.type == 30 || c.type == 31 || c.type == 34 || c.type == 36) continue;  // session-level: no query
+      EXPECT_EQ(event["query_id"], 1000 + c.type) << event;
+      EXPECT_TRUE(event["timestamp"].is_number_unsigned()) << event;
+    }
+    EXPECT_TRUE(found) << "type " << c.type << " (" << name << ") missing from " << fb.dump();
+  }
+  for (const auto& event : fb) {
+    if (event.value("type", "") != "search_view_appear") continue;
+    EXPECT_FALSE(event.contains("on_lock_screen")) << "unset fields are left out: " << event;
+  }
   EXPECT_EQ(d.stop(), 0);
 }
 

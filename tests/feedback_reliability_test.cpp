@@ -1,7 +1,7 @@
 // A daemon killed with SIGKILL while it writes feedback sessions: every session file it reported
 // is afterwards read back whole or cleanly discarded, never accepted torn, and the restarted
 // daemon recovers the files and goes on numbering after them. One file per round also loses a
-// random tail, as a torn write would leave it.
+// random tail, as a torn write would leave it. The test prints its seed; TAVIX_TEST_SEED replays it.
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -10,7 +10,6 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <chrono>
 #include <fstream>
 #include <map>
 #include <random>
@@ -24,6 +23,7 @@
 #include "network/user_agent.h"
 #include "platform/dispatch.h"
 #include "support/daemon_process.h"
+#include "support/test_seed.h"
 #include "tavix_proto/feedback_session.pb.h"
 #include "tavix_proto/ipc.pb.h"
 
@@ -106,7 +106,7 @@ Verdict checkFolder(const platform::fs::path& folder, platform::SerialQueue& que
   for (const auto& entry : platform::fs::directory_iterator(folder)) {
     const std::string name = entry.path().filename().string();
     if (name.rfind("session.", 0) != 0) continue;
-    FileContainer container(entry.path(), tavixdUserAgent(), queue, kMaxFileSize);
+    FileContainer container(entry.path(), tavixdSessionFileVersion(), queue, kMaxFileSize);
     auto record = container.readRecord();
     if (!record) {
       ++v.discarded;
@@ -115,7 +115,7 @@ Verdict checkFolder(const platform::fs::path& folder, platform::SerialQueue& que
     ++v.accepted;
     if (platform::fs::file_size(entry.path()) > record->ByteSizeLong()) ++v.cutShort;
     EXPECT_TRUE(known(record->agent())) << name << " header agent '" << record->agent() << "'";
-    EXPECT_EQ(record->version(), tavixdUserAgent()) << name;
+    EXPECT_EQ(record->version(), tavixdSessionFileVersion()) << name;
     for (const auto& f : record->feedbacks()) {
       ++v.events;
       EXPECT_TRUE(known(f.user_agent())) << name << " event agent '" << f.user_agent() << "'";
@@ -134,7 +134,7 @@ TEST(FeedbackReliability, SessionFilesSurviveAKillAtAnyPoint) {
   platform::DispatchPool pool{1};
   platform::SerialQueue queue(pool, "com.norvel.tavixd.persistentStorageQueue");
   const platform::fs::path folder = home.cache() / "com.norvel.tavixd";
-  std::mt19937 random(std::random_device{}());
+  std::mt19937 random(testing::testSeed());
   int highest = -1;
   int totalAccepted = 0;
 
@@ -155,10 +155,11 @@ TEST(FeedbackReliability, SessionFilesSurviveAKillAtAnyPoint) {
         }
       });
     }
-    // The kill lands while sessions are being written, not before the first one exists.
+    // The kill lands while sessions are being written: after the first file exists and a random
+    // number of clients have come and gone.
     ASSERT_TRUE(daemon->waitForLog("new file url")) << daemon->log();
-    std::uniform_int_distribution<int> pause(0, 300);
-    std::this_thread::sleep_for(std::chrono::milliseconds(pause(random)));
+    const std::size_t nth = std::uniform_int_distribution<std::size_t>(1, 150)(random);
+    testing::waitFor([&] { return testing::occurrences(daemon->log(), "client configuration") >= nth; }, 10000);
     daemon->signal(SIGKILL);
     EXPECT_EQ(daemon->waitExit(5000), 128 + SIGKILL);
     stop.store(true);
@@ -178,11 +179,11 @@ TEST(FeedbackReliability, SessionFilesSurviveAKillAtAnyPoint) {
       auto it = reported.begin();
       std::advance(it, std::uniform_int_distribution<std::size_t>(0, reported.size() - 1)(random));
       const platform::fs::path victim = it->second;
-      auto before = FileContainer(victim, tavixdUserAgent(), queue, kMaxFileSize).readRecord();
+      auto before = FileContainer(victim, tavixdSessionFileVersion(), queue, kMaxFileSize).readRecord();
       const auto size = platform::fs::file_size(victim);
       if (before && size > 0) {
         platform::fs::resize_file(victim, std::uniform_int_distribution<std::uintmax_t>(0, size - 1)(random));
-        auto after = FileContainer(victim, tavixdUserAgent(), queue, kMaxFileSize).readRecord();
+        auto after = FileContainer(victim, tavixdSessionFileVersion(), queue, kMaxFileSize).readRecord();
         if (after) {
           EXPECT_LE(after->feedbacks_size(), before->feedbacks_size());
           for (int i = 0; i < after->feedbacks_size(); ++i) {

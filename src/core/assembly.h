@@ -39,6 +39,7 @@ class AppWhitelistController;
 class TavixPersistentStorage;
 class LocationManager;
 class MotionManager;
+class ResourceVersionsProvider;
 
 class Assembly {
  public:
@@ -73,6 +74,9 @@ class Assembly {
   std::shared_ptr<TavixPersistentStorage> persistentStorage;
   std::shared_ptr<LocationManager> locationManager;
   std::shared_ptr<MotionManager> motionManager;
+  // The resource versions each new feedback session records; the download manager's, once it is
+  // built. Empty until then.
+  std::shared_ptr<ResourceVersionsProvider> resourceVersions;
 
   // The bag controller asks before it reads or writes its disk cache; always true.
   bool diskBagCacheEnabled() const { return true; }

@@ -77,9 +77,24 @@ BackgroundUploadSession::BackgroundUploadSession(std::shared_ptr<platform::http:
   if (auto ec = platform::createDirectory(journal_, true, 0700)) {
     log().error("cannot create the upload journal {}: {}", journal_.string(), ec.message());
   }
+  // What a crash left half-written: a body whose task never followed, the temporary file of an
+  // atomic write. Neither would ever be sent or removed.
   std::error_code ec;
+  std::vector<platform::fs::path> orphans;
   for (const auto& item : platform::fs::directory_iterator(journal_, ec)) {
-    nextJournalNumber_ = std::max(nextJournalNumber_, journalNumber(item.path().stem().string()) + 1);
+    const auto& path = item.path();
+    const bool temporary = path.filename().string().rfind('.', 0) == 0;
+    const bool lonelyBody = path.extension() == kBodySuffix &&
+                            !platform::fs::exists(journal_ / (path.stem().string() + kTaskSuffix));
+    if (temporary || lonelyBody) {
+      orphans.push_back(path);
+      continue;
+    }
+    nextJournalNumber_ = std::max(nextJournalNumber_, journalNumber(path.stem().string()) + 1);
+  }
+  for (const auto& orphan : orphans) {
+    log().notice("removing orphan upload journal file {}", orphan.filename().string());
+    platform::fs::remove(orphan, ec);
   }
 }
 

@@ -5,7 +5,8 @@
 // it once the server has answered or the transfer has failed. A task that was still on its way
 // when the process stopped is found in the journal by resumePendingTasks() at the next start and
 // sent again. Failures are final: the delegate hears of them and the entry is forgotten; only a
-// transfer cancelled because the transport went away stays for the next start.
+// transfer cancelled because the transport went away stays for the next start. Files a crash
+// left half-way (a body without its task, a temporary file) are removed when the session is made.
 //
 // Threading: owns the serial queue "com.norvel.tavixd.uploadsession"; the task table lives there.
 // Every public method is safe from any thread. Delegate calls and getAllTasks() callbacks run on

@@ -1,5 +1,7 @@
 #include "delivery/custom_feedback_flusher.h"
 
+#include <sys/stat.h>
+
 #include <algorithm>
 
 #include "bag/tavix_bag_controller.h"
@@ -14,6 +16,7 @@
 #include "feedback/tavix_feedback.h"
 #include "context/user_guid_controller.h"
 #include "network/user_agent.h"
+#include "platform/clock.h"
 #include "tavix_proto/feedback_records.pb.h"
 
 namespace tavix {
@@ -24,9 +27,30 @@ platform::Logger& flusherLog() { return TavixLogForCategory(TavixLoggingCategory
 
 // An oversize item is reported as a session of its own whose only event is the error.
 void reportOversizeItem(Assembly& assembly, std::uint64_t size, const std::string& type) {
-  // The record has no user-info dictionary; its two entries travel in the reason.
-  ClientSession::createFeedbackSessionFromError(4, kTVXErrorDomain, "size=" + std::to_string(size) + " type=" + type,
-                                                assembly);
+  proto::CTErrorFeedback error;
+  error.set_code(4);
+  error.set_domain(kTVXErrorDomain);
+  auto& info = *error.mutable_user_info()->mutable_fields();
+  info["size"].set_number_value(static_cast<double>(size));
+  info["type"].set_string_value(type);
+  ClientSession::createFeedbackSessionFromError(std::move(error), assembly);
+}
+
+// Whether an item was written to so recently that its writer may not be done with it. A time in
+// the future (a clock set back) does not hold an item for ever.
+bool stillBeingWritten(const platform::fs::path& item, platform::TimePoint now) {
+  struct stat st {};
+  if (::stat(item.c_str(), &st) != 0) return false;
+  const double modified = static_cast<double>(st.st_mtim.tv_sec) + st.st_mtim.tv_nsec / 1e9;
+  const double age = platform::toUnixSeconds(now) - modified;
+  return age >= 0 && age < kCustomFeedbackSettleSeconds;
+}
+
+void removeItem(const platform::fs::path& item) {
+  std::error_code removeError;
+  if (!platform::fs::remove(item, removeError) || removeError) {
+    flusherLog().notice("Failed to remove custom feedback: {}", removeError ? removeError.message() : item.string());
+  }
 }
 
 }  // namespace
@@ -95,8 +119,14 @@ void TavixCustomFeedbackFlusher::flushCustomFeedbackWithCompletionHandler(const 
     }
     std::int64_t limit = bag ? bag->maximumSizeForFeedbackType(type) : 0;
     const std::uint64_t maximum = limit > 0 ? static_cast<std::uint64_t>(limit) : kDefaultCustomFeedbackLimit;
+    const platform::TimePoint now = assembly_.clock ? assembly_.clock->now() : platform::TimePoint{};
     for (const auto& item : items) {
       if (item.empty()) continue;
+      // An item its writer may still be filling is left for a later run, not sent cut short.
+      if (assembly_.clock && stillBeingWritten(item, now)) {
+        flusherLog().info("Custom feedback {} is still being written; left for later", item.string());
+        continue;
+      }
       std::error_code sizeError;
       const std::uint64_t size = platform::fs::file_size(item, sizeError);
       if (sizeError) continue;
@@ -104,14 +134,15 @@ void TavixCustomFeedbackFlusher::flushCustomFeedbackWithCompletionHandler(const 
         reportOversizeItem(assembly_, size, type);
         TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.customfeedback." + type + ".filetoolarge");
         flusherLog().error("Custom feedback item {} too big to process: {}", type, size);
+        removeItem(item);
       } else if (assembly_.uploadManager) {
-        assembly_.uploadManager->uploadFeedback(item, type, kFeedbackEndpoint);
-      }
-    }
-    for (const auto& item : items) {
-      std::error_code removeError;
-      if (!platform::fs::remove(item, removeError) || removeError) {
-        flusherLog().notice("Failed to remove custom feedback: {}", removeError ? removeError.message() : item.string());
+        // Removed once its upload is journalled (or can never be sent); kept when it changed
+        // while it was read or could not be taken this time.
+        assembly_.uploadManager->uploadFeedback(item, type, kFeedbackEndpoint, [item](UploadOutcome outcome) {
+          if (outcome != UploadOutcome::kSourceChanged && outcome != UploadOutcome::kNotNow) removeItem(item);
+        });
+      } else {
+        removeItem(item);
       }
     }
   }

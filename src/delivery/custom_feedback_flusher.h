@@ -1,7 +1,9 @@
 // Custom feedback: files that other components leave in per-type folders under
 // "<caches>/com.norvel.tavixd/CustomFeedback", each uploaded as it is (compressed) with its type,
 // then deleted; then the crowdsourcing reports of the report store. Items larger than the bag's
-// limit for their type are not uploaded: an error session (code 4) reports them instead.
+// limit for their type are not uploaded: an error session (code 4, user info "size" and "type")
+// reports them instead. An item goes once its upload is journalled; one that is still being
+// written (changed within the last seconds, or while it was read) waits for a later run.
 //
 // Threading: a run executes on the caller's thread from start to end; the upload manager
 // compresses there too and enqueues background uploads.
@@ -37,6 +39,8 @@ const std::vector<std::string>& customFeedbackTypesInFlushOrder();
 
 // Bytes a custom-feedback item may have when the bag names no limit for its type.
 inline constexpr std::uint64_t kDefaultCustomFeedbackLimit = 2097152;
+// An item modified less than this long ago may still be being written: it waits for a later run.
+inline constexpr double kCustomFeedbackSettleSeconds = 2;
 
 class TavixCustomFeedbackFlusher {
  public:

@@ -64,28 +64,35 @@ void TavixFeedbackFlusher::forceFlushWithCompletion(std::function<void()> comple
   if (assembly_.transactions) *transaction = assembly_.transactions->begin("com.norvel.tavixd.feedbackFlusherTx");
   // One queue per run: files are read and deleted one at a time, in list order.
   auto runQueue = std::make_shared<platform::SerialQueue>(*assembly_.dispatchPool, "com.norvel.tavixd.feedbackFlusherQueue");
+  // The run is over once every session it took is either on its way or given back.
+  runGroup_ = std::make_shared<platform::DispatchGroup>(*runQueue, [runQueue, transaction, completion = std::move(completion)] {
+    if (completion) completion();
+    transaction->reset();
+  });
   auto channel = assembly_.flusherIPCListener;
   auto storage = assembly_.persistentStorage;
   const auto files = storage ? storage->getAvailableSessionHandles() : std::vector<std::shared_ptr<FileContainer>>{};
   auto self = shared_from_this();
   for (const auto& file : files) {
     runQueue->async([self, file, storage, channel] {
+      // Taken by rename, so that a dump and a periodic run never send one session twice.
+      auto claimed = storage->claimSessionWithFileContainer(file);
+      if (!claimed) return;
       std::shared_ptr<ClientSession> session;
-      if (auto record = file->readRecord()) session = ClientSession::fromRecord(self->assembly_, std::move(*record));
-      // Unreadable files (too large, another version, empty, corrupt) go too: they never would be.
-      storage->deleteSessionWithFileContainer(file);
-      if (!session) return;
+      if (auto record = claimed->readRecord()) session = ClientSession::fromRecord(self->assembly_, std::move(*record));
+      if (!session) {
+        // Unreadable files (too large, another version, empty, corrupt) go: they never would be.
+        storage->deleteSessionWithFileContainer(claimed);
+        return;
+      }
+      session->setStorageHandle(claimed);
       self->flushSyncFromArray({session});
       std::vector<std::string> bodies;
       self->flushToWireSync(channel ? &bodies : nullptr);
       if (channel && !bodies.empty()) channel->sendDataToSendingStreamListener(std::move(bodies));
     });
   }
-  // The queue is serial: this runs once every file above has been handled.
-  runQueue->async([runQueue, transaction, completion = std::move(completion)]() mutable {
-    if (completion) completion();
-    transaction->reset();
-  });
+  runQueue->async([group = runGroup_] { group->leave(); });
 }
 
 void TavixFeedbackFlusher::flush(std::shared_ptr<ClientSession> session, std::function<void()> callback) {
@@ -122,9 +129,26 @@ std::vector<std::string> TavixFeedbackFlusher::flushToWireWithObjectsReturned(bo
   flusherLog().debug("Sessions Flushed {}", sessionBuffer_.size());
   std::vector<std::string> bodies;
   auto uploads = assembly_.uploadManager;
+  auto storage = assembly_.persistentStorage;
   for (const auto& session : sessionBuffer_) {
     if (!uploads) break;
-    auto file = uploads->uploadJSONFeedback(session->getFeedbacksToSend(), identifier_);
+    // A session read from a claimed file: the file goes once the upload is journalled (or can
+    // never be sent), and is given back when the upload could not be taken this time. Either
+    // way no crash loses it: a claimed file waits again at the next start.
+    auto handle = session->storageHandle();
+    auto group = runGroup_;
+    if (group) group->enter();
+    auto resolve = [storage, handle, group](UploadOutcome outcome) {
+      if (storage && handle) {
+        if (outcome == UploadOutcome::kNotNow) {
+          storage->unclaimSessionWithFileContainer(handle);
+        } else {
+          storage->deleteSessionWithFileContainer(handle);
+        }
+      }
+      if (group) group->leave();
+    };
+    auto file = uploads->uploadJSONFeedback(session->getFeedbacksToSend(), identifier_, std::move(resolve));
     if (!returnObjects || !file) continue;
     if (auto contents = file->readContents()) {
       bodies.push_back(std::move(*contents));

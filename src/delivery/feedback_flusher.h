@@ -3,7 +3,9 @@
 // and hands that to the upload manager, one compressed upload per session. When the flush
 // command channel exists, the compressed bodies also go to it.
 //
-// Deletion comes before the upload: a session whose upload fails is lost, never retried.
+// A run claims each file (a rename) before it reads it, so two runs never send one session, and
+// deletes it only once its upload is in the upload journal; a session that could not be handed
+// over this time is given back for a later run. A failed upload itself is not retried.
 //
 // Threading: owns the serial queue "com.norvel.tavixd.tavixDataBufferQueue" (`queueBuffer`),
 // which guards the session buffer and the sending; a run reads and deletes files on a queue of
@@ -42,8 +44,9 @@ class TavixFeedbackFlusher : public std::enable_shared_from_this<TavixFeedbackFl
   // Only from RUN: moves the activity to CONTINUE, flushes everything, then sets DONE.
   void performPeriodicFlushActivity(const std::shared_ptr<platform::Activity>& activity);
 
-  // Flushes every waiting session file; `completion` runs (on the run's queue) once all are
-  // handled. Holds the transaction "com.norvel.tavixd.feedbackFlusherTx" until then.
+  // Flushes every waiting session file; `completion` runs (on the run's queue) once each is
+  // journalled for upload, discarded, or given back. Holds the transaction
+  // "com.norvel.tavixd.feedbackFlusherTx" until then. One run per flusher.
   void forceFlushWithCompletion(std::function<void()> completion);
 
   // Asynchronously on queueBuffer: appends the session, then calls `callback`.
@@ -70,6 +73,8 @@ class TavixFeedbackFlusher : public std::enable_shared_from_this<TavixFeedbackFl
   Assembly& assembly_;
   std::vector<std::shared_ptr<ClientSession>> sessionBuffer_;  // on queueBuffer_
   platform::SerialQueue queueBuffer_;
+  // The run under way (forceFlushWithCompletion); its uploads enter it until resolved.
+  std::shared_ptr<platform::DispatchGroup> runGroup_;
   // Kept for counting feedback per run; no flow uses it today.
   platform::SerialQueue feedbackCountQueue_;
   int identifier_ = 1;

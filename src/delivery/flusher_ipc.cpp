@@ -35,21 +35,6 @@ void send(const std::shared_ptr<platform::ipc::IpcConnection>& remote, const pro
   }
 }
 
-// A dispatch group: notify() runs once every enter() has been matched by a leave().
-class Group {
- public:
-  Group(platform::SerialQueue& queue, std::function<void()> notify) : queue_(queue), notify_(std::move(notify)) {}
-  void enter() { ++pending_; }
-  void leave() {
-    if (--pending_ == 0) queue_.async(std::move(notify_));
-  }
-
- private:
-  std::atomic<int> pending_{1};  // the one who fills the group leaves last
-  platform::SerialQueue& queue_;
-  std::function<void()> notify_;
-};
-
 }  // namespace
 
 std::shared_ptr<TavixFlusherIPC> TavixFlusherIPC::create(Assembly& assembly, GetClientConnections getClientConnections) {
@@ -199,7 +184,7 @@ void TavixFlusherIPC::dump() {
     return;
   }
   std::weak_ptr<TavixFlusherIPC> weak = weak_from_this();
-  auto group = std::make_shared<Group>(flusherIpcQueue_, [weak] {
+  auto group = std::make_shared<platform::DispatchGroup>(flusherIpcQueue_, [weak] {
     auto self = weak.lock();
     if (!self) return;
     sessionLog().notice("dump command complete, calling -workDone");

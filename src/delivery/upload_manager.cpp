@@ -49,6 +49,7 @@ std::string headersDescription(const platform::http::HeaderFields& headers) {
 
 TempFile::~TempFile() {
   if (fd_ >= 0) ::close(fd_);
+  if (!path_.empty()) ::unlink(path_.c_str());
 }
 
 std::optional<std::string> TempFile::readContents() const {
@@ -137,6 +138,13 @@ std::optional<std::string> UploadManager::crowdsourcingEndpointFromBag(const TVX
 void UploadManager::takeEndpointsFromBag(const TVXBag* bag) {
   setFeedbackEndpoint(feedbackEndpointFromBag(bag));
   setCrowdsourcingEndpoint(crowdsourcingEndpointFromBag(bag));
+  if (bag) queue_.async([self = shared_from_this()] { self->endpointsFromBag_ = true; });
+}
+
+UploadOutcome UploadManager::outcomeWithoutEndpoint() {
+  bool fromBag = false;
+  queue_.sync([&] { fromBag = endpointsFromBag_; });
+  return fromBag ? UploadOutcome::kNoEndpoint : UploadOutcome::kNotNow;
 }
 
 void UploadManager::bagDidChange(const platform::Notification& notification) {
@@ -191,18 +199,22 @@ std::shared_ptr<TempFile> UploadManager::makeTempFileWithAnnotation(const std::o
   return nullptr;
 }
 
-std::shared_ptr<TempFile> UploadManager::uploadJSONFeedback(std::string_view json, int endpoint) {
+std::shared_ptr<TempFile> UploadManager::uploadJSONFeedback(std::string_view json, int endpoint, UploadCompletion done) {
+  auto finish = [&done](UploadOutcome outcome) {
+    if (done) done(outcome);
+    return nullptr;
+  };
   auto file = makeTempFileWithAnnotation("tavix");
   if (!file) {
     uploadLog().error("Error getting temp file.");
-    return nullptr;
+    return finish(UploadOutcome::kNotNow);
   }
   uploadLog().debug("Compressing data for upload to {}", file->path().string());
 
   const auto parsed = nlohmann::json::parse(json, nullptr, false);
   if (parsed.is_discarded()) {
     TavixLogForCategory(TavixLoggingCategorySession).error("Invalid JSON Object {} error {}", json, "not JSON");
-    return nullptr;
+    return finish(UploadOutcome::kInvalid);
   }
   const std::int64_t count = parsed.is_object() || parsed.is_array() ? static_cast<std::int64_t>(parsed.size()) : 0;
 
@@ -216,27 +228,38 @@ std::shared_ptr<TempFile> UploadManager::uploadJSONFeedback(std::string_view jso
   if (stream.status() != 1) {
     TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.feedbacknotsent");
     uploadLog().error("Compression for upload failed");
-    return nullptr;
+    return finish(UploadOutcome::kNotNow);
   }
   std::error_code ec;
   if (!platform::fs::exists(file->path(), ec)) {
     uploadLog().error("Couldn't find file {} after compression.", file->path().string());
-    return nullptr;
+    return finish(UploadOutcome::kNotNow);
   }
   const auto url = urlForEndpoint(endpoint, "");
-  if (!url) return file;
+  if (!url) {
+    finish(outcomeWithoutEndpoint());
+    return file;
+  }
   auto request = assembly_.requestFactory
                      ? assembly_.requestFactory->flusherUploadRequest(*url, kUploadTimeoutSeconds, stream.dataDigestForStream())
                      : std::nullopt;
-  if (request) enqueueRequest(std::move(*request), file->path(), count);
+  if (!request) {
+    finish(UploadOutcome::kNotNow);
+    return file;
+  }
+  enqueueRequest(std::move(*request), file, count, std::move(done));
   return file;
 }
 
-void UploadManager::uploadFeedback(const platform::fs::path& source, const std::string& type, int endpoint) {
+void UploadManager::uploadFeedback(const platform::fs::path& source, const std::string& type, int endpoint,
+                                   UploadCompletion done) {
+  auto finish = [&done](UploadOutcome outcome) {
+    if (done) done(outcome);
+  };
   const auto url = urlForEndpoint(endpoint, type);
   if (!url) {
     uploadLog().error("Server feedback endpoint not set, data can't be sent to server");
-    return;
+    return finish(outcomeWithoutEndpoint());
   }
   uploadLog().debug("uploadFile: {}", source.string());
   const int in = ::open(source.c_str(), O_RDONLY | O_CLOEXEC);
@@ -244,50 +267,69 @@ void UploadManager::uploadFeedback(const platform::fs::path& source, const std::
   if (!file) {
     uploadLog().error("Error getting temp file.");
     if (in >= 0) ::close(in);
-    return;
+    return finish(UploadOutcome::kNotNow);
   }
   uploadLog().debug("Compressing data for upload to {}", file->path().string());
   CompressedOutputStream stream(std::make_shared<FileOutputStream>(file->path()), file->path());
   stream.open();
   ssize_t lastRead = -1;
+  bool changed = false;
   if (in >= 0) {
+    struct stat before {};
+    ::fstat(in, &before);
+    std::uint64_t copied = 0;
     std::uint8_t chunk[kCopyChunkSize];
     for (;;) {
       lastRead = ::read(in, chunk, sizeof chunk);
       if (lastRead < 0 && errno == EINTR) continue;
       if (lastRead <= 0) break;
       stream.write(chunk, static_cast<std::size_t>(lastRead));
+      copied += static_cast<std::uint64_t>(lastRead);
     }
+    // A writer still at work shows in the size or the modification time: such a file is not
+    // sent half-written.
+    struct stat after {};
+    ::fstat(in, &after);
+    changed = copied != static_cast<std::uint64_t>(before.st_size) || after.st_size != before.st_size ||
+              after.st_mtim.tv_sec != before.st_mtim.tv_sec || after.st_mtim.tv_nsec != before.st_mtim.tv_nsec;
     ::close(in);
   }
   stream.close();
+  if (changed && lastRead != -1) {
+    uploadLog().notice("{} changed while it was read; left for later", source.string());
+    return finish(UploadOutcome::kSourceChanged);
+  }
   std::error_code ec;
   if (lastRead != -1 && stream.status() == 1 && platform::fs::exists(file->path(), ec)) {
     auto request = assembly_.requestFactory
                        ? assembly_.requestFactory->flusherUploadRequest(*url, kUploadTimeoutSeconds, stream.dataDigestForStream())
                        : std::nullopt;
     if (request) {
-      enqueueRequest(std::move(*request), file->path(), 0);
+      enqueueRequest(std::move(*request), file, 0, std::move(done));
       return;
     }
   }
   uploadLog().error("Compression for upload failed");
+  finish(in < 0 ? UploadOutcome::kInvalid : UploadOutcome::kNotNow);
 }
 
-void UploadManager::enqueueRequest(URLRequest request, const platform::fs::path& file,
-                                   std::optional<std::int64_t> numberOfFeedbacks) {
+void UploadManager::enqueueRequest(URLRequest request, std::shared_ptr<TempFile> file,
+                                   std::optional<std::int64_t> numberOfFeedbacks, UploadCompletion done) {
   std::weak_ptr<UploadManager> weak = weak_from_this();
-  session_->getAllTasks([weak, request = std::move(request), file, numberOfFeedbacks](
-                            std::vector<BackgroundUploadSession::TaskInfo> tasks) mutable {
+  // The closure holds the temporary file: it goes once the journal has its copy, or not.
+  session_->getAllTasks([weak, request = std::move(request), file = std::move(file), numberOfFeedbacks,
+                         done = std::move(done)](std::vector<BackgroundUploadSession::TaskInfo> tasks) mutable {
     auto self = weak.lock();
-    if (!self) return;
-    if (tasks.size() < kMaximumPendingUploads) {
-      uploadLog().debug("Enqueuing for upload: {}, headers {}", file.string(), headersDescription(request.headers));
-      self->session_->uploadTask(std::move(request), file, numberOfFeedbacks);
-    } else {
-      // Dropped; the temporary file is left to the system's cleaning of its temporary folder.
+    UploadOutcome outcome = UploadOutcome::kNotNow;
+    if (self && tasks.size() < kMaximumPendingUploads) {
+      uploadLog().debug("Enqueuing for upload: {}, headers {}", file->path().string(), headersDescription(request.headers));
+      if (self->session_->uploadTask(std::move(request), file->path(), numberOfFeedbacks)) {
+        outcome = UploadOutcome::kJournaled;
+      }
+    } else if (self) {
       uploadLog().error("too many uploads pending: {}", tasks.size());
     }
+    if (done) done(outcome);
   });
 }
 

@@ -12,6 +12,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -27,8 +28,8 @@ namespace tavix {
 class Assembly;
 class TVXBag;
 
-// A temporary file that closes its descriptor when released; the file itself stays (the
-// platform's temporary folder is cleaned by others).
+// A temporary file, removed (and its descriptor closed) when the last holder lets it go: by then
+// its contents are in the upload journal, or the upload was given up.
 class TempFile {
  public:
   TempFile(int fd, platform::fs::path path) : fd_(fd), path_(std::move(path)) {}
@@ -49,6 +50,16 @@ class TempFile {
 inline constexpr int kCrowdsourcingEndpoint = 0;
 inline constexpr int kFeedbackEndpoint = 1;
 
+// What became of an upload, for the caller who must decide whether its source may go.
+enum class UploadOutcome {
+  kJournaled,      // in the upload journal: it will be sent, across restarts too
+  kNoEndpoint,     // the bag names no endpoint for it (feedback is off): it never will be
+  kInvalid,        // the source cannot be encoded: it never will be
+  kSourceChanged,  // the file grew or changed while it was read: it is still being written
+  kNotNow,         // not taken this time (no bag yet, too many uploads pending, disk trouble)
+};
+using UploadCompletion = std::function<void(UploadOutcome)>;
+
 class UploadManager : public std::enable_shared_from_this<UploadManager>, public BackgroundUploadSession::Delegate {
  public:
   // Uploads pending in the session beyond which new ones are dropped.
@@ -67,12 +78,15 @@ class UploadManager : public std::enable_shared_from_this<UploadManager>, public
   // Compresses `json` (JSON text) and enqueues it for the endpoint `endpoint`; the upload reports
   // the record's element count (keys of an object) as its number of feedbacks. Returns the
   // temporary file holding exactly the compressed body, or null when it stopped early (invalid
-  // JSON, no temporary file, no endpoint).
-  std::shared_ptr<TempFile> uploadJSONFeedback(std::string_view json, int endpoint);
+  // JSON, no temporary file, no endpoint). `done` hears the outcome once: on the caller's thread
+  // when it stopped early, else on the upload session's queue.
+  std::shared_ptr<TempFile> uploadJSONFeedback(std::string_view json, int endpoint, UploadCompletion done = {});
 
   // Compresses the file's contents in 8192-byte chunks and enqueues them for `endpoint`, with
-  // "type" = `type` appended to the URL when not empty.
-  void uploadFeedback(const platform::fs::path& file, const std::string& type, int endpoint);
+  // "type" = `type` appended to the URL when not empty. A file that changes while it is read is
+  // not sent (kSourceChanged). `done` as above.
+  void uploadFeedback(const platform::fs::path& file, const std::string& type, int endpoint,
+                      UploadCompletion done = {});
 
   // A new "com.norvel.tavixd.upload_<annotation>_XXXXX" file in the temporary folder (mkstemp),
   // or null.
@@ -102,14 +116,17 @@ class UploadManager : public std::enable_shared_from_this<UploadManager>, public
   void bagDidChange(const platform::Notification& notification);
   void takeEndpointsFromBag(const TVXBag* bag);
   std::optional<std::string> urlForEndpoint(int endpoint, const std::string& type);
-  void enqueueRequest(platform::http::URLRequest request, const platform::fs::path& file,
-                      std::optional<std::int64_t> numberOfFeedbacks);
+  // Without an endpoint: whether that is the bag's word (no feedback) or there is no bag yet.
+  UploadOutcome outcomeWithoutEndpoint();
+  void enqueueRequest(platform::http::URLRequest request, std::shared_ptr<TempFile> file,
+                      std::optional<std::int64_t> numberOfFeedbacks, UploadCompletion done);
 
   Assembly& assembly_;
   std::shared_ptr<BackgroundUploadSession> session_;
   platform::SerialQueue queue_;
   std::optional<std::string> feedbackEndpoint_;       // on queue_
   std::optional<std::string> crowdsourcingEndpoint_;  // on queue_
+  bool endpointsFromBag_ = false;                     // on queue_: set once a bag gave them
   platform::NotificationCenter::Registration bagObserver_;
 };
 

@@ -6,6 +6,7 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <fstream>
 #include <future>
 #include <nlohmann/json.hpp>
@@ -121,6 +122,10 @@ class UploadManagerTest : public ::testing::Test {
 TEST_F(UploadManagerTest, EndpointsFollowTheBag) {
   make();
   EXPECT_FALSE(manager->feedbackEndpoint());
+  // No bag yet: not now, rather than never.
+  std::vector<UploadOutcome> outcomes;
+  auto note = [&](UploadOutcome outcome) { outcomes.push_back(outcome); };
+  manager->uploadJSONFeedback(R"({"fb":[]})", kFeedbackEndpoint, note);
   postBag({{"feedback_enabled", true},
            {"feedback_url", "https://fb.example/upload?client=1"},
            {"crowdsourcing_url", "https://cs.example/reports"}});
@@ -134,11 +139,13 @@ TEST_F(UploadManagerTest, EndpointsFollowTheBag) {
   EXPECT_FALSE(manager->feedbackEndpoint());
   EXPECT_FALSE(manager->crowdsourcingEndpoint());
   platform::LogCapture logs;
-  EXPECT_TRUE(manager->uploadJSONFeedback(R"({"fb":[]})", kFeedbackEndpoint));
+  EXPECT_TRUE(manager->uploadJSONFeedback(R"({"fb":[]})", kFeedbackEndpoint, note));
   const auto file = home.root() / "item";
   std::ofstream(file) << "custom";
-  manager->uploadFeedback(file, "BrovaneAutoFill", kFeedbackEndpoint);
+  manager->uploadFeedback(file, "BrovaneAutoFill", kFeedbackEndpoint, note);
   EXPECT_EQ(logs.count("Server feedback endpoint not set, data can't be sent to server"), 1u);
+  EXPECT_EQ(outcomes, (std::vector<UploadOutcome>{UploadOutcome::kNotNow, UploadOutcome::kNoEndpoint,
+                                                  UploadOutcome::kNoEndpoint}));
   EXPECT_EQ(pendingTasks(), 0u);
   EXPECT_TRUE(received().empty());
 
@@ -161,9 +168,12 @@ TEST_F(UploadManagerTest, UploadsReachTheServerCompressedWithTheirDigestAndAreCo
                        {"first_use", false},
                        {"base_time", 1},
                        {"previous_session_end_reason", 1}};
-  auto file = manager->uploadJSONFeedback(record.dump(), kFeedbackEndpoint);
+  std::atomic<bool> journaled{false};
+  auto file = manager->uploadJSONFeedback(record.dump(), kFeedbackEndpoint,
+                                          [&](UploadOutcome outcome) { journaled = outcome == UploadOutcome::kJournaled; });
   ASSERT_TRUE(file);
   EXPECT_NE(file->path().filename().string().find("com.norvel.tavixd.upload_tavix_"), std::string::npos);
+  ASSERT_TRUE(testing::waitFor([&] { return journaled.load(); }));
   ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sentBefore + 7; }));
   auto got = received();
   ASSERT_EQ(got.size(), 1u);
@@ -176,6 +186,18 @@ TEST_F(UploadManagerTest, UploadsReachTheServerCompressedWithTheirDigestAndAreCo
   std::string plain;
   ASSERT_TRUE(devserver::inflateRaw(*body, &plain));
   EXPECT_EQ(json::parse(plain), record);
+  // Once journalled and let go, the temporary body is gone.
+  const auto temporary = file->path();
+  file.reset();
+  EXPECT_FALSE(platform::fs::exists(temporary));
+
+  // The same body again (a session sent once more after a crash): the server answers it as
+  // accepted, keeps it once and counts the repeat.
+  manager->uploadJSONFeedback(record.dump(), kFeedbackEndpoint);
+  ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sentBefore + 14; }));
+  EXPECT_EQ(received().size(), 1u);
+  httplib::Client control("127.0.0.1", server.port());
+  EXPECT_EQ(json::parse(control.Get("/_feedback_repeats")->body)["repeats"], 1);
 
   // A file upload carries its type, goes out in one piece and counts as one.
   const auto item = home.root() / "autofill.bin";
@@ -183,14 +205,13 @@ TEST_F(UploadManagerTest, UploadsReachTheServerCompressedWithTheirDigestAndAreCo
   for (std::size_t i = 0; i < content.size(); i += 7) content[i] = static_cast<char>(i * 31);
   std::ofstream(item, std::ios::binary) << content;
   manager->uploadFeedback(item, "BrovaneAutoFill", kFeedbackEndpoint);
-  ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sentBefore + 8; }));
+  ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sentBefore + 15; }));
   got = received();
   ASSERT_EQ(got.size(), 2u);
   EXPECT_EQ(got[1]["type"], "BrovaneAutoFill");
   EXPECT_EQ(got[1]["size"], content.size());
 
   // The crowdsourcing endpoint takes no "v"; a server error is counted and not retried.
-  httplib::Client control("127.0.0.1", server.port());
   control.Post("/_faults", R"({"path": "/crowdsourcing", "status": 500, "times": 1})", "application/json");
   manager->uploadFeedback(item, "", kCrowdsourcingEndpoint);
   ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacknotsent") == notSentBefore + 1; }));
@@ -248,6 +269,9 @@ TEST_F(UploadManagerTest, PendingUploadsSurviveARestartAndAreSentOnce) {
   ASSERT_TRUE(restarted.start(options, &error)) << error;
   transport = std::make_shared<platform::http::URLSession>(platform::http::URLSessionConfiguration{});
   const auto sentBefore = counter("com.norvel.tavixd.feedbacksent");
+  // What a crash between a body and its task, or inside an atomic write, leaves: removed at start.
+  std::ofstream(home.cache() / "journal" / "upload.99.body") << "orphan";
+  std::ofstream(home.cache() / "journal" / ".upload.98.body.Xy12Ab") << "half";
   make();
   ASSERT_TRUE(testing::waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sentBefore + 2; }));
   httplib::Client client("127.0.0.1", port);

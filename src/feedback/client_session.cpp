@@ -11,6 +11,7 @@
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "core/names.h"
+#include "core/resource_versions.h"
 #include "feedback/cba_filter.h"
 #include "feedback/feedback_json.h"
 #include "feedback/persistent_storage.h"
@@ -55,7 +56,13 @@ std::optional<std::string> firstUseKeyForAgent(std::string_view agent) {
 ClientSession::ClientSession(Assembly& assembly)
     : assembly_(assembly), sessionQueue_(*assembly.dispatchPool, "com.norvel.tavixd.clientSessionQueue") {
   backingStore_.set_session_start(platform::toUnixSeconds(assembly.clock->now()));
-  backingStore_.set_version(tavixdUserAgent());
+  backingStore_.set_version(tavixdSessionFileVersion());
+}
+
+FeedbackRef makeDaemonErrorFeedback(proto::CTErrorFeedback error, Assembly& assembly) {
+  error.set_timestamp(hostTicksNow(assembly.clock));
+  const std::string guid = assembly.guidController ? assembly.guidController->currentUserGUID() : std::string();
+  return makeTavixFeedbackWithCodable(error, 0, guid, tavixdUserAgent());
 }
 
 FeedbackRef makeDaemonErrorFeedback(std::int64_t code, const std::string& domain, const std::string& reason,
@@ -64,8 +71,11 @@ FeedbackRef makeDaemonErrorFeedback(std::int64_t code, const std::string& domain
   error.set_code(static_cast<std::int32_t>(code));
   error.set_domain(domain);
   error.set_reason(reason);
-  const std::string guid = assembly.guidController ? assembly.guidController->currentUserGUID() : std::string();
-  return makeTavixFeedbackWithCodable(error, 0, guid, tavixdUserAgent());
+  return makeDaemonErrorFeedback(std::move(error), assembly);
+}
+
+void ClientSession::createFeedbackSessionFromError(proto::CTErrorFeedback error, Assembly& assembly) {
+  if (auto session = open(assembly, makeDaemonErrorFeedback(std::move(error), assembly))) session->sessionComplete();
 }
 
 void ClientSession::createFeedbackSessionFromError(std::int64_t code, const std::string& domain,
@@ -78,6 +88,7 @@ std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackR
   auto& store = session->backingStore_;
   if (first && !first->user_agent().empty()) store.set_agent(first->user_agent());
   if (first && !first->user_guid().empty()) store.set_user_guid_string(first->user_guid());
+  session->takeUserGuid();
   store.set_previous_session_end_reason(static_cast<proto::SessionEndReason::Value>(previousSessionEndReason));
   // Suggestion sessions are sent without their base time.
   if (first && feedbackType(*first) == kFeedbackTypeSuggestionEngagement) store.set_remove_timestamps(true);
@@ -100,8 +111,11 @@ std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackR
       session->recordFirstUse(now);
     }
   }
-  // The download manager supplies resource versions; until it is in the graph there are none.
-  store.clear_resource_versions();
+  if (assembly.resourceVersions) {
+    for (auto& [name, version] : assembly.resourceVersions->resourceVersions()) {
+      (*store.mutable_resource_versions())[name] = version;
+    }
+  }
 
   if (assembly.persistentStorage) {
     auto handle = assembly.persistentStorage->createFileContainerForWriting();
@@ -115,6 +129,7 @@ std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackR
 std::shared_ptr<ClientSession> ClientSession::fromRecord(Assembly& assembly, proto::CTClientSession record) {
   auto session = std::make_shared<ClientSession>(assembly);
   session->backingStore_ = std::move(record);
+  session->takeUserGuid();
   return session;
 }
 
@@ -142,6 +157,7 @@ void ClientSession::addFeedback(const FeedbackRef& feedback) {
   if (handle) handle->writeFeedback(*feedback);
   if (backingStore_.has_user_guid_string() && feedback->user_guid() != backingStore_.user_guid_string()) {
     proto::CTErrorFeedback error;
+    error.set_timestamp(hostTicksNow(assembly_.clock));
     error.set_domain(kTVXErrorDomain);
     error.set_code(500);
     error.set_reason("different guid in session");
@@ -261,12 +277,13 @@ std::string ClientSession::getFeedbacksToSend() {
 
 std::string ClientSession::agent() const { return backingStore_.agent(); }
 
-std::string ClientSession::userGuid() const {
+void ClientSession::takeUserGuid() {
+  // Asked for every event the session takes: worked out once.
   const std::string& text = backingStore_.user_guid_string();
-  if (!isValidUUIDString(text)) return {};
-  std::string upper = text;
-  std::transform(upper.begin(), upper.end(), upper.begin(), [](unsigned char c) { return std::toupper(c); });
-  return upper;
+  userGuid_.clear();
+  if (!isValidUUIDString(text)) return;
+  userGuid_ = text;
+  std::transform(userGuid_.begin(), userGuid_.end(), userGuid_.begin(), [](unsigned char c) { return std::toupper(c); });
 }
 
 bool ClientSession::firstUseOfTheDay() const { return backingStore_.first_use_of_the_day(); }

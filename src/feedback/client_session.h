@@ -27,13 +27,15 @@ class FileContainer;
 // vocly that the lower-cased agent contains; none otherwise.
 std::optional<std::string> firstUseKeyForAgent(std::string_view agent);
 
-// An error event of the daemon itself: query id 0, the current GUID, the daemon's user agent.
+// An error event of the daemon itself: query id 0, the current GUID, the daemon's user agent,
+// stamped now.
+FeedbackRef makeDaemonErrorFeedback(proto::CTErrorFeedback error, Assembly& assembly);
 FeedbackRef makeDaemonErrorFeedback(std::int64_t code, const std::string& domain, const std::string& reason,
                                     Assembly& assembly);
 
 class ClientSession {
  public:
-  // A bare session: sessionStart = now, version = the daemon's user agent. Used for read-back.
+  // A bare session: sessionStart = now, version = tavixdSessionFileVersion(). Used for read-back.
   explicit ClientSession(Assembly& assembly);
   ClientSession(const ClientSession&) = delete;
   ClientSession& operator=(const ClientSession&) = delete;
@@ -46,6 +48,7 @@ class ClientSession {
   // is reported.
   static void createFeedbackSessionFromError(std::int64_t code, const std::string& domain, const std::string& reason,
                                              Assembly& assembly);
+  static void createFeedbackSessionFromError(proto::CTErrorFeedback error, Assembly& assembly);
   // A session read back from a file.
   static std::shared_ptr<ClientSession> fromRecord(Assembly& assembly, proto::CTClientSession record);
 
@@ -68,17 +71,21 @@ class ClientSession {
   std::vector<std::string> feedbacksWithRelativeTimestamp();
 
   std::string agent() const;
-  std::string userGuid() const;  // empty unless the stored string is a valid UUID
+  const std::string& userGuid() const { return userGuid_; }  // empty unless the stored string is a valid UUID
   bool firstUseOfTheDay() const;
   int previousSessionEndReason() const;
   const proto::CTClientSession& backingStore() const { return backingStore_; }
   std::shared_ptr<FileContainer> storageHandle() const { return std::atomic_load(&storageHandle_); }
+  // The file a session read back for sending came from.
+  void setStorageHandle(std::shared_ptr<FileContainer> handle) { std::atomic_store(&storageHandle_, std::move(handle)); }
 
  private:
   void recordFirstUse(platform::TimePoint time);
+  void takeUserGuid();
 
   Assembly& assembly_;
   proto::CTClientSession backingStore_;
+  std::string userGuid_;
   std::shared_ptr<FileContainer> storageHandle_;
   platform::SerialQueue sessionQueue_;
 };

@@ -90,7 +90,7 @@ ClientSessionManager::ClientSessionManager(Assembly& assembly, std::shared_ptr<T
 }
 
 ClientSessionManager::~ClientSessionManager() {
-  for (auto& timer : timers_) timer.cancel();
+  for (auto& [id, timer] : timers_) timer.cancel();
 }
 
 void ClientSessionManager::addTavixFeedback(FeedbackRef feedback) {
@@ -129,7 +129,9 @@ void ClientSessionManager::flushSession(std::function<void()> done) {
 void ClientSessionManager::flushSessionInvalidationWithAgent(const std::string& agent,
                                                              std::function<void(bool)> callback) {
   if (assembly_.sharedSession) {
-    addTavixFeedback(makeTavixFeedbackWithCodable(proto::CTConnectionInvalidatedFeedback(), 0, "", agent));
+    proto::CTConnectionInvalidatedFeedback invalidated;
+    invalidated.set_timestamp(hostTicksNow(assembly_.clock));
+    addTavixFeedback(makeTavixFeedbackWithCodable(invalidated, 0, "", agent));
     if (callback) callback(false);
     return;
   }
@@ -162,6 +164,12 @@ bool ClientSessionManager::hasSession() {
   bool open = false;
   sessionQueue_.sync([&] { open = single_ || shared_; });
   return open;
+}
+
+std::size_t ClientSessionManager::pendingTimers() {
+  std::size_t count = 0;
+  sessionQueue_.sync([&] { count = timers_.size(); });
+  return count;
 }
 
 std::string ClientSessionManager::sessionGuid() const {
@@ -247,14 +255,24 @@ void ClientSessionManager::setNewSession(const FeedbackRef& feedback) {
   }
   log().notice("new session id {} {}", sessionCounter_, identifier_);
   // Fixed at 600 s whatever the soft-limit override: the override only moves maxTime.
-  std::weak_ptr<ClientSessionManager> weak = weak_from_this();
   const std::uint64_t expected = sessionCounter_;
-  timers_.push_back(assembly_.clock->after(platform::seconds(600), sessionQueue_, [weak, expected] {
+  schedule(platform::seconds(600), [expected](ClientSessionManager& self) {
+    log().notice("soft limit reached expected {} current {} {}", expected, self.sessionCounter_, self.identifier_);
+    if (expected == self.sessionCounter_) self.onSoftLimitReached();
+  });
+}
+
+void ClientSessionManager::schedule(platform::Duration delay, std::function<void(ClientSessionManager&)> task) {
+  sessionQueue_.assertCurrent("ClientSessionManager::schedule");
+  // A fired timer forgets its handle: the table holds only the timers still to come.
+  const std::uint64_t id = ++lastTimerId_;
+  std::weak_ptr<ClientSessionManager> weak = weak_from_this();
+  timers_[id] = assembly_.clock->after(delay, sessionQueue_, [weak, id, task = std::move(task)] {
     auto self = weak.lock();
     if (!self) return;
-    log().notice("soft limit reached expected {} current {} {}", expected, self->sessionCounter_, self->identifier_);
-    if (expected == self->sessionCounter_) self->onSoftLimitReached();
-  }));
+    self->timers_.erase(id);
+    task(*self);
+  });
 }
 
 void ClientSessionManager::onSoftLimitReached() {
@@ -264,26 +282,26 @@ void ClientSessionManager::onSoftLimitReached() {
   if (auto center = assembly_.notificationCenter) {
     sessionQueue_.async([center] { center->post(kTVXSessionSoftLimitNotification); });
   }
-  std::weak_ptr<ClientSessionManager> weak = weak_from_this();
   const std::uint64_t expected = sessionCounter_;
-  timers_.push_back(assembly_.clock->after(platform::seconds(static_cast<double>(maxTime_)), sessionQueue_,
-                                           [weak, expected] {
-    auto self = weak.lock();
-    if (!self) return;
-    log().notice("max timer expired expected {} current {}", expected, self->sessionCounter_);
-    if (expected == self->sessionCounter_ && (self->single_ || self->shared_)) {
-      self->updateState(kMaxTimerExpired, nullptr);
+  schedule(platform::seconds(static_cast<double>(maxTime_)), [expected](ClientSessionManager& self) {
+    log().notice("max timer expired expected {} current {}", expected, self.sessionCounter_);
+    if (expected == self.sessionCounter_) {
+      // Its own session already ended: nothing to close and nothing to announce.
+      if (!self.single_ && !self.shared_) return;
+      self.updateState(kMaxTimerExpired, nullptr);
     }
-    if (auto center = self->assembly_.notificationCenter) center->post(kTVXSessionMaxLimitNotification);
-  }));
+    // Posted also for an earlier session's timer: listeners clear their caches at this point.
+    if (auto center = self.assembly_.notificationCenter) center->post(kTVXSessionMaxLimitNotification);
+  });
 }
 
 void ClientSessionManager::flushSessionWithReason(int reason, std::function<void()> callback) {
   if (single_ || shared_) {
     flushReason_ = reason;
-    auto close = [reason](ClientSession& session) {
+    auto close = [this, reason](ClientSession& session) {
       if (reason != 0) {
         proto::CTSessionEndFeedback end;
+        end.set_timestamp(hostTicksNow(assembly_.clock));
         end.set_reason(static_cast<proto::SessionEndReason::Value>(reason));
         session.addFeedback(makeTavixFeedbackWithCodable(end, 0, session.userGuid(), session.agent()));
       }

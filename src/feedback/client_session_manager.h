@@ -91,6 +91,8 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   // Synchronous readers (not from the manager's queue).
   unsigned currentState();
   bool hasSession();
+  // How many of the manager's timers are still to fire.
+  std::size_t pendingTimers();
   std::int64_t softLimitTime() const { return softLimitTime_; }
   std::int64_t idleTime() const { return idleTime_; }
   std::int64_t maxTime() const { return maxTime_; }
@@ -101,6 +103,8 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   void updateState(unsigned event, const FeedbackRef& feedback, std::function<void()> callback = {});
   void setNewSession(const FeedbackRef& feedback);
   void onSoftLimitReached();
+  // Runs `task` on the session queue after `delay`, unless the manager is gone by then.
+  void schedule(platform::Duration delay, std::function<void(ClientSessionManager&)> task);
   void flushSessionWithReason(int reason, std::function<void()> callback = {});
   std::string sessionGuid() const;
   // Whether the loaded bag, as the client with this user agent sees it, lets feedback through.
@@ -118,7 +122,8 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   std::int64_t idleTime_ = 180;
   std::int64_t maxTime_ = 300;
   platform::TimePoint expirationTime_{};
-  std::vector<platform::TimerHandle> timers_;
+  std::map<std::uint64_t, platform::TimerHandle> timers_;  // the timers still to fire, by id
+  std::uint64_t lastTimerId_ = 0;
   platform::SerialQueue sessionQueue_;
   std::function<void(const proto::CTTavixFeedback&)> feedbackObserver_;
 };

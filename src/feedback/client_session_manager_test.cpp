@@ -159,6 +159,31 @@ TEST(ClientSessionManager, LimitsOverridesAndFlushes) {
   EXPECT_EQ(endReason(sessions[0]), 4);
 }
 
+TEST(ClientSessionManager, AMaxTimerAnnouncesOnlyWhatItDidNotCloseItself) {
+  ManagerFixture f;
+  int maxPosts = 0;
+  auto reg = f.assembly.notificationCenter->addObserver(kTVXSessionMaxLimitNotification, nullptr, nullptr,
+                                                        [&](const platform::Notification&) { ++maxPosts; });
+  f.send(39, 0);
+  f.advanceTo(600);  // session 1 past its soft limit: its max timer is due at 900
+  f.manager->flushSession();
+  f.send(39, 700);  // session 2
+  f.advanceTo(900);
+  EXPECT_EQ(maxPosts, 1) << "an earlier session's timer still announces the max limit";
+  EXPECT_EQ(f.manager->currentState(), 0u) << "... but leaves the later session open";
+
+  f.advanceTo(1300);  // session 2 past its soft limit, then closed before its own max timer
+  EXPECT_EQ(f.manager->currentState(), 1u);
+  f.manager->flushSession();
+  f.advanceTo(1600);
+  EXPECT_EQ(maxPosts, 1) << "a timer that finds its own session gone posts nothing";
+  EXPECT_EQ(f.manager->pendingTimers(), 0u) << "fired timers are forgotten";
+  auto sessions = f.closed();
+  ASSERT_EQ(sessions.size(), 2u);
+  EXPECT_EQ(endReason(sessions[0]), 2);
+  EXPECT_EQ(endReason(sessions[1]), 2);
+}
+
 TEST(ClientSessionManager, SharedSessionKeepsOneMemberPerClientAndClosesThemTogether) {
   ManagerFixture f(true);
   f.send(39, 0, "seekara/1");

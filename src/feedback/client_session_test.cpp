@@ -8,6 +8,7 @@
 
 #include "core/assembly.h"
 #include "core/diagnostics.h"
+#include "core/resource_versions.h"
 #include "feedback/persistent_storage.h"
 #include "platform/counters.h"
 #include "platform/defaults.h"
@@ -88,8 +89,13 @@ TEST(ClientSession, EventsReachTheFileAndAForeignGuidIsFlagged) {
   EXPECT_EQ(record.previous_session_end_reason(), 3);
 }
 
+struct FixedResourceVersions : ResourceVersionsProvider {
+  std::map<std::string, std::string> resourceVersions() const override { return {{"lookup_hints", "7"}}; }
+};
+
 TEST(ClientSession, UploadRecordIsPrivacyFilteredWithMissingObjectsFirst) {
   SessionFixture f;
+  f.assembly.resourceVersions = std::make_shared<FixedResourceVersions>();
   proto::CTSuggestionEngagementFeedback suggestion;
   suggestion.set_timestamp(5000000);
   suggestion.mutable_suggestion()->set_id("server-suggestion-42");
@@ -103,7 +109,7 @@ TEST(ClientSession, UploadRecordIsPrivacyFilteredWithMissingObjectsFirst) {
   EXPECT_EQ(upload["user_guid"], kGuid);
   EXPECT_EQ(upload["base_time"], 0);  // a session opened by a suggestion engagement
   EXPECT_EQ(upload["previous_session_end_reason"], "external_request");
-  EXPECT_EQ(upload["resource_versions"], nlohmann::json::object());
+  EXPECT_EQ(upload["resource_versions"], (nlohmann::json{{"lookup_hints", "7"}}));
   const auto& fb = upload["fb"];
   ASSERT_EQ(fb.size(), 4u);
   EXPECT_EQ(fb[0]["type"], "session_missing_suggestions");
@@ -113,6 +119,21 @@ TEST(ClientSession, UploadRecordIsPrivacyFilteredWithMissingObjectsFirst) {
   EXPECT_EQ(fb[2]["timestamp"], 0);
   EXPECT_EQ(fb[3]["timestamp"], 1000);
   EXPECT_EQ(upload.dump().find("device-result-7"), std::string::npos);
+}
+
+TEST(ClientSession, EventsWithoutTimeStampsAllSitAtZero) {
+  SessionFixture f;
+  auto appear = [](proto::AppearEvent::Value how) {
+    proto::CTSearchViewAppearFeedback record;
+    record.set_trigger_event(how);
+    return makeTavixFeedbackWithCodable(record, 0, kGuid, "news/1");
+  };
+  auto session = ClientSession::open(f.assembly, appear(proto::AppearEvent::swipe_down));
+  session->addFeedback(appear(proto::AppearEvent::orb));
+  session->addFeedback(appear(proto::AppearEvent::back));
+  auto upload = nlohmann::json::parse(ClientSession::fromRecord(f.assembly, f.readBack(*session))->getFeedbacksToSend());
+  ASSERT_EQ(upload["fb"].size(), 3u);
+  for (const auto& event : upload["fb"]) EXPECT_EQ(event["timestamp"], 0) << event;
 }
 
 TEST(ClientSession, BaseTimeIsTheTruncatedStartOrNothingForADamagedOne) {

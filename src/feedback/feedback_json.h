@@ -7,7 +7,8 @@
 
 namespace tavix::feedback_json {
 
-// A message's fields under their proto names, defaults included; null when it cannot be encoded.
+// The fields of a message that are set, under their proto names: numbers as numbers, enumerated
+// values by name, maps as objects; fields at their default are left out.
 nlohmann::json messageToJson(const google::protobuf::Message& message);
 
 // The dictionary form with "timestamp" = `timestamp`; an empty object when there is no event,

@@ -5,12 +5,17 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <fmt/format.h>
 #include <google/protobuf/io/coded_stream.h>
 #include <google/protobuf/wire_format_lite.h>
 
 #include <cerrno>
+#include <algorithm>
 #include <charconv>
+#include <condition_variable>
 #include <cstring>
+#include <deque>
+#include <thread>
 
 #include "core/assembly.h"
 #include "core/diagnostics.h"
@@ -29,6 +34,8 @@ using google::protobuf::internal::WireFormatLite;
 namespace {
 
 constexpr const char* kSessionPrefix = "session.";
+// A session a flush has taken, until it is safely on its way: not a waiting session any more.
+constexpr const char* kClaimedPrefix = "claimed.";
 constexpr int kFeedbacksFieldNumber = 100;
 
 platform::Logger& log() { return TavixLogForCategory(TavixLoggingCategoryFeedbackStorage); }
@@ -78,22 +85,22 @@ std::vector<std::size_t> completeFieldEnds(const char* data, std::size_t size) {
 }
 
 std::string encodeFeedbackField(const proto::CTTavixFeedback& feedback) {
-  std::string body = feedback.SerializeAsString();
+  const std::size_t size = feedback.ByteSizeLong();
   std::string out;
-  out.reserve(body.size() + 8);
-  std::uint32_t tag = WireFormatLite::MakeTag(kFeedbacksFieldNumber, WireFormatLite::WIRETYPE_LENGTH_DELIMITED);
-  while (tag >= 0x80) {
-    out.push_back(static_cast<char>((tag & 0x7F) | 0x80));
-    tag >>= 7;
-  }
-  out.push_back(static_cast<char>(tag));
-  std::uint64_t length = body.size();
-  while (length >= 0x80) {
-    out.push_back(static_cast<char>((length & 0x7F) | 0x80));
-    length >>= 7;
-  }
-  out.push_back(static_cast<char>(length));
-  out += body;
+  out.reserve(size + 12);
+  auto varint = [&out](std::uint64_t value) {
+    while (value >= 0x80) {
+      out.push_back(static_cast<char>((value & 0x7F) | 0x80));
+      value >>= 7;
+    }
+    out.push_back(static_cast<char>(value));
+  };
+  varint(WireFormatLite::MakeTag(kFeedbacksFieldNumber, WireFormatLite::WIRETYPE_LENGTH_DELIMITED));
+  varint(size);
+  const std::size_t head = out.size();
+  out.resize(head + size);
+  // The size was just computed: serialise into place without a second copy.
+  feedback.SerializeWithCachedSizesToArray(reinterpret_cast<std::uint8_t*>(out.data() + head));
   return out;
 }
 
@@ -115,19 +122,43 @@ std::optional<platform::TimePoint> creationDate(const fs::path& path, std::strin
 
 }  // namespace
 
+std::string sessionFileVersion(const DeviceInformation& device) {
+  return fmt::format("{} ({}; {} {}) {}", kTVXTavixdNameVersion, device.answer("ProductType"),
+                     device.answer("ProductName"), device.answer("ProductVersion"), kTVXTavixdNameVersion);
+}
+
+const std::string& tavixdSessionFileVersion() {
+  static const std::string version = sessionFileVersion(DeviceInformation(nullptr));
+  return version;
+}
+
+long SessionFileIO::write(int fd, const void* data, std::size_t size, std::int64_t offset) {
+  return ::pwrite(fd, data, size, static_cast<off_t>(offset));
+}
+int SessionFileIO::truncate(int fd, std::int64_t length) { return ::ftruncate(fd, static_cast<off_t>(length)); }
+int SessionFileIO::sync(int fd) { return ::fdatasync(fd); }
+
+SessionFileIO& SessionFileIO::system() {
+  static SessionFileIO io;
+  return io;
+}
+
 // ---- FileContainer --------------------------------------------------------------------------
 
 FileContainer::FileContainer(fs::path fileUrl, std::string version, platform::SerialQueue& queue,
-                             std::uint64_t maxFileSize, platform::TransactionTracker* transactions)
+                             std::uint64_t maxFileSize, platform::TransactionTracker* transactions,
+                             SessionFileIO* io)
     : fileUrl_(std::move(fileUrl)),
       version_(std::move(version)),
       queue_(queue),
       maxFileSize_(maxFileSize),
-      transactions_(transactions) {}
+      transactions_(transactions),
+      io_(io ? io : &SessionFileIO::system()) {}
 
 FileContainer::FileContainer(int fd, fs::path fileUrl, std::string version, platform::SerialQueue& queue,
-                             std::uint64_t maxFileSize, platform::TransactionTracker* transactions)
-    : FileContainer(std::move(fileUrl), std::move(version), queue, maxFileSize, transactions) {
+                             std::uint64_t maxFileSize, platform::TransactionTracker* transactions,
+                             SessionFileIO* io)
+    : FileContainer(std::move(fileUrl), std::move(version), queue, maxFileSize, transactions, io) {
   fd_ = fd;
 }
 
@@ -146,12 +177,12 @@ void FileContainer::writeSessionHeader(const proto::CTClientSession& header) {
   });
 }
 
-void FileContainer::writeFeedback(const proto::CTTavixFeedback& feedback, std::function<void()> done) {
+void FileContainer::writeFeedback(const proto::CTTavixFeedback& feedback, std::function<void(bool)> done) {
   std::string data = encodeFeedbackField(feedback);
   queue_.async([self = shared_from_this(), data = std::move(data), done = std::move(done)] {
     if (self->fd_ < 0) return;
-    self->appendData(data);
-    if (done) done();
+    const bool written = self->appendData(data);
+    if (done) done(written);
   });
 }
 
@@ -159,11 +190,16 @@ bool FileContainer::appendData(const std::string& data) {
   queue_.assertCurrent("FileContainer::appendData");
   platform::TransactionTracker::Transaction transaction;
   if (transactions_) transaction = transactions_->begin("archiveObject");
-  const off_t offset = ::lseek(fd_, 0, SEEK_END);
-  if (offset < 0) {
-    log().error("{}", errnoText(errno));
-    return false;
+  // Appends go where the last whole record ended; the container is the file's only writer.
+  if (written_ < 0) {
+    struct stat st {};
+    if (::fstat(fd_, &st) != 0) {
+      log().error("{}", errnoText(errno));
+      return false;
+    }
+    written_ = st.st_size;
   }
+  const std::int64_t offset = written_;
   if (static_cast<std::uint64_t>(offset) + data.size() >= maxFileSize_) {
     TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.filesizeexceeded");
     log().error("bytes written ({}) + feedback ({}) exceeds max session size ({})", static_cast<std::uint64_t>(offset),
@@ -173,14 +209,25 @@ bool FileContainer::appendData(const std::string& data) {
   }
   std::size_t written = 0;
   while (written < data.size()) {
-    const ssize_t n = ::write(fd_, data.data() + written, data.size() - written);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      log().error("{}", errnoText(errno));
+    const long n = io_->write(fd_, data.data() + written, data.size() - written, offset + static_cast<std::int64_t>(written));
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) {
+      // Disk full or an I/O error: whatever part of the record went out is cut off again, so the
+      // file ends on a whole record and the next event is not lost behind a broken one.
+      const std::string why = n < 0 ? errnoText(errno) : std::string("nothing written");
+      if (io_->truncate(fd_, offset) == 0) {
+        log().error("Could not append {} bytes to {}: {}; cut back to {} bytes", data.size(), fileUrl_.string(), why,
+                    offset);
+      } else {
+        log().error("Could not append {} bytes to {}: {}; nor cut it back ({}), closing it", data.size(),
+                    fileUrl_.string(), why, errnoText(errno));
+        closeNow();
+      }
       return false;
     }
     written += static_cast<std::size_t>(n);
   }
+  written_ = offset + static_cast<std::int64_t>(data.size());
   return true;
 }
 
@@ -194,6 +241,14 @@ void FileContainer::close() {
 void FileContainer::closeNow() {
   if (fd_ >= 0) ::close(fd_);
   fd_ = -1;
+  written_ = -1;
+}
+
+int FileContainer::detachDescriptor() {
+  const int fd = fd_;
+  fd_ = -1;
+  written_ = -1;
+  return fd;
 }
 
 bool FileContainer::isOpen() {
@@ -301,18 +356,71 @@ std::optional<proto::CTClientSession> FileContainer::unarchiveObject() {
 
 // ---- TavixPersistentStorage -----------------------------------------------------------------
 
-TavixPersistentStorage::TavixPersistentStorage(Assembly& assembly)
+// One thread and its job list. Jobs run in order; the thread drains them before it stops.
+struct TavixPersistentStorage::Syncer {
+  std::mutex lock;
+  std::condition_variable changed;
+  std::deque<std::function<void()>> jobs;
+  bool busy = false;
+  bool stopping = false;
+  std::thread thread{[this] { run(); }};
+
+  ~Syncer() {
+    {
+      std::lock_guard guard(lock);
+      stopping = true;
+    }
+    changed.notify_all();
+    thread.join();
+  }
+  void post(std::function<void()> job) {
+    {
+      std::lock_guard guard(lock);
+      jobs.push_back(std::move(job));
+    }
+    changed.notify_all();
+  }
+  bool morePending() {
+    std::lock_guard guard(lock);
+    return !jobs.empty();
+  }
+  void waitIdle() {
+    std::unique_lock guard(lock);
+    changed.wait(guard, [this] { return jobs.empty() && !busy; });
+  }
+  void run() {
+    std::unique_lock guard(lock);
+    for (;;) {
+      changed.wait(guard, [this] { return stopping || !jobs.empty(); });
+      if (jobs.empty()) return;
+      auto job = std::move(jobs.front());
+      jobs.pop_front();
+      busy = true;
+      guard.unlock();
+      job();
+      guard.lock();
+      busy = false;
+      changed.notify_all();
+    }
+  }
+};
+
+TavixPersistentStorage::TavixPersistentStorage(Assembly& assembly, std::shared_ptr<SessionFileIO> io)
     : assembly_(assembly),
+      io_(std::move(io)),
       queue_(*assembly.dispatchPool, "com.norvel.tavixd.persistentStorageQueue"),
       cachesUrl_(assembly.cachesFolder()),
-      version_(tavixdUserAgent()),
+      version_(tavixdSessionFileVersion()),
       maxFileSize_(static_cast<std::uint64_t>(assembly.userDefaults->integerForKey("TVXSessionSizeLimit"))),
-      maxFileAge_(assembly.userDefaults->integerForKey("TVXSessionMaxAge")) {
+      maxFileAge_(assembly.userDefaults->integerForKey("TVXSessionMaxAge")),
+      syncer_(std::make_unique<Syncer>()) {
   scanDirectory();
 }
 
 TavixPersistentStorage::~TavixPersistentStorage() {
-  queue_.sync([] {});  // let queued appends and deletions finish
+  queue_.sync([] {});   // let queued appends, closes and deletions finish
+  syncer_->waitIdle();  // ... and the closed files be synced (their jobs use the syncer)
+  syncer_.reset();
 }
 
 void TavixPersistentStorage::scanDirectory() {
@@ -326,6 +434,19 @@ void TavixPersistentStorage::scanDirectory() {
     if (ec != std::errc::no_such_file_or_directory) log().error("error scanning cache directory {}", ec.message());
     return;
   }
+  // A flush that stopped half-way left its claimed sessions: they wait again. Sent or not, they
+  // go out once more; the server knows a repeat by its digest.
+  std::vector<fs::path> claimed;
+  for (const auto& entry : it) {
+    if (entry.path().filename().string().rfind(std::string(kClaimedPrefix) + kSessionPrefix, 0) == 0) {
+      claimed.push_back(entry.path());
+    }
+  }
+  for (const auto& path : claimed) {
+    const fs::path waiting = path.parent_path() / path.filename().string().substr(std::strlen(kClaimedPrefix));
+    if (::rename(path.c_str(), waiting.c_str()) != 0) log().error("file renaming error {}", errnoText(errno));
+  }
+  it = fs::directory_iterator(cachesUrl_, ec);
   const platform::TimePoint now = assembly_.clock->now();
   std::int64_t largest = -1;
   for (const auto& entry : it) {
@@ -350,8 +471,7 @@ void TavixPersistentStorage::scanDirectory() {
     std::int64_t number = 0;
     const auto parsed = std::from_chars(digits.data(), digits.data() + digits.size(), number);
     const bool numeric = !digits.empty() && parsed.ec == std::errc() && parsed.ptr == digits.data() + digits.size();
-    fileContainers_.push_back(std::make_shared<FileContainer>(
-        url, version_.empty() ? tavixdUserAgent() : version_, queue_, maxFileSize_, assembly_.transactions));
+    fileContainers_.push_back(makeContainer(url));
     if (numeric && number > largest && number < INT32_MAX) largest = number;
   }
   if (largest >= 0) {
@@ -371,28 +491,96 @@ std::shared_ptr<FileContainer> TavixPersistentStorage::createFileContainerForWri
   }
   ::fchmod(fd, 0600);  // the umask must not widen or narrow it
   log().debug("new file url {}", url.string());
-  return std::make_shared<FileContainer>(fd, url, version(), queue_, maxFileSize_, assembly_.transactions);
+  return std::make_shared<FileContainer>(fd, url, version(), queue_, maxFileSize_, assembly_.transactions, io_.get());
+}
+
+std::shared_ptr<FileContainer> TavixPersistentStorage::makeContainer(fs::path url) {
+  const std::string v = version();
+  return std::make_shared<FileContainer>(std::move(url), v.empty() ? tavixdSessionFileVersion() : v, queue_,
+                                         maxFileSize_, assembly_.transactions, io_.get());
+}
+
+void TavixPersistentStorage::syncDirectory() {
+  const int dir = ::open(cachesUrl_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  if (dir < 0 || ::fsync(dir) != 0) log().error("could not sync {}: {}", cachesUrl_.string(), errnoText(errno));
+  if (dir >= 0) ::close(dir);
 }
 
 void TavixPersistentStorage::closeSessionWithFileContainer(std::shared_ptr<FileContainer> container) {
   if (!container) return;
   queue_.async([this, container] {
-    fileContainers_.push_back(container);
     log().debug("close file url {}", container->fileUrl().string());
+    const int fd = container->detachDescriptor();
+    // Durable before it counts as closed: the file's data, and its name in the folder. A file
+    // already closed (full) is opened again to be synced.
+    syncer_->post([this, container, fd] {
+      const int target = fd >= 0 ? fd : ::open(container->fileUrl().c_str(), O_RDONLY | O_CLOEXEC);
+      if (target < 0 || io().sync(target) != 0) {
+        log().error("could not sync {}: {}", container->fileUrl().string(), errnoText(errno));
+      }
+      if (target >= 0) ::close(target);
+      synced_.push_back(container);
+      // Files closed together (a shared session's members) share one sync of the folder.
+      if (syncer_->morePending()) return;
+      syncDirectory();
+      std::lock_guard guard(listLock_);
+      fileContainers_.insert(fileContainers_.end(), synced_.begin(), synced_.end());
+      synced_.clear();
+    });
+  });
+}
+
+std::shared_ptr<FileContainer> TavixPersistentStorage::claimSessionWithFileContainer(
+    const std::shared_ptr<FileContainer>& container) {
+  std::shared_ptr<FileContainer> claimed;
+  if (!container) return claimed;
+  queue_.sync([&] {
+    std::lock_guard guard(listLock_);
+    const auto it = std::find(fileContainers_.begin(), fileContainers_.end(), container);
+    if (it == fileContainers_.end()) return;  // taken by another flush, or deleted
+    const fs::path& from = container->fileUrl();
+    const fs::path to = from.parent_path() / (kClaimedPrefix + from.filename().string());
+    if (::rename(from.c_str(), to.c_str()) != 0) {
+      log().error("could not claim {}: {}", from.string(), errnoText(errno));
+      return;
+    }
+    fileContainers_.erase(it);
     container->closeNow();
+    claimed = makeContainer(to);
+  });
+  return claimed;
+}
+
+void TavixPersistentStorage::unclaimSessionWithFileContainer(std::shared_ptr<FileContainer> claimed) {
+  if (!claimed) return;
+  queue_.async([this, claimed] {
+    const fs::path& from = claimed->fileUrl();
+    const std::string name = from.filename().string();
+    if (name.rfind(kClaimedPrefix, 0) != 0) return;
+    const fs::path to = from.parent_path() / name.substr(std::strlen(kClaimedPrefix));
+    if (::rename(from.c_str(), to.c_str()) != 0) {
+      log().error("could not give back {}: {}", from.string(), errnoText(errno));
+      return;
+    }
+    std::lock_guard guard(listLock_);
+    fileContainers_.push_back(makeContainer(to));
   });
 }
 
 std::vector<std::shared_ptr<FileContainer>> TavixPersistentStorage::getAvailableSessionHandles() {
-  std::vector<std::shared_ptr<FileContainer>> copy;
-  queue_.sync([&] { copy = fileContainers_; });
-  return copy;
+  queue_.sync([] {});   // closes asked for before have reached the syncer
+  syncer_->waitIdle();  // ... and are listed
+  std::lock_guard guard(listLock_);
+  return fileContainers_;
 }
 
 void TavixPersistentStorage::deleteSessionWithFileContainer(std::shared_ptr<FileContainer> container) {
   if (!container) return;
   queue_.async([this, container] {
-    std::erase(fileContainers_, container);
+    {
+      std::lock_guard guard(listLock_);
+      std::erase(fileContainers_, container);
+    }
     container->closeNow();
     if (container->fileUrl().empty()) {
       log().fault("Handle {} does not have a File URL", static_cast<const void*>(container.get()));

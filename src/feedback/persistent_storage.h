@@ -33,15 +33,42 @@ namespace platform {
 class TransactionTracker;
 }
 
+class DeviceInformation;
+
+// The system calls session files are written and synced with. The storage uses the real ones;
+// tests hand in their own to make the disk fill up or fail.
+class SessionFileIO {
+ public:
+  virtual ~SessionFileIO() = default;
+  // Writes at `offset` (pwrite).
+  virtual long write(int fd, const void* data, std::size_t size, std::int64_t offset);
+  virtual int truncate(int fd, std::int64_t length);
+  // Makes the file's data durable (fdatasync).
+  virtual int sync(int fd);
+  // The real calls; shared by every container that is given none.
+  static SessionFileIO& system();
+};
+
+// What a session file carries as its version: the daemon's name and version and the device text
+// of its user agent without the kernel release, "<daemon> (<ProductType>; <ProductName>
+// <ProductVersion>) <daemon>". A kernel update keeps the files waiting to be sent; a daemon
+// upgrade (or a new OS release) discards them, since their records may differ.
+std::string sessionFileVersion(const DeviceInformation& device);
+// sessionFileVersion() of this machine, made once.
+const std::string& tavixdSessionFileVersion();
+
 // One session file. Shared (shared_ptr) by the session that writes it and the storage's list.
 class FileContainer : public std::enable_shared_from_this<FileContainer> {
  public:
-  // A file that already exists (found by the scan); nothing is opened.
+  // A file that already exists (found by the scan); nothing is opened. `io` defaults to the real
+  // system calls and must outlive the container.
   FileContainer(platform::fs::path fileUrl, std::string version, platform::SerialQueue& queue,
-                std::uint64_t maxFileSize, platform::TransactionTracker* transactions = nullptr);
+                std::uint64_t maxFileSize, platform::TransactionTracker* transactions = nullptr,
+                SessionFileIO* io = nullptr);
   // A file opened for writing; the container owns `fd`.
   FileContainer(int fd, platform::fs::path fileUrl, std::string version, platform::SerialQueue& queue,
-                std::uint64_t maxFileSize, platform::TransactionTracker* transactions = nullptr);
+                std::uint64_t maxFileSize, platform::TransactionTracker* transactions = nullptr,
+                SessionFileIO* io = nullptr);
   ~FileContainer();
   FileContainer(const FileContainer&) = delete;
   FileContainer& operator=(const FileContainer&) = delete;
@@ -50,11 +77,13 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   // not write session to file." and closes the file.
   void writeSessionHeader(const proto::CTClientSession& header);
 
-  // Asynchronously appends the event as field 100 while the file is open, then calls `done`
-  // (also when the append was refused for size). On a closed file nothing happens and `done` is
-  // not called. An append that would bring the file to maxFileSize bytes or more is refused,
-  // counted, and closes the file for good.
-  void writeFeedback(const proto::CTTavixFeedback& feedback, std::function<void()> done = {});
+  // Asynchronously appends the event as field 100 while the file is open, then calls `done` with
+  // whether the event is in the file (also when the append was refused). On a closed file nothing
+  // happens and `done` is not called. An append that would bring the file to maxFileSize bytes or
+  // more is refused, counted, and closes the file for good. A write that fails (disk full, I/O
+  // error) is cut back to the end of the last whole record and the file takes the next event; if
+  // it cannot be cut back, the file is closed there.
+  void writeFeedback(const proto::CTTavixFeedback& feedback, std::function<void(bool written)> done = {});
 
   // Synchronously on the queue: the file's session record, or nothing when the file is missing,
   // empty, larger than maxFileSize, unparsable before its first event, or of another version.
@@ -75,14 +104,17 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   friend class TavixPersistentStorage;
   bool appendData(const std::string& data);  // on queue
   void closeNow();                           // on queue
+  int detachDescriptor();                    // on queue: the file takes no more appends
   std::optional<proto::CTClientSession> unarchiveObject();  // on queue
 
   platform::fs::path fileUrl_;
   int fd_ = -1;
+  std::int64_t written_ = -1;  // on queue: where the next record goes; -1 until known
   std::string version_;
   platform::SerialQueue& queue_;
   std::uint64_t maxFileSize_;
   platform::TransactionTracker* transactions_;
+  SessionFileIO* io_;
 };
 
 class TavixPersistentStorage {
@@ -90,7 +122,9 @@ class TavixPersistentStorage {
   // Reads "TVXSessionSizeLimit" and "TVXSessionMaxAge" from the assembly's defaults and scans
   // the caches folder on the calling thread: files older than the age limit are deleted, the
   // others are listed as waiting sessions and new files are numbered after the largest found.
-  explicit TavixPersistentStorage(Assembly& assembly);
+  // Files of a flush that stopped half-way ("claimed.session.N") are waiting sessions again.
+  // `io` (for tests) replaces the system calls that write and sync the files.
+  explicit TavixPersistentStorage(Assembly& assembly, std::shared_ptr<SessionFileIO> io = nullptr);
   ~TavixPersistentStorage();
   TavixPersistentStorage(const TavixPersistentStorage&) = delete;
   TavixPersistentStorage& operator=(const TavixPersistentStorage&) = delete;
@@ -98,14 +132,27 @@ class TavixPersistentStorage {
   // A new "session.N" file (0600) opened for writing, or null when it cannot be made. Any thread.
   std::shared_ptr<FileContainer> createFileContainerForWriting();
 
-  // Asynchronously lists the container as waiting to be sent and closes its file.
+  // Asynchronously closes the file, makes it and the folder durable, then lists the container
+  // as waiting to be sent. The syncing runs on a thread of the storage's own, so that a slow
+  // device flush holds up neither the queue's appends nor the dispatch pool.
   void closeSessionWithFileContainer(std::shared_ptr<FileContainer> container);
-  // Synchronously: a copy of the waiting list.
+  // Synchronously: a copy of the waiting list, once every close asked for before is listed.
   std::vector<std::shared_ptr<FileContainer>> getAvailableSessionHandles();
   // Asynchronously unlists the container, closes it and deletes its file.
   void deleteSessionWithFileContainer(std::shared_ptr<FileContainer> container);
 
-  // The version new and scanned containers must carry (default: tavixdUserAgent()). Any thread.
+  // Synchronously takes a waiting session for sending: its file is renamed "claimed.session.N"
+  // and leaves the waiting list, so that no other flush takes it too. The container returned
+  // reads the renamed file; delete it (deleteSessionWithFileContainer) once the session is safely
+  // on its way, or give it back. Null when the session is not waiting any more (another flush
+  // took it) or the file cannot be renamed. Not from the storage's queue.
+  std::shared_ptr<FileContainer> claimSessionWithFileContainer(const std::shared_ptr<FileContainer>& container);
+  // Asynchronously gives a claimed session back: it is "session.N" again and waits for a later
+  // flush.
+  void unclaimSessionWithFileContainer(std::shared_ptr<FileContainer> claimed);
+
+  // The version new and scanned containers must carry (default: tavixdSessionFileVersion()).
+  // Any thread.
   std::string version();
   void setVersion(std::string version);
   platform::SerialQueue& queue() { return queue_; }
@@ -118,10 +165,20 @@ class TavixPersistentStorage {
  private:
   void scanDirectory();
 
+  std::shared_ptr<FileContainer> makeContainer(platform::fs::path url);
+  void syncDirectory();
+  SessionFileIO& io() { return io_ ? *io_ : SessionFileIO::system(); }
+
+  struct Syncer;  // the thread closed files are made durable on
+
   Assembly& assembly_;
+  std::shared_ptr<SessionFileIO> io_;
   platform::SerialQueue queue_;
   platform::fs::path cachesUrl_;
-  std::vector<std::shared_ptr<FileContainer>> fileContainers_;  // on queue_ (and the scan)
+  // Changed on queue_ and by the syncer, which lists closed files.
+  std::mutex listLock_;
+  std::vector<std::shared_ptr<FileContainer>> fileContainers_;
+  std::vector<std::shared_ptr<FileContainer>> synced_;  // the syncer's: durable, folder not yet
   // A lock rather than the queue: new files are made from other queues, and a synchronous hop
   // from a pool thread onto a busy pool could starve it.
   std::mutex versionLock_;
@@ -129,6 +186,7 @@ class TavixPersistentStorage {
   std::uint64_t maxFileSize_;
   std::int64_t maxFileAge_;
   std::atomic<std::int32_t> handleId_{0};
+  std::unique_ptr<Syncer> syncer_;
 };
 
 }  // namespace tavix

@@ -4,7 +4,11 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
+#include <atomic>
+#include <cerrno>
 #include <fstream>
+#include <limits>
+#include <mutex>
 
 #include "core/assembly.h"
 #include "core/diagnostics.h"
@@ -86,7 +90,23 @@ TEST(TavixPersistentStorage, ScanListsSessionsAndNumbersNewFilesAfterTheLargest)
   ASSERT_EQ(::stat(container->fileUrl().c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0600u);
   EXPECT_EQ(storage.createFileContainerForWriting()->fileUrl().filename(), "session.14");
-  EXPECT_EQ(storage.version(), tavixdUserAgent());
+  EXPECT_EQ(storage.version(), tavixdSessionFileVersion());
+}
+
+TEST(TavixPersistentStorage, AKernelUpdateKeepsTheFileVersionANewReleaseChangesIt) {
+  testing::TempHome root;
+  auto write = [&](const char* path, const std::string& text) {
+    fs::create_directories((root.root() / path).parent_path());
+    std::ofstream(root.root() / path) << text;
+  };
+  write("etc/os-release", "NAME=\"Debian GNU/Linux\"\nVERSION_ID=\"12\"\n");
+  write("proc/sys/kernel/osrelease", "6.1.0-27-amd64\n");
+  const std::string before = sessionFileVersion(DeviceInformation(nullptr, root.root()));
+  EXPECT_EQ(before.find("6.1.0"), std::string::npos) << before;
+  write("proc/sys/kernel/osrelease", "6.1.0-28-amd64\n");
+  EXPECT_EQ(sessionFileVersion(DeviceInformation(nullptr, root.root())), before);
+  write("etc/os-release", "NAME=\"Debian GNU/Linux\"\nVERSION_ID=\"13\"\n");
+  EXPECT_NE(sessionFileVersion(DeviceInformation(nullptr, root.root())), before);
 }
 
 TEST(TavixPersistentStorage, FilesPastTheAgeLimitAreDeletedAtStart) {
@@ -111,7 +131,7 @@ TEST(TavixPersistentStorage, SessionWrittenEventByEventReadsBackAndDeletes) {
   storage.closeSessionWithFileContainer(container);
   ASSERT_EQ(storage.getAvailableSessionHandles().size(), 1u);
   EXPECT_FALSE(container->isOpen());
-  container->writeFeedback(*event(4), [] { ADD_FAILURE() << "a closed file takes no events"; });
+  container->writeFeedback(*event(4), [](bool) { ADD_FAILURE() << "a closed file takes no events"; });
 
   auto session = container->readRecord();
   ASSERT_TRUE(session.has_value());
@@ -154,7 +174,7 @@ TEST(FileContainer, CutOffOrEmptyFilesKeepOnlyWhatIsWhole) {
 }
 
 TEST(FileContainer, SizeLimitRefusesReachingItButReadsAFileOfExactlyIt) {
-  const auto head = header(tavixdUserAgent());
+  const auto head = header(tavixdSessionFileVersion());
   const auto one = event(1);
   const std::uint64_t limit = head.ByteSizeLong() + encodedSize(*one);
 
@@ -165,7 +185,7 @@ TEST(FileContainer, SizeLimitRefusesReachingItButReadsAFileOfExactlyIt) {
     const auto before = counter("com.norvel.tavixd.filesizeexceeded");
     container->writeSessionHeader(head);
     bool done = false;
-    container->writeFeedback(*one, [&] { done = true; });
+    container->writeFeedback(*one, [&](bool written) { done = !written; });
     EXPECT_FALSE(container->isOpen());
     EXPECT_TRUE(done);  // told even though refused
     EXPECT_EQ(counter("com.norvel.tavixd.filesizeexceeded"), before + 1);
@@ -189,6 +209,117 @@ TEST(FileContainer, SizeLimitRefusesReachingItButReadsAFileOfExactlyIt) {
     EXPECT_FALSE(belowIt.readRecord().has_value());
     EXPECT_EQ(counter("com.norvel.tavixd.filetoolarge"), before + 1);
   }
+}
+
+// A disk that runs out of room: a write gets what room is left (a short write), the next one
+// ENOSPC. Cutting a file back can be made to fail too.
+class FillingDisk : public SessionFileIO {
+ public:
+  std::atomic<long> room{std::numeric_limits<long>::max()};
+  std::atomic<bool> truncateFails{false};
+  std::atomic<int> syncs{0};
+
+  long write(int fd, const void* data, std::size_t size, std::int64_t offset) override {
+    if (room.load() <= 0) {
+      errno = ENOSPC;
+      return -1;
+    }
+    const long n = std::min<long>(static_cast<long>(size), room.load());
+    room -= n;
+    return SessionFileIO::write(fd, data, static_cast<std::size_t>(n), offset);
+  }
+  int truncate(int fd, std::int64_t length) override {
+    if (truncateFails) {
+      errno = EIO;
+      return -1;
+    }
+    return SessionFileIO::truncate(fd, length);
+  }
+  int sync(int fd) override {
+    ++syncs;
+    return SessionFileIO::sync(fd);
+  }
+};
+
+TEST(FileContainer, AFullDiskLosesNoEventItAcknowledged) {
+  StorageFixture f;
+  auto disk = std::make_shared<FillingDisk>();
+  TavixPersistentStorage storage(f.assembly, disk);
+  auto container = storage.createFileContainerForWriting();
+  container->writeSessionHeader(header(storage.version()));
+  std::vector<std::string> acknowledged;
+  std::mutex lock;
+  auto write = [&](int n) {
+    container->writeFeedback(*event(n), [&, n](bool written) {
+      std::lock_guard guard(lock);
+      if (written) acknowledged.push_back("query " + std::to_string(n));
+    });
+    container->isOpen();  // the append has run
+  };
+  for (int n = 1; n <= 3; ++n) write(n);
+  disk->room = 5;  // event 4 gets five bytes in, then the disk is full
+  write(4);
+  disk->room = std::numeric_limits<long>::max();
+  write(5);
+  disk->room = 3;
+  disk->truncateFails = true;  // event 6 cannot even be cut back: the file closes there
+  write(6);
+  EXPECT_FALSE(container->isOpen());
+  disk->room = std::numeric_limits<long>::max();
+  write(7);
+  ASSERT_EQ(acknowledged, (std::vector<std::string>{"query 1", "query 2", "query 3", "query 5"}));
+
+  storage.closeSessionWithFileContainer(container);
+  ASSERT_EQ(storage.getAvailableSessionHandles().size(), 1u);
+  auto record = container->readRecord();
+  ASSERT_TRUE(record);
+  std::vector<std::string> read;
+  for (const auto& f : record->feedbacks()) read.push_back(f.payload().cache_hit().input());
+  EXPECT_EQ(read, acknowledged);
+
+  // A session closed whole is synced before it waits to be sent.
+  auto other = storage.createFileContainerForWriting();
+  other->writeSessionHeader(header(storage.version()));
+  const int before = disk->syncs;
+  storage.closeSessionWithFileContainer(other);
+  EXPECT_EQ(storage.getAvailableSessionHandles().size(), 2u);
+  EXPECT_EQ(disk->syncs, before + 1);
+}
+
+TEST(TavixPersistentStorage, AClaimedSessionIsTakenOnceAndWaitsAgainAfterACrash) {
+  StorageFixture f;
+  auto storage = std::make_unique<TavixPersistentStorage>(f.assembly);
+  for (int i = 0; i < 2; ++i) {
+    auto container = storage->createFileContainerForWriting();
+    container->writeSessionHeader(header(storage->version()));
+    container->writeFeedback(*event(i));
+    storage->closeSessionWithFileContainer(container);
+  }
+  const auto waiting = storage->getAvailableSessionHandles();
+  ASSERT_EQ(waiting.size(), 2u);
+  const fs::path name = waiting[0]->fileUrl();
+
+  auto claimed = storage->claimSessionWithFileContainer(waiting[0]);
+  ASSERT_TRUE(claimed);
+  EXPECT_FALSE(storage->claimSessionWithFileContainer(waiting[0])) << "a second flush finds it taken";
+  EXPECT_FALSE(fs::exists(name));
+  EXPECT_EQ(claimed->fileUrl().filename(), "claimed." + name.filename().string());
+  EXPECT_EQ(storage->getAvailableSessionHandles().size(), 1u);
+  ASSERT_TRUE(claimed->readRecord());
+
+  // Given back: it waits under its own name again.
+  storage->unclaimSessionWithFileContainer(claimed);
+  EXPECT_EQ(storage->getAvailableSessionHandles().size(), 2u);
+  EXPECT_TRUE(fs::exists(name));
+
+  // Claimed when the daemon stops: the next start finds it waiting.
+  for (const auto& handle : storage->getAvailableSessionHandles()) ASSERT_TRUE(storage->claimSessionWithFileContainer(handle));
+  EXPECT_TRUE(storage->getAvailableSessionHandles().empty());
+  storage.reset();
+  TavixPersistentStorage restarted(f.assembly);
+  EXPECT_EQ(restarted.getAvailableSessionHandles().size(), 2u);
+  EXPECT_TRUE(fs::exists(name));
+  EXPECT_GE(restarted.nextHandleId(), 2);
 }
 
 }  // namespace

@@ -85,6 +85,13 @@ void SessionProcessingHelper::process(Message* codable) {
       didExpand(*id);
     } else {
       didReference(*object, *id);
+      // A reference is its identifier: the object goes in full once per session, in the event
+      // that carries it whole or among the missing ones. One without an identifier stays whole.
+      if (!id->empty()) {
+        const std::string kept = *id;
+        object->Clear();
+        *identifierOf(object) = kept;
+      }
     }
   }
 }

@@ -1,7 +1,7 @@
 // Makes one session's events safe to upload: every result and suggestion identifier is replaced
 // by a session-local number ("1", "2", ...), and objects that events only referred to (engaged,
 // listed as visible) without ever carrying them in full (ranking events) are collected so the
-// session can send them once in full.
+// session can send them once in full. Referring events keep only the identifier of an object.
 //
 // One helper per session upload; not thread-safe (used on one queue at a time).
 #pragma once
@@ -22,7 +22,8 @@ class SessionProcessingHelper {
   SessionProcessingHelper() = default;
 
   // Replaces the identifiers of the objects `codable` carries (in place) and notes whether it
-  // carries them in full. Null is ignored.
+  // carries them in full; in an event that only refers to them, an object with an identifier is
+  // cut down to it. Null is ignored.
   void process(google::protobuf::Message* codable);
 
   // None for an empty identifier; the same number for an identifier seen before; else the next.

@@ -27,6 +27,7 @@ TEST(SessionProcessingHelper, IdentifiersBecomeStableSessionLocalNumbers) {
   proto::CTVisibleResultsFeedback visible;
   visible.add_results()->set_id("a");
   visible.add_results()->set_id("");
+  visible.mutable_results(1)->set_fbr("kept whole");
   helper.process(&first);
   helper.process(&second);
   helper.process(&third);
@@ -37,6 +38,7 @@ TEST(SessionProcessingHelper, IdentifiersBecomeStableSessionLocalNumbers) {
   EXPECT_EQ(third.result().id(), "1");
   EXPECT_EQ(visible.results(0).id(), "1");
   EXPECT_EQ(visible.results(1).id(), "");  // never counted as missing
+  EXPECT_EQ(visible.results(1).fbr(), "kept whole") << "without an identifier nothing else names it";
   EXPECT_FALSE(helper.replacementForIdentifier("").has_value());
   EXPECT_EQ(helper.replacementForIdentifier("c"), "3");
 }
@@ -69,6 +71,8 @@ TEST(SessionProcessingHelper, OnlyObjectsNeverSeenInFullAreMissing) {
   const auto missing = helper.missingResults();
   ASSERT_EQ(missing.size(), 1u);
   EXPECT_EQ(missing[0].fbr(), "first");
+  // The referring events keep only the identifier: the object goes in full once, above.
+  EXPECT_EQ(firstB.result().ShortDebugString(), "id: \"" + missing[0].id() + "\"");
   const auto missingSuggestions = helper.missingSuggestions();
   ASSERT_EQ(missingSuggestions.size(), 1u);
   EXPECT_EQ(missingSuggestions[0].id(), suggestion.suggestion().id());

@@ -1,13 +1,15 @@
 #include "feedback/tavix_feedback.h"
 
-#include <google/protobuf/util/json_util.h>
+#include <google/protobuf/struct.pb.h>
 
 #include <algorithm>
 #include <cctype>
+#include <cmath>
 
 #include "core/diagnostics.h"
 #include "feedback/feedback_json.h"
 #include "feedback/vocabulary.h"
+#include "platform/clock.h"
 
 namespace tavix {
 
@@ -16,8 +18,10 @@ using google::protobuf::Message;
 
 namespace {
 
-// Oneof fields of the payload are numbered type + 10.
+// Oneof fields of the payload are numbered type + 10; from 200 on they hold records without a
+// type of their own.
 constexpr int kPayloadFieldOffset = 10;
+constexpr int kFirstUntypedPayloadField = 200;
 
 const FieldDescriptor* payloadFieldFor(const google::protobuf::Descriptor* codable) {
   const auto* payload = proto::CTFeedbackPayload::descriptor();
@@ -55,6 +59,12 @@ FeedbackRef makeTavixFeedbackWithCodable(const Message& codable, std::int64_t qu
   return makeTavixFeedback(std::move(payload), queryId, userGuid, userAgent);
 }
 
+std::uint64_t hostTicksNow(const platform::Clock* clock) {
+  if (!clock) return 0;
+  const double seconds = platform::toUnixSeconds(clock->now());
+  return seconds > 0 ? static_cast<std::uint64_t>(seconds * 1e9) : 0;
+}
+
 int feedbackType(const proto::CTTavixFeedback& feedback) { return feedback.payload().type(); }
 
 const Message* feedbackCodable(const proto::CTFeedbackPayload& payload) {
@@ -78,7 +88,8 @@ std::uint64_t codableTimestamp(const Message* codable) {
 
 int codableType(const Message& codable) {
   const FieldDescriptor* field = payloadFieldFor(codable.GetDescriptor());
-  return field ? field->number() - kPayloadFieldOffset : kFeedbackTypeCodableFallback;
+  if (!field || field->number() >= kFirstUntypedPayloadField) return kFeedbackTypeCodableFallback;
+  return field->number() - kPayloadFieldOffset;
 }
 
 bool codableRequiresQueryId(const Message* codable) {
@@ -96,14 +107,99 @@ bool codableRequiresQueryId(const Message* codable) {
 
 namespace feedback_json {
 
+namespace {
+
+nlohmann::json structValueToJson(const google::protobuf::Value& value);
+
+// Whole numbers go out without a fraction, as the platform's JSON writer writes them: 4085, not
+// 4085.0. Beyond 2^53 a double holds no exact integer any more and stays a double.
+nlohmann::json number(double value) {
+  if (std::trunc(value) == value && std::fabs(value) < 9007199254740992.0) return static_cast<std::int64_t>(value);
+  return value;
+}
+
+nlohmann::json structToJson(const google::protobuf::Struct& object) {
+  nlohmann::json out = nlohmann::json::object();
+  for (const auto& [key, value] : object.fields()) out[key] = structValueToJson(value);
+  return out;
+}
+
+nlohmann::json structValueToJson(const google::protobuf::Value& value) {
+  switch (value.kind_case()) {
+    case google::protobuf::Value::kNumberValue: return number(value.number_value());
+    case google::protobuf::Value::kStringValue: return value.string_value();
+    case google::protobuf::Value::kBoolValue: return value.bool_value();
+    case google::protobuf::Value::kStructValue: return structToJson(value.struct_value());
+    case google::protobuf::Value::kListValue: {
+      nlohmann::json list = nlohmann::json::array();
+      for (const auto& item : value.list_value().values()) list.push_back(structValueToJson(item));
+      return list;
+    }
+    default: return nullptr;
+  }
+}
+
+// One value of `field` (element `index` of a repeated field, or the field itself for -1).
+nlohmann::json fieldValueToJson(const Message& message, const FieldDescriptor* field, int index) {
+  const auto* r = message.GetReflection();
+  const bool repeated = index >= 0;
+  switch (field->cpp_type()) {
+    case FieldDescriptor::CPPTYPE_INT32:
+      return repeated ? r->GetRepeatedInt32(message, field, index) : r->GetInt32(message, field);
+    case FieldDescriptor::CPPTYPE_INT64:
+      return repeated ? r->GetRepeatedInt64(message, field, index) : r->GetInt64(message, field);
+    case FieldDescriptor::CPPTYPE_UINT32:
+      return repeated ? r->GetRepeatedUInt32(message, field, index) : r->GetUInt32(message, field);
+    case FieldDescriptor::CPPTYPE_UINT64:
+      return repeated ? r->GetRepeatedUInt64(message, field, index) : r->GetUInt64(message, field);
+    case FieldDescriptor::CPPTYPE_DOUBLE:
+      return number(repeated ? r->GetRepeatedDouble(message, field, index) : r->GetDouble(message, field));
+    case FieldDescriptor::CPPTYPE_FLOAT:
+      return number(repeated ? r->GetRepeatedFloat(message, field, index) : r->GetFloat(message, field));
+    case FieldDescriptor::CPPTYPE_BOOL:
+      return repeated ? r->GetRepeatedBool(message, field, index) : r->GetBool(message, field);
+    case FieldDescriptor::CPPTYPE_STRING:
+      return repeated ? r->GetRepeatedString(message, field, index) : r->GetString(message, field);
+    case FieldDescriptor::CPPTYPE_ENUM: {
+      const int number = repeated ? r->GetRepeatedEnumValue(message, field, index) : r->GetEnumValue(message, field);
+      // The value's name is its wire string; a number this build does not know goes as it is.
+      if (const auto* value = field->enum_type()->FindValueByNumber(number)) return value->name();
+      return number;
+    }
+    case FieldDescriptor::CPPTYPE_MESSAGE:
+      return messageToJson(repeated ? r->GetRepeatedMessage(message, field, index) : r->GetMessage(message, field));
+  }
+  return nullptr;
+}
+
+}  // namespace
+
 nlohmann::json messageToJson(const Message& message) {
-  google::protobuf::util::JsonPrintOptions options;
-  options.preserve_proto_field_names = true;
-  options.always_print_primitive_fields = true;
-  std::string text;
-  if (!google::protobuf::util::MessageToJsonString(message, &text, options).ok()) return nullptr;
-  auto parsed = nlohmann::json::parse(text, nullptr, /*allow_exceptions=*/false);
-  return parsed.is_discarded() ? nlohmann::json(nullptr) : parsed;
+  if (const auto* object = dynamic_cast<const google::protobuf::Struct*>(&message)) return structToJson(*object);
+  nlohmann::json out = nlohmann::json::object();
+  const auto* r = message.GetReflection();
+  std::vector<const FieldDescriptor*> fields;
+  r->ListFields(message, &fields);  // only the fields that are set: defaults stay out
+  for (const FieldDescriptor* field : fields) {
+    if (field->is_map()) {
+      nlohmann::json map = nlohmann::json::object();
+      const FieldDescriptor* key = field->message_type()->map_key();
+      const FieldDescriptor* value = field->message_type()->map_value();
+      for (int i = 0; i < r->FieldSize(message, field); ++i) {
+        const Message& entry = r->GetRepeatedMessage(message, field, i);
+        const nlohmann::json k = fieldValueToJson(entry, key, -1);
+        map[k.is_string() ? k.get<std::string>() : k.dump()] = fieldValueToJson(entry, value, -1);
+      }
+      out[field->name()] = std::move(map);
+    } else if (field->is_repeated()) {
+      nlohmann::json list = nlohmann::json::array();
+      for (int i = 0; i < r->FieldSize(message, field); ++i) list.push_back(fieldValueToJson(message, field, i));
+      out[field->name()] = std::move(list);
+    } else {
+      out[field->name()] = fieldValueToJson(message, field, -1);
+    }
+  }
+  return out;
 }
 
 nlohmann::json dictionaryObject(const proto::CTTavixFeedback& feedback, std::uint64_t timestamp) {

@@ -18,6 +18,10 @@
 
 namespace tavix {
 
+namespace platform {
+class Clock;
+}
+
 using FeedbackRef = std::shared_ptr<proto::CTTavixFeedback>;
 
 // Wraps a client's payload as it came (its `type` is kept). `userGuid` is stored upper-cased.
@@ -43,6 +47,9 @@ bool codableRequiresQueryId(const google::protobuf::Message* codable);
 
 // Host ticks (nanoseconds) to whole milliseconds.
 inline std::uint64_t hostTicksToMilliseconds(std::uint64_t ticks) { return ticks / 1000000u; }
+// The time stamp of a record the daemon makes now: the clock's time in nanoseconds since 1970, so
+// that the daemon's records and sessions agree, also on a virtual clock. 0 without a clock.
+std::uint64_t hostTicksNow(const platform::Clock* clock);
 
 // The dictionary form as compact JSON text: the codable's fields under their JSON names,
 // "query_id" when the codable requires it, "type" by name and "timestamp" = rel_timestamp.

@@ -94,6 +94,25 @@ class SerialQueue {
   std::shared_ptr<Impl> impl_;  // shared with drain jobs still posted when the queue goes
 };
 
+// A dispatch group: notify runs on `queue` once every enter() has been matched by a leave(). The
+// group starts entered once, for whoever fills it, who leaves last. Safe from any thread; share it
+// (shared_ptr) with the work it waits for.
+class DispatchGroup {
+ public:
+  DispatchGroup(SerialQueue& queue, Task notify) : queue_(queue), notify_(std::move(notify)) {}
+  DispatchGroup(const DispatchGroup&) = delete;
+  DispatchGroup& operator=(const DispatchGroup&) = delete;
+  void enter() { ++pending_; }
+  void leave() {
+    if (--pending_ == 0) queue_.async(std::move(notify_));
+  }
+
+ private:
+  std::atomic<int> pending_{1};
+  SerialQueue& queue_;
+  Task notify_;
+};
+
 // "Synchronous reads, barrier writes": reads run on the caller's thread and may overlap one
 // another; a write waits for reads in progress, runs alone, and every read submitted after the
 // write was submitted sees its effect. Writes run in submission order.

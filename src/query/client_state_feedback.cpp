@@ -110,6 +110,9 @@ ClientState::StartRecord ClientState::startSearchEventForRequest(const platform:
   auto& headers = *start->mutable_headers();
   for (const auto& [name, value] : request.headers.all()) headers[name] = value;
   start->set_uuid(makeRandomUUIDString());
+  if (assembly_.useMarvola() && assembly_.requestFactory) {
+    start->set_marvola_status(assembly_.requestFactory->proxyGetStatus());
+  }
   return start;
 }
 
@@ -134,6 +137,7 @@ void ClientState::endNetworkFeedback(const StartRecord& start, const std::string
       return it == first->end() ? nullptr : it->second.string();
     };
     if (const auto* status = string("status")) end.set_tavix_status(*status);
+    if (const auto* fbq = string("fbq")) end.set_fbq(*fbq);
     if (const auto* ip = string("partial_client_ip")) end.set_tavix_partial_client_ip(*ip);
     if (const auto it = first->find("duration"); it != first->end()) {
       if (const auto* real = it->second.real()) end.set_tavix_duration(*real);

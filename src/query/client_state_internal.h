@@ -5,6 +5,7 @@
 #include <string>
 
 #include "core/assembly.h"
+#include "feedback/tavix_feedback.h"
 #include "platform/clock.h"
 #include "platform/http/url_request.h"
 
@@ -12,11 +13,7 @@ namespace tavix::query_internal {
 
 // Event time stamps follow the assembly's clock (nanoseconds), so that records and sessions agree,
 // also on a virtual clock.
-inline std::uint64_t eventTimestamp(const Assembly& assembly) {
-  if (!assembly.clock) return 0;
-  const double seconds = platform::toUnixSeconds(assembly.clock->now());
-  return seconds > 0 ? static_cast<std::uint64_t>(seconds * 1e9) : 0;
-}
+inline std::uint64_t eventTimestamp(const Assembly& assembly) { return hostTicksNow(assembly.clock); }
 
 // "Name: value, Name: value" for the protocol log.
 inline std::string headersText(const platform::http::HeaderFields& headers) {

@@ -175,6 +175,13 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
   start->set_trigger_event(
       static_cast<proto::TriggerSearchRequestEvent::Value>(kind.triggerEvent.value_or(request->triggerEvent)));
   start->set_endpoint_type(static_cast<proto::EndpointType::Value>(kind.endpoint));
+  if (const auto* lookup = dynamic_cast<const TVXLookupRequest*>(request.get())) {
+    start->set_lookup_selection_type(lookup->lookupSelectionType == TVXLookupSelectionTypeExplicit
+                                         ? proto::LookupSelectionType::lookup_explicit
+                                     : lookup->lookupSelectionType == TVXLookupSelectionTypeHint
+                                         ? proto::LookupSelectionType::lookup_hint_tap
+                                         : proto::LookupSelectionType::lookup_default);
+  }
   addCodable(*start, queryId, false);
   if (kind.dispatching[0] != '\0') log.notice(fmt::runtime(kind.dispatching));
 

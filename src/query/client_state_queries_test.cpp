@@ -238,7 +238,10 @@ TEST_F(QueriesTest, LookupsFlightsAndZeroKeywordRecordWhatTheyAskedFor) {
   EXPECT_EQ(starts[0].payload().network_search_start().input(), "serendipity");
   EXPECT_EQ(starts[0].payload().network_search_start().trigger_event(), 11);
   EXPECT_EQ(starts[0].payload().network_search_start().endpoint_type(), 6);
+  EXPECT_EQ(starts[0].payload().network_search_start().lookup_selection_type(),
+            proto::LookupSelectionType::lookup_explicit);
   EXPECT_EQ(starts[1].payload().network_search_start().input(), "");
+  EXPECT_FALSE(starts[1].payload().network_search_start().has_lookup_selection_type());
   EXPECT_EQ(starts[1].payload().network_search_start().trigger_event(), 9);
   EXPECT_EQ(starts[2].payload().network_search_start().input(), "UA 123");
   EXPECT_EQ(starts[2].payload().network_search_start().trigger_event(), 20);

@@ -77,6 +77,8 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
     start.set_input(input);
     start.set_trigger_event(length < smartMinimum ? proto::TriggerSearchRequestEvent::warm
                                                   : proto::TriggerSearchRequestEvent::new_character);
+    start.set_index_type(proto::IndexType::engaged_completion_cache);
+    start.set_query_id(queryId);
     addCodable(start, queryId, true);
 
     const bool brovane = clientName == "brovane";

@@ -112,6 +112,8 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
   ASSERT_EQ(localStart.size(), 1u);
   EXPECT_EQ(localStart[0].payload().local_search_start().input(), "zq");
   EXPECT_EQ(localStart[0].payload().local_search_start().trigger_event(), 1);
+  EXPECT_EQ(localStart[0].payload().local_search_start().index_type(), proto::IndexType::engaged_completion_cache);
+  EXPECT_EQ(localStart[0].payload().local_search_start().query_id(), 2u);
 
   // The search screen asks for three on a suggestion keystroke (21): the first is kept, the
   // other two go to the client; a plain keystroke looks for none.
@@ -159,6 +161,7 @@ TEST_F(SearchTest, TheSameKeystrokeTwiceIsServedFromTheQueryCache) {
   EXPECT_EQ(end.response_size(), call.reply->data.size());
   EXPECT_EQ(end.tavix_status(), "ok");
   EXPECT_EQ(end.tavix_partial_client_ip(), "127.0.0");
+  EXPECT_EQ(end.fbq().rfind("devserver-", 0), 0u) << end.fbq();
   EXPECT_GT(end.network_timing_data().at("total"), 0.0);
   EXPECT_EQ(end.peer_address(), "127.0.0.1");
   EXPECT_EQ(ends[0].query_id(), 10);
@@ -239,6 +242,9 @@ TEST_F(SearchTest, TheServerCanAskForANewerBagAndTheBagCanRouteThroughItsProxy) 
   EXPECT_TRUE(direct.first().reply);
   EXPECT_EQ(received("/search").size(), 1u);
   EXPECT_TRUE(testing::waitFor([&] { return received("/bag").size() == 2; }, 5000));
+  auto starts = recordsOfType(*state, 14);
+  ASSERT_FALSE(starts.empty());
+  EXPECT_FALSE(starts.back().payload().network_search_start().has_marvola_status());
 
   // With it on, the request goes to the bag's proxy, which is asked for the absolute URL.
   defaults->setObject("TVXUseMarvola", true);
@@ -247,6 +253,9 @@ TEST_F(SearchTest, TheServerCanAskForANewerBagAndTheBagCanRouteThroughItsProxy) 
   proxied.first();
   EXPECT_EQ(received("/search").size(), 1u);
   EXPECT_EQ(received(server.baseURL() + "/search", &proxy).size(), 1u);
+  starts = recordsOfType(*state, 14, 2);
+  ASSERT_EQ(starts.size(), 2u);
+  EXPECT_EQ(starts.back().payload().network_search_start().marvola_status(), 1);
 
   // A retried look-up goes through the proxy on every attempt.
   send("POST", "/_faults",

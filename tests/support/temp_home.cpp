@@ -36,4 +36,10 @@ bool waitFor(const std::function<bool()>& condition, int timeoutMs) {
   return condition();
 }
 
+std::size_t occurrences(const std::string& text, const std::string& what) {
+  std::size_t n = 0;
+  for (auto at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) ++n;
+  return n;
+}
+
 }  // namespace tavix::testing

@@ -30,4 +30,7 @@ class TempHome {
 // wait on real threads (inotify, child processes); virtual-time tests never need it.
 bool waitFor(const std::function<bool()>& condition, int timeoutMs = 5000);
 
+// How often `what` occurs in `text` (log lines, for tests that wait on the n-th one).
+std::size_t occurrences(const std::string& text, const std::string& what);
+
 }  // namespace tavix::testing

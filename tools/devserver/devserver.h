@@ -21,6 +21,8 @@
 //                    POST /crowdsourcing: {"path","type","v","digest","compressed_size","size",
 //                    "json" (or "text" when the body is not JSON)}; also kept in feedback.jsonl
 //                    of the data dir. Uploads with a wrong digest or a corrupt body get 400.
+//                    An upload whose digest came before is a repeat: answered 200, not kept.
+//   GET  /_feedback_repeats  {"repeats": N}, the repeats answered so far
 //
 // Threading: start() and stop() from one thread; the server answers on its own threads.
 #pragma once

@@ -74,13 +74,23 @@ bool inflateRaw(std::string_view compressed, std::string* out) {
   return status == Z_STREAM_END;
 }
 
-void FeedbackStore::add(json entry) {
+bool FeedbackStore::add(json entry, const std::string& digest) {
   std::lock_guard guard(lock_);
+  if (!digests_.insert(digest).second) {
+    ++repeats_;
+    return false;
+  }
   if (!dataDir_.empty()) {
     std::ofstream out(dataDir_ / "feedback.jsonl", std::ios::app);
     out << entry.dump(-1, ' ', false, json::error_handler_t::replace) << '\n';
   }
   received_.push_back(std::move(entry));
+  return true;
+}
+
+std::size_t FeedbackStore::repeats() const {
+  std::lock_guard guard(lock_);
+  return repeats_;
 }
 
 json FeedbackStore::all() const {
@@ -91,6 +101,8 @@ json FeedbackStore::all() const {
 void FeedbackStore::reset() {
   std::lock_guard guard(lock_);
   received_ = json::array();
+  digests_.clear();
+  repeats_ = 0;
 }
 
 void addFeedbackRoutes(httplib::Server& server, FeedbackStore& store, const RouteWrapper& served) {
@@ -119,7 +131,7 @@ void addFeedbackRoutes(httplib::Server& server, FeedbackStore& store, const Rout
     } else {
       entry["text"] = plain;
     }
-    store.add(std::move(entry));
+    store.add(std::move(entry), digest);
     res.set_content("{}", "application/json");
   };
   // httplib inflates request bodies itself, and only zlib-wrapped ones: a raw DEFLATE body would
@@ -140,6 +152,9 @@ void addFeedbackRoutes(httplib::Server& server, FeedbackStore& store, const Rout
   server.Post("/crowdsourcing", served(upload));
   server.Get("/_feedback", [&store](const httplib::Request&, httplib::Response& res) {
     res.set_content(store.all().dump(-1, ' ', false, json::error_handler_t::replace), "application/json");
+  });
+  server.Get("/_feedback_repeats", [&store](const httplib::Request&, httplib::Response& res) {
+    res.set_content(json{{"repeats", store.repeats()}}.dump(), "application/json");
   });
 }
 

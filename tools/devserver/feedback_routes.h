@@ -1,11 +1,15 @@
 // The devserver's feedback back end: POST /feedback and POST /crowdsourcing take raw-DEFLATE
 // bodies with an "X-Norvel-Digest" header, inflate them, check the digest and keep what arrived.
-// GET /_feedback lists it; POST /_reset also forgets it (through reset()).
+// A body whose digest was seen before is a repeat (the daemon sends a session again when it
+// cannot know it got through): it is answered as accepted, counted and not kept again.
+// GET /_feedback lists what was kept, GET /_feedback_repeats answers {"repeats": N}; POST /_reset
+// also forgets both (through reset()).
 #pragma once
 
 #include <filesystem>
 #include <functional>
 #include <mutex>
+#include <set>
 #include <string>
 #include <string_view>
 
@@ -27,14 +31,18 @@ class FeedbackStore {
   // `dataDir` (may be empty) receives feedback.jsonl, one line per accepted upload.
   explicit FeedbackStore(std::filesystem::path dataDir = {}) : dataDir_(std::move(dataDir)) {}
   void setDataDir(std::filesystem::path dataDir) { dataDir_ = std::move(dataDir); }
-  void add(nlohmann::json entry);
+  // Keeps `entry` unless an upload with the same digest came before; false for such a repeat.
+  bool add(nlohmann::json entry, const std::string& digest);
   nlohmann::json all() const;
+  std::size_t repeats() const;
   void reset();
 
  private:
   mutable std::mutex lock_;
   std::filesystem::path dataDir_;
   nlohmann::json received_ = nlohmann::json::array();
+  std::set<std::string> digests_;
+  std::size_t repeats_ = 0;
 };
 
 using RouteWrapper = std::function<httplib::Server::Handler(httplib::Server::Handler)>;

@@ -1,0 +1,17 @@
+// Who tells feedback sessions which versions of the bag's resource files the device holds. The
+// download manager answers once it exists; until then no one does and sessions carry none.
+#pragma once
+
+#include <map>
+#include <string>
+
+namespace tavix {
+
+class ResourceVersionsProvider {
+ public:
+  virtual ~ResourceVersionsProvider() = default;
+  // Resource name → version of the file on the device. Safe from any thread.
+  virtual std::map<std::string, std::string> resourceVersions() const = 0;
+};
+
+}  // namespace tavix
