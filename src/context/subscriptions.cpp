@@ -92,8 +92,9 @@ SubscriptionRecords collectSubscriptions(const SubscriptionBagSettings& bag, Vid
 std::optional<std::string> subscriptionHeaderValue(const SubscriptionRecords& records) {
   if (records.empty()) return std::nullopt;
   platform::PropertyValue::Array array;
-  for (const auto& [key, record] : records) array.push_back(record);
-  return platform::toJson(array);
+  array.reserve(records.size());
+  for (const auto& entry : records) array.emplace_back(entry.second);
+  return platform::toJson(platform::PropertyValue(std::move(array)));
 }
 
 }  // namespace tavix
