@@ -43,25 +43,14 @@ std::vector<std::string_view> split(std::string_view text, char separator) {
   }
 }
 
-int hexValue(char c) {
-  if (c >= '0' && c <= '9') return c - '0';
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-  return -1;
-}
-
 // Percent-decoding as URL components do it: "+" stays a plus sign.
 std::string percentDecode(std::string_view text) {
-  std::string out;
-  out.reserve(text.size());
-  for (std::size_t i = 0; i < text.size(); ++i) {
-    if (text[i] == '%' && i + 2 < text.size() && hexValue(text[i + 1]) >= 0 && hexValue(text[i + 2]) >= 0) {
-      out.push_back(static_cast<char>(hexValue(text[i + 1]) << 4 | hexValue(text[i + 2])));
-      i += 2;
-    } else {
-      out.push_back(text[i]);
-    }
-  }
+  int length = 0;
+  // libcurl ignores the handle here; a null one is allowed.
+  char* decoded = curl_easy_unescape(nullptr, text.data(), static_cast<int>(text.size()), &length);
+  if (!decoded) return std::string(text);
+  std::string out(decoded, static_cast<std::size_t>(length));
+  curl_free(decoded);
   return out;
 }
 
