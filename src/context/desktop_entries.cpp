@@ -103,7 +103,8 @@ std::vector<InstalledApp> installedApps(const std::vector<fs::path>& folders) {
     fs::recursive_directory_iterator it(folder, fs::directory_options::skip_permission_denied, error), end;
     for (; !error && it != end; it.increment(error)) {
       const fs::path& path = it->path();
-      if (path.extension() != kSuffix || !it->is_regular_file(error)) continue;
+      std::error_code entryError;  // a dangling link must not end the walk
+      if (path.extension() != kSuffix || !it->is_regular_file(entryError)) continue;
       std::string id = identifierFor(path.lexically_relative(folder));
       if (id.empty() || !seen.insert(id).second) continue;  // a folder earlier in the list decided
       auto text = readBounded(path);
@@ -156,7 +157,10 @@ void DesktopEntryWatcher::rewatch() {
       watch(folder, [this](const std::string&) { changed(); });
       fs::recursive_directory_iterator it(folder, fs::directory_options::skip_permission_denied, error), end;
       for (; !error && it != end; it.increment(error)) {
-        if (it->is_directory(error) && !it->is_symlink(error)) watch(it->path(), [this](const std::string&) { changed(); });
+        std::error_code entryError;
+        if (it->is_directory(entryError) && !it->is_symlink(entryError)) {
+          watch(it->path(), [this](const std::string&) { changed(); });
+        }
       }
     } else if (fs::is_directory(folder.parent_path(), error)) {
       const std::string name = folder.filename().string();
