@@ -1,0 +1,119 @@
+#include "context/subscriptions.h"
+
+#include <gtest/gtest.h>
+
+#include "platform/defaults.h"
+#include "platform/log.h"
+
+namespace tavix {
+namespace {
+
+using platform::fromUnixSeconds;
+
+struct FakeVideo final : VideoSubscriptionProvider {
+  std::vector<VideoSubscription> subscriptions;
+  bool fails = false;
+  int calls = 0;
+  std::vector<std::string> askedBundles, askedDomains;
+  bool activeSubscriptions(const std::vector<std::string>& bundles, const std::vector<std::string>& domains,
+                           std::vector<VideoSubscription>* out, std::string* error) override {
+    ++calls;
+    askedBundles = bundles;
+    askedDomains = domains;
+    if (fails) *error = "service gone";
+    else *out = subscriptions;
+    return !fails;
+  }
+};
+
+struct FakeMusic final : MusicSubscriptionProvider {
+  int status = 0;
+  int lastKnownAccountStatus() const override { return status; }
+};
+
+const platform::TimePoint kNow = fromUnixSeconds(1767225600);
+
+SubscriptionBagSettings bag() { return {{{"tv.example.com"}}, {{"com.example.tv"}}, 3600}; }
+
+TEST(Subscriptions, OnlySubscriptionsModifiedWithinTheTTLAreReported) {
+  FakeVideo video;
+  FakeMusic music;
+  video.subscriptions = {{"com.example.tv", "app", fromUnixSeconds(1767225600 - 3600)},   // at the edge: kept
+                         {"tv.example.com", "web", fromUnixSeconds(1767225600 - 3601)},   // too old
+                         {"late.example", "app", fromUnixSeconds(1767225600 + 1)}};       // in the future
+  SubscriptionRecords records = collectSubscriptions(bag(), video, music, kNow);
+  EXPECT_EQ(video.askedBundles, std::vector<std::string>{"com.example.tv"});
+  EXPECT_EQ(video.askedDomains, std::vector<std::string>{"tv.example.com"});
+  EXPECT_EQ(subscriptionHeaderValue(records), R"([{"active":true,"provider":"com.example.tv","type":"app"}])");
+
+  music.status = kMusicSubscriptionStatusSubscribed;
+  records = collectSubscriptions(bag(), video, music, kNow);
+  EXPECT_EQ(subscriptionHeaderValue(records),
+            R"([{"active":true,"provider":"com.example.tv","type":"app"},)"
+            R"({"active":true,"attribute":"premium","provider":"tarn"}])");
+}
+
+TEST(Subscriptions, ABagWithoutEitherWhitelistReportsNothing) {
+  FakeVideo video;
+  FakeMusic music;
+  music.status = kMusicSubscriptionStatusSubscribed;
+  video.subscriptions = {{"com.example.tv", "app", kNow}};
+  SubscriptionBagSettings noDomains = bag(), noBundles = bag();
+  noDomains.domainWhitelist.reset();
+  noBundles.bundleIdentifierWhitelist.reset();
+  for (const SubscriptionBagSettings& settings : {noDomains, noBundles}) {
+    const SubscriptionRecords records = collectSubscriptions(settings, video, music, kNow);
+    EXPECT_TRUE(records.empty());
+    EXPECT_FALSE(subscriptionHeaderValue(records));
+  }
+  EXPECT_EQ(video.calls, 0);
+  // A failing service still lets the music subscription through.
+  platform::LogCapture capture;
+  video.fails = true;
+  const SubscriptionRecords records = collectSubscriptions(bag(), video, music, kNow);
+  EXPECT_EQ(records.size(), 1u);
+  EXPECT_TRUE(records.count("tarn"));
+  EXPECT_TRUE(capture.contains("Error fetching third party subscription information from daemon: service gone"));
+}
+
+TEST(Subscriptions, DefaultsProvidersReadWhatAnIntegratorWrote) {
+  std::string pattern = (std::filesystem::temp_directory_path() / "tavix-subs-XXXXXX").string();
+  const std::filesystem::path folder = ::mkdtemp(pattern.data());
+  platform::UserDefaults defaults(folder, "com.norvel.tavixd");
+  DefaultsVideoSubscriptionProvider video(defaults);
+  DefaultsMusicSubscriptionProvider music(defaults);
+  DefaultsStorefrontProvider storefront(defaults);
+  std::vector<VideoSubscription> out;
+  std::string error;
+  EXPECT_TRUE(video.activeSubscriptions({"a"}, {"b.example"}, &out, &error));
+  EXPECT_TRUE(out.empty());
+  EXPECT_EQ(music.lastKnownAccountStatus(), 0);
+  EXPECT_FALSE(storefront.storefrontIdentifier());
+
+  using D = platform::Dictionary;
+  defaults.setObject(kTVXVideoSubscriptionsKey,
+                     platform::PropertyValue::Array{
+                         D{{"identifier", "a"}, {"type", "app"}, {"modified", platform::Date{kNow}}},
+                         D{{"identifier", "b.example"}, {"type", "web"}, {"modified", 1767225000}},
+                         D{{"identifier", "a"}, {"modified", 1767225000}, {"active", false}},
+                         D{{"identifier", "not.listed"}, {"modified", 1767225000}},
+                         D{{"identifier", "a"}, {"modified", "yesterday"}},
+                         D{{"type", "app"}, {"modified", 1767225000}}, "junk"});
+  defaults.setObject(kTVXMusicSubscriptionStatusKey, 3);
+  defaults.setObject(kTVXStorefrontIdentifierKey, "143441-1,29");
+  ASSERT_TRUE(video.activeSubscriptions({"a"}, {"b.example"}, &out, &error));
+  ASSERT_EQ(out.size(), 2u);
+  EXPECT_EQ(out[0].modified, kNow);
+  EXPECT_EQ(out[1].sourceIdentifier, "b.example");
+  EXPECT_EQ(out[1].modified, fromUnixSeconds(1767225000));
+  EXPECT_EQ(music.lastKnownAccountStatus(), kMusicSubscriptionStatusSubscribed);
+  EXPECT_EQ(storefront.storefrontIdentifier(), "143441-1,29");
+
+  defaults.setObject(kTVXVideoSubscriptionsKey, "not an array");
+  EXPECT_FALSE(video.activeSubscriptions({"a"}, {}, &out, &error));
+  EXPECT_FALSE(error.empty());
+  std::filesystem::remove_all(folder);
+}
+
+}  // namespace
+}  // namespace tavix
