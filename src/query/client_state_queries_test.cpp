@@ -4,6 +4,7 @@
 
 #include <fstream>
 #include <functional>
+#include <future>
 
 #include "core/diagnostics.h"
 #include "platform/counters.h"
@@ -293,6 +294,34 @@ class VirtualTimeTest : private VirtualClockHolder, public QueryFixture {
   VirtualTimeTest() : QueryFixture(&virtualClock) {}
   using VirtualClockHolder::virtualClock;
 };
+
+TEST_F(VirtualTimeTest, WithoutABagInTimeASearchFailsAtTheEndOfTheWaitAndRecordsWhy) {
+  // The bag never comes: the search waits the first-launch wait on this clock, no longer.
+  fault("/bag", {{"hang", true}});
+  assembly.bagController = TavixBagController::create(assembly);
+  auto waiting = make("com.norvel.seekara", "Seekara/1.0");
+  Replies timedOut;
+  auto searching = std::async(std::launch::async,
+                              [&] { waiting->search(request<TVXSearchRequest>(7, "weather"), timedOut.block()); });
+  virtualClock.awaitParked(1);
+  virtualClock.advance(platform::seconds(kTVXFirstLaunchBagSemaphoreWait / 1000.0 - 0.001));
+  EXPECT_EQ(timedOut.count(), 0u);
+  virtualClock.advance(platform::seconds(0.001));
+  searching.get();
+  auto call = timedOut.first();
+  EXPECT_EQ(call.queryId, 7u);
+  EXPECT_FALSE(call.reply);
+  ASSERT_TRUE(call.error);
+  EXPECT_EQ(call.error->domain, kTVXErrorDomain);
+  EXPECT_EQ(call.error->code, 1);
+  EXPECT_EQ(call.error->reason, "timeout");
+  auto skipped = recordsOfType(*waiting, 38);
+  ASSERT_EQ(skipped.size(), 1u);
+  EXPECT_EQ(skipped[0].payload().skip_tavix_search().reason(), 3);
+  EXPECT_EQ(skipped[0].query_id(), 7);
+  EXPECT_EQ(skipped[0].user_agent(), "Seekara/1.0");
+  EXPECT_TRUE(received("/search").empty());
+}
 
 TEST_F(VirtualTimeTest, ALookupIsRetriedOnlyUntilItsRenderDeadline) {
   // searchRenderTimeout 2000 ms: the deadline is 1.5 s after the request goes out.

@@ -14,29 +14,6 @@ namespace {
 
 using SearchTest = QueryFixture;
 
-TEST_F(SearchTest, WithoutABagInTimeTheQueryFailsFastAndRecordsWhy) {
-  // The bag is slow to come: the query gives up after the first-launch wait.
-  fault("/bag", {{"delay_ms", 1500}});
-  assembly.bagController = TavixBagController::create(assembly);
-  auto waiting = make("com.norvel.seekara", "Seekara/1.0");
-  Replies timedOut;
-  waiting->search(request<TVXSearchRequest>(7, "weather"), timedOut.block());
-  auto call = timedOut.first();
-  EXPECT_EQ(call.queryId, 7u);
-  EXPECT_FALSE(call.reply);
-  ASSERT_TRUE(call.error);
-  EXPECT_EQ(call.error->domain, kTVXErrorDomain);
-  EXPECT_EQ(call.error->code, 1);
-  EXPECT_EQ(call.error->reason, "timeout");
-  auto skipped = recordsOfType(*waiting, 38);
-  ASSERT_EQ(skipped.size(), 1u);
-  EXPECT_EQ(skipped[0].payload().skip_tavix_search().reason(), 3);
-  EXPECT_EQ(skipped[0].payload().skip_tavix_search().input(), "weather");
-  EXPECT_EQ(skipped[0].query_id(), 7);
-  EXPECT_EQ(skipped[0].user_agent(), "Seekara/1.0");
-  EXPECT_TRUE(received("/search").empty());
-}
-
 TEST_F(SearchTest, ADisabledBagAnswersWithNothingAndSendsNothing) {
   serveBag(bagWith({{"enabled", false}}));
   auto disabled = make("com.norvel.brovane", "Brovane/1.0");
