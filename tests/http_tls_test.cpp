@@ -46,6 +46,7 @@ TEST(HTTPTLSTest, PeersAreVerifiedAgainstTheTrustedCertificates) {
   httplib::SSLServer server(cert.c_str(), key.c_str());
   ASSERT_TRUE(server.is_valid());
   server.Get("/bag", [](const httplib::Request&, httplib::Response& res) { res.set_content("{}", "application/json"); });
+  // The bound socket already listens: connections wait in its backlog until the thread accepts.
   const int port = server.bind_to_any_port("127.0.0.1");
   ASSERT_GT(port, 0);
   std::thread listener([&] { server.listen_after_bind(); });
@@ -57,7 +58,6 @@ TEST(HTTPTLSTest, PeersAreVerifiedAgainstTheTrustedCertificates) {
       listener.join();
     }
   } stopOnExit{server, listener};
-  for (int i = 0; i < 5000 && !server.is_running(); ++i) std::this_thread::sleep_for(std::chrono::milliseconds(1));
   const std::string url = "https://127.0.0.1:" + std::to_string(port) + "/bag";
 
   DispatchPool pool(1);

@@ -266,51 +266,6 @@ TEST(IpcDaemon, ClientFailsCallsInFlightOnceAndReconnectsToTheNextDaemon) {
   EXPECT_EQ(calls, 1);
 }
 
-TEST(IpcDaemon, ServesTheSocketHandedOverBySystemd) {
-  tavix::testing::TempHome home;
-  const std::string path = (home.runtime() / "activated.sock").string();
-  int listener = socket(AF_UNIX, SOCK_STREAM, 0);
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path.c_str());
-  ASSERT_EQ(bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
-  ASSERT_EQ(listen(listener, 8), 0);
-  const auto logFile = home.root() / "activated.log";
-  tavix::testing::keepBagFetchesLocal(home);
-  const pid_t pid = fork();
-  if (pid == 0) {
-    home.exportEnvironment();
-    int log = open(logFile.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    dup2(log, 2);
-    dup2(listener, 3);
-    setenv("LISTEN_FDS", "1", 1);
-    setenv("LISTEN_PID", std::to_string(getpid()).c_str(), 1);
-    execl(TAVIXD_BINARY, TAVIXD_BINARY, static_cast<char*>(nullptr));
-    _exit(127);
-  }
-  close(listener);
-  Client::Options o;
-  o.socketPath = path;
-  o.configuration.set_identifier("tests");
-  o.configuration.set_user_agent("tests/1");
-  Client client(o);
-  auto notifyError = client.notifySync("com.norvel.tests.activated");
-  EXPECT_FALSE(notifyError) << notifyError->code << " " << notifyError->reason;
-  // The daemon made no socket of its own.
-  EXPECT_FALSE(std::filesystem::exists(home.runtime() / "com.norvel.tavixd" / "socket"));
-  // The listener answers before start-up has put in its signal sources; stop it only once it is up.
-  EXPECT_TRUE(tavix::testing::waitFor([&] {
-    std::ifstream in(logFile);
-    std::stringstream text;
-    text << in.rdbuf();
-    return text.str().find("tavixd started") != std::string::npos;
-  }));
-  kill(pid, SIGTERM);
-  int status = 0;
-  waitpid(pid, &status, 0);
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-}
-
 TEST(IpcDaemon, ToolReadsDefaultsAndCountersWithTheDaemonStoppedAndRunsActivities) {
   tavix::testing::TempHome home;
   home.exportEnvironment();  // the tool runs in this environment

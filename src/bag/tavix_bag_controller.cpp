@@ -208,6 +208,10 @@ class TavixBagController::RetryClock final : public platform::Clock {
     pending_.push_back(handle);
     return handle;
   }
+  bool waitFor(std::unique_lock<std::mutex>& lock, std::condition_variable& signal, platform::Duration timeout,
+               const std::function<bool()>& ready) override {
+    return inner_.waitFor(lock, signal, timeout, ready);
+  }
   void shutdown() {
     std::lock_guard hold(lock_);
     off_ = true;

@@ -13,28 +13,6 @@ platform::Dictionary bagFromJson(const char* text) {
   return v && v->dictionary() ? *v->dictionary() : platform::Dictionary{};
 }
 
-TEST(TVXBag, EmptyBagAnswersTheDefaults) {
-  TVXBag bag(platform::Dictionary{}, "Seekara/1");
-  EXPECT_EQ(bag.clientName(), "seekara");
-  EXPECT_FALSE(bag.version());
-  EXPECT_TRUE(bag.isEnabled());
-  EXPECT_FALSE(bag.feedbackEnabled());
-  EXPECT_FALSE(bag.searchURL());
-  EXPECT_EQ(bag.searchRenderTimeout(), 2000);
-  EXPECT_DOUBLE_EQ(bag.timeoutIntervalForRequest(), 10);
-  EXPECT_TRUE(bag.supportedGeoLocationSources().empty());
-  EXPECT_EQ(bag.smartHistoryMaxRows(), 10000);
-  EXPECT_EQ(bag.smartHistoryTimeout(), 5);
-  EXPECT_DOUBLE_EQ(bag.brovaneLast1hour(), 10.0);
-  EXPECT_DOUBLE_EQ(bag.brovaneAll(), 0.001);
-  EXPECT_DOUBLE_EQ(bag.brovaneMostRecent(), 1.0);
-  EXPECT_EQ(bag.maximumSizeForFeedbackType("crash"), 0);
-  EXPECT_TRUE(bag.resources().empty());
-  EXPECT_FALSE(bag.subscriptionProviderDomainWhitelist());
-  EXPECT_FALSE(bag.marvolaConfiguration());
-  EXPECT_FALSE(bag.refreshDisabled());
-}
-
 TEST(TVXBag, ReadsEveryKindOfValueFromServerJson) {
   TVXBag bag(bagFromJson(R"({"version": 12, "search_url": "https://s.example/search",
       "min_query_length": 3.0, "request_timeout_s": 2.5, "brovane_last_1day": 4,

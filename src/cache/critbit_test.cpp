@@ -63,19 +63,6 @@ TEST(CritbitRecord, ResultCodesOfInsertContainsAndDelete) {
   EXPECT_EQ(tree.root, 0u);
 }
 
-TEST(CritbitRecord, NodesAreTaggedAndCriticalBitsMasked) {
-  critbit_tree tree;
-  int v = 0;
-  critbit_insert(&tree, "a", &v, 1);  // 0x61
-  EXPECT_EQ(tree.root & 1, 0u);       // a lone leaf
-  critbit_insert(&tree, "c", &v, 1);  // 0x63: differs from 0x61 in bit 0x02
-  ASSERT_EQ(tree.root & 1, 1u);
-  auto* node = reinterpret_cast<critbit_internal_node*>(tree.root - 1);
-  EXPECT_EQ(node->byte, 0u);
-  EXPECT_EQ(node->otherbits, 0xFD);
-  critbit_clear(&tree);
-}
-
 TEST(CritbitRecord, PrefixEnumerationResultCodes) {
   critbit_tree tree;
   int v = 0;

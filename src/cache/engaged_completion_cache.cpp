@@ -546,7 +546,8 @@ std::optional<std::vector<TVXSearchSuggestion>> EngagedCompletionCache::completi
   });
 
   std::unique_lock<std::mutex> guard(wait->lock);
-  if (!wait->done.wait_for(guard, std::chrono::milliseconds(timeoutMs), [&] { return wait->finished; })) {
+  if (!env_.clock->waitFor(guard, wait->done, platform::seconds(timeoutMs / 1000.0),
+                           [&] { return wait->finished; })) {
     eccLog().debug("EngagedCompletionCache search timed out for input {} timeout value {}", input, timeoutMs);
     return std::nullopt;
   }

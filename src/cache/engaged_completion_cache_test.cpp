@@ -221,12 +221,17 @@ TEST(EngagedCompletionCacheTimeout, SearchThatOutlivesItsTimeoutReturnsNothing) 
   auto cache = EngagedCompletionCache::create({home.cache(), &clock, &pool, nullptr});
   cache->addCompletion("late", "la");
 
-  // Occupy the pool's only thread so the search block cannot start in time.
+  // Occupy the pool's only thread so the search block cannot start before the deadline.
   std::promise<void> release;
   std::shared_future<void> gate = release.get_future().share();
   pool.post([gate] { gate.wait(); });
   platform::LogCapture log;
-  EXPECT_FALSE(cache->completionsForInput("la", 0, 5, 20));
+  auto late = std::async(std::launch::async, [&] { return cache->completionsForInput("la", 0, 5, 20); });
+  clock.awaitParked(1);
+  clock.advance(platform::seconds(0.019));
+  EXPECT_EQ(clock.parkedWaiters(), 1u) << "still waiting 1 ms before its deadline";
+  clock.advance(platform::seconds(0.001));
+  EXPECT_FALSE(late.get());
   EXPECT_TRUE(log.contains("EngagedCompletionCache search timed out for input la timeout value 20"));
   release.set_value();
   pool.drain();  // the late block runs to its end; its results go nowhere

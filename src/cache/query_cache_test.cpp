@@ -51,30 +51,6 @@ class QueryCacheTest : public ::testing::Test {
   std::shared_ptr<QueryCache> cache_;
 };
 
-TEST(CachedResultSetFields, ReadsReplyHeaderAndQueryItems) {
-  platform::http::URLRequest request;
-  request.url = "https://s.example/search?q=ca&qtype=web&suggest_queries=1&lc=caf%C3%A9&lc=second";
-  request.headers.set("X-Norvel-UI-Scale", "2.0");
-  platform::Dictionary reply{{"query", "Camera"}, {"completion_score", 0.5}, {"max_age", std::int64_t{30}}};
-  const auto now = platform::fromUnixSeconds(1000);
-  CachedResultSet e("CA", &request, reply, "u", "body", now);
-  EXPECT_EQ(e.input(), "ca");
-  EXPECT_EQ(e.query(), "camera");
-  EXPECT_EQ(e.uiScale(), 2.0);
-  EXPECT_FLOAT_EQ(e.completionScore(), 0.5f);
-  EXPECT_EQ(e.expireTime(), now + seconds(30));
-  EXPECT_EQ(e.qtype(), "web");
-  EXPECT_EQ(e.suggest_queries(), "1");
-  EXPECT_EQ(e.localCompletion(), "café");
-  EXPECT_EQ(e.cost(), 4u);
-  EXPECT_EQ(e.resultSet(), nullptr);
-
-  CachedResultSet bare("a", nullptr, {{"query", "ab"}, {"max_age", 0}}, "u", "b", now);
-  EXPECT_FALSE(bare.expireTime());
-  EXPECT_FALSE(bare.qtype());
-  EXPECT_EQ(bare.uiScale(), 0);
-}
-
 TEST_F(QueryCacheTest, ServesLongerInputsUpToTheCompletedQuery) {
   store(entry("ca", "camera"));
   for (const char* typed : {"ca", "cam", "CAME", "camer", "camera"}) EXPECT_EQ(hit(typed), "uuid-camera") << typed;

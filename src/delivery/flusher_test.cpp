@@ -184,25 +184,6 @@ TEST_F(FlusherTest, PeriodicRunSendsEachSessionOnceAndDeletesItsFile) {
   EXPECT_EQ(transactions.openCount(), 0u);
 }
 
-// (A run with periodic flushing stopped is tested against the real daemon.)
-TEST_F(FlusherTest, SessionsWaitInTheBufferUntilSent) {
-  start();
-  writeSession("seekara/1", 2);
-  ASSERT_TRUE(waitFor([&] { return waitingSessions() == 1; }));
-
-  auto flusher = TavixFeedbackFlusher::create(assembly);
-  auto record = assembly.persistentStorage->getAvailableSessionHandles().front()->readRecord();
-  ASSERT_TRUE(record);
-  flusher->flush(ClientSession::fromRecord(assembly, *record));
-  EXPECT_EQ(flusher->countOfDatabuffer(), 1u);
-  std::vector<std::string> bodies;
-  flusher->flushToWireSync(&bodies);
-  EXPECT_EQ(flusher->countOfDatabuffer(), 0u);
-  ASSERT_EQ(bodies.size(), 1u);
-  ASSERT_TRUE(waitFor([&] { return received().size() == 1; }));
-  EXPECT_EQ(received()[0]["compressed_size"], bodies[0].size()) << "the body handed back is the one sent";
-}
-
 class CustomFeedbackTest : public FlusherTest {
  protected:
   platform::fs::path root() { return home.cache() / "com.norvel.tavixd" / kTVXCustomFeedbackDir; }

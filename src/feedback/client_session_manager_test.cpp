@@ -199,7 +199,9 @@ TEST(ClientSessionManager, SharedSessionKeepsOneMemberPerClientAndClosesThemToge
   for (const auto& s : sessions) {
     EXPECT_EQ(endReason(s), 2);
     ASSERT_EQ(s.feedbacks_size(), 3);
-    if (s.agent() == "brovane/2") EXPECT_TRUE(s.feedbacks(1).payload().has_connection_invalidated());
+    if (s.agent() == "brovane/2") {
+      EXPECT_TRUE(s.feedbacks(1).payload().has_connection_invalidated());
+    }
   }
 }
 

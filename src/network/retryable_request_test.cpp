@@ -126,15 +126,4 @@ TEST_F(RetryableRequestTest, UndelayedRetriesStopAtTheFirstResponseWhateverItsSt
   EXPECT_EQ(attemptsOnTheWire(), 4u);
 }
 
-TEST_F(RetryableRequestTest, APassedDeadlineReportsTheFirstErrorAtOnce) {
-  fault({{"path", "/bag"}, {"drop", true}});
-  Result past;
-  clock.advance(seconds(5));
-  send(TVXRetryableNetworkRequest(request("/bag"), clock.now() - seconds(1), true), 3, past)->resume();
-  ASSERT_TRUE(tavix::testing::waitFor([&] { return past.calls == 1; }));
-  EXPECT_TRUE(past.error);
-  EXPECT_EQ(clock.pendingTimers(), 0u);
-  EXPECT_EQ(attemptsOnTheWire(), 1u);
-}
-
 }  // namespace

@@ -1,5 +1,6 @@
 #include "platform/clock.h"
 
+#include <algorithm>
 #include <cmath>
 
 #include <asio/steady_timer.hpp>
@@ -49,7 +50,74 @@ TimerHandle SystemClock::after(Duration delay, SerialQueue& queue, Task task) {
   return TimerHandle(cancelled);
 }
 
+bool SystemClock::waitFor(std::unique_lock<std::mutex>& lock, std::condition_variable& signal, Duration timeout,
+                          const std::function<bool()>& ready) {
+  // The condition variable measures on the steady clock, like the timers.
+  return signal.wait_for(lock, std::max(timeout, Duration::zero()), ready);
+}
+
 VirtualClock::VirtualClock(TimePoint start) : now_(start) {}
+
+bool VirtualClock::waitFor(std::unique_lock<std::mutex>& lock, std::condition_variable& signal, Duration timeout,
+                           const std::function<bool()>& ready) {
+  if (ready()) return true;
+  auto parked = std::make_shared<Parked>();
+  parked->mutex = lock.mutex();
+  parked->signal = &signal;
+  {
+    std::lock_guard<std::mutex> guard(lock_);
+    parked->deadline = now_ + std::max(timeout, Duration::zero());
+    parked_.push_back(parked);
+  }
+  parkedChanged_.notify_all();
+  bool result;
+  for (;;) {
+    if ((result = ready())) break;
+    // advance() moves now_ before it takes our mutex to notify, so this check cannot miss it.
+    if (now() >= parked->deadline) break;
+    signal.wait(lock);
+  }
+  // advance() takes guard, then our mutex: let go of the mutex before taking guard.
+  lock.unlock();
+  {
+    std::lock_guard<std::mutex> hold(parked->guard);
+    parked->gone = true;
+  }
+  {
+    std::lock_guard<std::mutex> guard(lock_);
+    std::erase(parked_, parked);
+  }
+  parkedChanged_.notify_all();
+  lock.lock();
+  return result;
+}
+
+void VirtualClock::wakeDueWaiters() {
+  std::vector<std::shared_ptr<Parked>> due;
+  {
+    std::lock_guard<std::mutex> guard(lock_);
+    for (const auto& p : parked_) {
+      if (p->deadline <= now_) due.push_back(p);
+    }
+  }
+  for (const auto& p : due) {
+    std::lock_guard<std::mutex> hold(p->guard);
+    if (p->gone) continue;
+    // Under the waiter's own mutex, so the wake cannot fall between its check and its wait.
+    std::lock_guard<std::mutex> waiter(*p->mutex);
+    p->signal->notify_all();
+  }
+}
+
+std::size_t VirtualClock::parkedWaiters() const {
+  std::lock_guard<std::mutex> guard(lock_);
+  return parked_.size();
+}
+
+void VirtualClock::awaitParked(std::size_t count) const {
+  std::unique_lock<std::mutex> guard(lock_);
+  parkedChanged_.wait(guard, [&] { return parked_.size() >= count; });
+}
 
 TimePoint VirtualClock::now() const {
   std::lock_guard<std::mutex> guard(lock_);
@@ -77,17 +145,19 @@ void VirtualClock::advance(Duration by) {
       auto first = timers_.begin();
       if (first == timers_.end() || first->first.first > end) {
         now_ = end;
-        return;
+        break;
       }
       now_ = std::max(now_, first->first.first);
       next = std::move(first->second);
       timers_.erase(first);
     }
+    wakeDueWaiters();
     if (next.cancelled->load()) continue;
     next.queue->sync([&] {
       if (!next.cancelled->load()) next.task();
     });
   }
+  wakeDueWaiters();
 }
 
 std::size_t VirtualClock::pendingTimers() const {

@@ -8,9 +8,11 @@
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
+#include <functional>
 #include <map>
 #include <memory>
 #include <mutex>
+#include <vector>
 
 #include "platform/dispatch.h"
 #include "platform/time.h"
@@ -42,6 +44,12 @@ class Clock {
   // Runs `task` on `queue` once `delay` has passed (at once for a delay of zero or less).
   // The queue must outlive the timer, or the timer must be cancelled before the queue goes.
   virtual TimerHandle after(Duration delay, SerialQueue& queue, Task task) = 0;
+
+  // Blocks until `ready()` holds or `timeout` has passed on this clock, and answers ready().
+  // `lock` holds the mutex that guards what ready() reads; whoever makes it true notifies
+  // `signal` under that mutex. The lock is held again on return.
+  virtual bool waitFor(std::unique_lock<std::mutex>& lock, std::condition_variable& signal, Duration timeout,
+                       const std::function<bool()>& ready) = 0;
 };
 
 // Real time: timers are Asio steady timers on the pool, so they are not moved by wall-clock jumps.
@@ -50,6 +58,8 @@ class SystemClock final : public Clock {
   explicit SystemClock(DispatchPool& pool) : pool_(pool) {}
   TimePoint now() const override;
   TimerHandle after(Duration delay, SerialQueue& queue, Task task) override;
+  bool waitFor(std::unique_lock<std::mutex>& lock, std::condition_variable& signal, Duration timeout,
+               const std::function<bool()>& ready) override;
 
  private:
   DispatchPool& pool_;
@@ -64,6 +74,9 @@ class VirtualClock final : public Clock {
   explicit VirtualClock(TimePoint start = fromUnixSeconds(1767225600));
   TimePoint now() const override;
   TimerHandle after(Duration delay, SerialQueue& queue, Task task) override;
+  // Parks the caller until ready() holds or advance() reaches the deadline.
+  bool waitFor(std::unique_lock<std::mutex>& lock, std::condition_variable& signal, Duration timeout,
+               const std::function<bool()>& ready) override;
 
   // Moves time forward by `by`. Every timer that falls due on the way fires in due order (ties in
   // the order they were set), with now() equal to its due time, and runs to completion on its
@@ -73,13 +86,32 @@ class VirtualClock final : public Clock {
   // Timers set and neither fired nor cancelled.
   std::size_t pendingTimers() const;
 
+  // Callers blocked in waitFor() right now.
+  std::size_t parkedWaiters() const;
+  // Blocks until at least `count` callers are parked in waitFor(): the barrier a test passes
+  // before it advances time past their deadline.
+  void awaitParked(std::size_t count) const;
+
  private:
   struct Pending {
     SerialQueue* queue;
     Task task;
     std::shared_ptr<std::atomic<bool>> cancelled;
   };
+  // A caller inside waitFor(). `guard` keeps its mutex and condition alive while advance()
+  // wakes it: the waiter takes `guard` before it leaves.
+  struct Parked {
+    std::mutex guard;
+    std::mutex* mutex;
+    std::condition_variable* signal;
+    TimePoint deadline;
+    bool gone = false;
+  };
+  void wakeDueWaiters();
+
   mutable std::mutex lock_;
+  mutable std::condition_variable parkedChanged_;
+  std::vector<std::shared_ptr<Parked>> parked_;
   TimePoint now_;
   std::uint64_t sequence_ = 0;
   std::multimap<std::pair<TimePoint, std::uint64_t>, Pending> timers_;

@@ -5,6 +5,8 @@
 #include <atomic>
 #include <chrono>
 #include <cmath>
+#include <condition_variable>
+#include <future>
 #include <limits>
 #include <vector>
 
@@ -62,6 +64,38 @@ TEST_F(VirtualClockTest, CancelledTimerNeverRuns) {
   EXPECT_EQ(fired, 0);
 }
 
+TEST_F(VirtualClockTest, AWaitEndsWhenItsConditionHoldsOrWhenTimeReachesItsDeadline) {
+  std::mutex lock;
+  std::condition_variable signal;
+  bool ready = false;
+  auto wait = [&](double timeout) {
+    std::unique_lock hold(lock);
+    return clock.waitFor(hold, signal, seconds(timeout), [&] { return ready; });
+  };
+
+  // Time passes during the wait: only reaching the deadline ends it.
+  auto timedOut = std::async(std::launch::async, wait, 5.0);
+  clock.awaitParked(1);
+  const TimePoint parkedAt = clock.now();
+  clock.advance(seconds(4.999));
+  EXPECT_EQ(clock.parkedWaiters(), 1u);
+  clock.advance(seconds(0.001));
+  EXPECT_FALSE(timedOut.get());
+  EXPECT_EQ(clock.now() - parkedAt, seconds(5));
+
+  // A timer on the way that makes the condition true ends it long before its deadline.
+  auto signalled = std::async(std::launch::async, wait, 60.0);
+  clock.awaitParked(1);
+  clock.after(seconds(2), queue, [&] {
+    std::lock_guard hold(lock);
+    ready = true;
+    signal.notify_all();
+  });
+  clock.advance(seconds(3));
+  EXPECT_TRUE(signalled.get());
+  EXPECT_TRUE(wait(0)) << "a condition already true needs no time";
+}
+
 TEST_F(VirtualClockTest, RepeatingTimerRunsEveryIntervalUntilStopped) {
   std::vector<double> at;
   const double t0 = toUnixSeconds(clock.now());
@@ -103,8 +137,10 @@ TEST(SystemClock, TimerFiresOnItsQueueAfterTheDelay) {
   ASSERT_TRUE(testing::waitFor([&] { return fired.load() > 0; }, 2000));
   EXPECT_GE(std::chrono::steady_clock::now() - start, 30ms);
   EXPECT_TRUE(onQueue.load());
+  // Steady timers expire in due order, so the cancelled one has woken by now; drained, and its
+  // queue flushed, it has had every chance to run.
   pool.drain();
-  std::this_thread::sleep_for(20ms);
+  queue.sync([] {});
   EXPECT_EQ(fired.load(), 1);
 }
 

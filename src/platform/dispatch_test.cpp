@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <future>
 #include <thread>
 #include <vector>
 
@@ -100,12 +101,19 @@ TEST(DispatchPool, DrainWaitsForQueueWorkPostedByQueueWork) {
   DispatchPool pool(3);
   SerialQueue a(pool, "test.a");
   std::atomic<int> done{0};
-  a.async([&] {
-    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  std::promise<void> started, release;
+  a.async([&, gate = release.get_future().share()] {
+    started.set_value();
+    gate.wait();
     a.async([&] { done++; });
     pool.post([&] { done++; });
   });
+  started.get_future().wait();
+  // The task posts its work only once let go, which races with drain() below; either way drain()
+  // must not return before that work has run.
+  std::thread releaser([&] { release.set_value(); });
   pool.drain();
+  releaser.join();
   EXPECT_EQ(done.load(), 2);
 }
 

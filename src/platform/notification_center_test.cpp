@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <future>
 #include <thread>
 
 namespace tavix::platform {
@@ -36,9 +37,11 @@ TEST(NotificationCenter, RemovedObserverHearsNothingEvenWhenQueued) {
   NotificationCenter center;
   std::atomic<int> heard{0};
   auto reg = center.addObserver("N", nullptr, &queue, [&](const Notification&) { heard++; });
-  queue.async([] { std::this_thread::sleep_for(std::chrono::milliseconds(20)); });
-  center.post("N");  // queued behind the sleeper
+  std::promise<void> release;
+  queue.async([gate = release.get_future().share()] { gate.wait(); });
+  center.post("N");  // queued behind the blocked task
   reg.reset();
+  release.set_value();
   queue.sync([] {});
   EXPECT_EQ(heard.load(), 0);
 }

@@ -146,24 +146,5 @@ TEST(TransactionTracker, CountsByNameAndCallsTheIdleHandlerWhenTheLastCloses) {
   EXPECT_TRUE(tracker.open().empty());
 }
 
-TEST(Logging, CaptureSeesEveryLevelWhateverTheOutputLevel) {
-  setLogLevel(LogLevel::Error);
-  Logger log("com.norvel.tavixd", "Tavix_Test");
-  LogCapture capture;
-  log.debug("launch event for {}", "x");
-  log.fault("Couldn't transition flusher activity to {} state.", "done");
-  auto lines = capture.lines();
-  ASSERT_EQ(lines.size(), 2u);
-  EXPECT_EQ(lines[0].level, LogLevel::Debug);
-  EXPECT_EQ(lines[1].message, "Couldn't transition flusher activity to done state.");
-  EXPECT_EQ(lines[1].category, "Tavix_Test");
-  setLogLevel(LogLevel::Info);
-
-  LogLevel parsed;
-  EXPECT_TRUE(parseLogLevel("fault", &parsed));
-  EXPECT_EQ(parsed, LogLevel::Fault);
-  EXPECT_FALSE(parseLogLevel("verbose", &parsed));
-}
-
 }  // namespace
 }  // namespace tavix::platform

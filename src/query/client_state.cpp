@@ -215,7 +215,7 @@ bool ClientState::ensureBag() {
   markNetworkRequest();
   const int waitMs = bagWaitMilliseconds();
   std::unique_lock lock(mutex_);
-  if (bagSignal_.wait_for(lock, std::chrono::milliseconds(waitMs), [this] { return bagSignals_ > 0; })) {
+  if (assembly_.clock->waitFor(lock, bagSignal_, platform::seconds(waitMs / 1000.0), [this] { return bagSignals_ > 0; })) {
     --bagSignals_;
   }
   TavixLogForCategory(TavixLoggingCategoryDefault).notice("client {} finished waiting for bag", identifier_);

@@ -4,6 +4,7 @@
 
 #include <fstream>
 #include <functional>
+#include <future>
 
 #include "core/diagnostics.h"
 #include "platform/counters.h"
@@ -294,29 +295,60 @@ class VirtualTimeTest : private VirtualClockHolder, public QueryFixture {
   using VirtualClockHolder::virtualClock;
 };
 
+TEST_F(VirtualTimeTest, WithoutABagInTimeASearchFailsAtTheEndOfTheWaitAndRecordsWhy) {
+  // The bag never comes: the search waits the first-launch wait on this clock, no longer.
+  fault("/bag", {{"hang", true}});
+  assembly.bagController = TavixBagController::create(assembly);
+  auto waiting = make("com.norvel.seekara", "Seekara/1.0");
+  Replies timedOut;
+  auto searching = std::async(std::launch::async,
+                              [&] { waiting->search(request<TVXSearchRequest>(7, "weather"), timedOut.block()); });
+  virtualClock.awaitParked(1);
+  virtualClock.advance(platform::seconds(kTVXFirstLaunchBagSemaphoreWait / 1000.0 - 0.001));
+  EXPECT_EQ(timedOut.count(), 0u);
+  virtualClock.advance(platform::seconds(0.001));
+  searching.get();
+  auto call = timedOut.first();
+  EXPECT_EQ(call.queryId, 7u);
+  EXPECT_FALSE(call.reply);
+  ASSERT_TRUE(call.error);
+  EXPECT_EQ(call.error->domain, kTVXErrorDomain);
+  EXPECT_EQ(call.error->code, 1);
+  EXPECT_EQ(call.error->reason, "timeout");
+  auto skipped = recordsOfType(*waiting, 38);
+  ASSERT_EQ(skipped.size(), 1u);
+  EXPECT_EQ(skipped[0].payload().skip_tavix_search().reason(), 3);
+  EXPECT_EQ(skipped[0].query_id(), 7);
+  EXPECT_EQ(skipped[0].user_agent(), "Seekara/1.0");
+  EXPECT_TRUE(received("/search").empty());
+}
+
 TEST_F(VirtualTimeTest, ALookupIsRetriedOnlyUntilItsRenderDeadline) {
   // searchRenderTimeout 2000 ms: the deadline is 1.5 s after the request goes out.
   serveBag(bagWith({{"search_render_timeout_ms", 2000}}));
   auto state = make("com.norvel.lookup", "Lookup/1.0");
-  fault("/search", {{"delay_ms", 300}, {"reset", true}});
   auto lookup = std::make_shared<TVXLookupRequest>();
   lookup->queryString = "serendipity";
 
   // Before the deadline every reset is retried: the first attempt and three retries.
+  fault("/search", {{"reset", true}});
   Replies inTime;
   lookup->queryId = 70;
   state->lookup(lookup, inTime.block());
-  virtualClock.advance(platform::seconds(1.4));
   EXPECT_TRUE(inTime.first().error);
   EXPECT_EQ(received("/search").size(), 4u);
 
-  // Past it, the first failure is the last.
+  // Past it, the first failure is the last: the attempt is held at the server while time passes
+  // the deadline, then reset. A retry would now be answered.
+  fault("/search", {{"hang", true}, {"reset", true}, {"times", 1}});
   Replies late;
   lookup->queryId = 71;
   state->lookup(lookup, late.block());
+  ASSERT_TRUE(testing::waitFor([&] { return received("/search").size() == 5; }));
   virtualClock.advance(platform::seconds(1.6));
+  send("POST", "/_reset");
   EXPECT_TRUE(late.first().error);
-  EXPECT_EQ(received("/search").size(), 5u);
+  EXPECT_TRUE(received("/search").empty()) << "retried past the deadline";
 }
 
 TEST_F(VirtualTimeTest, TwoWarmsWithin30SecondsSendOneRequest) {

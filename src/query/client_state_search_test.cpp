@@ -14,50 +14,6 @@ namespace {
 
 using SearchTest = QueryFixture;
 
-TEST_F(SearchTest, WithoutABagInTimeTheQueryFailsFastAndRecordsWhy) {
-  // The bag is slow to come: the query gives up after the first-launch wait.
-  fault("/bag", {{"delay_ms", 1500}});
-  assembly.bagController = TavixBagController::create(assembly);
-  auto waiting = make("com.norvel.seekara", "Seekara/1.0");
-  Replies timedOut;
-  waiting->search(request<TVXSearchRequest>(7, "weather"), timedOut.block());
-  auto call = timedOut.first();
-  EXPECT_EQ(call.queryId, 7u);
-  EXPECT_FALSE(call.reply);
-  ASSERT_TRUE(call.error);
-  EXPECT_EQ(call.error->domain, kTVXErrorDomain);
-  EXPECT_EQ(call.error->code, 1);
-  EXPECT_EQ(call.error->reason, "timeout");
-  auto skipped = recordsOfType(*waiting, 38);
-  ASSERT_EQ(skipped.size(), 1u);
-  EXPECT_EQ(skipped[0].payload().skip_tavix_search().reason(), 3);
-  EXPECT_EQ(skipped[0].payload().skip_tavix_search().input(), "weather");
-  EXPECT_EQ(skipped[0].query_id(), 7);
-  EXPECT_EQ(skipped[0].user_agent(), "Seekara/1.0");
-  EXPECT_TRUE(received("/search").empty());
-}
-
-TEST_F(SearchTest, ADisabledBagAnswersWithNothingAndSendsNothing) {
-  serveBag(bagWith({{"enabled", false}}));
-  auto disabled = make("com.norvel.brovane", "Brovane/1.0");
-  Replies none;
-  disabled->search(request<TVXSearchRequest>(8, "weather"), none.block());
-  auto call = none.first();
-  EXPECT_FALSE(call.reply);
-  EXPECT_FALSE(call.error);
-  Replies zkwNone;
-  disabled->zeroKeyword(request<TVXZeroKeywordRequest>(9, "ignored"), zkwNone.block());
-  EXPECT_FALSE(zkwNone.first().error);
-  auto skipped = recordsOfType(*disabled, 38, 2);
-  ASSERT_EQ(skipped.size(), 2u);
-  EXPECT_EQ(skipped[0].payload().skip_tavix_search().reason(), 2);
-  EXPECT_EQ(skipped[0].payload().skip_tavix_search().input(), "weather");
-  EXPECT_EQ(skipped[1].payload().skip_tavix_search().reason(), 2);
-  EXPECT_EQ(skipped[1].payload().skip_tavix_search().input(), "");
-  EXPECT_TRUE(received("/search").empty());
-  EXPECT_EQ(none.count(), 1u);
-}
-
 TEST_F(SearchTest, ABagWithoutASearchURLFailsAsTheTransportWouldAndRecordsIt) {
   platform::Dictionary bag = bagWith();
   bag.erase("search_url");
@@ -182,30 +138,6 @@ TEST_F(SearchTest, TheSameKeystrokeTwiceIsServedFromTheQueryCache) {
   EXPECT_EQ(TavixDiagnosticDataReporter::store().value(createCounterKey("Seekara/1.0", "fedapicall.serverstatus") +
                                                        "200"),
             okBefore + 1);
-}
-
-TEST_F(SearchTest, ABodyThatIsNotJsonReachesTheClientWithTheParseErrorAndIsNotCached) {
-  serveBag(bagWith());
-  auto state = make("com.norvel.seekara", "Seekara/1.0");
-  fault("/search", {{"body", "<html>busy</html>"}, {"times", 1}});
-  Replies garbled;
-  state->search(request<TVXSearchRequest>(20, "camera"), garbled.block());
-  auto call = garbled.first();
-  ASSERT_TRUE(call.reply);
-  EXPECT_EQ(call.reply->data, "<html>busy</html>");
-  ASSERT_TRUE(call.error);
-  EXPECT_EQ(call.error->domain, kTVXJSONErrorDomain);
-  // Still a finished network search, not a failure.
-  EXPECT_EQ(recordsOfType(*state, 15).size(), 1u);
-  EXPECT_TRUE(recordsOfType(*state, 18, 0).empty());
-
-  Replies again;
-  state->search(request<TVXSearchRequest>(21, "camera"), again.block());
-  call = again.first();
-  ASSERT_TRUE(call.reply);
-  EXPECT_FALSE(call.error);
-  EXPECT_EQ(received("/search").size(), 2u);
-  EXPECT_TRUE(recordsOfType(*state, 39, 0).empty());
 }
 
 TEST_F(SearchTest, MessagesReturnKeyRecordsAGoToSearchAndVerboseRepliesCarryTheExchange) {

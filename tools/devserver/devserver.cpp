@@ -214,7 +214,13 @@ struct DevServer::Impl {
       if (fault && fault->delayMs > 0) std::this_thread::sleep_for(std::chrono::milliseconds(fault->delayMs));
       if (fault && fault->hang) {
         hangUntilAbandoned(req);
-        if (!isStopping()) return handler(req, res);  // released by a reset of the faults
+        // Released by a reset of the faults: answered, or with "reset" too, failed only now.
+        if (!isStopping() && !fault->reset) return handler(req, res);
+        if (!isStopping()) {
+          resetConnection(req);
+          res.set_header("Connection", "close");
+          return;
+        }
         res.set_content_provider(1024, "application/json", [](size_t, size_t, httplib::DataSink&) { return false; });
         return;
       }

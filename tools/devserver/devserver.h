@@ -10,7 +10,8 @@
 //                    applies to requests of that path; "times" limits how many (absent: all);
 //                    "body": "[1]" answers that text (with "status", default 200) instead;
 //                    "hang": true never answers (until the client gives up, the faults are
-//                    reset, when it answers normally, or stop());
+//                    reset, when it answers normally, or stop()); with "reset" too, the
+//                    connection is reset when the faults are;
 //                    "reset": true resets the connection (TCP RST) instead of answering;
 //                    "headers": {"Name": "value"} adds header fields to the answer;
 //                    hostile answers: "nested": N arrays nested N deep; "huge": N a JSON string

@@ -156,43 +156,6 @@ TEST(IpcServer, DeliversFramesAndDescriptorsBothWaysWithPeerCredentials) {
   EXPECT_EQ(r.invalidations, 1);
 }
 
-TEST(IpcServer, OversizeFrameClosesOnlyThatConnection) {
-  testing::TempHome home;
-  DispatchPool pool(2);
-  Logger log("test", "ipc");
-  LogCapture capture;
-  const std::string path = (home.runtime() / "socket").string();
-  std::error_code ec;
-  auto listener = IpcListener::listen(pool, path, log, &ec);
-  ASSERT_TRUE(listener);
-  Received r;
-  std::mutex lock;
-  std::vector<std::shared_ptr<IpcConnection>> all;
-  listener->resume(
-      [&](const std::shared_ptr<IpcConnection>& c) {
-        std::lock_guard l(lock);
-        all.push_back(startRecording(c, r));
-      },
-      "test.connection");
-
-  UniqueFd bad;
-  ASSERT_FALSE(connectTo(path, &bad));
-  const char header[] = {'\x01', '\x00', '\x00', '\x01'};  // 16 MiB + 1
-  std::size_t sent = 0;
-  ASSERT_FALSE(sendWithFds(bad.get(), std::string_view(header, 4), {}, true, &sent));
-  FrameDecoder d;
-  EXPECT_EQ(readFrame(bad.get(), d), "<eof>");
-  EXPECT_TRUE(testing::waitFor([&] { return capture.contains("over the limit of 16777216"); }));
-
-  UniqueFd good;
-  ASSERT_FALSE(connectTo(path, &good));
-  ASSERT_FALSE(sendWithFds(good.get(), encodeFrame("still here"), {}, true, &sent));
-  EXPECT_TRUE(testing::waitFor([&] {
-    std::lock_guard l(r.lock);
-    return !r.payloads.empty() && r.payloads.back() == "still here";
-  }));
-}
-
 TEST(IpcServer, PeerThatStopsReadingIsDisconnected) {
   DispatchPool pool(2);
   Logger log("test", "ipc");
