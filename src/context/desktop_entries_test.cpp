@@ -64,6 +64,10 @@ class ArmCountingClock final : public platform::Clock {
     cv.notify_all();
     return handle;
   }
+  bool waitFor(std::unique_lock<std::mutex>& held, std::condition_variable& signal, platform::Duration timeout,
+               const std::function<bool()>& ready) override {
+    return clock.waitFor(held, signal, timeout, ready);
+  }
   bool waitArmed(int count) {
     std::unique_lock<std::mutex> guard(lock);
     return cv.wait_for(guard, std::chrono::seconds(10), [&] { return armed >= count; });
