@@ -9,7 +9,6 @@
 // opens, as a daemon on a device would have done long before it went idle.
 //
 //   idle_cost [--window SECONDS] [--settle SECONDS] [--starts N] [--strace]
-#include <fcntl.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -23,6 +22,7 @@
 #include <filesystem>
 #include <fstream>
 #include <map>
+#include <optional>
 #include <sstream>
 #include <string>
 #include <thread>
@@ -30,6 +30,8 @@
 
 #include "devserver/devserver.h"
 #include "platform/defaults.h"
+#include "support/daemon_process.h"
+#include "support/temp_home.h"
 #include "tavix/client.h"
 
 namespace {
@@ -112,11 +114,10 @@ std::map<int, ThreadSample> sampleThreads(pid_t pid) {
 // A daemon in a temporary home whose bag comes from `bagURL`.
 class Daemon {
  public:
-  Daemon(const std::string& root, const std::string& bagURL) : root_(root), socket_(root + "/socket") {
-    tavix::platform::UserDefaults defaults(root + "/config/com.norvel.tavixd", "com.norvel.tavixd");
+  explicit Daemon(const std::string& bagURL) : socket_((home_.runtime() / "socket").string()) {
+    tavix::platform::UserDefaults defaults(home_.config() / "com.norvel.tavixd", "com.norvel.tavixd");
     defaults.setObject("TVXBagURL", bagURL);
   }
-  ~Daemon() { stop(); }
 
   struct Started {
     double connectMs = -1;  // until a connect() on the socket succeeded
@@ -125,18 +126,7 @@ class Daemon {
 
   Started start() {
     const auto began = Clock::now();
-    pid_ = fork();
-    if (pid_ == 0) {
-      setenv("HOME", root_.c_str(), 1);
-      setenv("XDG_CACHE_HOME", (root_ + "/cache").c_str(), 1);
-      setenv("XDG_CONFIG_HOME", (root_ + "/config").c_str(), 1);
-      setenv("XDG_RUNTIME_DIR", root_.c_str(), 1);
-      const int log = open((root_ + "/tavixd.log").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600);
-      dup2(log, 2);
-      execl(TAVIXD_BINARY, TAVIXD_BINARY, "--socket", socket_.c_str(), "--log-level", "error",
-            static_cast<char*>(nullptr));
-      _exit(127);
-    }
+    process_.emplace(TAVIXD_BINARY, home_, std::vector<std::string>{"--socket", socket_, "--log-level", "error"});
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     std::snprintf(address.sun_path, sizeof address.sun_path, "%s", socket_.c_str());
@@ -152,13 +142,12 @@ class Daemon {
   }
 
   void stop() {
-    if (pid_ <= 0) return;
-    kill(pid_, SIGTERM);
-    waitpid(pid_, nullptr, 0);
-    pid_ = -1;
+    if (process_) process_->stop();
+    process_.reset();
   }
 
-  pid_t pid() const { return pid_; }
+  pid_t pid() const { return process_ ? process_->pid() : -1; }
+  const fs::path& root() const { return home_.root(); }
 
  private:
   Started answered(Clock::time_point began) const {
@@ -177,9 +166,9 @@ class Daemon {
     return started;
   }
 
-  std::string root_;
+  tavix::testing::TempHome home_;
   std::string socket_;
-  pid_t pid_ = -1;
+  std::optional<tavix::testing::DaemonProcess> process_;
 };
 
 // Answers the median start to socket ready, or -1 when a start failed.
@@ -246,8 +235,8 @@ IdleFigures reportWindow(pid_t pid, int seconds) {
 }
 
 // `strace -c -f` attached for the window; its summary printed as it stands.
-void reportSyscalls(pid_t pid, int seconds, const std::string& root) {
-  const std::string out = root + "/strace.txt";
+void reportSyscalls(pid_t pid, int seconds, const fs::path& root) {
+  const std::string out = (root / "strace.txt").string();
   const pid_t tracer = fork();
   if (tracer == 0) {
     const std::string target = std::to_string(pid);
@@ -275,29 +264,22 @@ int main(int argc, char** argv) {
     std::fprintf(stderr, "usage: %s [--window SECONDS] [--settle SECONDS] [--starts N] [--strace]\n", argv[0]);
     return 2;
   }
-  char dir[] = "/tmp/tavix-bench-XXXXXX";
-  if (!mkdtemp(dir)) {
-    std::perror("mkdtemp");
-    return 1;
-  }
-  const std::string root = dir;
   tavix::devserver::DevServer server;
   std::string error;
   if (!server.start({}, &error)) {
     std::fprintf(stderr, "devserver: %s\n", error.c_str());
-    fs::remove_all(root);
     return 1;
   }
 
   int result = 1;
   {
-    Daemon daemon(root, server.baseURL() + "/bag");
+    Daemon daemon(server.baseURL() + "/bag");
     const double startMs = reportStarts(daemon, flags.starts);
     if (startMs >= 0 && daemon.start().connectMs >= 0) {
       // Lets the bag and resource fetches finish and their follow-up timers settle.
       std::this_thread::sleep_for(std::chrono::seconds(flags.settleSeconds));
       const IdleFigures idle = reportWindow(daemon.pid(), flags.windowSeconds);
-      if (flags.strace) reportSyscalls(daemon.pid(), flags.windowSeconds, root);
+      if (flags.strace) reportSyscalls(daemon.pid(), flags.windowSeconds, daemon.root());
       std::printf("aims: wake-ups 0 [%s: %ld], threads <= 4 [%s: %ld], RssAnon <= 1.5 MiB [%s: %.2f MiB], "
                   "start <= 30 ms [%s: %.1f ms]\n",
                   verdict(idle.wakeups == 0), idle.wakeups, verdict(idle.threads <= 4), idle.threads,
@@ -308,6 +290,5 @@ int main(int argc, char** argv) {
     }
   }
   server.stop();
-  fs::remove_all(root);
   return result;
 }

@@ -6,10 +6,8 @@
 //     searches sent straight to the devserver through the same HTTP stack. Both report what the
 //     load costs the devserver (it runs in a process of its own so that its share can be read
 //     from /proc): its CPU, its threads, its accept queue and the connections opened.
-#include <fcntl.h>
 #include <signal.h>
 #include <stdlib.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <benchmark/benchmark.h>
@@ -30,7 +28,9 @@
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
 #include "platform/http/url_session.h"
+#include "support/daemon_process.h"
 #include "support/devserver_process.h"
+#include "support/temp_home.h"
 #include "tavix/client.h"
 
 namespace {
@@ -48,51 +48,31 @@ void reportLatencies(benchmark::State& state, std::vector<double>& micros) {
 // A devserver and a daemon that asks it for its bag, started once for every benchmark.
 struct Environment {
   tavix::testing::DevServerProcess server{TAVIX_DEVSERVER_BINARY, {"--max-lifetime", "3600"}};
-  std::string root;
-  std::string socket;
-  pid_t daemon = -1;
+  tavix::testing::TempHome home;
+  std::string socket = (home.runtime() / "socket").string();
+  std::unique_ptr<tavix::testing::DaemonProcess> daemon;
   std::string error;
 
   Environment() {
-    char dir[] = "/tmp/tavix-bench-XXXXXX";
-    if (!mkdtemp(dir)) {
-      error = "mkdtemp";
-      return;
-    }
-    root = dir;
-    socket = root + "/socket";
     if (server.base.empty()) {
       error = "devserver: " + server.firstLine;
       return;
     }
     {
-      tavix::platform::UserDefaults defaults(root + "/config/com.norvel.tavixd", "com.norvel.tavixd");
+      tavix::platform::UserDefaults defaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
       defaults.setObject("TVXBagURL", server.base + "/bag");
     }
-    daemon = fork();
-    if (daemon == 0) {
-      setenv("XDG_CACHE_HOME", (root + "/cache").c_str(), 1);
-      setenv("XDG_CONFIG_HOME", (root + "/config").c_str(), 1);
-      setenv("XDG_RUNTIME_DIR", root.c_str(), 1);
-      // Its log lines (50 connections from one process are worth a line each) stay out of the table.
-      const int log = open((root + "/tavixd.log").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0600);
-      dup2(log, 2);
-      execl(TAVIXD_BINARY, TAVIXD_BINARY, "--socket", socket.c_str(), "--log-level", "error",
-            static_cast<char*>(nullptr));
-      _exit(127);
-    }
+    // Its log (50 connections from one process are worth a line each) goes to a file in the home.
+    daemon = std::make_unique<tavix::testing::DaemonProcess>(
+        TAVIXD_BINARY, home, std::vector<std::string>{"--socket", socket, "--log-level", "error"});
     const auto deadline = Clock::now() + std::chrono::seconds(5);
     while (!std::filesystem::exists(socket) && Clock::now() < deadline) {
       std::this_thread::sleep_for(std::chrono::milliseconds(5));
     }
   }
   ~Environment() {
-    if (daemon > 0) {
-      kill(daemon, SIGTERM);
-      waitpid(daemon, nullptr, 0);
-    }
+    if (daemon) daemon->stop();
     if (server.pid > 0) kill(server.pid, SIGTERM);
-    if (!root.empty()) std::filesystem::remove_all(root);
   }
 
   client::Client::Options options() const {
@@ -305,21 +285,29 @@ long acceptQueue(int port) {
   return -1;
 }
 
-// Threads of `pid` and how many of them are running (state R) right now.
-std::pair<int, int> threadStates(pid_t pid) {
-  int threads = 0, running = 0;
+struct ThreadStates {
+  int threads = 0;
+  int running = 0;    // state R: on a core or waiting for one
+  int onSockets = 0;  // blocked in select or poll: cpp-httplib's listener and its threads that hold a connection
+};
+
+ThreadStates threadStates(pid_t pid) {
+  ThreadStates states;
   std::error_code ec;
   for (const auto& entry : std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/task", ec)) {
     const std::string stat = readFile(entry.path() / "stat");
     const auto close = stat.rfind(')');
-    ++threads;
-    if (close != std::string::npos && close + 2 < stat.size() && stat[close + 2] == 'R') ++running;
+    ++states.threads;
+    if (close != std::string::npos && close + 2 < stat.size() && stat[close + 2] == 'R') ++states.running;
+    // select, poll, pselect6, ppoll on x86-64; an idle pool thread waits on its condition variable (futex).
+    const long call = std::atol(readFile(entry.path() / "syscall").c_str());
+    if (call == 23 || call == 7 || call == 270 || call == 271) ++states.onSockets;
   }
-  return {threads, running};
+  return states;
 }
 
 // What a load costs the devserver (and the daemon, when one is in the path), read from /proc
-// before, during (every 20 ms, on a thread of its own) and after the load. The counters of the
+// before, during (every 50 ms, on a thread of its own) and after the load. The counters of the
 // network namespace count every process in it: run nothing else meanwhile.
 class LoadProbe {
  public:
@@ -348,6 +336,7 @@ class LoadProbe {
     state.counters["server_threads"] = maxThreads_;
     state.counters["server_running_mean"] = samples_ ? runningSum_ / samples_ : 0;
     state.counters["server_running_max"] = maxRunning_;
+    state.counters["server_on_sockets_max"] = maxOnSockets_;
     state.counters["accept_queue_max"] = maxAcceptQueue_;
     state.counters["listen_overflows"] = netCounter("/proc/net/netstat", "TcpExt", "ListenOverflows") - overflows_;
     state.counters["tcp_connects"] = netCounter("/proc/net/snmp", "Tcp", "ActiveOpens") - opens_;
@@ -356,13 +345,14 @@ class LoadProbe {
  private:
   void sample() {
     while (!stop_) {
-      const auto [threads, running] = threadStates(server_);
-      maxThreads_ = std::max(maxThreads_, threads);
-      maxRunning_ = std::max(maxRunning_, running);
-      runningSum_ += running;
+      const auto states = threadStates(server_);
+      maxThreads_ = std::max(maxThreads_, states.threads);
+      maxRunning_ = std::max(maxRunning_, states.running);
+      maxOnSockets_ = std::max(maxOnSockets_, states.onSockets);
+      runningSum_ += states.running;
       ++samples_;
       maxAcceptQueue_ = std::max(maxAcceptQueue_, acceptQueue(port_));
-      std::this_thread::sleep_for(std::chrono::milliseconds(20));
+      std::this_thread::sleep_for(std::chrono::milliseconds(50));
     }
   }
 
@@ -374,7 +364,7 @@ class LoadProbe {
   std::pair<double, double> machine_;
   long opens_, overflows_;
   std::atomic<bool> stop_{false};
-  int maxThreads_ = 0, maxRunning_ = 0, samples_ = 0;
+  int maxThreads_ = 0, maxRunning_ = 0, maxOnSockets_ = 0, samples_ = 0;
   double runningSum_ = 0;
   long maxAcceptQueue_ = 0;
   std::thread sampler_;  // last: starts once every field above is set
@@ -426,7 +416,7 @@ void BM_FiftyClientsTyping(benchmark::State& state) {
   for (auto& holder : clients) {
     if (!connectedClient(state, holder)) return;
   }
-  typeConcurrently(state, environment().daemon,
+  typeConcurrently(state, environment().daemon->pid(),
                    [&](int i, std::uint64_t n) { return search(*clients[i], n, uniqueInput(n)); });
 }
 BENCHMARK(BM_FiftyClientsTyping)->UseRealTime()->Iterations(10);
