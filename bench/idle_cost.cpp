@@ -1,9 +1,9 @@
 // What an idle tavixd costs the machine, with no client connected: wake-ups over a window (the
 // scheduler's per-thread switch counts, so the figure says which thread wakes and where it was
 // blocked), threads, anonymous and resident memory, and how long a start takes until the socket
-// accepts a connection (and until a first empty call is answered through it). With --strace, a second window of the same length under `strace -c -f`
-// gives the system calls behind the wake-ups (ptrace stops inflate the switch counts, hence the
-// separate window).
+// accepts a connection (and until a first empty call is answered through it). With --strace, a
+// second window of the same length under `strace -c -f` gives the system calls behind the
+// wake-ups (ptrace stops inflate the switch counts, hence the separate window).
 //
 // The daemon fetches its bag and resources from a devserver in this process before the window
 // opens, as a daemon on a device would have done long before it went idle.
@@ -259,6 +259,8 @@ const char* verdict(bool pass) { return pass ? "pass" : "FAIL"; }
 }  // namespace
 
 int main(int argc, char** argv) {
+  // A window is long: each line shows as it comes, also when the output goes to a file.
+  std::setvbuf(stdout, nullptr, _IOLBF, 0);
   Flags flags;
   if (!parseFlags(argc, argv, &flags)) {
     std::fprintf(stderr, "usage: %s [--window SECONDS] [--settle SECONDS] [--starts N] [--strace]\n", argv[0]);
