@@ -21,6 +21,7 @@
 #include "platform/files.h"
 #include "platform/json_value.h"
 #include "platform/notification_center.h"
+#include "platform/strings.h"
 
 namespace tavix {
 
@@ -52,14 +53,6 @@ std::string sourceName(int type) {
     case 4: case 5: return "wifi";
     default: return "unknown";
   }
-}
-
-std::string lowercased(std::string_view s) {
-  std::string out(s);
-  for (char& c : out) {
-    if (c >= 'A' && c <= 'Z') c = static_cast<char>(c - 'A' + 'a');
-  }
-  return out;
 }
 
 // "a=1&b=2" → items; empty with `ok` false when a part is not exactly one name and one value.
@@ -321,7 +314,7 @@ class TVXNetworkRequestFactory::Builder {
   static void addLocationItems(Self& f, TavixURLRequestBuilder& b, const TVXBag& bag, std::uint64_t fieldMask) {
     Context& c = *f.context_;
     bool noLocation = (fieldMask & TVXFieldMaskNoLocation) != 0;
-    if (lowercased(bag.userAgent()).find("news") != std::string::npos) {
+    if (platform::asciiLowercased(bag.userAgent()).find("news") != std::string::npos) {
       auto& location = f.providers_.locationManager;
       if (noLocation || !location || !isAuthorized(location->newsAuthorizationStatus())) {
         b.defaultQueryItemWithName("geosrc", kNoLocationUser);

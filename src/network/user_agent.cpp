@@ -6,18 +6,13 @@
 
 #include "platform/defaults.h"
 #include "platform/files.h"
+#include "platform/strings.h"
 
 namespace tavix {
 
 namespace {
 
-std::string trim(std::string s) {
-  const char* blanks = " \t\r\n";
-  auto begin = s.find_first_not_of(blanks);
-  if (begin == std::string::npos) return {};
-  auto end = s.find_last_not_of(blanks);
-  return s.substr(begin, end - begin + 1);
-}
+std::string trim(std::string_view s) { return std::string(platform::trimmedWhitespace(s)); }
 
 // One field of an os-release file; quotes around the value are dropped.
 std::string osReleaseField(const std::string& text, std::string_view field) {
@@ -37,14 +32,6 @@ std::string osReleaseField(const std::string& text, std::string_view field) {
     pos = end + 1;
   }
   return {};
-}
-
-std::string lowercased(std::string_view s) {
-  std::string out(s);
-  for (char& c : out) {
-    if (c >= 'A' && c <= 'Z') c = static_cast<char>(c - 'A' + 'a');
-  }
-  return out;
 }
 
 constexpr std::array<const char*, 9> kClientNames = {
@@ -104,7 +91,7 @@ std::optional<std::string> createUserAgentString(std::optional<std::string_view>
 }
 
 std::optional<std::string> extractClientNameFromString(std::string_view userAgent) {
-  std::string lower = lowercased(userAgent);
+  std::string lower = platform::asciiLowercased(userAgent);
   for (const char* name : kClientNames) {
     if (lower.find(name) != std::string::npos) return std::string(name);
   }
@@ -113,7 +100,7 @@ std::optional<std::string> extractClientNameFromString(std::string_view userAgen
 
 std::string getClientFromUserAgent(std::optional<std::string_view> userAgent) {
   if (!userAgent) return "unknown";
-  std::string lower = lowercased(*userAgent);
+  std::string lower = platform::asciiLowercased(*userAgent);
   if (lower.find("brovane") != std::string::npos) return "brovane";
   if (lower.find("seekara") != std::string::npos) return "seekara";
   return "unknown";

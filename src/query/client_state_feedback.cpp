@@ -24,6 +24,7 @@
 #include "query/client_state.h"
 #include "query/client_state_internal.h"
 #include "tavix_proto/feedback_records.pb.h"
+#include "platform/strings.h"
 
 namespace tavix {
 
@@ -86,8 +87,7 @@ void ClientState::recordSkipSearch(int reason, const std::string& input, std::ui
 void ClientState::recordDidGoToSearch(const TVXRequest& request, const std::string& input) {
   const auto agent = userAgent();
   if (!agent || request.triggerEvent != proto::TriggerSearchRequestEvent::return_key) return;
-  std::string lower = *agent;
-  std::transform(lower.begin(), lower.end(), lower.begin(), [](unsigned char c) { return std::tolower(c); });
+  const std::string lower = platform::asciiLowercased(*agent);
   if (lower.find("messages") == std::string::npos) return;
   proto::CTDidGoToSearchFeedback didGo;
   didGo.set_timestamp(eventTimestamp(assembly_));
