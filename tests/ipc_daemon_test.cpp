@@ -356,10 +356,10 @@ TEST(IpcDaemon, ClearDataLaunchEventForgetsTheSystemSearchCompletionsOnly) {
     tavix::platform::DispatchPool pool(2);
     tavix::platform::SystemClock clock(pool);
     auto cache = tavix::EngagedCompletionCache::create({folder, &clock, &pool, nullptr});
-    cache->addCompletion("camera", "cam", 0, 1);
-    cache->addCompletion("cafe rouge", "caf", 0, 2);
-    cache->addCompletion("calendar", "cal", 0, 2);
-    ASSERT_EQ(cache->rowCountForClient(2), 2);
+    cache->addCompletion("camera", "cam", 0, tavix::kEngagedCompletionClientBrovane);
+    cache->addCompletion("cafe rouge", "caf", 0, tavix::kEngagedCompletionClientSeekara);
+    cache->addCompletion("calendar", "cal", 0, tavix::kEngagedCompletionClientSeekara);
+    ASSERT_EQ(cache->rowCountForClient(tavix::kEngagedCompletionClientSeekara), 2);
     cache->closeDBConnection();
   }
   Daemon d(home);
@@ -370,8 +370,8 @@ TEST(IpcDaemon, ClearDataLaunchEventForgetsTheSystemSearchCompletionsOnly) {
   tavix::platform::DispatchPool pool(2);
   tavix::platform::SystemClock clock(pool);
   auto cache = tavix::EngagedCompletionCache::create({folder, &clock, &pool, nullptr});
-  EXPECT_EQ(cache->rowCountForClient(2), 0);
-  EXPECT_EQ(cache->rowCountForClient(1), 1);
+  EXPECT_EQ(cache->rowCountForClient(tavix::kEngagedCompletionClientSeekara), 0);
+  EXPECT_EQ(cache->rowCountForClient(tavix::kEngagedCompletionClientBrovane), 1);
 }
 
 }  // namespace

@@ -21,6 +21,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "platform/clock.h"
@@ -43,6 +44,20 @@ struct TVXSearchSuggestion {
   double score = 0;
   int type = 0;  // 1 for origin "se", 8 for origin "3d", 0 otherwise
 };
+
+// The cache keeps each client's completions apart under a number of its own.
+enum EngagedCompletionClient : unsigned long {
+  kEngagedCompletionClientOther = 0,
+  kEngagedCompletionClientBrovane = 1,
+  kEngagedCompletionClientSeekara = 2,
+};
+
+// The number of a client short name ("brovane", "seekara"); any other name is kEngagedCompletionClientOther.
+inline EngagedCompletionClient engagedCompletionClientForName(std::string_view shortName) {
+  if (shortName == "brovane") return kEngagedCompletionClientBrovane;
+  if (shortName == "seekara") return kEngagedCompletionClientSeekara;
+  return kEngagedCompletionClientOther;
+}
 
 // Scoring weights. The client connection fills them from the bag when smart history is enabled:
 // "brovane_last_1hour", "brovane_last_1day", "brovane_last_1week", "brovane_last_1month",

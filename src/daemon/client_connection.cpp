@@ -44,6 +44,18 @@ void trace(std::uint32_t code) {
   if (TVXTraceEnabled) TavixLogForCategory(TavixLoggingCategoryRequest).debug("trace 0x{:08x}", code);
 }
 
+// The trace codes around each traced query kind.
+enum TVXTraceCode : std::uint32_t {
+  TVXTraceCodeSearchStart = 0x2b000004,
+  TVXTraceCodeSearchEnd = 0x2b000008,
+  TVXTraceCodeCardStart = 0x2b00000c,
+  TVXTraceCodeCardEnd = 0x2b000010,
+  TVXTraceCodeZeroKeywordStart = 0x2b00001c,
+  TVXTraceCodeZeroKeywordEnd = 0x2b000020,
+  TVXTraceCodeLookupStart = 0x2b00002c,
+  TVXTraceCodeLookupEnd = 0x2b000030,
+};
+
 struct TraceCodes {
   std::uint32_t start = 0;
   std::uint32_t end = 0;
@@ -51,10 +63,10 @@ struct TraceCodes {
 
 TraceCodes traceCodesFor(proto::TVXRequest::KindCase kind) {
   switch (kind) {
-    case proto::TVXRequest::kSearch: return {0x2b000004, 0x2b000008};
-    case proto::TVXRequest::kCard: return {0x2b00000c, 0x2b000010};
-    case proto::TVXRequest::kZeroKeyword: return {0x2b00001c, 0x2b000020};
-    case proto::TVXRequest::kLookup: return {0x2b00002c, 0x2b000030};
+    case proto::TVXRequest::kSearch: return {TVXTraceCodeSearchStart, TVXTraceCodeSearchEnd};
+    case proto::TVXRequest::kCard: return {TVXTraceCodeCardStart, TVXTraceCodeCardEnd};
+    case proto::TVXRequest::kZeroKeyword: return {TVXTraceCodeZeroKeywordStart, TVXTraceCodeZeroKeywordEnd};
+    case proto::TVXRequest::kLookup: return {TVXTraceCodeLookupStart, TVXTraceCodeLookupEnd};
     default: return {};
   }
 }
@@ -72,13 +84,6 @@ std::string defaultKeyboardInputMode(const platform::UserDefaults* defaults) {
     if (auto mode = defaults->stringForKey("TVXKeyboardInputMode"); mode && !mode->empty()) return *mode;
   }
   return TVXCurrentLocaleSettings(defaults).locale;
-}
-
-// The engaged-completion cache's client number of a client short name.
-unsigned long completionClientNumber(const std::optional<std::string>& shortName) {
-  if (shortName == "brovane") return 1;
-  if (shortName == "seekara") return 2;
-  return 0;
 }
 
 // Sends one frame to the client; a frame that cannot go (the client has gone, or it is over the
@@ -590,7 +595,7 @@ void ClientConnection::engagedCompletionMessage(const proto::Envelope& in) {
                               connection_->peer().pid, dates.from_date(), dates.to_date());
         break;
       }
-      const auto client = completionClientNumber(state_ ? state_->clientShortName() : std::nullopt);
+      const auto client = engagedCompletionClientForName(state_ ? state_->clientShortName().value_or("") : "");
       cache->clearCompletionsFromDate(platform::fromUnixSeconds(dates.from_date()),
                                       platform::fromUnixSeconds(dates.to_date()), client);
       break;

@@ -149,7 +149,9 @@ void ClientConnection::reportFeedbackPayloadData(const std::string& data, std::u
   }
 
   const auto shortName = state_->clientShortName().value_or("");
-  const unsigned long featureClient = shortName == "brovane" ? 1 : 2;
+  // Feature counts come from the browser's completions or else the system search's.
+  const unsigned long featureClient =
+      shortName == "brovane" ? kEngagedCompletionClientBrovane : kEngagedCompletionClientSeekara;
   std::uint64_t queryId = argumentQueryId;
   if (payload.has_network_search_start() && payload.network_search_start().query_id() != 0) {
     queryId = payload.network_search_start().query_id();

@@ -101,7 +101,7 @@ void createCustomFeedbackDirectories(const platform::Paths& paths) {
     log.error("failed creating CustomFeedback dir:{}", describe(root, ec));
     return;
   }
-  for (int type = 1; type <= 7; ++type) {
+  for (int type = kTVXFirstCustomFeedbackType; type <= kTVXLastCustomFeedbackType; ++type) {
     auto name = customFeedbackDirectoryForType(type);
     if (!name) continue;
     const auto dir = root / *name;
@@ -229,7 +229,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
     launchLog.info("launch event for {}", name);
     // The system search asks for its completion history to be forgotten.
     if (name == "com.norvel.proactive.queries.clearData") {
-      EngagedCompletionCache::sharedInstance(assembly)->clearAllCompletionsForClient(2);
+      EngagedCompletionCache::sharedInstance(assembly)->clearAllCompletionsForClient(kEngagedCompletionClientSeekara);
     }
   });
 

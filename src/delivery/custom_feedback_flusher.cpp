@@ -70,7 +70,7 @@ const std::vector<std::string>& customFeedbackTypesInFlushOrder() {
   static const std::vector<std::string> types = {
       std::string(kTVXSeekaraResultFeaturesDir), std::string(kTVXBrovaneAutoFillDir),
       std::string(kTVXBrovaneAutoPlayDir),       std::string(kTVXQuilletDir),
-      std::string(kTVXProactiveEventTrackerDir), std::string(kTVXEngagedCompletionDir),
+      std::string(kTVXEventTrackerDir), std::string(kTVXEngagedCompletionDir),
   };
   return types;
 }

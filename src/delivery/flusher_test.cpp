@@ -207,7 +207,7 @@ class CustomFeedbackTest : public FlusherTest {
  protected:
   platform::fs::path root() { return home.cache() / "com.norvel.tavixd" / kTVXCustomFeedbackDir; }
   void makeDirectories() {
-    for (int type = 1; type <= 7; ++type) {
+    for (int type = kTVXFirstCustomFeedbackType; type <= kTVXLastCustomFeedbackType; ++type) {
       if (auto name = customFeedbackDirectoryForType(type)) platform::fs::create_directories(root() / *name);
     }
   }

@@ -48,9 +48,15 @@ bool isAuthorized(int status) {
 
 std::string sourceName(int type) {
   switch (type) {
-    case 1: case 2: case 3: case 9: return "gps";
-    case 6: case 7: case 8: return "cell";
-    case 4: case 5: return "wifi";
+    case TVXLocationSourceTypeSatellite:
+    case TVXLocationSourceTypeSatelliteAssisted:
+    case TVXLocationSourceTypeSatelliteDifferential:
+    case TVXLocationSourceTypeSatelliteFused: return "gps";
+    case TVXLocationSourceTypeCell:
+    case TVXLocationSourceTypeCellTriangulated:
+    case TVXLocationSourceTypeCellTower: return "cell";
+    case TVXLocationSourceTypeWiFi:
+    case TVXLocationSourceTypeWiFiScan: return "wifi";
     default: return "unknown";
   }
 }
@@ -705,12 +711,12 @@ TVXNetworkRequestFactory::Request TVXNetworkRequestFactory::searchRequest(const 
     Context& c = *context_;
     b->forceQueryItemWithName("q", request.queryString);
     switch (request.triggerEvent) {
-      case 22:
-      case 23: b->forceQueryItemWithName("qtype", "explicit"); break;
-      case 24: b->forceQueryItemWithName("qtype", "suggest_with_results"); break;
-      case 8:
-      case 10: b->forceQueryItemWithName("qtype", "suggested"); break;
-      case 21: b->defaultQueryItemWithName("suggest_queries", "withtop"); break;
+      case TVXTriggerEventSearchOnly:
+      case TVXTriggerEventReturnKey: b->forceQueryItemWithName("qtype", "explicit"); break;
+      case TVXTriggerEventSuggestWithResults: b->forceQueryItemWithName("qtype", "suggest_with_results"); break;
+      case TVXTriggerEventSuggestion:
+      case TVXTriggerEventPartialSuggestion: b->forceQueryItemWithName("qtype", "suggested"); break;
+      case TVXTriggerEventSuggestQueries: b->defaultQueryItemWithName("suggest_queries", "withtop"); break;
       default: break;
     }
     Builder::addRequestAndDebugItems(*this, *b, request);

@@ -51,6 +51,8 @@ struct URLSessionTaskMetrics;
 
 // The domain of the error that comes with a reply body that is not JSON.
 inline constexpr const char* kTVXJSONErrorDomain = "TavixJSONErrorDomain";
+// Its one code: the text could not be read as the JSON expected.
+inline constexpr long kTVXJSONErrorCodeNotJSON = 3840;
 // The domain of a server's HTTP status that failed a request (the code is the status), kept apart
 // from kTVXErrorDomain, whose codes are the daemon's own.
 inline constexpr const char* kTVXHTTPStatusErrorDomain = "TavixHTTPStatusErrorDomain";

@@ -215,7 +215,7 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
       if (!parsed || !parsed->array()) {
         log.error("Failed to deserialize card details for into a dictionary. Error: {}. Response data: \"{}\"",
                   parsed ? std::string("not a list") : parseError, data);
-        reply(queryId, std::nullopt, TVXError{kTVXJSONErrorDomain, 3840, "not a list"});
+        reply(queryId, std::nullopt, TVXError{kTVXJSONErrorDomain, kTVXJSONErrorCodeNotJSON, "not a list"});
         self->failSearchFeedback(std::nullopt, *request, start, data.size(), status, timing);
         return;
       }
@@ -239,7 +239,7 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
       if (kind.endpoint != proto::EndpointType::tavix_flight) {
         std::string parseError;
         if (!platform::parseJson(data, &parseError)) {
-          jsonError = TVXError{kTVXJSONErrorDomain, 3840, parseError.empty() ? "not JSON" : parseError};
+          jsonError = TVXError{kTVXJSONErrorDomain, kTVXJSONErrorCodeNotJSON, parseError.empty() ? "not JSON" : parseError};
         }
       }
       self->endNetworkFeedback(start, data, data.size(), status, timing, queryId);
@@ -296,7 +296,7 @@ void ClientState::debugFlightSearch(const TVXFlightSearchRequest& request, const
   const auto parsed = platform::parseJson(text.str(), &parseError);
   if (!parsed || (!parsed->array() && !parsed->dictionary())) {
     log.error("Failed to parse flight test data json. Error: {}", parseError.empty() ? "not a list" : parseError);
-    reply(request.queryId, std::nullopt, TVXError{kTVXJSONErrorDomain, 3840, "flight test data is not JSON"});
+    reply(request.queryId, std::nullopt, TVXError{kTVXJSONErrorDomain, kTVXJSONErrorCodeNotJSON, "flight test data is not JSON"});
     return;
   }
   auto squeeze = [](std::string s) {

@@ -69,7 +69,7 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
   const std::int64_t smartMinimum = bag->smartHistoryMinimumQueryLength();
   const std::string clientName = bag->clientName().value_or("");
   const bool seekaraTrigger = request->triggerEvent == proto::TriggerSearchRequestEvent::suggest_queries ||
-                              request->triggerEvent == 24;
+                              request->triggerEvent == TVXTriggerEventSuggestWithResults;
   if ((smartMinimum == 0 || length >= smartMinimum - 1) && bag->smartHistoryEnabled() &&
       (clientName == "brovane" || (clientName == "seekara" && seekaraTrigger))) {
     proto::CTStartLocalSearchFeedback start;
@@ -82,7 +82,7 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
     addCodable(start, queryId, true);
 
     const bool brovane = clientName == "brovane";
-    const unsigned long client = brovane ? 1 : 2;
+    const unsigned long client = brovane ? kEngagedCompletionClientBrovane : kEngagedCompletionClientSeekara;
     unsigned long count = 1;
     if (!brovane) {
       const auto asked = bag->smartHistoryCompletionReturnCount();
@@ -188,7 +188,7 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
         const auto parsed = platform::parseJson(data, &parseError);
         std::optional<TVXError> jsonError;
         if (!parsed) {
-          jsonError = TVXError{kTVXJSONErrorDomain, 3840, parseError.empty() ? "not JSON" : parseError};
+          jsonError = TVXError{kTVXJSONErrorDomain, kTVXJSONErrorCodeNotJSON, parseError.empty() ? "not JSON" : parseError};
         } else if (self->queryCache_) {
           // The server's reply is a list; its first dictionary names the completed query.
           const platform::Dictionary* first = parsed->dictionary();

@@ -28,7 +28,7 @@ TEST_F(SearchTest, WithoutABagInTimeTheQueryFailsFastAndRecordsWhy) {
   EXPECT_EQ(call.error->domain, kTVXErrorDomain);
   EXPECT_EQ(call.error->code, 1);
   EXPECT_EQ(call.error->reason, "timeout");
-  auto skipped = recordsOfType(*waiting, 38);
+  auto skipped = recordsOfType(*waiting, kFeedbackTypeSkipSearch);
   ASSERT_EQ(skipped.size(), 1u);
   EXPECT_EQ(skipped[0].payload().skip_tavix_search().reason(), 3);
   EXPECT_EQ(skipped[0].payload().skip_tavix_search().input(), "weather");
@@ -48,7 +48,7 @@ TEST_F(SearchTest, ADisabledBagAnswersWithNothingAndSendsNothing) {
   Replies zkwNone;
   disabled->zeroKeyword(request<TVXZeroKeywordRequest>(9, "ignored"), zkwNone.block());
   EXPECT_FALSE(zkwNone.first().error);
-  auto skipped = recordsOfType(*disabled, 38, 2);
+  auto skipped = recordsOfType(*disabled, kFeedbackTypeSkipSearch, 2);
   ASSERT_EQ(skipped.size(), 2u);
   EXPECT_EQ(skipped[0].payload().skip_tavix_search().reason(), 2);
   EXPECT_EQ(skipped[0].payload().skip_tavix_search().input(), "weather");
@@ -70,7 +70,7 @@ TEST_F(SearchTest, ABagWithoutASearchURLFailsAsTheTransportWouldAndRecordsIt) {
   EXPECT_EQ(std::pair(error->domain, error->code),
             std::pair(std::string(platform::http::kURLErrorDomain),
                       std::int64_t{platform::http::URLErrorUnsupportedURL}));
-  auto errors = recordsOfType(*state, 18);
+  auto errors = recordsOfType(*state, kFeedbackTypeError);
   ASSERT_EQ(errors.size(), 1u);
   EXPECT_EQ(errors[0].query_id(), 12);
   EXPECT_EQ(errors[0].payload().error().code(), platform::http::URLErrorUnsupportedURL);
@@ -87,7 +87,7 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
   auto call = skipped.first();
   EXPECT_FALSE(call.reply);
   EXPECT_FALSE(call.error);
-  auto skips = recordsOfType(*seekara, 38);
+  auto skips = recordsOfType(*seekara, kFeedbackTypeSkipSearch);
   ASSERT_EQ(skips.size(), 1u);
   EXPECT_EQ(skips[0].payload().skip_tavix_search().reason(), 1);
   EXPECT_EQ(skips[0].payload().skip_tavix_search().input(), "zq");
@@ -108,7 +108,7 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
   EXPECT_TRUE(call.reply->localSuggestions.empty());
   EXPECT_EQ(brovane->completionCacheSuggestions().size(), 1u);
   EXPECT_EQ(received("/search").size(), 1u);
-  auto localStart = recordsOfType(*brovane, 16);
+  auto localStart = recordsOfType(*brovane, kFeedbackTypeLocalSearchStart);
   ASSERT_EQ(localStart.size(), 1u);
   EXPECT_EQ(localStart[0].payload().local_search_start().input(), "zq");
   EXPECT_EQ(localStart[0].payload().local_search_start().trigger_event(), 1);
@@ -127,7 +127,7 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
   Replies shorter;
   seekara->search(request<TVXSearchRequest>(4, "z", 21), shorter.block());
   shorter.first();
-  localStart = recordsOfType(*seekara, 16, 2);
+  localStart = recordsOfType(*seekara, kFeedbackTypeLocalSearchStart, 2);
   ASSERT_EQ(localStart.size(), 2u);
   EXPECT_EQ(localStart[1].payload().local_search_start().trigger_event(), 19);
 }
@@ -146,8 +146,8 @@ TEST_F(SearchTest, TheSameKeystrokeTwiceIsServedFromTheQueryCache) {
   EXPECT_FALSE(call.error);
   EXPECT_NE(call.reply->data.find("\"status\":\"ok\""), std::string::npos);
   // The end record carries the server's own account of the request and the transport's timing.
-  auto ends = recordsOfType(*state, 15);
-  auto starts = recordsOfType(*state, 14);
+  auto ends = recordsOfType(*state, kFeedbackTypeNetworkSearchEnd);
+  auto starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart);
   ASSERT_EQ(starts.size(), 1u);
   ASSERT_EQ(ends.size(), 1u);
   const auto& start = starts[0].payload().network_search_start();
@@ -196,8 +196,8 @@ TEST_F(SearchTest, ABodyThatIsNotJsonReachesTheClientWithTheParseErrorAndIsNotCa
   ASSERT_TRUE(call.error);
   EXPECT_EQ(call.error->domain, kTVXJSONErrorDomain);
   // Still a finished network search, not a failure.
-  EXPECT_EQ(recordsOfType(*state, 15).size(), 1u);
-  EXPECT_TRUE(recordsOfType(*state, 18, 0).empty());
+  EXPECT_EQ(recordsOfType(*state, kFeedbackTypeNetworkSearchEnd).size(), 1u);
+  EXPECT_TRUE(recordsOfType(*state, kFeedbackTypeError, 0).empty());
 
   Replies again;
   state->search(request<TVXSearchRequest>(21, "camera"), again.block());
@@ -242,7 +242,7 @@ TEST_F(SearchTest, TheServerCanAskForANewerBagAndTheBagCanRouteThroughItsProxy) 
   EXPECT_TRUE(direct.first().reply);
   EXPECT_EQ(received("/search").size(), 1u);
   EXPECT_TRUE(testing::waitFor([&] { return received("/bag").size() == 2; }, 5000));
-  auto starts = recordsOfType(*state, 14);
+  auto starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart);
   ASSERT_FALSE(starts.empty());
   EXPECT_FALSE(starts.back().payload().network_search_start().has_marvola_status());
 
@@ -253,7 +253,7 @@ TEST_F(SearchTest, TheServerCanAskForANewerBagAndTheBagCanRouteThroughItsProxy) 
   proxied.first();
   EXPECT_EQ(received("/search").size(), 1u);
   EXPECT_EQ(received(server.baseURL() + "/search", &proxy).size(), 1u);
-  starts = recordsOfType(*state, 14, 2);
+  starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart, 2);
   ASSERT_EQ(starts.size(), 2u);
   EXPECT_EQ(starts.back().payload().network_search_start().marvola_status(), 1);
 

@@ -20,6 +20,7 @@
 #include "devserver/devserver.h"
 #include "feedback/client_session_manager.h"
 #include "feedback/persistent_storage.h"
+#include "feedback/vocabulary.h"
 #include "network/request_factory.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
