@@ -477,7 +477,13 @@ Dictionary TavixBagController::cacheBagDictionary(const Dictionary& dictionary) 
     bagLog().fault("Couldn't get path to cache bag.  Error: {}.", ec.message());
     return augmented;
   }
-  const std::string bytes = platform::toBinaryPlist(PropertyValue(augmented));
+  const PropertyValue bag(augmented);
+  if (!platform::plistCanHold(bag)) {
+    // Cutting the string short would store a bag the server never sent.
+    bagLog().error("Error writing bag to persistent cache: {}.", "a string holds U+0000");
+    return augmented;
+  }
+  const std::string bytes = platform::toBinaryPlist(bag);
   if (bytes.empty()) bagLog().error("Error writing bag to persistent cache: {}.", "empty property list");
   if (auto werr = platform::writeFileAtomically(*path, bytes, 0600)) {
     bagLog().error("Could not write to {}", path->string());
