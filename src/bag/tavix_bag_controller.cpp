@@ -8,7 +8,7 @@
 
 #include <fmt/core.h>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "context/user_guid_controller.h"
 #include "core/assembly.h"
 #include "core/diagnostics.h"
@@ -18,7 +18,7 @@
 #include "feedback/tavix_feedback.h"
 #include "network/retryable_request.h"
 #include "network/url_request_builder.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/http/url.h"

@@ -4,7 +4,7 @@
 
 #include <cmath>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "cache/query_cache.h"
 #include "cache/engaged_completion_cache.h"
 #include "core/assembly.h"
@@ -17,7 +17,7 @@
 #include "network/locale_context.h"
 #include "network/request_factory.h"
 #include "network/tracing.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/activity.h"
 #include "platform/defaults.h"
 #include "platform/http/url_request.h"

@@ -1,5 +1,5 @@
 #include "daemon/client_connection.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 
 #include <sys/socket.h>
 #include <unistd.h>

@@ -5,7 +5,7 @@
 
 #include <nlohmann/json.hpp>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "cache/engaged_completion_cache.h"
 #include "context/user_guid_controller.h"
 #include "core/assembly.h"
@@ -17,7 +17,7 @@
 #include "feedback/client_session.h"
 #include "feedback/client_session_manager.h"
 #include "feedback/tavix_feedback.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/files.h"
 #include "query/client_state.h"
 #include "tavix_proto/feedback_session.pb.h"

@@ -6,6 +6,7 @@
 #include <google/protobuf/stubs/logging.h>
 
 #include "context/user_guid_controller.h"
+#include "bag/tavix_bag_controller.h"
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
@@ -30,7 +31,7 @@ TavixService::TavixService(Assembly& assembly, platform::ipc::LaunchEventRegistr
   assembly_.sharedSession = assembly_.userDefaults->boolForKey("TVXSharedSession");
   assembly_.guidController = std::make_shared<TavixUserGUIDController>(assembly_);
   assembly_.clientSessionManager =
-      std::make_shared<ClientSessionManager>(assembly_, assembly_.guidController, "tavix");
+      std::make_shared<ClientSessionManager>(assembly_, assembly_.guidController, assembly_.bagController, "tavix");
   // A malformed message is logged once by the connection; protobuf's own parse complaints would
   // let any peer write to our log at will.
   google::protobuf::SetLogHandler(nullptr);

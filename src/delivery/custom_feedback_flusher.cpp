@@ -5,7 +5,7 @@
 #include <algorithm>
 
 #include "bag/tavix_bag_controller.h"
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
@@ -15,7 +15,7 @@
 #include "feedback/client_session.h"
 #include "feedback/tavix_feedback.h"
 #include "context/user_guid_controller.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "tavix_proto/feedback_records.pb.h"
 

@@ -8,7 +8,7 @@
 #include <nlohmann/json.hpp>
 
 #include "bag/tavix_bag_controller.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"

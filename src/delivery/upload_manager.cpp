@@ -11,7 +11,7 @@
 #include <nlohmann/json.hpp>
 
 #include "bag/tavix_bag_controller.h"
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"

@@ -11,7 +11,7 @@
 #include <future>
 #include <nlohmann/json.hpp>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/names.h"

@@ -17,7 +17,7 @@
 #include "feedback/persistent_storage.h"
 #include "feedback/session_processing_helper.h"
 #include "feedback/vocabulary.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/strings.h"

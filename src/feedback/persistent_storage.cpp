@@ -20,7 +20,7 @@
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/transactions.h"

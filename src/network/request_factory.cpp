@@ -5,7 +5,7 @@
 
 #include <fmt/core.h>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "context/location.h"
 #include "context/motion.h"
 #include "core/assembly.h"
@@ -14,7 +14,7 @@
 #include "network/language_identifier.h"
 #include "network/locale_context.h"
 #include "network/url_request_builder.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"

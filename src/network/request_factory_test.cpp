@@ -5,7 +5,7 @@
 #include <atomic>
 #include <map>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "context/location.h"
 #include "context/motion.h"
 #include "core/assembly.h"

@@ -6,7 +6,7 @@
 #include <cctype>
 
 #include "bag/tavix_bag_controller.h"
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "context/location.h"
 #include "context/user_guid_controller.h"
 #include "core/assembly.h"
@@ -17,7 +17,7 @@
 #include "feedback/vocabulary.h"
 #include "network/request_factory.h"
 #include "network/retryable_request.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/http/url_session.h"
 #include "platform/json_value.h"

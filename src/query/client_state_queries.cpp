@@ -8,7 +8,7 @@
 #include <fstream>
 #include <sstream>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "core/assembly.h"
 #include "core/logging.h"
 #include "core/names.h"

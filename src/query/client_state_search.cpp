@@ -3,7 +3,7 @@
 #include <fmt/format.h>
 
 #include "bag/tavix_bag_controller.h"
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "cache/engaged_completion_cache.h"
 #include "cache/query_cache.h"
 #include "core/assembly.h"

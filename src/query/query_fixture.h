@@ -91,7 +91,7 @@ class QueryFixture : public ::testing::Test {
     // The daemon's own session manager (warm-up records); clients keep sessions of their own.
     assembly.guidController = std::make_shared<TavixUserGUIDController>(assembly);
     assembly.clientSessionManager =
-        std::make_shared<ClientSessionManager>(assembly, assembly.guidController, "tavix");
+        std::make_shared<ClientSessionManager>(assembly, assembly.guidController, nullptr, "tavix");
   }
   ~QueryFixture() override {
     states.clear();

@@ -1,4 +1,4 @@
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 
 #include <gtest/gtest.h>
 
