@@ -16,6 +16,7 @@
 #include "platform/ipc/server.h"
 #include "platform/log.h"
 #include "platform/notification_center.h"
+#include "cache/engaged_completion_cache.h"
 
 namespace {
 
@@ -42,6 +43,7 @@ struct World {
     assembly.transactions = &transactions;
     assembly.activityScheduler = &activities;
     assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
+    assembly.engagedCompletionCache = EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, nullptr});
     activities.checkIn("fuzz.activity", platform::seconds(0), [](const auto&) {});
     events.setHandler("com.norvel.notifyd.matching", [](const std::string&) {});
     connect();

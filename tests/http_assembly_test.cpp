@@ -1,4 +1,4 @@
-// The Assembly's four URL sessions: made once per process and configured for their traffic.
+// The Assembly's four URL sessions: made once per assembly and configured for their traffic.
 #include <gtest/gtest.h>
 
 #include <thread>
@@ -14,7 +14,7 @@ using tavix::Assembly;
 using tavix::platform::UserDefaults;
 using tavix::platform::http::URLSession;
 
-TEST(HTTPAssemblyTest, SessionsAreMadeOncePerProcessAndReadNoParallaxOnlyThen) {
+TEST(HTTPAssemblyTest, SessionsAreMadeOncePerAssemblyAndReadNoParallaxOnlyThen) {
   tavix::testing::TempHome home;
   auto defaults = std::make_shared<UserDefaults>(home.config(), "com.norvel.tavixd");
   defaults->setObject("TVXNoParallax", true);
@@ -24,11 +24,12 @@ TEST(HTTPAssemblyTest, SessionsAreMadeOncePerProcessAndReadNoParallaxOnlyThen) {
 
   std::shared_ptr<URLSession> a, b;
   std::thread t1([&] { a = first.urlSession(); });
-  std::thread t2([&] { b = second.urlSession(); });
+  std::thread t2([&] { b = first.urlSession(); });
   t1.join();
   t2.join();
   ASSERT_TRUE(a);
   EXPECT_EQ(a, b);
+  EXPECT_NE(second.urlSession(), a) << "each assembly owns its sessions";
   EXPECT_FALSE(a->configuration().tcpFastOpen);
   EXPECT_FALSE(a->configuration().tlsSessionReuse);
   EXPECT_EQ(a->configuration().memoryCacheCapacity, 4194304u);
@@ -41,9 +42,9 @@ TEST(HTTPAssemblyTest, SessionsAreMadeOncePerProcessAndReadNoParallaxOnlyThen) {
   EXPECT_NE(bag, a);
   EXPECT_NE(download, bag);
   EXPECT_NE(upload, download);
-  EXPECT_EQ(second.bagSession(), bag);
-  EXPECT_EQ(second.downloadURLSession(), download);
-  EXPECT_EQ(second.uploadURLSession(), upload);
+  EXPECT_EQ(first.bagSession(), bag);
+  EXPECT_EQ(first.downloadURLSession(), download);
+  EXPECT_EQ(first.uploadURLSession(), upload);
   EXPECT_EQ(bag->configuration().memoryCacheCapacity, 0u);
   EXPECT_EQ(download->configuration().identifier, "com.norvel.tavixd");
   EXPECT_EQ(upload->configuration().identifier, "com.norvel.tavixd.flusher.urlsession");

@@ -178,19 +178,6 @@ std::shared_ptr<EngagedCompletionCache> EngagedCompletionCache::create(Environme
   return cache;
 }
 
-std::shared_ptr<EngagedCompletionCache> EngagedCompletionCache::sharedInstance(const Assembly& assembly) {
-  // Lives as long as the process and is never destroyed: its queues belong to the daemon's pool,
-  // which is gone by the time static destructors run. Every statement is committed as it runs, so
-  // there is nothing to close at exit.
-  static std::once_flag once;
-  static std::shared_ptr<EngagedCompletionCache>* instance = nullptr;
-  std::call_once(once, [&] {
-    instance = new std::shared_ptr<EngagedCompletionCache>(create(Environment{
-        assembly.cachesFolder(), assembly.clock, assembly.dispatchPool, assembly.userDefaults.get()}));
-  });
-  return *instance;
-}
-
 EngagedCompletionCache::EngagedCompletionCache(Environment env)
     : env_(std::move(env)),
       databaseDirPath_((env_.storagePath / kDatabaseDirName).string()),

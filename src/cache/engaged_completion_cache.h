@@ -91,8 +91,6 @@ class EngagedCompletionCache : public std::enable_shared_from_this<EngagedComple
   // up the text transforms in the background. A database that cannot be opened leaves the cache
   // inert: adds do nothing, searches return nothing.
   static std::shared_ptr<EngagedCompletionCache> create(Environment env);
-  // The one instance of the daemon, on the assembly's caches folder; made on first call.
-  static std::shared_ptr<EngagedCompletionCache> sharedInstance(const Assembly& assembly);
 
   ~EngagedCompletionCache();
   EngagedCompletionCache(const EngagedCompletionCache&) = delete;

@@ -500,7 +500,7 @@ void ClientConnection::setEngagedCompletionCacheValues(const TVXBag& bag) {
   parameters.all = bag.brovaneAll();
   parameters.mostRecent = bag.brovaneMostRecent();
   parameters.minThresholdToSend = bag.minThresholdToSend();
-  EngagedCompletionCache::sharedInstance(assembly_)->updateParameters(parameters);
+  assembly_.engagedCompletionCache->updateParameters(parameters);
 }
 
 void ClientConnection::request(std::uint64_t callId, const proto::Envelope& in) {
@@ -586,7 +586,7 @@ void ClientConnection::feedback(std::uint64_t callId) {
 
 void ClientConnection::engagedCompletionMessage(const proto::Envelope& in) {
   ensureState();
-  auto cache = EngagedCompletionCache::sharedInstance(assembly_);
+  auto cache = assembly_.engagedCompletionCache;
   switch (in.message_case()) {
     case proto::Envelope::kClearEngagedCompletions: {
       const auto& dates = in.clear_engaged_completions();

@@ -22,6 +22,7 @@
 #include "query/client_state_manager.h"
 #include "support/temp_home.h"
 #include "tavix_proto/ipc.pb.h"
+#include "cache/engaged_completion_cache.h"
 
 namespace tavix {
 namespace {
@@ -54,6 +55,7 @@ struct Harness {
     assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
     assembly.paths = platform::Paths{home.cache(), home.config(), home.runtime()};
     assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
+    assembly.engagedCompletionCache = EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, nullptr});
     assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
     int fds[2];
     EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);

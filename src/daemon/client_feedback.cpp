@@ -194,7 +194,7 @@ void ClientConnection::reportFeedbackPayloadData(const std::string& data, std::u
         } else if (result.section_bundle_id().rfind("com.norvel.tavix", 0) == 0) {
           origin = 1;
         }
-        EngagedCompletionCache::sharedInstance(assembly_)->addCompletion(
+        assembly_.engagedCompletionCache->addCompletion(
             query, input, origin, client, static_cast<unsigned long>(bag->smartHistoryMaxRows()));
         sendCompletionFeatureFeedback(assembly_, result, input, featureClient, true);
       }

@@ -142,6 +142,8 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   assembly.locationManager = std::make_shared<DefaultsLocationManager>(*defaults, clock, pool);
   assembly.motionManager = std::make_shared<DefaultsMotionManager>(*defaults, pool);
   assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+  assembly.engagedCompletionCache =
+      EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, defaults.get()});
 
   // Uploads left unsent by the last run resume here; endpoints come with the bag.
   assembly.uploadManager = UploadManager::create(assembly);
@@ -229,7 +231,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
     launchLog.info("launch event for {}", name);
     // The system search asks for its completion history to be forgotten.
     if (name == "com.norvel.proactive.queries.clearData") {
-      EngagedCompletionCache::sharedInstance(assembly)->clearAllCompletionsForClient(kEngagedCompletionClientSeekara);
+      assembly.engagedCompletionCache->clearAllCompletionsForClient(kEngagedCompletionClientSeekara);
     }
   });
 

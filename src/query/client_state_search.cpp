@@ -89,7 +89,7 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
       count = asked > 0 ? static_cast<unsigned long>(asked) : 3;
     }
     const auto timeout = static_cast<unsigned long>(std::max<std::int64_t>(bag->smartHistoryTimeout(), 0));
-    auto found = EngagedCompletionCache::sharedInstance(assembly_)->completionsForInput(input, client, count, timeout);
+    auto found = assembly_.engagedCompletionCache->completionsForInput(input, client, count, timeout);
     if (!found || found->empty()) {
       TavixLogForCategory(TavixLoggingCategoryDefault).notice("Local completion not found: input {}", input);
     } else {

@@ -95,7 +95,7 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
 
   // Engaged completions for "zq": the browser gets one and no more, kept for the keystroke;
   // with it the short input goes to the network after all.
-  auto engaged = EngagedCompletionCache::sharedInstance(assembly);
+  auto engaged = assembly.engagedCompletionCache;
   for (const char* completion : {"zqalpha", "zqbeta", "zqgamma", "zqdelta"}) {
     engaged->addCompletion(completion, "zq", 0, 1);
     engaged->addCompletion(completion, "zq", 0, 2);
