@@ -45,7 +45,7 @@ struct World {
     assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
     assembly.engagedCompletionCache = EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, nullptr});
     activities.checkIn("fuzz.activity", platform::seconds(0), [](const auto&) {});
-    events.setHandler("com.norvel.notifyd.matching", [](const std::string&) {});
+    events.setHandler("com.norvel.notify.matching", [](const std::string&) {});
     connect();
   }
 
@@ -81,6 +81,6 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   }
   const std::string payload(reinterpret_cast<const char*>(data), size);
   auto client = world->client;
-  world->connection->queue().sync([&] { client->handleMessage(payload); });
+  world->connection->queue().sync([&] { client->handleIncomingMessage(payload); });
   return 0;
 }

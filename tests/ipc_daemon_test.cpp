@@ -334,8 +334,8 @@ TEST(IpcDaemon, ToolReadsDefaultsAndCountersWithTheDaemonStoppedAndRunsActivitie
     EXPECT_TRUE(d.waitForLog("Flushing custom feedback.")) << d.log();
     EXPECT_EQ(runTool("activity run com.norvel.tavixd.nothing", &out), 1);
     EXPECT_NE(out.find("no activity com.norvel.tavixd.nothing"), std::string::npos) << out;
-    EXPECT_EQ(runTool("--socket " + d.socket + " notify com.norvel.proactive.queries.clearData", &out), 0) << out;
-    EXPECT_TRUE(d.waitForLog("launch event for com.norvel.proactive.queries.clearData")) << d.log();
+    EXPECT_EQ(runTool("--socket " + d.socket + " notify com.norvel.predictions.queries.clearData", &out), 0) << out;
+    EXPECT_TRUE(d.waitForLog("launch event for com.norvel.predictions.queries.clearData")) << d.log();
     EXPECT_EQ(runTool("search hello", &out), 1) << "no bag, so the search fails";
     EXPECT_NE(out.find("\"reason\":\"timeout\""), std::string::npos) << out;
     EXPECT_EQ(d.stop(), 0);
@@ -364,7 +364,7 @@ TEST(IpcDaemon, ClearDataLaunchEventForgetsTheSystemSearchCompletionsOnly) {
   }
   Daemon d(home);
   Client client(options(d));
-  ASSERT_FALSE(client.notifySync("com.norvel.proactive.queries.clearData")) << d.log();
+  ASSERT_FALSE(client.notifySync("com.norvel.predictions.queries.clearData")) << d.log();
   EXPECT_EQ(d.stop(), 0) << d.log();
 
   tavix::platform::DispatchPool pool(2);

@@ -43,11 +43,11 @@ DeviceInformation::DeviceInformation(const platform::UserDefaults* defaults, std
     : defaults_(defaults), root_(std::move(root)) {}
 
 std::string DeviceInformation::answer(std::string_view key) const {
-  if (key == "ProductVersion") {
-    std::call_once(versionOnce_, [this] { productVersion_ = read("ProductVersion"); });
-    return productVersion_;
+  if (key == "OSVersion") {
+    std::call_once(versionOnce_, [this] { osVersion_ = read("OSVersion"); });
+    return osVersion_;
   }
-  if (key == "ProductType" || key == "ProductName" || key == "BuildVersion") return read(key);
+  if (key == "Model" || key == "OSName" || key == "OSBuild") return read(key);
   return {};
 }
 
@@ -57,35 +57,35 @@ std::string DeviceInformation::read(std::string_view key) const {
     if (override && !override->empty()) return *override;
   }
   std::string text;
-  if (key == "ProductType") {
+  if (key == "Model") {
     if (!platform::readFile(root_ / "sys/class/dmi/id/product_name", &text)) {
       text = trim(text);
       if (!text.empty()) return text;
     }
     return "Linux";
   }
-  if (key == "BuildVersion") {
+  if (key == "OSBuild") {
     if (!platform::readFile(root_ / "proc/sys/kernel/osrelease", &text)) {
       text = trim(text);
       if (!text.empty()) return text;
     }
     return "0";
   }
-  // ProductName and ProductVersion come from os-release, with its documented fallback file.
+  // OSName and OSVersion come from os-release, with its documented fallback file.
   if (platform::readFile(root_ / "etc/os-release", &text)) {
     text.clear();
     platform::readFile(root_ / "usr/lib/os-release", &text);
   }
-  std::string value = osReleaseField(text, key == "ProductName" ? "NAME" : "VERSION_ID");
+  std::string value = osReleaseField(text, key == "OSName" ? "NAME" : "VERSION_ID");
   if (!value.empty()) return value;
-  return key == "ProductName" ? "Linux" : "0";
+  return key == "OSName" ? "Linux" : "0";
 }
 
 std::optional<std::string> createUserAgentString(std::optional<std::string_view> clientAgent,
                                                  const DeviceInformation& device) {
   if (clientAgent && clientAgent->empty()) return std::nullopt;
-  std::string devicePart = fmt::format("{}; {} {} {}", device.answer("ProductType"), device.answer("ProductName"),
-                                       device.answer("ProductVersion"), device.answer("BuildVersion"));
+  std::string devicePart = fmt::format("{}; {} {} {}", device.answer("Model"), device.answer("OSName"),
+                                       device.answer("OSVersion"), device.answer("OSBuild"));
   return fmt::format("{} ({}) {}", kTVXTavixdNameVersion, devicePart,
                      clientAgent ? *clientAgent : std::string_view(kTVXTavixdNameVersion));
 }

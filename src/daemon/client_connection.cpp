@@ -33,7 +33,7 @@ namespace tavix {
 
 namespace {
 
-constexpr const char* kNotifyStream = "com.norvel.notifyd.matching";
+constexpr const char* kNotifyStream = "com.norvel.notify.matching";
 
 platform::Logger& connectionLog() { return TavixLogForCategory(TavixLoggingCategoryConnection); }
 platform::Logger& sessionLog() { return TavixLogForCategory(TavixLoggingCategorySession); }
@@ -256,7 +256,7 @@ void ClientConnection::send(std::uint64_t callId, proto::Envelope& out) {
   sendToClient(*connection_, answerBytes(*connection_, callId, out));
 }
 
-void ClientConnection::handleMessage(const std::string& payload) {
+void ClientConnection::handleIncomingMessage(const std::string& payload) {
   openOrExtendTransaction();
   const pid_t pid = connection_->peer().pid;
   proto::Envelope in;

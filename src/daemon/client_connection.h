@@ -3,7 +3,7 @@
 // the same client identifier), routes queries to it, takes the client's feedback, relays bag and
 // resource notifications, and answers each call once.
 //
-// Runs on the IPC connection's own serial queue: handleMessage() and invalidated() are called
+// Runs on the IPC connection's own serial queue: handleIncomingMessage() and invalidated() are called
 // there, and the configuration and bound state are touched only there. Replies to queries come
 // back from the URL session's threads and go straight to the connection, which is thread-safe.
 #pragma once
@@ -59,7 +59,7 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
 
   // One frame from the client. Malformed or unknown messages are logged; a call among them is
   // answered with `call_failed`. Never throws, never ends the daemon.
-  void handleMessage(const std::string& payload);
+  void handleIncomingMessage(const std::string& payload);
 
   // The connection has ended: stops the timer and closes the transaction, whose keep-alive lasts
   // another kIdleTransactionSeconds so that the daemon does not leave while the client may come

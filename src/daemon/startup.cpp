@@ -48,8 +48,7 @@ using platform::PropertyValue;
 
 namespace {
 
-// How often the background activities fall due. The launch configuration of the original
-// platform is not ours to read; these are the daemon's own.
+// How often the background activities fall due.
 constexpr double kFlusherIntervalSeconds = 3600;
 constexpr double kCustomFeedbackIntervalSeconds = 4 * 3600;
 // Counters are saved this often (when changed) and at exit.
@@ -227,10 +226,10 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   auto& launchLog = TavixLogForCategory(TavixLoggingCategoryDefault);
   launchEvents.setHandler("com.norvel.tavixd.urlsession",
                           [&launchLog](const std::string& session) { launchLog.info("launch event for {}", session); });
-  launchEvents.setHandler("com.norvel.notifyd.matching", [&launchLog, &assembly](const std::string& name) {
+  launchEvents.setHandler("com.norvel.notify.matching", [&launchLog, &assembly](const std::string& name) {
     launchLog.info("launch event for {}", name);
     // The system search asks for its completion history to be forgotten.
-    if (name == "com.norvel.proactive.queries.clearData") {
+    if (name == "com.norvel.predictions.queries.clearData") {
       assembly.engagedCompletionCache->clearAllCompletionsForClient(kEngagedCompletionClientSeekara);
     }
   });
@@ -296,8 +295,8 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   });
 
   // Clients that connect early wait in the socket's backlog until every handler they may reach
-  // (launch events, activities) is in place, as a launch service holds messages for a starting job.
-  listener->resume([&service](const auto& connection) { service.shouldAcceptNewConnection(connection); },
+  // (launch events, activities) is in place: none of their messages finds a handler missing.
+  listener->resume([&service](const auto& connection) { service.shouldAcceptConnection(connection); },
                    "com.norvel.tavixd.connection");
   log.info("listening on {}", activated < 0 ? socketPath : "the socket handed over by systemd");
   log.info("tavixd started (pid {}), caches in {}", getpid(), assembly.cachesFolder().string());

@@ -51,7 +51,7 @@ std::optional<std::string> TavixService::clientIDForConnection(const platform::i
   return platform::ipc::lastPathComponent(path);
 }
 
-bool TavixService::shouldAcceptNewConnection(const std::shared_ptr<platform::ipc::IpcConnection>& connection) {
+bool TavixService::shouldAcceptConnection(const std::shared_ptr<platform::ipc::IpcConnection>& connection) {
   const pid_t pid = connection->peer().pid;
   const std::string clientID = clientIDForConnection(*connection).value_or("(null)");
   connectionLog().notice("new connection from {} ({})", clientID, pid);
@@ -73,7 +73,7 @@ bool TavixService::shouldAcceptNewConnection(const std::shared_ptr<platform::ipc
   // invalidation handler has run.
   connection->start(
       [weakClient](std::string payload) {
-        if (auto c = weakClient.lock()) c->handleMessage(payload);
+        if (auto c = weakClient.lock()) c->handleIncomingMessage(payload);
       },
       [weakService, weakClient, clientID, pid] {
         auto service = weakService.lock();

@@ -315,7 +315,7 @@ void UploadManager::enqueueRequest(URLRequest request, std::shared_ptr<TempFile>
   });
 }
 
-void UploadManager::didCompleteWithError(const BackgroundUploadSession::TaskInfo& task,
+void UploadManager::taskDidComplete(const BackgroundUploadSession::TaskInfo& task,
                                          const std::optional<HTTPURLResponse>& response,
                                          const std::optional<URLError>& error) {
   if (error && error->domain == platform::http::kURLErrorDomain && error->code == platform::http::URLErrorTimedOut) {
@@ -331,11 +331,11 @@ void UploadManager::didCompleteWithError(const BackgroundUploadSession::TaskInfo
   } else {
     TavixDiagnosticDataReporter::addValue(count, "com.norvel.tavixd.feedbacksent");
   }
-  uploadLog().debug("URLSession:task:didCompleteWithError: id={}, error={}, statusCode={}", task.taskIdentifier,
+  uploadLog().debug("taskDidComplete: id={}, error={}, statusCode={}", task.taskIdentifier,
                     error ? error->description : std::string("(null)"), status);
 }
 
-void UploadManager::didSendBodyData(const BackgroundUploadSession::TaskInfo& task, std::int64_t totalBytesSent,
+void UploadManager::taskDidSendBodyData(const BackgroundUploadSession::TaskInfo& task, std::int64_t totalBytesSent,
                                     std::int64_t totalBytesExpectedToSend) {
   const double fraction =
       totalBytesExpectedToSend > 0 ? double(totalBytesSent) / double(totalBytesExpectedToSend) : 1.0;

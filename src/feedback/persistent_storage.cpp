@@ -123,8 +123,8 @@ std::optional<platform::TimePoint> creationDate(const fs::path& path, std::strin
 }  // namespace
 
 std::string sessionFileVersion(const DeviceInformation& device) {
-  return fmt::format("{} ({}; {} {}) {}", kTVXTavixdNameVersion, device.answer("ProductType"),
-                     device.answer("ProductName"), device.answer("ProductVersion"), kTVXTavixdNameVersion);
+  return fmt::format("{} ({}; {} {}) {}", kTVXTavixdNameVersion, device.answer("Model"),
+                     device.answer("OSName"), device.answer("OSVersion"), kTVXTavixdNameVersion);
 }
 
 const std::string& tavixdSessionFileVersion() {

@@ -514,7 +514,7 @@ class TVXNetworkRequestFactory::Builder {
     if (!TVXBag(bag.sharedRawBag(), "messages").isEnabled()) blacklisted.emplace_back(kTVXSTSAppBundleIdentifier);
     const platform::PropertyValue restriction(std::move(blacklisted));
     if (!managed->setObject(kTVXBlacklistedAppBundleIDsKey, restriction)) {
-      requestLog().error("error setting MC restrictions: {}", managed->filePath().string());
+      requestLog().error("error setting device restrictions: {}", managed->filePath().string());
       return;
     }
     requestLog().notice("set effective visibility restriction for {} to {}", kTVXSTSAppBundleIdentifier,
