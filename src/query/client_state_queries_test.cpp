@@ -8,7 +8,7 @@
 #include "core/diagnostics.h"
 #include "platform/counters.h"
 #include "core/names.h"
-#include "query/query_fixture.h"
+#include "support/query_fixture.h"
 
 namespace tavix::query_testing {
 namespace {

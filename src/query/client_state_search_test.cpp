@@ -7,7 +7,7 @@
 #include "platform/counters.h"
 #include "core/names.h"
 #include "feedback/vocabulary.h"
-#include "query/query_fixture.h"
+#include "support/query_fixture.h"
 
 namespace tavix::query_testing {
 namespace {
