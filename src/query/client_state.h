@@ -166,6 +166,30 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   std::optional<std::string> geoSessionEntityString();
   std::string currentUserGuid();
 
+  // ---- The steps of search() (client_state_search.cpp)
+  // The engaged completions for the input: the first is kept for the keystroke (and remembered
+  // for the next ones), the rest go back with the reply.
+  struct LocalCompletions {
+    std::vector<std::string> kept;
+    std::vector<std::string> others;
+  };
+  LocalCompletions localCompletionsForSearch(const TVXSearchRequest& request, const TVXBag& bag);
+  // Answers from the query cache when it holds this request; records the hit.
+  bool answerSearchFromQueryCache(const TVXSearchRequest& request, const platform::http::URLRequest& httpRequest,
+                                  const std::vector<std::string>& localSuggestions, const TVXReplyBlock& reply);
+  void sendSearch(std::shared_ptr<const TVXSearchRequest> request, TVXReplyBlock reply,
+                  std::shared_ptr<const platform::http::URLRequest> httpRequest,
+                  std::vector<std::string> localSuggestions);
+  struct SearchResponse {
+    std::string data;
+    std::optional<platform::http::HTTPURLResponse> response;
+    std::optional<platform::http::URLError> error;
+  };
+  void searchResponseArrived(const TVXSearchRequest& request, const TVXReplyBlock& reply,
+                             const platform::http::URLRequest& httpRequest, const StartRecord& start,
+                             const std::vector<std::string>& localSuggestions, const SearchResponse& answer,
+                             const platform::http::URLSessionTaskMetrics& timing);
+
   // ---- The kinds besides search (client_state_queries.cpp)
   void performQuery(const ClientStateQueryKind& kind, std::shared_ptr<const TVXRequest> request, TVXReplyBlock reply);
   void debugFlightSearch(const TVXFlightSearchRequest& request, const TVXReplyBlock& reply);
