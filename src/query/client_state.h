@@ -192,6 +192,15 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
 
   // ---- The kinds besides search (client_state_queries.cpp)
   void performQuery(const ClientStateQueryKind& kind, std::shared_ptr<const TVXRequest> request, TVXReplyBlock reply);
+  // The steps of performQuery(). The bag to build with; false when the query was answered
+  // already (no bag could be had, or the bag is disabled).
+  bool bagForQuery(const ClientStateQueryKind& kind, const TVXRequest& request, const TVXReplyBlock& reply,
+                   std::shared_ptr<const TVXBag>* bag);
+  StartRecord startRecordForQuery(const ClientStateQueryKind& kind, const TVXRequest& request,
+                                  const platform::http::URLRequest& httpRequest);
+  void queryResponseArrived(const ClientStateQueryKind& kind, const TVXRequest& request, const TVXReplyBlock& reply,
+                            const platform::http::URLRequest& httpRequest, const StartRecord& start,
+                            SearchResponse answer, const platform::http::URLSessionTaskMetrics& timing);
   void debugFlightSearch(const TVXFlightSearchRequest& request, const TVXReplyBlock& reply);
 
   Assembly& assembly_;
