@@ -431,7 +431,9 @@ void EngagedCompletionCache::addCompletion(const std::string& completion, const 
   if (transformed.empty()) return;
   eccLog().debug("Adding completion: {} input: {} transformed: {}", completion, input, transformed);
 
-  const char* originText = (origin == 1 || origin == 3) ? "se" : origin == 2 ? "3d" : "";
+  const char* originText = (origin == kEngagedCompletionOriginTavix || origin == kEngagedCompletionOriginSeekara) ? "se"
+                           : origin == kEngagedCompletionOriginThirdParty                                      ? "3d"
+                                                                                                               : "";
   sqlite3_bind_text(s.stmt, 1, completion.c_str(), -1, SQLITE_TRANSIENT);
   sqlite3_bind_text(s.stmt, 2, input.c_str(), -1, SQLITE_TRANSIENT);
   sqlite3_bind_int(s.stmt, 3, static_cast<std::int32_t>(wholeSeconds(now)));

@@ -52,6 +52,15 @@ enum EngagedCompletionClient : unsigned long {
   kEngagedCompletionClientSeekara = 2,
 };
 
+// Where an engaged completion came from: a Tavix result (stored as "se"), another app's result
+// ("3d") or the system search (again "se").
+enum EngagedCompletionOrigin : int {
+  kEngagedCompletionOriginUnknown = 0,
+  kEngagedCompletionOriginTavix = 1,
+  kEngagedCompletionOriginThirdParty = 2,
+  kEngagedCompletionOriginSeekara = 3,
+};
+
 // The number of a client short name ("brovane", "seekara"); any other name is kEngagedCompletionClientOther.
 inline EngagedCompletionClient engagedCompletionClientForName(std::string_view shortName) {
   if (shortName == "brovane") return kEngagedCompletionClientBrovane;
@@ -103,8 +112,9 @@ class EngagedCompletionCache : public std::enable_shared_from_this<EngagedComple
   EngagedCompletionParameters parameters() const;
 
   // Records an engagement. Ages out rows older than 30 days (all clients) and trims the client
-  // to `maxRows` (10000 when 0) first. Origin codes 1 and 3 store "se", 2 stores "3d".
-  void addCompletion(const std::string& completion, const std::string& input, int origin = 0,
+  // to `maxRows` (10000 when 0) first. `origin` is an EngagedCompletionOrigin.
+  void addCompletion(const std::string& completion, const std::string& input,
+                     int origin = kEngagedCompletionOriginUnknown,
                      unsigned long client = 0, unsigned long maxRows = kDefaultMaxRows);
 
   // Up to `count` completions whose input or normalised completion begins with `input`, best

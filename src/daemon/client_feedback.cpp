@@ -186,13 +186,13 @@ void ClientConnection::reportFeedbackPayloadData(const std::string& data, std::u
       }
       auto bag = state_->currentBag();
       if (bag && bag->smartHistoryEnabled() && !query.empty()) {
-        int origin = 2;
-        unsigned long client = 1;
+        int origin = kEngagedCompletionOriginThirdParty;
+        unsigned long client = kEngagedCompletionClientBrovane;
         if (shortName == "seekara") {
-          origin = 3;
-          client = 2;
+          origin = kEngagedCompletionOriginSeekara;
+          client = kEngagedCompletionClientSeekara;
         } else if (result.section_bundle_id().rfind("com.norvel.tavix", 0) == 0) {
-          origin = 1;
+          origin = kEngagedCompletionOriginTavix;
         }
         assembly_.engagedCompletionCache->addCompletion(
             query, input, origin, client, static_cast<unsigned long>(bag->smartHistoryMaxRows()));

@@ -17,6 +17,7 @@
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
+#include "platform/http/url.h"
 #include "platform/http/url_session.h"
 #include "platform/json_value.h"
 #include "query/client_state.h"
@@ -64,26 +65,15 @@ namespace {
 
 std::string emptyInput(const TVXRequest&, const URLRequest&) { return {}; }
 
-// The value of the "q" item of the built URL, decoded.
+// The value of the "q" item of the built URL, decoded ("+" is a blank).
 std::string queryItemQ(const TVXRequest&, const URLRequest& http) {
-  const auto question = http.url.find('?');
-  if (question == std::string::npos) return {};
-  std::istringstream items(http.url.substr(question + 1));
-  for (std::string item; std::getline(items, item, '&');) {
-    if (item.rfind("q=", 0) != 0) continue;
-    std::string out;
-    for (std::size_t i = 2; i < item.size(); ++i) {
-      if (item[i] == '+') {
-        out += ' ';
-      } else if (item[i] == '%' && i + 2 < item.size() && std::isxdigit(static_cast<unsigned char>(item[i + 1])) &&
-                 std::isxdigit(static_cast<unsigned char>(item[i + 2]))) {
-        out += static_cast<char>(std::stoi(item.substr(i + 1, 2), nullptr, 16));
-        i += 2;
-      } else {
-        out += item[i];
-      }
-    }
-    return out;
+  const auto url = platform::http::URL::parse(http.url);
+  const auto query = url ? url->query() : std::nullopt;
+  if (!query) return {};
+  std::string plusAsBlank = *query;
+  for (std::size_t at = 0; (at = plusAsBlank.find('+', at)) != std::string::npos;) plusAsBlank.replace(at, 1, "%20");
+  for (const auto& [name, value] : platform::http::decodedQueryItems(plusAsBlank)) {
+    if (name == "q") return value.value_or("");
   }
   return {};
 }
