@@ -7,7 +7,6 @@
 #pragma once
 
 #include <memory>
-#include <mutex>
 
 #include "platform/files.h"
 
@@ -45,7 +44,8 @@ class Assembly {
   Assembly(const Assembly&) = delete;
   Assembly& operator=(const Assembly&) = delete;
 
-  // The platform services every object may use. Not owned: they outlive the assembly.
+  // The platform services every object may use. Not owned: they outlive the assembly. The pool and
+  // the clock are always set; objects use them without checking.
   platform::DispatchPool* dispatchPool = nullptr;
   platform::Clock* clock = nullptr;
   platform::TransactionTracker* transactions = nullptr;

@@ -223,15 +223,13 @@ void ClientConnection::invalidated() {
 
 void ClientConnection::openOrExtendTransaction() {
   idleTimer_.cancel();
-  if (assembly_.clock) {
-    std::weak_ptr<ClientConnection> weak = weak_from_this();
-    idleTimer_ = assembly_.clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(), [weak] {
-      auto self = weak.lock();
-      if (!self) return;
-      connectionLog().debug("timing out idle ipc transaction");
-      self->closeTransaction(true);
-    });
-  }
+  std::weak_ptr<ClientConnection> weak = weak_from_this();
+  idleTimer_ = assembly_.clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(), [weak] {
+    auto self = weak.lock();
+    if (!self) return;
+    connectionLog().debug("timing out idle ipc transaction");
+    self->closeTransaction(true);
+  });
   if (!transactionOpen_.exchange(true) && assembly_.transactions) {
     std::lock_guard lock(transactionLock_);
     transaction_ = assembly_.transactions->begin("com.norvel.tavixd.ipc");

@@ -119,11 +119,11 @@ void TavixCustomFeedbackFlusher::flushCustomFeedbackWithCompletionHandler(const 
     }
     std::int64_t limit = bag ? bag->maximumSizeForFeedbackType(type) : 0;
     const std::uint64_t maximum = limit > 0 ? static_cast<std::uint64_t>(limit) : kDefaultCustomFeedbackLimit;
-    const platform::TimePoint now = assembly_.clock ? assembly_.clock->now() : platform::TimePoint{};
+    const platform::TimePoint now = assembly_.clock->now();
     for (const auto& item : items) {
       if (item.empty()) continue;
       // An item its writer may still be filling is left for a later run, not sent cut short.
-      if (assembly_.clock && stillBeingWritten(item, now)) {
+      if (stillBeingWritten(item, now)) {
         flusherLog().info("Custom feedback {} is still being written; left for later", item.string());
         continue;
       }

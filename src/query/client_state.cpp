@@ -93,7 +93,7 @@ std::optional<platform::TimePoint> ClientState::lastNetworkRequest() const {
 }
 
 void ClientState::markNetworkRequest() {
-  const auto now = assembly_.clock ? assembly_.clock->now() : platform::TimePoint{};
+  const auto now = assembly_.clock->now();
   std::lock_guard lock(mutex_);
   lastNetworkRequest_ = now;
 }

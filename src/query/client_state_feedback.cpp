@@ -202,7 +202,7 @@ void ClientState::warm() {
     searchLog().debug("warm not required, bag fetch in process");
     return;
   }
-  const auto now = assembly_.clock ? assembly_.clock->now() : platform::TimePoint{};
+  const auto now = assembly_.clock->now();
   {
     std::lock_guard lock(mutex_);
     if (lastNetworkRequest_ && now - *lastNetworkRequest_ < platform::seconds(30)) {

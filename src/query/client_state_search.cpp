@@ -224,7 +224,7 @@ void ClientState::searchResponseArrived(const TVXSearchRequest& request, const T
     const platform::Dictionary* first = parsed->dictionary();
     if (const auto* list = parsed->array(); list && !list->empty()) first = list->front().dictionary();
     if (first) {
-      auto now = assembly_.clock ? assembly_.clock->now() : platform::TimePoint{};
+      auto now = assembly_.clock->now();
       queryCache_->set(Ref<CachedResultSet>(new CachedResultSet(input, &httpRequest, *first, request.uuid, data, now)));
     }
   }
