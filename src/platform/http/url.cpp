@@ -2,6 +2,8 @@
 
 #include <curl/curl.h>
 
+#include <algorithm>
+
 namespace tavix::platform::http {
 
 struct URL::Handle {
@@ -64,8 +66,18 @@ std::string URL::host() const { return part(CURLUPART_HOST).value_or(""); }
 std::optional<std::string> URL::query() const { return part(CURLUPART_QUERY); }
 std::optional<std::string> URL::fragment() const { return part(CURLUPART_FRAGMENT); }
 
+namespace {
+
+bool isUnreserved(char c) {
+  return (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9') || c == '-' || c == '_' ||
+         c == '.' || c == '~';
+}
+
+}  // namespace
+
 std::string percentEncode(std::string_view text) {
-  if (text.empty()) return {};
+  // Most names and values need no escape: they are copied without a trip through libcurl.
+  if (std::all_of(text.begin(), text.end(), isUnreserved)) return std::string(text);
   // The handle argument has been unused since libcurl 7.82.
   char* encoded = curl_easy_escape(nullptr, text.data(), static_cast<int>(text.size()));
   if (!encoded) return {};
@@ -75,7 +87,7 @@ std::string percentEncode(std::string_view text) {
 }
 
 std::string percentDecode(std::string_view text) {
-  if (text.empty()) return {};
+  if (text.find('%') == std::string_view::npos) return std::string(text);
   int length = 0;
   char* decoded = curl_easy_unescape(nullptr, text.data(), static_cast<int>(text.size()), &length);
   if (!decoded) return std::string(text);
