@@ -74,7 +74,10 @@ class SearchProviderTest : public ::testing::Test {
     provider.emplace(PROVIDER_BINARY, home, std::vector<std::string>{"--opener", opener.string()}, "provider.log");
     ASSERT_TRUE(tavix::testing::waitFor([&] { return nameHasOwner(); })) << provider->log();
   }
-  void TearDown() override { sd_bus_flush_close_unref(shell); }
+  void TearDown() override {
+    sd_bus_error_free(&error);  // the last failed call's error
+    sd_bus_flush_close_unref(shell);
+  }
 
   bool nameHasOwner() {
     sd_bus_message* reply = nullptr;
