@@ -50,7 +50,7 @@ struct Fixture {
                                              {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
     assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
     assembly.guidController = std::make_shared<TavixUserGUIDController>(assembly);
-    manager = std::make_shared<ClientSessionManager>(assembly, assembly.guidController, "tavix");
+    manager = std::make_shared<ClientSessionManager>(assembly, assembly.guidController, nullptr, "tavix");
   }
   ~Fixture() { pool.drain(); }
 

@@ -2,7 +2,7 @@
 // the percent-encoding. This runs on every keystroke of search-as-you-type.
 #include <benchmark/benchmark.h>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "context/location.h"
 #include "core/assembly.h"
 #include "network/request_factory.h"

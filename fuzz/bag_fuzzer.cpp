@@ -7,7 +7,7 @@
 #include <cstdint>
 #include <string>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "platform/json_value.h"
 #include "platform/property_value.h"
 

@@ -16,6 +16,7 @@
 #include "platform/ipc/server.h"
 #include "platform/log.h"
 #include "platform/notification_center.h"
+#include "cache/engaged_completion_cache.h"
 
 namespace {
 
@@ -42,8 +43,9 @@ struct World {
     assembly.transactions = &transactions;
     assembly.activityScheduler = &activities;
     assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
+    assembly.engagedCompletionCache = EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, nullptr});
     activities.checkIn("fuzz.activity", platform::seconds(0), [](const auto&) {});
-    events.setHandler("com.norvel.notifyd.matching", [](const std::string&) {});
+    events.setHandler("com.norvel.notify.matching", [](const std::string&) {});
     connect();
   }
 
@@ -79,6 +81,6 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   }
   const std::string payload(reinterpret_cast<const char*>(data), size);
   auto client = world->client;
-  world->connection->queue().sync([&] { client->handleMessage(payload); });
+  world->connection->queue().sync([&] { client->handleIncomingMessage(payload); });
   return 0;
 }

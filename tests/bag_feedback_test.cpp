@@ -7,14 +7,14 @@
 #include <nlohmann/json.hpp>
 
 #include "bag/tavix_bag_controller.h"
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "context/user_guid_controller.h"
 #include "core/assembly.h"
 #include "devserver/devserver.h"
 #include "feedback/client_session_manager.h"
 #include "feedback/persistent_storage.h"
 #include "network/request_factory.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
@@ -47,7 +47,7 @@ class BagFeedbackTest : public ::testing::Test {
     assembly.guidController = std::make_shared<TavixUserGUIDController>(assembly);
     assembly.bagController = TavixBagController::create(assembly);
     assembly.clientSessionManager =
-        std::make_shared<ClientSessionManager>(assembly, assembly.guidController, "tavix");
+        std::make_shared<ClientSessionManager>(assembly, assembly.guidController, assembly.bagController, "tavix");
   }
   ~BagFeedbackTest() override {
     assembly.bagController->invalidate();

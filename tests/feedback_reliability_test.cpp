@@ -20,7 +20,7 @@
 #include <vector>
 
 #include "feedback/persistent_storage.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/dispatch.h"
 #include "support/daemon_process.h"
 #include "support/test_seed.h"

@@ -289,8 +289,8 @@ TEST(IpcDaemon, ToolReadsDefaultsAndCountersWithTheDaemonStoppedAndRunsActivitie
     EXPECT_TRUE(d.waitForLog("Flushing custom feedback.")) << d.log();
     EXPECT_EQ(runTool("activity run com.norvel.tavixd.nothing", &out), 1);
     EXPECT_NE(out.find("no activity com.norvel.tavixd.nothing"), std::string::npos) << out;
-    EXPECT_EQ(runTool("--socket " + d.socket + " notify com.norvel.proactive.queries.clearData", &out), 0) << out;
-    EXPECT_TRUE(d.waitForLog("launch event for com.norvel.proactive.queries.clearData")) << d.log();
+    EXPECT_EQ(runTool("--socket " + d.socket + " notify com.norvel.predictions.queries.clearData", &out), 0) << out;
+    EXPECT_TRUE(d.waitForLog("launch event for com.norvel.predictions.queries.clearData")) << d.log();
     EXPECT_EQ(runTool("search hello", &out), 1) << "no bag, so the search fails";
     EXPECT_NE(out.find("\"reason\":\"timeout\""), std::string::npos) << out;
     EXPECT_EQ(d.stop(), 0);
@@ -311,22 +311,22 @@ TEST(IpcDaemon, ClearDataLaunchEventForgetsTheSystemSearchCompletionsOnly) {
     tavix::platform::DispatchPool pool(2);
     tavix::platform::SystemClock clock(pool);
     auto cache = tavix::EngagedCompletionCache::create({folder, &clock, &pool, nullptr});
-    cache->addCompletion("camera", "cam", 0, 1);
-    cache->addCompletion("cafe rouge", "caf", 0, 2);
-    cache->addCompletion("calendar", "cal", 0, 2);
-    ASSERT_EQ(cache->rowCountForClient(2), 2);
+    cache->addCompletion("camera", "cam", 0, tavix::kEngagedCompletionClientBrovane);
+    cache->addCompletion("cafe rouge", "caf", 0, tavix::kEngagedCompletionClientSeekara);
+    cache->addCompletion("calendar", "cal", 0, tavix::kEngagedCompletionClientSeekara);
+    ASSERT_EQ(cache->rowCountForClient(tavix::kEngagedCompletionClientSeekara), 2);
     cache->closeDBConnection();
   }
   Daemon d(home);
   Client client(options(d));
-  ASSERT_FALSE(client.notifySync("com.norvel.proactive.queries.clearData")) << d.log();
+  ASSERT_FALSE(client.notifySync("com.norvel.predictions.queries.clearData")) << d.log();
   EXPECT_EQ(d.stop(), 0) << d.log();
 
   tavix::platform::DispatchPool pool(2);
   tavix::platform::SystemClock clock(pool);
   auto cache = tavix::EngagedCompletionCache::create({folder, &clock, &pool, nullptr});
-  EXPECT_EQ(cache->rowCountForClient(2), 0);
-  EXPECT_EQ(cache->rowCountForClient(1), 1);
+  EXPECT_EQ(cache->rowCountForClient(tavix::kEngagedCompletionClientSeekara), 0);
+  EXPECT_EQ(cache->rowCountForClient(tavix::kEngagedCompletionClientBrovane), 1);
 }
 
 }  // namespace

@@ -8,7 +8,7 @@
 
 #include <fmt/core.h>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "context/user_guid_controller.h"
 #include "core/assembly.h"
 #include "core/diagnostics.h"
@@ -18,12 +18,14 @@
 #include "feedback/tavix_feedback.h"
 #include "network/retryable_request.h"
 #include "network/url_request_builder.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
+#include "platform/http/url.h"
 #include "platform/http/url_session.h"
 #include "platform/json_value.h"
 #include "platform/transactions.h"
+#include "platform/strings.h"
 
 namespace tavix {
 
@@ -46,12 +48,6 @@ constexpr long kBagFetchErrorCode = 2;
 
 platform::Logger& bagLog() { return TavixLogForCategory(TavixLoggingCategoryBag); }
 
-std::string lowercased(std::string_view s) {
-  std::string out(s);
-  for (char& c : out) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
-  return out;
-}
-
 std::string uppercased(std::string_view s) {
   std::string out(s);
   for (char& c : out) c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
@@ -59,7 +55,7 @@ std::string uppercased(std::string_view s) {
 }
 
 bool isLoopbackHost(std::string host) {
-  host = lowercased(host);
+  host = platform::asciiLowercased(host);
   if (host == "localhost") return true;
   if (host.size() > 2 && host.front() == '[' && host.back() == ']') host = host.substr(1, host.size() - 2);
   in_addr v4{};
@@ -72,38 +68,17 @@ bool isLoopbackHost(std::string host) {
 // An absolute URL the daemon may fetch a bag from: HTTPS with a host, or plain HTTP to this
 // machine only (development servers); the configuration must not travel in clear text.
 bool isUsableBagURL(const std::string& url) {
-  if (!TavixURLRequestBuilder::requestBuilderWithURL(url)) return false;
-  const auto sep = url.find("://");
-  if (sep == std::string::npos) return false;
-  const std::string scheme = lowercased(url.substr(0, sep));
-  std::string authority = url.substr(sep + 3, url.find_first_of("/?#", sep + 3) - (sep + 3));
-  if (auto at = authority.rfind('@'); at != std::string::npos) authority = authority.substr(at + 1);
-  std::string host = authority;
-  if (!authority.empty() && authority.front() == '[') {
-    const auto close = authority.find(']');
-    if (close == std::string::npos) return false;
-    host = authority.substr(0, close + 1);
-  } else if (auto colon = authority.find(':'); colon != std::string::npos) {
-    host = authority.substr(0, colon);
-  }
-  if (host.empty()) return false;
+  const auto parsed = platform::http::URL::parse(url);
+  if (!parsed || parsed->host().empty()) return false;
+  const std::string scheme = parsed->scheme();
   if (scheme == "https") return true;
-  return scheme == "http" && isLoopbackHost(host);
-}
-
-std::string describeHeaders(const platform::http::HeaderFields& headers) {
-  std::string out = "{";
-  for (const auto& [name, value] : headers.all()) {
-    if (out.size() > 1) out += ", ";
-    out += name + ": " + value;
-  }
-  return out + "}";
+  return scheme == "http" && isLoopbackHost(parsed->host());
 }
 
 std::string describeResponse(const std::optional<platform::http::HTTPURLResponse>& response) {
   if (!response) return "(none)";
   return fmt::format("{{status: {}, url: {}, headers: {}}}", response->statusCode, response->url,
-                     describeHeaders(response->headers));
+                     response->headers.description());
 }
 
 const char* typeName(PropertyValue::Type type) {
@@ -416,7 +391,7 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
     return;
   }
   TavixLogForCategory(TavixLoggingCategoryProtocol)
-      .notice("Initiating bag fetch attempt with request {} header {}", request->url, describeHeaders(request->headers));
+      .notice("Initiating bag fetch attempt with request {} header {}", request->url, request->headers.description());
 
   // The fetch is a feedback session of its own: start, end and, on failure, the error.
   const auto start = bagFetchStartRecord(*request, hostTicks(*assembly_.clock));
@@ -506,7 +481,13 @@ Dictionary TavixBagController::cacheBagDictionary(const Dictionary& dictionary) 
     bagLog().fault("Couldn't get path to cache bag.  Error: {}.", ec.message());
     return augmented;
   }
-  const std::string bytes = platform::toBinaryPlist(PropertyValue(augmented));
+  const PropertyValue bag(augmented);
+  if (!platform::plistCanHold(bag)) {
+    // Cutting the string short would store a bag the server never sent.
+    bagLog().error("Error writing bag to persistent cache: {}.", "a string holds U+0000");
+    return augmented;
+  }
+  const std::string bytes = platform::toBinaryPlist(bag);
   if (bytes.empty()) bagLog().error("Error writing bag to persistent cache: {}.", "empty property list");
   if (auto werr = platform::writeFileAtomically(*path, bytes, 0600)) {
     bagLog().error("Could not write to {}", path->string());

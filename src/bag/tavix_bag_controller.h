@@ -21,6 +21,7 @@
 #include <string_view>
 #include <system_error>
 
+#include "bagview/tvx_bag.h"
 #include "core/names.h"
 #include "network/request_factory.h"
 #include "platform/dispatch.h"
@@ -64,6 +65,7 @@ struct TVXBagError {
 int compareNumericStrings(std::string_view a, std::string_view b);
 
 class TavixBagController final : public TVXBagURLSource,
+                                 public TVXInMemoryBagSource,
                                  public std::enable_shared_from_this<TavixBagController> {
  public:
   using Completion = std::function<void(std::shared_ptr<const TVXBag>, std::optional<TVXBagError>)>;
@@ -104,7 +106,7 @@ class TavixBagController final : public TVXBagURLSource,
   // assembly: for shutdown, before the assembly's services go. Waits for a completion running now.
   void invalidate();
 
-  std::shared_ptr<const TVXBag> inMemoryBag();
+  std::shared_ptr<const TVXBag> inMemoryBag() override;
   void setInMemoryBag(std::shared_ptr<const TVXBag> bag);
 
   const std::optional<std::string>& userAgent() const { return userAgent_; }

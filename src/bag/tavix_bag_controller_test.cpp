@@ -10,7 +10,7 @@
 #include <thread>
 #include <nlohmann/json.hpp>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "devserver/devserver.h"

@@ -178,19 +178,6 @@ std::shared_ptr<EngagedCompletionCache> EngagedCompletionCache::create(Environme
   return cache;
 }
 
-std::shared_ptr<EngagedCompletionCache> EngagedCompletionCache::sharedInstance(const Assembly& assembly) {
-  // Lives as long as the process and is never destroyed: its queues belong to the daemon's pool,
-  // which is gone by the time static destructors run. Every statement is committed as it runs, so
-  // there is nothing to close at exit.
-  static std::once_flag once;
-  static std::shared_ptr<EngagedCompletionCache>* instance = nullptr;
-  std::call_once(once, [&] {
-    instance = new std::shared_ptr<EngagedCompletionCache>(create(Environment{
-        assembly.cachesFolder(), assembly.clock, assembly.dispatchPool, assembly.userDefaults.get()}));
-  });
-  return *instance;
-}
-
 EngagedCompletionCache::EngagedCompletionCache(Environment env)
     : env_(std::move(env)),
       databaseDirPath_((env_.storagePath / kDatabaseDirName).string()),
@@ -444,7 +431,9 @@ void EngagedCompletionCache::addCompletion(const std::string& completion, const 
   if (transformed.empty()) return;
   eccLog().debug("Adding completion: {} input: {} transformed: {}", completion, input, transformed);
 
-  const char* originText = (origin == 1 || origin == 3) ? "se" : origin == 2 ? "3d" : "";
+  const char* originText = (origin == kEngagedCompletionOriginTavix || origin == kEngagedCompletionOriginSeekara) ? "se"
+                           : origin == kEngagedCompletionOriginThirdParty                                      ? "3d"
+                                                                                                               : "";
   sqlite3_bind_text(s.stmt, 1, completion.c_str(), -1, SQLITE_TRANSIENT);
   sqlite3_bind_text(s.stmt, 2, input.c_str(), -1, SQLITE_TRANSIENT);
   sqlite3_bind_int(s.stmt, 3, static_cast<std::int32_t>(wholeSeconds(now)));

@@ -21,6 +21,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "platform/clock.h"
@@ -43,6 +44,29 @@ struct TVXSearchSuggestion {
   double score = 0;
   int type = 0;  // 1 for origin "se", 8 for origin "3d", 0 otherwise
 };
+
+// The cache keeps each client's completions apart under a number of its own.
+enum EngagedCompletionClient : unsigned long {
+  kEngagedCompletionClientOther = 0,
+  kEngagedCompletionClientBrovane = 1,
+  kEngagedCompletionClientSeekara = 2,
+};
+
+// Where an engaged completion came from: a Tavix result (stored as "se"), another app's result
+// ("3d") or the system search (again "se").
+enum EngagedCompletionOrigin : int {
+  kEngagedCompletionOriginUnknown = 0,
+  kEngagedCompletionOriginTavix = 1,
+  kEngagedCompletionOriginThirdParty = 2,
+  kEngagedCompletionOriginSeekara = 3,
+};
+
+// The number of a client short name ("brovane", "seekara"); any other name is kEngagedCompletionClientOther.
+inline EngagedCompletionClient engagedCompletionClientForName(std::string_view shortName) {
+  if (shortName == "brovane") return kEngagedCompletionClientBrovane;
+  if (shortName == "seekara") return kEngagedCompletionClientSeekara;
+  return kEngagedCompletionClientOther;
+}
 
 // Scoring weights. The client connection fills them from the bag when smart history is enabled:
 // "brovane_last_1hour", "brovane_last_1day", "brovane_last_1week", "brovane_last_1month",
@@ -76,8 +100,6 @@ class EngagedCompletionCache : public std::enable_shared_from_this<EngagedComple
   // up the text transforms in the background. A database that cannot be opened leaves the cache
   // inert: adds do nothing, searches return nothing.
   static std::shared_ptr<EngagedCompletionCache> create(Environment env);
-  // The one instance of the daemon, on the assembly's caches folder; made on first call.
-  static std::shared_ptr<EngagedCompletionCache> sharedInstance(const Assembly& assembly);
 
   ~EngagedCompletionCache();
   EngagedCompletionCache(const EngagedCompletionCache&) = delete;
@@ -90,8 +112,9 @@ class EngagedCompletionCache : public std::enable_shared_from_this<EngagedComple
   EngagedCompletionParameters parameters() const;
 
   // Records an engagement. Ages out rows older than 30 days (all clients) and trims the client
-  // to `maxRows` (10000 when 0) first. Origin codes 1 and 3 store "se", 2 stores "3d".
-  void addCompletion(const std::string& completion, const std::string& input, int origin = 0,
+  // to `maxRows` (10000 when 0) first. `origin` is an EngagedCompletionOrigin.
+  void addCompletion(const std::string& completion, const std::string& input,
+                     int origin = kEngagedCompletionOriginUnknown,
                      unsigned long client = 0, unsigned long maxRows = kDefaultMaxRows);
 
   // Up to `count` completions whose input or normalised completion begins with `input`, best

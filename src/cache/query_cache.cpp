@@ -13,35 +13,12 @@
 #include "core/names.h"
 #include "platform/http/url_request.h"
 #include "platform/memory_pressure.h"
+#include "platform/http/url.h"
 
 namespace tavix {
 namespace {
 
 platform::Logger& cachingLog() { return TavixLogForCategory(TavixLoggingCategoryCaching); }
-
-int hexValue(char c) {
-  if (c >= '0' && c <= '9') return c - '0';
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-  return -1;
-}
-
-std::string percentDecode(std::string_view text) {
-  std::string out;
-  out.reserve(text.size());
-  for (std::size_t i = 0; i < text.size(); ++i) {
-    if (text[i] == '%' && i + 2 < text.size()) {
-      int hi = hexValue(text[i + 1]), lo = hexValue(text[i + 2]);
-      if (hi >= 0 && lo >= 0) {
-        out.push_back(static_cast<char>(hi * 16 + lo));
-        i += 2;
-        continue;
-      }
-    }
-    out.push_back(text[i]);
-  }
-  return out;
-}
 
 // Both the key and the typed input go through the same Unicode lower-casing.
 std::string lowercased(const std::string& s) {
@@ -63,25 +40,9 @@ std::size_t queryLength(std::string_view utf8) {
 }
 
 QueryItems queryItemsOfURL(const std::string& url) {
-  QueryItems items;
-  std::size_t q = url.find('?');
-  if (q == std::string::npos) return items;
-  std::string_view query(url);
-  query.remove_prefix(q + 1);
-  if (std::size_t hash = query.find('#'); hash != std::string_view::npos) query = query.substr(0, hash);
-  while (!query.empty()) {
-    std::size_t amp = query.find('&');
-    std::string_view part = query.substr(0, amp);
-    std::size_t eq = part.find('=');
-    if (eq == std::string_view::npos) {
-      items.emplace_back(percentDecode(part), std::nullopt);
-    } else {
-      items.emplace_back(percentDecode(part.substr(0, eq)), percentDecode(part.substr(eq + 1)));
-    }
-    if (amp == std::string_view::npos) break;
-    query.remove_prefix(amp + 1);
-  }
-  return items;
+  const auto parsed = platform::http::URL::parse(url);
+  const auto query = parsed ? parsed->query() : std::nullopt;
+  return query ? platform::http::decodedQueryItems(*query) : QueryItems{};
 }
 
 std::optional<std::string> findQueryParam(const QueryItems& items, const std::string& name) {

@@ -24,7 +24,7 @@ std::optional<TVXLocation> DefaultsLocationManager::fixedLocation() const {
   fix.latitude = *latitude;
   fix.longitude = *longitude;
   fix.horizontalAccuracy = number("accuracy").value_or(1000);
-  fix.type = static_cast<int>(number("type").value_or(4));
+  fix.type = static_cast<int>(number("type").value_or(TVXLocationSourceTypeWiFi));
   fix.timestamp = clock_.now();
   return fix;
 }

@@ -31,8 +31,20 @@ enum TVXLocationAuthorizationStatus : int {
   TVXLocationAuthorizationWhenInUse = 4,
 };
 
-// One fix. `type` is the location service's source code: 1, 2, 3, 9 satellite; 4, 5 Wi-Fi;
-// 6, 7, 8 cell; anything else unknown.
+// The location service's source codes of a fix; any other code is an unknown source.
+enum TVXLocationSourceType : int {
+  TVXLocationSourceTypeSatellite = 1,
+  TVXLocationSourceTypeSatelliteAssisted = 2,
+  TVXLocationSourceTypeSatelliteDifferential = 3,
+  TVXLocationSourceTypeWiFi = 4,
+  TVXLocationSourceTypeWiFiScan = 5,
+  TVXLocationSourceTypeCell = 6,
+  TVXLocationSourceTypeCellTriangulated = 7,
+  TVXLocationSourceTypeCellTower = 8,
+  TVXLocationSourceTypeSatelliteFused = 9,
+};
+
+// One fix; `type` is a TVXLocationSourceType code.
 struct TVXLocation {
   double latitude = 0;
   double longitude = 0;

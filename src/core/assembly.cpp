@@ -23,20 +23,24 @@ constexpr std::size_t kBagBodyLimit = 2 * 1024 * 1024;
 constexpr std::size_t kResourceBodyLimit = 64 * 1024 * 1024;
 constexpr std::size_t kUploadReplyBodyLimit = 1024 * 1024;
 
-// Made once and never released: the sessions outlive every Assembly and run until the process
-// ends, so each keeps a delegate queue of its own rather than one on a pool that may go first.
-std::shared_ptr<URLSession> makeOnce(std::once_flag& once, std::shared_ptr<URLSession>*& slot,
+std::shared_ptr<URLSession> makeOnce(std::once_flag& once, std::shared_ptr<URLSession>& slot,
                                      const std::function<URLSessionConfiguration()>& configure) {
-  std::call_once(once, [&] { slot = new std::shared_ptr<URLSession>(std::make_shared<URLSession>(configure())); });
-  return *slot;
+  std::call_once(once, [&] { slot = std::make_shared<URLSession>(configure()); });
+  return slot;
 }
 
 }  // namespace
 
+struct Assembly::Sessions {
+  std::once_flag queryOnce, bagOnce, downloadOnce, uploadOnce;
+  std::shared_ptr<URLSession> query, bag, download, upload;
+};
+
+Assembly::Assembly() : sessions_(std::make_unique<Sessions>()) {}
+Assembly::~Assembly() = default;
+
 std::shared_ptr<URLSession> Assembly::urlSession() const {
-  static std::once_flag once;
-  static std::shared_ptr<URLSession>* session = nullptr;
-  return makeOnce(once, session, [this] {
+  return makeOnce(sessions_->queryOnce, sessions_->query, [this] {
     // "Parallax" is the fast-connection pair: TCP Fast Open and TLS session resumption.
     const bool noParallax = userDefaults && userDefaults->boolForKey("TVXNoParallax");
     URLSessionConfiguration c;
@@ -54,9 +58,7 @@ std::shared_ptr<URLSession> Assembly::urlSession() const {
 }
 
 std::shared_ptr<URLSession> Assembly::bagSession() const {
-  static std::once_flag once;
-  static std::shared_ptr<URLSession>* session = nullptr;
-  return makeOnce(once, session, [] {
+  return makeOnce(sessions_->bagOnce, sessions_->bag, [] {
     URLSessionConfiguration c;
     c.connectionIdleTimeout = std::chrono::seconds(10);
     c.requestTimeoutIsDeadline = true;
@@ -67,9 +69,7 @@ std::shared_ptr<URLSession> Assembly::bagSession() const {
 }
 
 std::shared_ptr<URLSession> Assembly::downloadURLSession() const {
-  static std::once_flag once;
-  static std::shared_ptr<URLSession>* session = nullptr;
-  return makeOnce(once, session, [] {
+  return makeOnce(sessions_->downloadOnce, sessions_->download, [] {
     URLSessionConfiguration c;
     c.identifier = "com.norvel.tavixd";
     c.maximumResponseBodySize = kResourceBodyLimit;
@@ -79,9 +79,7 @@ std::shared_ptr<URLSession> Assembly::downloadURLSession() const {
 }
 
 std::shared_ptr<URLSession> Assembly::uploadURLSession() const {
-  static std::once_flag once;
-  static std::shared_ptr<URLSession>* session = nullptr;
-  return makeOnce(once, session, [] {
+  return makeOnce(sessions_->uploadOnce, sessions_->upload, [] {
     URLSessionConfiguration c;
     c.identifier = "com.norvel.tavixd.flusher.urlsession";
     c.timeoutIntervalForRequest = 300;

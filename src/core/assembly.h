@@ -24,30 +24,28 @@ class URLSession;
 }
 }  // namespace platform
 
-// Service objects made by later subsystems; a slot stays empty until its subsystem is built.
 class TVXNetworkRequestFactory;
 class TavixBagController;
-class DownloadManager;
 class UploadManager;
 class ClientStateManager;
 class TavixUserGUIDController;
 class ClientSessionManager;
-class Lookup;
-class TavixSubscriptionManager;
 class TavixFlusherIPC;
-class AppWhitelistController;
 class TavixPersistentStorage;
+class EngagedCompletionCache;
 class LocationManager;
 class MotionManager;
 class ResourceVersionsProvider;
 
 class Assembly {
  public:
-  Assembly() = default;
+  Assembly();
+  ~Assembly();
   Assembly(const Assembly&) = delete;
   Assembly& operator=(const Assembly&) = delete;
 
-  // The platform services every object may use. Not owned: they outlive the assembly.
+  // The platform services every object may use. Not owned: they outlive the assembly. The pool and
+  // the clock are always set; objects use them without checking.
   platform::DispatchPool* dispatchPool = nullptr;
   platform::Clock* clock = nullptr;
   platform::TransactionTracker* transactions = nullptr;
@@ -62,16 +60,14 @@ class Assembly {
 
   std::shared_ptr<TVXNetworkRequestFactory> requestFactory;
   std::shared_ptr<TavixBagController> bagController;
-  std::shared_ptr<DownloadManager> downloadManager;
   std::shared_ptr<UploadManager> uploadManager;
   std::shared_ptr<ClientStateManager> clientStateManager;
   std::shared_ptr<TavixUserGUIDController> guidController;
   std::shared_ptr<ClientSessionManager> clientSessionManager;
-  std::shared_ptr<Lookup> lookup;
-  std::shared_ptr<TavixSubscriptionManager> subscriptionManager;
   std::shared_ptr<TavixFlusherIPC> flusherIPCListener;
-  std::shared_ptr<AppWhitelistController> appWhitelistController;
   std::shared_ptr<TavixPersistentStorage> persistentStorage;
+  // The completions people engaged with, kept across clients and connections.
+  std::shared_ptr<EngagedCompletionCache> engagedCompletionCache;
   std::shared_ptr<LocationManager> locationManager;
   std::shared_ptr<MotionManager> motionManager;
   // The resource versions each new feedback session records; the download manager's, once it is
@@ -84,10 +80,9 @@ class Assembly {
   // The current "TVXUseMarvola" default, read on every call so a change needs no restart.
   bool useMarvola() const;
 
-  // The four process-wide URL sessions (queries, bag, resource downloads, feedback uploads).
-  // Each is made on the first call of its accessor, whichever Assembly it is asked of, and the
-  // same session is returned ever after; safe from any thread. urlSession reads "TVXNoParallax"
-  // from userDefaults once, when it is made.
+  // The assembly's four URL sessions (queries, bag, resource downloads, feedback uploads). Each is
+  // made on the first call of its accessor and the same session is returned ever after; safe from
+  // any thread. urlSession reads "TVXNoParallax" from userDefaults once, when it is made.
   std::shared_ptr<platform::http::URLSession> urlSession() const;
   std::shared_ptr<platform::http::URLSession> bagSession() const;
   std::shared_ptr<platform::http::URLSession> downloadURLSession() const;
@@ -96,6 +91,11 @@ class Assembly {
   // The daemon's folder in the user's caches directory: "<caches>/com.norvel.tavixd".
   platform::fs::path cachesFolder() const;
 
+ private:
+  struct Sessions;
+  // Declared last: the sessions go first when the assembly goes, cancelling what is still in
+  // flight while the services those completions reach are alive.
+  std::unique_ptr<Sessions> sessions_;
 };
 
 // The application domain of the daemon's defaults and its folder names.

@@ -21,6 +21,17 @@ struct TVXQueryItem {
   bool operator==(const TVXQueryItem&) const = default;
 };
 
+// The trigger events the request paths act on, by their wire numbers; the feedback vocabulary
+// (TriggerSearchRequestEvent) names every event up to 23.
+enum TVXTriggerEvent : std::int64_t {
+  TVXTriggerEventSuggestion = 8,
+  TVXTriggerEventPartialSuggestion = 10,
+  TVXTriggerEventSuggestQueries = 21,
+  TVXTriggerEventSearchOnly = 22,
+  TVXTriggerEventReturnKey = 23,
+  TVXTriggerEventSuggestWithResults = 24,
+};
+
 // The fields every kind carries.
 struct TVXRequest {
   virtual ~TVXRequest() = default;

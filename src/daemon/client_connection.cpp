@@ -4,7 +4,7 @@
 
 #include <cmath>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "cache/query_cache.h"
 #include "cache/engaged_completion_cache.h"
 #include "core/assembly.h"
@@ -17,7 +17,7 @@
 #include "network/locale_context.h"
 #include "network/request_factory.h"
 #include "network/tracing.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/activity.h"
 #include "platform/defaults.h"
 #include "platform/http/url_request.h"
@@ -33,7 +33,7 @@ namespace tavix {
 
 namespace {
 
-constexpr const char* kNotifyStream = "com.norvel.notifyd.matching";
+constexpr const char* kNotifyStream = "com.norvel.notify.matching";
 
 platform::Logger& connectionLog() { return TavixLogForCategory(TavixLoggingCategoryConnection); }
 platform::Logger& sessionLog() { return TavixLogForCategory(TavixLoggingCategorySession); }
@@ -44,6 +44,20 @@ void trace(std::uint32_t code) {
   if (TVXTraceEnabled) TavixLogForCategory(TavixLoggingCategoryRequest).debug("trace 0x{:08x}", code);
 }
 
+// The trace codes around each traced query kind.
+enum TVXTraceCode : std::uint32_t {
+  TVXTraceCodeSearchStart = 0x2b000004,
+  TVXTraceCodeSearchEnd = 0x2b000008,
+  TVXTraceCodeCardStart = 0x2b00000c,
+  TVXTraceCodeCardEnd = 0x2b000010,
+  TVXTraceCodeZeroKeywordStart = 0x2b00001c,
+  TVXTraceCodeZeroKeywordEnd = 0x2b000020,
+  TVXTraceCodeFeedbackStart = 0x2b000024,
+  TVXTraceCodeFeedbackEnd = 0x2b000028,
+  TVXTraceCodeLookupStart = 0x2b00002c,
+  TVXTraceCodeLookupEnd = 0x2b000030,
+};
+
 struct TraceCodes {
   std::uint32_t start = 0;
   std::uint32_t end = 0;
@@ -51,10 +65,10 @@ struct TraceCodes {
 
 TraceCodes traceCodesFor(proto::TVXRequest::KindCase kind) {
   switch (kind) {
-    case proto::TVXRequest::kSearch: return {0x2b000004, 0x2b000008};
-    case proto::TVXRequest::kCard: return {0x2b00000c, 0x2b000010};
-    case proto::TVXRequest::kZeroKeyword: return {0x2b00001c, 0x2b000020};
-    case proto::TVXRequest::kLookup: return {0x2b00002c, 0x2b000030};
+    case proto::TVXRequest::kSearch: return {TVXTraceCodeSearchStart, TVXTraceCodeSearchEnd};
+    case proto::TVXRequest::kCard: return {TVXTraceCodeCardStart, TVXTraceCodeCardEnd};
+    case proto::TVXRequest::kZeroKeyword: return {TVXTraceCodeZeroKeywordStart, TVXTraceCodeZeroKeywordEnd};
+    case proto::TVXRequest::kLookup: return {TVXTraceCodeLookupStart, TVXTraceCodeLookupEnd};
     default: return {};
   }
 }
@@ -72,13 +86,6 @@ std::string defaultKeyboardInputMode(const platform::UserDefaults* defaults) {
     if (auto mode = defaults->stringForKey("TVXKeyboardInputMode"); mode && !mode->empty()) return *mode;
   }
   return TVXCurrentLocaleSettings(defaults).locale;
-}
-
-// The engaged-completion cache's client number of a client short name.
-unsigned long completionClientNumber(const std::optional<std::string>& shortName) {
-  if (shortName == "brovane") return 1;
-  if (shortName == "seekara") return 2;
-  return 0;
 }
 
 // Sends one frame to the client; a frame that cannot go (the client has gone, or it is over the
@@ -216,15 +223,13 @@ void ClientConnection::invalidated() {
 
 void ClientConnection::openOrExtendTransaction() {
   idleTimer_.cancel();
-  if (assembly_.clock) {
-    std::weak_ptr<ClientConnection> weak = weak_from_this();
-    idleTimer_ = assembly_.clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(), [weak] {
-      auto self = weak.lock();
-      if (!self) return;
-      connectionLog().debug("timing out idle ipc transaction");
-      self->closeTransaction(true);
-    });
-  }
+  std::weak_ptr<ClientConnection> weak = weak_from_this();
+  idleTimer_ = assembly_.clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(), [weak] {
+    auto self = weak.lock();
+    if (!self) return;
+    connectionLog().debug("timing out idle ipc transaction");
+    self->closeTransaction(true);
+  });
   if (!transactionOpen_.exchange(true) && assembly_.transactions) {
     std::lock_guard lock(transactionLock_);
     transaction_ = assembly_.transactions->begin("com.norvel.tavixd.ipc");
@@ -251,119 +256,129 @@ void ClientConnection::send(std::uint64_t callId, proto::Envelope& out) {
   sendToClient(*connection_, answerBytes(*connection_, callId, out));
 }
 
-void ClientConnection::handleMessage(const std::string& payload) {
+void ClientConnection::reply(std::uint64_t callId, proto::Envelope& out) {
+  if (callId == 0) return;  // a call without an id cannot be answered
+  sendToClient(*connection_, answerBytes(*connection_, callId, out));
+}
+
+void ClientConnection::handleIncomingMessage(const std::string& payload) {
   openOrExtendTransaction();
-  const pid_t pid = connection_->peer().pid;
   proto::Envelope in;
   if (!in.ParseFromString(payload)) {
-    connectionLog().error("malformed message of {} bytes from pid {}", payload.size(), pid);
+    connectionLog().error("malformed message of {} bytes from pid {}", payload.size(), connection_->peer().pid);
     return;
   }
   // Descriptors the daemon does not take are closed here rather than left to pile up.
   if (in.attached_fds() > 0) connection_->takeReceivedFds(in.attached_fds());
 
   const std::uint64_t callId = in.call_id();
-  proto::Envelope out;
-  auto notAvailable = [&](proto::TVXError* error) { setError(error, 500, "not available"); };
-
   switch (in.message_case()) {
-    case proto::Envelope::kConfigure:
-      configure(callId, in);
-      return;
-    case proto::Envelope::kBag: {
-      ensureState();
-      if (!state_) return;  // no bound state, no reply: as for queries
-      auto pending = std::make_shared<PendingCall>(connection_, callId);
-      state_->bag(userAgent_, [pending](const std::shared_ptr<const TVXBag>& bag,
-                                             const std::optional<TVXError>& error) {
-        proto::Envelope reply;
-        if (bag) bagToWire(*bag, reply.mutable_bag_reply()->mutable_bag());
-        if (error) errorToWire(*error, reply.mutable_bag_reply()->mutable_error());
-        if (!bag && !error) reply.mutable_bag_reply();
-        pending->answer(reply);
-      });
-      return;
-    }
-    case proto::Envelope::kRequest:
-      request(callId, in);
-      return;
-    case proto::Envelope::kFeedback:
-      feedback(callId);
-      return;
-    case proto::Envelope::kListenToFlusher: {
-      ensureState();
-      // The tool's end of a fresh flusher channel rides with the reply.
-      auto* reply = out.mutable_listen_to_flusher_reply();
-      platform::ipc::UniqueFd endpoint;
-      if (assembly_.flusherIPCListener) endpoint = assembly_.flusherIPCListener->endpoint();
-      if (!endpoint.valid()) {
-        notAvailable(reply->mutable_error());
-        break;
-      }
-      if (callId == 0) return;
-      reply->set_has_endpoint(true);
-      out.set_attached_fds(1);
-      out.set_call_id(callId);
-      std::vector<platform::ipc::UniqueFd> fds;
-      fds.push_back(std::move(endpoint));
-      sendToClient(*connection_, out.SerializeAsString(), std::move(fds));
-      return;
-    }
-    case proto::Envelope::kListSessions: {
-      ensureState();
-      auto* reply = out.mutable_list_sessions_reply();
-      if (assembly_.clientStateManager) {
-        for (const auto& session : assembly_.clientStateManager->sessions()) {
-          reply->add_sessions(platform::toJson(session));
-        }
-      }
-      break;
-    }
-    case proto::Envelope::kFileHandleAndAttributesForResource:
-      ensureState();
-      notAvailable(out.mutable_file_handle_and_attributes_for_resource_reply()->mutable_error());
-      break;
-    case proto::Envelope::kGetImageMap: {
-      ensureState();
-      // Without a bound state the answer is empty, as for a bag without resources.
-      auto bag = state_ ? state_->currentBag() : nullptr;
-      if (bag) out.mutable_get_image_map_reply()->set_resources_json(platform::toJson(bag->resources()));
-      else out.mutable_get_image_map_reply();
-      break;
-    }
+    case proto::Envelope::kConfigure: return configure(callId, in);
+    case proto::Envelope::kBag: return bag(callId);
+    case proto::Envelope::kRequest: return request(callId, in);
+    case proto::Envelope::kFeedback: return feedback(callId);
+    case proto::Envelope::kListenToFlusher: return listenToFlusher(callId);
+    case proto::Envelope::kListSessions: return listSessions(callId);
+    case proto::Envelope::kFileHandleAndAttributesForResource: return fileHandleAndAttributesForResource(callId);
+    case proto::Envelope::kGetImageMap: return getImageMap(callId);
     case proto::Envelope::kReportFeedbackPayloadData:
-      reportFeedbackPayloadData(in.report_feedback_payload_data().data(), in.report_feedback_payload_data().query_id());
-      return;
+      return reportFeedbackPayloadData(in.report_feedback_payload_data().data(),
+                                       in.report_feedback_payload_data().query_id());
     case proto::Envelope::kClearEngagedCompletions:
     case proto::Envelope::kAddCompletion:
-    case proto::Envelope::kUpdateParameters:
-      engagedCompletionMessage(in);
-      return;
-    case proto::Envelope::kNotify: {
-      const std::string stream = in.notify().stream().empty() ? kNotifyStream : in.notify().stream();
-      auto* reply = out.mutable_notify_reply();
-      reply->set_delivered(launchEvents_ && launchEvents_->deliver(stream, in.notify().name()));
-      if (!reply->delivered()) setError(reply->mutable_error(), 404, "no handler for stream " + stream);
-      break;
-    }
-    case proto::Envelope::kRunActivity: {
-      auto* reply = out.mutable_run_activity_reply();
-      const std::string& name = in.run_activity().name();
-      if (!assembly_.activityScheduler || !assembly_.activityScheduler->state(name)) {
-        setError(reply->mutable_error(), 404, "no activity " + name);
-      } else if (!assembly_.activityScheduler->runNow(name)) {
-        setError(reply->mutable_error(), 500, "activity " + name + " is running");
-      }
-      break;
-    }
-    default:
-      connectionLog().error("unknown message {} from pid {}", static_cast<int>(in.message_case()), pid);
-      if (callId == 0) return;
-      setError(out.mutable_call_failed(), 500, "unknown message");
-      break;
+    case proto::Envelope::kUpdateParameters: return engagedCompletionMessage(in);
+    case proto::Envelope::kNotify: return notify(callId, in);
+    case proto::Envelope::kRunActivity: return runActivity(callId, in);
+    default: return unknownMessage(callId, in);
   }
-  if (callId == 0) return;  // a call without an id cannot be answered
-  send(callId, out);
+}
+
+void ClientConnection::bag(std::uint64_t callId) {
+  ensureState();
+  if (!state_) return;  // no bound state, no reply: as for queries
+  auto pending = std::make_shared<PendingCall>(connection_, callId);
+  state_->bag(userAgent_, [pending](const std::shared_ptr<const TVXBag>& bag, const std::optional<TVXError>& error) {
+    proto::Envelope out;
+    if (bag) bagToWire(*bag, out.mutable_bag_reply()->mutable_bag());
+    if (error) errorToWire(*error, out.mutable_bag_reply()->mutable_error());
+    if (!bag && !error) out.mutable_bag_reply();
+    pending->answer(out);
+  });
+}
+
+void ClientConnection::listenToFlusher(std::uint64_t callId) {
+  ensureState();
+  proto::Envelope out;
+  // The tool's end of a fresh flusher channel rides with the reply.
+  auto* answer = out.mutable_listen_to_flusher_reply();
+  platform::ipc::UniqueFd endpoint;
+  if (assembly_.flusherIPCListener) endpoint = assembly_.flusherIPCListener->endpoint();
+  if (!endpoint.valid()) {
+    setError(answer->mutable_error(), 500, "not available");
+    return reply(callId, out);
+  }
+  if (callId == 0) return;
+  answer->set_has_endpoint(true);
+  out.set_attached_fds(1);
+  out.set_call_id(callId);
+  std::vector<platform::ipc::UniqueFd> fds;
+  fds.push_back(std::move(endpoint));
+  sendToClient(*connection_, out.SerializeAsString(), std::move(fds));
+}
+
+void ClientConnection::listSessions(std::uint64_t callId) {
+  ensureState();
+  proto::Envelope out;
+  auto* answer = out.mutable_list_sessions_reply();
+  if (assembly_.clientStateManager) {
+    for (const auto& session : assembly_.clientStateManager->sessions()) answer->add_sessions(platform::toJson(session));
+  }
+  reply(callId, out);
+}
+
+void ClientConnection::fileHandleAndAttributesForResource(std::uint64_t callId) {
+  ensureState();
+  proto::Envelope out;
+  setError(out.mutable_file_handle_and_attributes_for_resource_reply()->mutable_error(), 500, "not available");
+  reply(callId, out);
+}
+
+void ClientConnection::getImageMap(std::uint64_t callId) {
+  ensureState();
+  proto::Envelope out;
+  // Without a bound state the answer is empty, as for a bag without resources.
+  auto bag = state_ ? state_->currentBag() : nullptr;
+  auto* answer = out.mutable_get_image_map_reply();
+  if (bag) answer->set_resources_json(platform::toJson(bag->resources()));
+  reply(callId, out);
+}
+
+void ClientConnection::notify(std::uint64_t callId, const proto::Envelope& in) {
+  proto::Envelope out;
+  const std::string stream = in.notify().stream().empty() ? kNotifyStream : in.notify().stream();
+  auto* answer = out.mutable_notify_reply();
+  answer->set_delivered(launchEvents_ && launchEvents_->deliver(stream, in.notify().name()));
+  if (!answer->delivered()) setError(answer->mutable_error(), 404, "no handler for stream " + stream);
+  reply(callId, out);
+}
+
+void ClientConnection::runActivity(std::uint64_t callId, const proto::Envelope& in) {
+  proto::Envelope out;
+  auto* answer = out.mutable_run_activity_reply();
+  const std::string& name = in.run_activity().name();
+  if (!assembly_.activityScheduler || !assembly_.activityScheduler->state(name)) {
+    setError(answer->mutable_error(), 404, "no activity " + name);
+  } else if (!assembly_.activityScheduler->runNow(name)) {
+    setError(answer->mutable_error(), 500, "activity " + name + " is running");
+  }
+  reply(callId, out);
+}
+
+void ClientConnection::unknownMessage(std::uint64_t callId, const proto::Envelope& in) {
+  connectionLog().error("unknown message {} from pid {}", static_cast<int>(in.message_case()), connection_->peer().pid);
+  proto::Envelope out;
+  setError(out.mutable_call_failed(), 500, "unknown message");
+  reply(callId, out);
 }
 
 void ClientConnection::ensureState() {
@@ -446,7 +461,7 @@ void ClientConnection::configure(std::uint64_t callId, const proto::Envelope& in
   }
   proto::Envelope out;
   out.mutable_configure_reply()->set_has_endpoint(false);
-  if (callId != 0) send(callId, out);
+  reply(callId, out);
 }
 
 void ClientConnection::bagDidLoad(const std::shared_ptr<const TVXBag>& bag, const std::optional<TVXError>& error) {
@@ -495,7 +510,7 @@ void ClientConnection::setEngagedCompletionCacheValues(const TVXBag& bag) {
   parameters.all = bag.brovaneAll();
   parameters.mostRecent = bag.brovaneMostRecent();
   parameters.minThresholdToSend = bag.minThresholdToSend();
-  EngagedCompletionCache::sharedInstance(assembly_)->updateParameters(parameters);
+  assembly_.engagedCompletionCache->updateParameters(parameters);
 }
 
 void ClientConnection::request(std::uint64_t callId, const proto::Envelope& in) {
@@ -561,27 +576,27 @@ void ClientConnection::request(std::uint64_t callId, const proto::Envelope& in) 
 }
 
 void ClientConnection::feedback(std::uint64_t callId) {
-  trace(0x2b000024);
+  trace(TVXTraceCodeFeedbackStart);
   ensureState();
   proto::Envelope out;
   out.mutable_feedback_reply();
   auto manager = state_ ? state_->sessionManager() : nullptr;
   if (!manager) {
-    if (callId != 0) send(callId, out);
-    trace(0x2b000028);
+    reply(callId, out);
+    trace(TVXTraceCodeFeedbackEnd);
     return;
   }
   auto pending = std::make_shared<PendingCall>(connection_, callId);
   manager->currentSessionFeedbacks([pending, out](std::vector<std::string> feedbacks) mutable {
     for (auto& feedback : feedbacks) out.mutable_feedback_reply()->add_feedbacks(std::move(feedback));
     pending->answer(out);
-    trace(0x2b000028);
+    trace(TVXTraceCodeFeedbackEnd);
   });
 }
 
 void ClientConnection::engagedCompletionMessage(const proto::Envelope& in) {
   ensureState();
-  auto cache = EngagedCompletionCache::sharedInstance(assembly_);
+  auto cache = assembly_.engagedCompletionCache;
   switch (in.message_case()) {
     case proto::Envelope::kClearEngagedCompletions: {
       const auto& dates = in.clear_engaged_completions();
@@ -590,7 +605,7 @@ void ClientConnection::engagedCompletionMessage(const proto::Envelope& in) {
                               connection_->peer().pid, dates.from_date(), dates.to_date());
         break;
       }
-      const auto client = completionClientNumber(state_ ? state_->clientShortName() : std::nullopt);
+      const auto client = engagedCompletionClientForName(state_ ? state_->clientShortName().value_or("") : "");
       cache->clearCompletionsFromDate(platform::fromUnixSeconds(dates.from_date()),
                                       platform::fromUnixSeconds(dates.to_date()), client);
       break;

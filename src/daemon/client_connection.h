@@ -3,7 +3,7 @@
 // the same client identifier), routes queries to it, takes the client's feedback, relays bag and
 // resource notifications, and answers each call once.
 //
-// Runs on the IPC connection's own serial queue: handleMessage() and invalidated() are called
+// Runs on the IPC connection's own serial queue: handleIncomingMessage() and invalidated() are called
 // there, and the configuration and bound state are touched only there. Replies to queries come
 // back from the URL session's threads and go straight to the connection, which is thread-safe.
 #pragma once
@@ -59,7 +59,7 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
 
   // One frame from the client. Malformed or unknown messages are logged; a call among them is
   // answered with `call_failed`. Never throws, never ends the daemon.
-  void handleMessage(const std::string& payload);
+  void handleIncomingMessage(const std::string& payload);
 
   // The connection has ended: stops the timer and closes the transaction, whose keep-alive lasts
   // another kIdleTransactionSeconds so that the daemon does not leave while the client may come
@@ -87,12 +87,24 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void configure(std::uint64_t callId, const proto::Envelope& in);
   // Binds the state for the configuration when it can; logs why not otherwise.
   void ensureState();
+  // Sends `out` as the answer to `callId`, or unasked with call id 0.
   void send(std::uint64_t callId, proto::Envelope& out);
+  // Answers call `callId` with `out`; a message without a call id gets no answer.
+  void reply(std::uint64_t callId, proto::Envelope& out);
   void relayResourceNotification(const platform::Notification& notification, bool downloaded);
   void bagDidLoad(const std::shared_ptr<const TVXBag>& bag, const std::optional<TVXError>& error);
   void bagChangeNotification(const platform::Notification& notification);
   void setEngagedCompletionCacheValues(const TVXBag& bag);
+  // One method per message.
+  void bag(std::uint64_t callId);
   void request(std::uint64_t callId, const proto::Envelope& in);
+  void listenToFlusher(std::uint64_t callId);
+  void listSessions(std::uint64_t callId);
+  void fileHandleAndAttributesForResource(std::uint64_t callId);
+  void getImageMap(std::uint64_t callId);
+  void notify(std::uint64_t callId, const proto::Envelope& in);
+  void runActivity(std::uint64_t callId, const proto::Envelope& in);
+  void unknownMessage(std::uint64_t callId, const proto::Envelope& in);
   void reportFeedbackPayloadData(const std::string& data, std::uint64_t queryId);
   void feedback(std::uint64_t callId);
   void engagedCompletionMessage(const proto::Envelope& in);

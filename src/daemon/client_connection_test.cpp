@@ -1,5 +1,5 @@
 #include "daemon/client_connection.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 
 #include <sys/socket.h>
 #include <unistd.h>
@@ -22,6 +22,7 @@
 #include "query/client_state_manager.h"
 #include "support/temp_home.h"
 #include "tavix_proto/ipc.pb.h"
+#include "cache/engaged_completion_cache.h"
 
 namespace tavix {
 namespace {
@@ -54,6 +55,7 @@ struct Harness {
     assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
     assembly.paths = platform::Paths{home.cache(), home.config(), home.runtime()};
     assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
+    assembly.engagedCompletionCache = EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, nullptr});
     assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
     int fds[2];
     EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
@@ -63,7 +65,7 @@ struct Harness {
     subject = std::make_shared<ClientConnection>(assembly, connection, &events);
     subject->start();
     std::weak_ptr<ClientConnection> weak = subject;
-    connection->start([weak](std::string p) { if (auto s = weak.lock()) s->handleMessage(p); },
+    connection->start([weak](std::string p) { if (auto s = weak.lock()) s->handleIncomingMessage(p); },
                       [weak] { if (auto s = weak.lock()) s->invalidated(); });
   }
   ~Harness() {
@@ -183,16 +185,16 @@ TEST(ClientConnection, DeliversLaunchEventsAndRunsActivitiesOrSaysWhyNot) {
     if (a->state() == platform::ActivityState::Run) ++runs;
   });
   std::vector<std::string> seen;
-  h.events.setHandler("com.norvel.notifyd.matching", [&](const std::string& name) { seen.push_back(name); });
+  h.events.setHandler("com.norvel.notify.matching", [&](const std::string& name) { seen.push_back(name); });
 
-  auto reply = h.call(notify("com.norvel.proactive.queries.clearData"), 5);
+  auto reply = h.call(notify("com.norvel.predictions.queries.clearData"), 5);
   EXPECT_EQ(reply.call_id(), 5u);
   EXPECT_TRUE(reply.notify_reply().delivered());
   reply = h.call(notify("x", "no.such.stream"));
   EXPECT_FALSE(reply.notify_reply().delivered());
   EXPECT_EQ(reply.notify_reply().error().code(), 404);
   h.pool.drain();
-  EXPECT_EQ(seen, std::vector<std::string>{"com.norvel.proactive.queries.clearData"});
+  EXPECT_EQ(seen, std::vector<std::string>{"com.norvel.predictions.queries.clearData"});
 
   proto::Envelope run;
   run.mutable_run_activity()->set_name("test.activity");
@@ -250,7 +252,7 @@ TEST(ClientConnection, RefusesConfigurationsThatWouldInjectHeaders) {
   // The device's part of the agent comes from defaults, and is held to the same rule.
   capture.clear();
   Harness h;
-  h.assembly.userDefaults->setObject("TVXDeviceProductType", "Desk\nX-Injected: model");
+  h.assembly.userDefaults->setObject("TVXDeviceModel", "Desk\nX-Injected: model");
   configure.mutable_configure()->mutable_configuration()->set_user_agent("seekara/1.0");
   EXPECT_FALSE(h.call(configure).has_configure_reply());
   EXPECT_TRUE(capture.contains("configuration carries a control character"));

@@ -5,7 +5,7 @@
 
 #include <nlohmann/json.hpp>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "cache/engaged_completion_cache.h"
 #include "context/user_guid_controller.h"
 #include "core/assembly.h"
@@ -17,7 +17,7 @@
 #include "feedback/client_session.h"
 #include "feedback/client_session_manager.h"
 #include "feedback/tavix_feedback.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/files.h"
 #include "query/client_state.h"
 #include "tavix_proto/feedback_session.pb.h"
@@ -149,7 +149,9 @@ void ClientConnection::reportFeedbackPayloadData(const std::string& data, std::u
   }
 
   const auto shortName = state_->clientShortName().value_or("");
-  const unsigned long featureClient = shortName == "brovane" ? 1 : 2;
+  // Feature counts come from the browser's completions or else the system search's.
+  const unsigned long featureClient =
+      shortName == "brovane" ? kEngagedCompletionClientBrovane : kEngagedCompletionClientSeekara;
   std::uint64_t queryId = argumentQueryId;
   if (payload.has_network_search_start() && payload.network_search_start().query_id() != 0) {
     queryId = payload.network_search_start().query_id();
@@ -184,15 +186,15 @@ void ClientConnection::reportFeedbackPayloadData(const std::string& data, std::u
       }
       auto bag = state_->currentBag();
       if (bag && bag->smartHistoryEnabled() && !query.empty()) {
-        int origin = 2;
-        unsigned long client = 1;
+        int origin = kEngagedCompletionOriginThirdParty;
+        unsigned long client = kEngagedCompletionClientBrovane;
         if (shortName == "seekara") {
-          origin = 3;
-          client = 2;
+          origin = kEngagedCompletionOriginSeekara;
+          client = kEngagedCompletionClientSeekara;
         } else if (result.section_bundle_id().rfind("com.norvel.tavix", 0) == 0) {
-          origin = 1;
+          origin = kEngagedCompletionOriginTavix;
         }
-        EngagedCompletionCache::sharedInstance(assembly_)->addCompletion(
+        assembly_.engagedCompletionCache->addCompletion(
             query, input, origin, client, static_cast<unsigned long>(bag->smartHistoryMaxRows()));
         sendCompletionFeatureFeedback(assembly_, result, input, featureClient, true);
       }

@@ -48,8 +48,7 @@ using platform::PropertyValue;
 
 namespace {
 
-// How often the background activities fall due. The launch configuration of the original
-// platform is not ours to read; these are the daemon's own.
+// How often the background activities fall due.
 constexpr double kFlusherIntervalSeconds = 3600;
 constexpr double kCustomFeedbackIntervalSeconds = 4 * 3600;
 // Counters are saved this often (when changed) and at exit.
@@ -101,7 +100,7 @@ void createCustomFeedbackDirectories(const platform::Paths& paths) {
     log.error("failed creating CustomFeedback dir:{}", describe(root, ec));
     return;
   }
-  for (int type = 1; type <= 7; ++type) {
+  for (int type = kTVXFirstCustomFeedbackType; type <= kTVXLastCustomFeedbackType; ++type) {
     auto name = customFeedbackDirectoryForType(type);
     if (!name) continue;
     const auto dir = root / *name;
@@ -110,61 +109,34 @@ void createCustomFeedbackDirectories(const platform::Paths& paths) {
   }
 }
 
-int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
-  platform::setLogLevel(options.logLevel);
-  auto& log = TavixLogForCategory(TavixLoggingCategoryDefault);
-  // Before any thread: taking the sockets changes the environment.
-  const int activated = adoptActivatedSocket(options, log);
+namespace {
 
-  // Before the pool: tasks dropped when the pool goes still end their transactions.
-  platform::TransactionTracker transactions;
-  platform::DispatchPool pool;
-  platform::SystemClock clock(pool);
-  platform::SerialQueue activityQueue(pool, "com.norvel.tavixd.activities");
-  platform::ActivityScheduler activities(clock, activityQueue, transactions);
-  platform::RunLoop runLoop;
-
-  auto defaults = std::make_shared<platform::UserDefaults>(paths.configFolder(kTavixdDomain), kTavixdDomain, &log);
-  defaults->watch(pool);
-
-  TVXTracingSetup(*defaults);
-  defaults->registerDefaults(tavixdRegisteredDefaults());
-  createCustomFeedbackDirectories(paths);
-
-  Assembly assembly;
-  assembly.dispatchPool = &pool;
-  assembly.clock = &clock;
-  assembly.transactions = &transactions;
-  assembly.activityScheduler = &activities;
-  assembly.paths = paths;
-  assembly.userDefaults = defaults;
+// The services, made and wired in the order start-up needs: each finds in the assembly the ones it
+// reads in its constructor. Uploads left unsent by the last run resume with the upload manager;
+// endpoints come with the bag.
+void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform::Clock& clock) {
+  auto& defaults = *assembly.userDefaults;
   assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
-  assembly.locationManager = std::make_shared<DefaultsLocationManager>(*defaults, clock, pool);
-  assembly.motionManager = std::make_shared<DefaultsMotionManager>(*defaults, pool);
+  assembly.locationManager = std::make_shared<DefaultsLocationManager>(defaults, clock, pool);
+  assembly.motionManager = std::make_shared<DefaultsMotionManager>(defaults, pool);
   assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
-
-  // Uploads left unsent by the last run resume here; endpoints come with the bag.
+  assembly.engagedCompletionCache =
+      EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, assembly.userDefaults.get()});
   assembly.uploadManager = UploadManager::create(assembly);
   assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+}
 
-  const auto countersFile = assembly.cachesFolder() / "counters.plist";
-  auto& counters = TavixDiagnosticDataReporter::store();
-  if (auto ec = counters.load(countersFile)) log.error("cannot read counters {}", describe(countersFile, ec));
-  TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.launch");
-  assembly.bagController = TavixBagController::create(assembly);
-
-  // Topic weights a person or another program left for us; any property-list value, sent as JSON.
-  if (auto silhouette = defaults->objectForKey("silhouette")) {
-    assembly.requestFactory->setSilhouetteTopics(silhouette->string() ? *silhouette->string()
-                                                                     : platform::toJson(*silhouette));
+// Topic weights a person or another program left for us; any property-list value, sent as JSON.
+void applySilhouette(const platform::UserDefaults& defaults, TVXNetworkRequestFactory& requestFactory) {
+  if (auto silhouette = defaults.objectForKey("silhouette")) {
+    requestFactory.setSilhouetteTopics(silhouette->string() ? *silhouette->string() : platform::toJson(*silhouette));
   }
+}
 
-  platform::SerialQueue ipcEventQueue(pool, "com.norvel.tavixd.ipc_event");
-  platform::ipc::LaunchEventRegistry launchEvents(ipcEventQueue);
-  TavixService service(assembly, &launchEvents);
-  // After the service: a client state shares the service's GUID controller and session manager.
-  assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
-  assembly.flusherIPCListener = TavixFlusherIPC::create(assembly, [&service, &assembly] {
+// The flush command channel: it flushes each connected client's session, and hears every
+// feedback event of the daemon's own session manager.
+std::shared_ptr<TavixFlusherIPC> makeFlusherChannel(Assembly& assembly, TavixService& service) {
+  auto channel = TavixFlusherIPC::create(assembly, [&service, &assembly] {
     std::vector<TavixFlusherIPC::ClientConnectionHandle> handles;
     for (const auto& client : service.getClientConnections()) {
       TavixFlusherIPC::ClientConnectionHandle handle;
@@ -185,54 +157,38 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
     }
     return handles;
   });
-  if (assembly.clientSessionManager) {
-    std::weak_ptr<TavixFlusherIPC> channel = assembly.flusherIPCListener;
-    assembly.clientSessionManager->setFeedbackObserver([channel](const proto::CTTavixFeedback& feedback) {
-      if (auto c = channel.lock()) c->sendDataToReceivingStreamListener(feedback);
-    });
-  }
+  std::weak_ptr<TavixFlusherIPC> weak = channel;
+  assembly.clientSessionManager->setFeedbackObserver([weak](const proto::CTTavixFeedback& feedback) {
+    if (auto c = weak.lock()) c->sendDataToReceivingStreamListener(feedback);
+  });
+  return channel;
+}
 
-  // The orderly end, on every way out once the services exist.
-  auto shutDown = [&] {
-    assembly.flusherIPCListener.reset();  // its dumps reach the service, which goes next
-    pool.drain();  // let queued work finish while everything it may touch is still alive
-    // A bag fetch may still be on the wire; its completion must not reach the services going next.
-    assembly.bagController->invalidate();
-    // Work that arrived since (a last feedback event, a closing connection) must not run while the
-    // assembly's objects are being destroyed: stop the workers first.
-    pool.shutdown();
-    if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
-    log.info("tavixd stopped");
-  };
-
-  // Socket activation hands the listening socket over; otherwise we make our own.
+// Socket activation hands the listening socket over; otherwise we make our own at `socketPath`.
+std::unique_ptr<platform::ipc::IpcListener> openListener(int activated, const std::string& socketPath,
+                                                         platform::DispatchPool& pool, platform::Logger& log) {
   auto& connectionLog = TavixLogForCategory(TavixLoggingCategoryConnection);
-  std::error_code listenError;
-  std::unique_ptr<platform::ipc::IpcListener> listener;
-  const std::string socketPath =
-      options.socketPath.empty() ? (paths.runtimeFolder(kTavixdDomain) / "socket").string() : options.socketPath;
-  if (activated >= 0) {
-    listener = platform::ipc::IpcListener::adopt(pool, activated, connectionLog, &listenError);
-  } else {
-    listener = platform::ipc::IpcListener::listen(pool, socketPath, connectionLog, &listenError);
-  }
-  if (!listener) {
-    log.fault("cannot listen on {}: {}", activated < 0 ? socketPath : "the activated socket", listenError.message());
-    shutDown();
-    return 1;
-  }
+  std::error_code error;
+  auto listener = activated >= 0 ? platform::ipc::IpcListener::adopt(pool, activated, connectionLog, &error)
+                                 : platform::ipc::IpcListener::listen(pool, socketPath, connectionLog, &error);
+  if (!listener) log.fault("cannot listen on {}: {}", activated < 0 ? socketPath : "the activated socket", error.message());
+  return listener;
+}
 
+void registerLaunchEvents(platform::ipc::LaunchEventRegistry& launchEvents, Assembly& assembly) {
   auto& launchLog = TavixLogForCategory(TavixLoggingCategoryDefault);
   launchEvents.setHandler("com.norvel.tavixd.urlsession",
                           [&launchLog](const std::string& session) { launchLog.info("launch event for {}", session); });
-  launchEvents.setHandler("com.norvel.notifyd.matching", [&launchLog, &assembly](const std::string& name) {
+  launchEvents.setHandler("com.norvel.notify.matching", [&launchLog, &assembly](const std::string& name) {
     launchLog.info("launch event for {}", name);
     // The system search asks for its completion history to be forgotten.
-    if (name == "com.norvel.proactive.queries.clearData") {
-      EngagedCompletionCache::sharedInstance(assembly)->clearAllCompletionsForClient(2);
+    if (name == "com.norvel.predictions.queries.clearData") {
+      assembly.engagedCompletionCache->clearAllCompletionsForClient(kEngagedCompletionClientSeekara);
     }
   });
+}
 
+void checkInActivities(platform::ActivityScheduler& activities, Assembly& assembly, platform::Logger& log) {
   activities.checkIn(kFlusherActivity, platform::seconds(kFlusherIntervalSeconds), [&assembly](const auto& activity) {
     TavixFeedbackFlusher::handlePeriodicFlushActivity(assembly, activity);
   });
@@ -249,6 +205,133 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
                          }
                        });
                      });
+}
+
+// The periodic chores on a queue of their own: counters saved, the idle exit, the service
+// manager's watchdog and the memory-pressure monitor.
+class Housekeeping {
+ public:
+  Housekeeping(platform::DispatchPool& pool, platform::Clock& clock)
+      : clock_(clock),
+        queue_(pool, "com.norvel.tavixd.housekeeping"),
+        saveCounters_(clock, queue_),
+        idleCheck_(clock, queue_),
+        watchdog_(clock, queue_),
+        memoryPressure_(clock, queue_) {}
+
+  // `isBusy` says whether a transaction is open or a client connected; `exit` ends the run loop.
+  void start(platform::CounterStore& counters, const platform::fs::path& countersFile, double exitWhenIdle,
+             std::function<bool()> isBusy, std::function<void()> exit, platform::Logger& log) {
+    queue_.sync([&] {
+      if (!memoryPressure_.start()) log.info("no memory pressure information; caches shrink only when told");
+      // Pings from a pool queue: a pool wedged for the whole interval gets the daemon restarted.
+      if (const auto interval = platform::watchdogInterval(); interval > platform::Duration::zero()) {
+        watchdog_.start(interval / 3, [] { platform::notifyServiceManager("WATCHDOG=1"); });
+      }
+      saveCounters_.start(platform::seconds(kCounterSaveIntervalSeconds), [&counters, countersFile, &log] {
+        if (!counters.dirty()) return;
+        if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
+      });
+      if (exitWhenIdle > 0) {
+        auto idleSince = std::make_shared<platform::TimePoint>(clock_.now());
+        idleCheck_.start(platform::seconds(std::min(1.0, exitWhenIdle)),
+                         [this, idleSince, exitWhenIdle, isBusy = std::move(isBusy), exit = std::move(exit), &log] {
+                           if (isBusy()) {
+                             *idleSince = clock_.now();
+                           } else if (clock_.now() - *idleSince >= platform::seconds(exitWhenIdle)) {
+                             log.info("idle for {} s, exiting", exitWhenIdle);
+                             exit();
+                           }
+                         });
+      }
+    });
+  }
+
+  void stop() {
+    queue_.sync([&] {
+      saveCounters_.stop();
+      idleCheck_.stop();
+      watchdog_.stop();
+      memoryPressure_.stop();
+    });
+  }
+
+ private:
+  platform::Clock& clock_;
+  platform::SerialQueue queue_;
+  platform::RepeatingTimer saveCounters_;
+  platform::RepeatingTimer idleCheck_;
+  platform::RepeatingTimer watchdog_;
+  platform::PressureStallMonitor memoryPressure_;
+};
+
+}  // namespace
+
+int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
+  platform::setLogLevel(options.logLevel);
+  auto& log = TavixLogForCategory(TavixLoggingCategoryDefault);
+  // Before any thread: taking the sockets changes the environment.
+  const int activated = adoptActivatedSocket(options, log);
+
+  // Before the pool: tasks dropped when the pool goes still end their transactions.
+  platform::TransactionTracker transactions;
+  platform::DispatchPool pool;
+  platform::SystemClock clock(pool);
+  platform::SerialQueue activityQueue(pool, "com.norvel.tavixd.activities");
+  platform::ActivityScheduler activities(clock, activityQueue, transactions);
+  platform::RunLoop runLoop;
+
+  auto defaults = std::make_shared<platform::UserDefaults>(paths.configFolder(kTavixdDomain), kTavixdDomain, &log);
+  defaults->watch(pool);
+  TVXTracingSetup(*defaults);
+  defaults->registerDefaults(tavixdRegisteredDefaults());
+  createCustomFeedbackDirectories(paths);
+
+  Assembly assembly;
+  assembly.dispatchPool = &pool;
+  assembly.clock = &clock;
+  assembly.transactions = &transactions;
+  assembly.activityScheduler = &activities;
+  assembly.paths = paths;
+  assembly.userDefaults = defaults;
+  assembleServices(assembly, pool, clock);
+
+  const auto countersFile = assembly.cachesFolder() / "counters.plist";
+  auto& counters = TavixDiagnosticDataReporter::store();
+  if (auto ec = counters.load(countersFile)) log.error("cannot read counters {}", describe(countersFile, ec));
+  TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.launch");
+  assembly.bagController = TavixBagController::create(assembly);
+  applySilhouette(*defaults, *assembly.requestFactory);
+
+  platform::SerialQueue ipcEventQueue(pool, "com.norvel.tavixd.ipc_event");
+  platform::ipc::LaunchEventRegistry launchEvents(ipcEventQueue);
+  TavixService service(assembly, &launchEvents);
+  // After the service: a client state shares the service's GUID controller and session manager.
+  assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
+  assembly.flusherIPCListener = makeFlusherChannel(assembly, service);
+
+  // The orderly end, on every way out once the services exist.
+  auto shutDown = [&] {
+    assembly.flusherIPCListener.reset();  // its dumps reach the service, which goes next
+    pool.drain();  // let queued work finish while everything it may touch is still alive
+    // A bag fetch may still be on the wire; its completion must not reach the services going next.
+    assembly.bagController->invalidate();
+    // Work that arrived since (a last feedback event, a closing connection) must not run while the
+    // assembly's objects are being destroyed: stop the workers first.
+    pool.shutdown();
+    if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
+    log.info("tavixd stopped");
+  };
+
+  const std::string socketPath =
+      options.socketPath.empty() ? (paths.runtimeFolder(kTavixdDomain) / "socket").string() : options.socketPath;
+  auto listener = openListener(activated, socketPath, pool, log);
+  if (!listener) {
+    shutDown();
+    return 1;
+  }
+  registerLaunchEvents(launchEvents, assembly);
+  checkInActivities(activities, assembly, log);
 
   // Warm the bag: a valid disk bag is already in memory; otherwise this starts the first fetch.
   pool.post([bagController = assembly.bagController] { bagController->currentBag(); });
@@ -263,39 +346,15 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
     runLoop.stop();
   });
 
-  platform::SerialQueue housekeeping(pool, "com.norvel.tavixd.housekeeping");
-  platform::RepeatingTimer saveCounters(clock, housekeeping);
-  platform::RepeatingTimer idleCheck(clock, housekeeping);
-  platform::RepeatingTimer watchdog(clock, housekeeping);
-  platform::PressureStallMonitor memoryPressure(clock, housekeeping);
-  housekeeping.sync([&] {
-    if (!memoryPressure.start()) log.info("no memory pressure information; caches shrink only when told");
-    // Pings from a pool queue: a pool wedged for the whole interval gets the daemon restarted.
-    if (const auto interval = platform::watchdogInterval(); interval > platform::Duration::zero()) {
-      watchdog.start(interval / 3, [] { platform::notifyServiceManager("WATCHDOG=1"); });
-    }
-    saveCounters.start(platform::seconds(kCounterSaveIntervalSeconds), [&] {
-      if (!counters.dirty()) return;
-      if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
-    });
-    if (options.exitWhenIdle > 0) {
-      // Idle means: no open transaction and no client connected.
-      auto idleSince = std::make_shared<platform::TimePoint>(clock.now());
-      const double step = std::min(1.0, options.exitWhenIdle);
-      idleCheck.start(platform::seconds(step), [&, idleSince] {
-        if (transactions.openCount() > 0 || !service.getClientConnections().empty()) {
-          *idleSince = clock.now();
-        } else if (clock.now() - *idleSince >= platform::seconds(options.exitWhenIdle)) {
-          log.info("idle for {} s, exiting", options.exitWhenIdle);
-          runLoop.stop();
-        }
-      });
-    }
-  });
+  Housekeeping housekeeping(pool, clock);
+  housekeeping.start(
+      counters, countersFile, options.exitWhenIdle,
+      [&] { return transactions.openCount() > 0 || !service.getClientConnections().empty(); },
+      [&] { runLoop.stop(); }, log);
 
   // Clients that connect early wait in the socket's backlog until every handler they may reach
-  // (launch events, activities) is in place, as a launch service holds messages for a starting job.
-  listener->resume([&service](const auto& connection) { service.shouldAcceptNewConnection(connection); },
+  // (launch events, activities) is in place: none of their messages finds a handler missing.
+  listener->resume([&service](const auto& connection) { service.shouldAcceptConnection(connection); },
                    "com.norvel.tavixd.connection");
   log.info("listening on {}", activated < 0 ? socketPath : "the socket handed over by systemd");
   log.info("tavixd started (pid {}), caches in {}", getpid(), assembly.cachesFolder().string());
@@ -304,12 +363,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   platform::notifyServiceManager("STOPPING=1\nSTATUS=Stopping");
 
   listener.reset();  // no new clients while shutting down
-  housekeeping.sync([&] {
-    saveCounters.stop();
-    idleCheck.stop();
-    watchdog.stop();
-    memoryPressure.stop();
-  });
+  housekeeping.stop();
   shutDown();
   return 0;
 }

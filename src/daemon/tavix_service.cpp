@@ -6,6 +6,7 @@
 #include <google/protobuf/stubs/logging.h>
 
 #include "context/user_guid_controller.h"
+#include "bag/tavix_bag_controller.h"
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
@@ -30,7 +31,7 @@ TavixService::TavixService(Assembly& assembly, platform::ipc::LaunchEventRegistr
   assembly_.sharedSession = assembly_.userDefaults->boolForKey("TVXSharedSession");
   assembly_.guidController = std::make_shared<TavixUserGUIDController>(assembly_);
   assembly_.clientSessionManager =
-      std::make_shared<ClientSessionManager>(assembly_, assembly_.guidController, "tavix");
+      std::make_shared<ClientSessionManager>(assembly_, assembly_.guidController, assembly_.bagController, "tavix");
   // A malformed message is logged once by the connection; protobuf's own parse complaints would
   // let any peer write to our log at will.
   google::protobuf::SetLogHandler(nullptr);
@@ -50,7 +51,7 @@ std::optional<std::string> TavixService::clientIDForConnection(const platform::i
   return platform::ipc::lastPathComponent(path);
 }
 
-bool TavixService::shouldAcceptNewConnection(const std::shared_ptr<platform::ipc::IpcConnection>& connection) {
+bool TavixService::shouldAcceptConnection(const std::shared_ptr<platform::ipc::IpcConnection>& connection) {
   const pid_t pid = connection->peer().pid;
   const std::string clientID = clientIDForConnection(*connection).value_or("(null)");
   connectionLog().notice("new connection from {} ({})", clientID, pid);
@@ -72,7 +73,7 @@ bool TavixService::shouldAcceptNewConnection(const std::shared_ptr<platform::ipc
   // invalidation handler has run.
   connection->start(
       [weakClient](std::string payload) {
-        if (auto c = weakClient.lock()) c->handleMessage(payload);
+        if (auto c = weakClient.lock()) c->handleIncomingMessage(payload);
       },
       [weakService, weakClient, clientID, pid] {
         auto service = weakService.lock();

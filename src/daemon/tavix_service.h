@@ -34,7 +34,7 @@ class TavixService {
 
   // The listener's delegate hook: every connection is accepted, bound to a new ClientConnection
   // and started. A second connection from one process is logged as a warning and served.
-  bool shouldAcceptNewConnection(const std::shared_ptr<platform::ipc::IpcConnection>& connection);
+  bool shouldAcceptConnection(const std::shared_ptr<platform::ipc::IpcConnection>& connection);
 
   // A copy of the live connections, taken synchronously on the service queue; callable from any
   // other queue.

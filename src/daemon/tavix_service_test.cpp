@@ -42,7 +42,7 @@ TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
     std::error_code ec;
     auto listener = ipc::IpcListener::listen(pool, (home.runtime() / "socket").string(), log, &ec);
     ASSERT_TRUE(listener);
-    listener->resume([&](const auto& c) { EXPECT_TRUE(service.shouldAcceptNewConnection(c)); }, "test.connection");
+    listener->resume([&](const auto& c) { EXPECT_TRUE(service.shouldAcceptConnection(c)); }, "test.connection");
 
     ipc::UniqueFd first, second;
     ASSERT_FALSE(ipc::connectTo(listener->path(), &first));

@@ -1,6 +1,6 @@
 #include "daemon/wire_records.h"
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "platform/json_value.h"
 #include "tavix_proto/ipc.pb.h"
 

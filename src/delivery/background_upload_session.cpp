@@ -197,7 +197,7 @@ void BackgroundUploadSession::start(const std::string& journalName, URLRequest r
       if (response) {
         auto it = self->tasks_.find(*identifier);
         if (auto delegate = self->delegate_.lock(); delegate && it != self->tasks_.end()) {
-          delegate->didSendBodyData(it->second.info, bodySize, bodySize);
+          delegate->taskDidSendBodyData(it->second.info, bodySize, bodySize);
         }
       }
       self->completed(*identifier, response, error);
@@ -220,7 +220,7 @@ void BackgroundUploadSession::completed(std::uint64_t taskIdentifier, std::optio
   tasks_.erase(it);
   if (error && error->code == platform::http::URLErrorCancelled) return;  // kept for the next start
   forget(entry.journalName);
-  if (auto delegate = delegate_.lock()) delegate->didCompleteWithError(entry.info, response, error);
+  if (auto delegate = delegate_.lock()) delegate->taskDidComplete(entry.info, response, error);
 }
 
 void BackgroundUploadSession::forget(const std::string& journalName) {

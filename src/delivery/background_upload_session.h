@@ -45,10 +45,10 @@ class BackgroundUploadSession : public std::enable_shared_from_this<BackgroundUp
    public:
     virtual ~Delegate() = default;
     // The server answered (`response`) or the transfer failed (`error`).
-    virtual void didCompleteWithError(const TaskInfo& task, const std::optional<platform::http::HTTPURLResponse>& response,
+    virtual void taskDidComplete(const TaskInfo& task, const std::optional<platform::http::HTTPURLResponse>& response,
                                       const std::optional<platform::http::URLError>& error) = 0;
     // The whole body went out (this transport reports no finer progress).
-    virtual void didSendBodyData(const TaskInfo& task, std::int64_t totalBytesSent,
+    virtual void taskDidSendBodyData(const TaskInfo& task, std::int64_t totalBytesSent,
                                  std::int64_t totalBytesExpectedToSend) = 0;
   };
 

@@ -5,7 +5,7 @@
 #include <algorithm>
 
 #include "bag/tavix_bag_controller.h"
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
@@ -15,7 +15,7 @@
 #include "feedback/client_session.h"
 #include "feedback/tavix_feedback.h"
 #include "context/user_guid_controller.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "tavix_proto/feedback_records.pb.h"
 
@@ -70,7 +70,7 @@ const std::vector<std::string>& customFeedbackTypesInFlushOrder() {
   static const std::vector<std::string> types = {
       std::string(kTVXSeekaraResultFeaturesDir), std::string(kTVXBrovaneAutoFillDir),
       std::string(kTVXBrovaneAutoPlayDir),       std::string(kTVXQuilletDir),
-      std::string(kTVXProactiveEventTrackerDir), std::string(kTVXEngagedCompletionDir),
+      std::string(kTVXEventTrackerDir), std::string(kTVXEngagedCompletionDir),
   };
   return types;
 }
@@ -119,11 +119,11 @@ void TavixCustomFeedbackFlusher::flushCustomFeedbackWithCompletionHandler(const 
     }
     std::int64_t limit = bag ? bag->maximumSizeForFeedbackType(type) : 0;
     const std::uint64_t maximum = limit > 0 ? static_cast<std::uint64_t>(limit) : kDefaultCustomFeedbackLimit;
-    const platform::TimePoint now = assembly_.clock ? assembly_.clock->now() : platform::TimePoint{};
+    const platform::TimePoint now = assembly_.clock->now();
     for (const auto& item : items) {
       if (item.empty()) continue;
       // An item its writer may still be filling is left for a later run, not sent cut short.
-      if (assembly_.clock && stillBeingWritten(item, now)) {
+      if (stillBeingWritten(item, now)) {
         flusherLog().info("Custom feedback {} is still being written; left for later", item.string());
         continue;
       }

@@ -8,7 +8,7 @@
 #include <nlohmann/json.hpp>
 
 #include "bag/tavix_bag_controller.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
@@ -188,7 +188,7 @@ class CustomFeedbackTest : public FlusherTest {
  protected:
   platform::fs::path root() { return home.cache() / "com.norvel.tavixd" / kTVXCustomFeedbackDir; }
   void makeDirectories() {
-    for (int type = 1; type <= 7; ++type) {
+    for (int type = kTVXFirstCustomFeedbackType; type <= kTVXLastCustomFeedbackType; ++type) {
       if (auto name = customFeedbackDirectoryForType(type)) platform::fs::create_directories(root() / *name);
     }
   }

@@ -1,4 +1,5 @@
 #include "delivery/output_stream.h"
+#include "platform/strings.h"
 
 #include <fcntl.h>
 #include <openssl/evp.h>
@@ -172,14 +173,7 @@ std::optional<std::error_code> CompressedOutputStream::streamError() const {
 }
 
 std::string CompressedOutputStream::dataDigestForStream() const {
-  static constexpr char kHex[] = "0123456789abcdef";
-  std::string hex;
-  hex.reserve(digest_.size() * 2);
-  for (std::uint8_t b : digest_) {
-    hex += kHex[b >> 4];
-    hex += kHex[b & 0xf];
-  }
-  return hex;
+  return platform::hexString(std::string_view(reinterpret_cast<const char*>(digest_.data()), digest_.size()));
 }
 
 }  // namespace tavix

@@ -11,7 +11,7 @@
 #include <nlohmann/json.hpp>
 
 #include "bag/tavix_bag_controller.h"
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
@@ -19,6 +19,7 @@
 #include "delivery/output_stream.h"
 #include "network/request_factory.h"
 #include "platform/http/url_session.h"
+#include "platform/http/url.h"
 
 namespace tavix {
 
@@ -33,15 +34,6 @@ platform::Logger& uploadLog() { return TavixLogForCategory(TavixLoggingCategoryU
 constexpr double kUploadTimeoutSeconds = 300;
 constexpr std::size_t kCopyChunkSize = 8192;
 constexpr std::size_t kMaximumTempPathLength = 1024;
-
-std::string headersDescription(const platform::http::HeaderFields& headers) {
-  std::string out = "{";
-  for (const auto& [name, value] : headers.all()) {
-    if (out.size() > 1) out += ", ";
-    out += name + ": " + value;
-  }
-  return out + "}";
-}
 
 }  // namespace
 
@@ -71,17 +63,7 @@ std::optional<std::string> TempFile::readContents() const {
 // ---- helpers
 
 std::string appendingQueryItem(std::string_view url, std::string_view name, std::string_view value) {
-  static constexpr char kHex[] = "0123456789ABCDEF";
-  std::string encoded;
-  for (unsigned char c : value) {
-    if (std::isalnum(c) || c == '-' || c == '_' || c == '.' || c == '~') {
-      encoded += static_cast<char>(c);
-    } else {
-      encoded += '%';
-      encoded += kHex[c >> 4];
-      encoded += kHex[c & 0xf];
-    }
-  }
+  const std::string encoded = platform::http::percentEncode(value);
   std::string base(url);
   std::string fragment;
   if (const auto hash = base.find('#'); hash != std::string::npos) {
@@ -322,7 +304,7 @@ void UploadManager::enqueueRequest(URLRequest request, std::shared_ptr<TempFile>
     auto self = weak.lock();
     UploadOutcome outcome = UploadOutcome::kNotNow;
     if (self && tasks.size() < kMaximumPendingUploads) {
-      uploadLog().debug("Enqueuing for upload: {}, headers {}", file->path().string(), headersDescription(request.headers));
+      uploadLog().debug("Enqueuing for upload: {}, headers {}", file->path().string(), request.headers.description());
       if (self->session_->uploadTask(std::move(request), file->path(), numberOfFeedbacks)) {
         outcome = UploadOutcome::kJournaled;
       }
@@ -333,7 +315,7 @@ void UploadManager::enqueueRequest(URLRequest request, std::shared_ptr<TempFile>
   });
 }
 
-void UploadManager::didCompleteWithError(const BackgroundUploadSession::TaskInfo& task,
+void UploadManager::taskDidComplete(const BackgroundUploadSession::TaskInfo& task,
                                          const std::optional<HTTPURLResponse>& response,
                                          const std::optional<URLError>& error) {
   if (error && error->domain == platform::http::kURLErrorDomain && error->code == platform::http::URLErrorTimedOut) {
@@ -349,11 +331,11 @@ void UploadManager::didCompleteWithError(const BackgroundUploadSession::TaskInfo
   } else {
     TavixDiagnosticDataReporter::addValue(count, "com.norvel.tavixd.feedbacksent");
   }
-  uploadLog().debug("URLSession:task:didCompleteWithError: id={}, error={}, statusCode={}", task.taskIdentifier,
+  uploadLog().debug("taskDidComplete: id={}, error={}, statusCode={}", task.taskIdentifier,
                     error ? error->description : std::string("(null)"), status);
 }
 
-void UploadManager::didSendBodyData(const BackgroundUploadSession::TaskInfo& task, std::int64_t totalBytesSent,
+void UploadManager::taskDidSendBodyData(const BackgroundUploadSession::TaskInfo& task, std::int64_t totalBytesSent,
                                     std::int64_t totalBytesExpectedToSend) {
   const double fraction =
       totalBytesExpectedToSend > 0 ? double(totalBytesSent) / double(totalBytesExpectedToSend) : 1.0;

@@ -105,10 +105,10 @@ class UploadManager : public std::enable_shared_from_this<UploadManager>, public
   static std::optional<std::string> crowdsourcingEndpointFromBag(const TVXBag* bag);
 
   // BackgroundUploadSession::Delegate.
-  void didCompleteWithError(const BackgroundUploadSession::TaskInfo& task,
+  void taskDidComplete(const BackgroundUploadSession::TaskInfo& task,
                             const std::optional<platform::http::HTTPURLResponse>& response,
                             const std::optional<platform::http::URLError>& error) override;
-  void didSendBodyData(const BackgroundUploadSession::TaskInfo& task, std::int64_t totalBytesSent,
+  void taskDidSendBodyData(const BackgroundUploadSession::TaskInfo& task, std::int64_t totalBytesSent,
                        std::int64_t totalBytesExpectedToSend) override;
 
  private:

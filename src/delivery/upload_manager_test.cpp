@@ -11,7 +11,7 @@
 #include <future>
 #include <nlohmann/json.hpp>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/names.h"
@@ -26,6 +26,7 @@
 #include "platform/json_value.h"
 #include "platform/log.h"
 #include "platform/notification_center.h"
+#include "platform/raw_deflate.h"
 #include "support/temp_home.h"
 
 namespace tavix {
@@ -183,9 +184,9 @@ TEST_F(UploadManagerTest, UploadsReachTheServerCompressedWithTheirDigestAndAreCo
   const auto body = file->readContents();
   ASSERT_TRUE(body);
   EXPECT_EQ(got[0]["compressed_size"], body->size());
-  std::string plain;
-  ASSERT_TRUE(devserver::inflateRaw(*body, &plain));
-  EXPECT_EQ(json::parse(plain), record);
+  const auto plain = platform::inflateRaw(*body);
+  ASSERT_TRUE(plain);
+  EXPECT_EQ(json::parse(*plain), record);
   // Once journalled and let go, the temporary body is gone.
   const auto temporary = file->path();
   file.reset();

@@ -1,4 +1,5 @@
 #include "feedback/cba_filter.h"
+#include "platform/strings.h"
 
 #include <arpa/inet.h>
 #include <libpsl.h>
@@ -16,12 +17,6 @@ constexpr std::string_view kWebSuggestSection = "com.norvel.tavix.web_suggest";
 constexpr std::string_view kWebIndexSection = "com.norvel.tavix.web_index";
 // Wrappers nest at most this deep in practice; the bound keeps a crafted URL from looping long.
 constexpr int kMaxAMPUnwrapping = 4;
-
-std::string lower(std::string_view text) {
-  std::string out(text);
-  std::transform(out.begin(), out.end(), out.begin(), [](unsigned char c) { return std::tolower(c); });
-  return out;
-}
 
 bool isSchemeChar(char c) {
   return std::isalnum(static_cast<unsigned char>(c)) || c == '+' || c == '-' || c == '.';
@@ -73,7 +68,7 @@ bool parseAuthority(std::string_view authority, URLComponents& out) {
     host = authority.substr(0, colon);
     port = authority.substr(colon + 1);
   }
-  out.host = lower(host);
+  out.host = platform::asciiLowercased(host);
   while (!out.host.empty() && out.host.back() == '.') out.host.pop_back();
   if (!port.empty()) {
     if (!allDigits(port) || port.size() > 5) return false;
@@ -154,7 +149,7 @@ std::optional<URLComponents> tavix_componentsWithString(std::string_view text) {
   URLComponents out;
   bool hasAuthority = false;
   if (auto scheme = schemeOf(text)) {
-    out.scheme = lower(*scheme);
+    out.scheme = platform::asciiLowercased(*scheme);
     text = text.substr(scheme->size() + 1);
     if (startsWith(text, "//")) {
       hasAuthority = true;

@@ -17,21 +17,16 @@
 #include "feedback/persistent_storage.h"
 #include "feedback/session_processing_helper.h"
 #include "feedback/vocabulary.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
+#include "platform/strings.h"
 
 namespace tavix {
 
 namespace {
 
 platform::Logger& sessionLog() { return TavixLogForCategory(TavixLoggingCategorySession); }
-
-std::string lower(std::string_view text) {
-  std::string out(text);
-  std::transform(out.begin(), out.end(), out.begin(), [](unsigned char c) { return std::tolower(c); });
-  return out;
-}
 
 bool sameLocalDay(platform::TimePoint a, platform::TimePoint b) {
   const std::time_t ta = static_cast<std::time_t>(platform::toUnixSeconds(a));
@@ -46,7 +41,7 @@ bool sameLocalDay(platform::TimePoint a, platform::TimePoint b) {
 
 std::optional<std::string> firstUseKeyForAgent(std::string_view agent) {
   static constexpr std::array<const char*, 6> kClients = {"brovane", "seekara", "lookup", "messages", "news", "vocly"};
-  const std::string l = lower(agent);
+  const std::string l = platform::asciiLowercased(agent);
   for (const char* name : kClients) {
     if (l.find(name) != std::string::npos) return std::string("TavixFirstUseOfTheDay_") + name;
   }
@@ -251,7 +246,7 @@ std::vector<std::string> ClientSession::privacyFilteredFeedbacksWithRelativeTime
 std::string ClientSession::getFeedbacksToSend() {
   std::vector<FeedbackRef> events = getSessionFeedbacks();
   // Only the browser reports completion-bar engagements.
-  if (lower(agent()).find("brovane") != std::string::npos) events = CBAFilterController().arrayOfCBAFilteredFeedback(events);
+  if (platform::asciiLowercased(agent()).find("brovane") != std::string::npos) events = CBAFilterController().arrayOfCBAFilteredFeedback(events);
   const std::vector<std::string> filtered = privacyFilteredFeedbacksWithRelativeTimestamp(events);
   nlohmann::json fb = nlohmann::json::array();
   for (const auto& text : filtered) fb.push_back(nlohmann::json::parse(text, nullptr, false));

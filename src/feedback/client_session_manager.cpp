@@ -1,11 +1,10 @@
 #include "feedback/client_session_manager.h"
 
-#include "bag/tavix_bag_controller.h"
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "context/user_guid_controller.h"
 #include "core/assembly.h"
 #include "core/logging.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "feedback/vocabulary.h"
 #include "platform/defaults.h"
 #include "platform/notification_center.h"
@@ -57,9 +56,10 @@ void ClientSessionShared::enumerateSessionsUsingBlock(const std::function<void(C
 // ---- ClientSessionManager -------------------------------------------------------------------
 
 ClientSessionManager::ClientSessionManager(Assembly& assembly, std::shared_ptr<TavixUserGUIDController> guidController,
-                                           std::string identifier)
+                                           std::shared_ptr<TVXInMemoryBagSource> bag, std::string identifier)
     : assembly_(assembly),
       guidController_(std::move(guidController)),
+      bag_(std::move(bag)),
       identifier_(std::move(identifier)),
       sessionQueue_(*assembly.dispatchPool, "com.norvel.tavixd.clientSessionManagerQueue") {
   const std::int64_t soft = assembly.userDefaults->integerForKey("TVXSessionSoftLimitOverride");
@@ -148,8 +148,8 @@ void ClientSessionManager::reportErrorAsTavixdFeedback(int code, const std::stri
 
 bool ClientSessionManager::feedbackEnabledFor(const std::string& userAgent) const {
   // Without a bag nothing says no: feedback is kept until the first bag arrives.
-  if (!assembly_.bagController) return true;
-  auto bag = assembly_.bagController->inMemoryBag();
+  if (!bag_) return true;
+  auto bag = bag_->inMemoryBag();
   if (!bag) return true;
   return TVXBag(bag->sharedRawBag(), userAgent).feedbackEnabled();
 }

@@ -23,6 +23,7 @@
 namespace tavix {
 
 class TavixUserGUIDController;
+class TVXInMemoryBagSource;
 
 
 // One session per client user agent, opened and closed together (shared sessions).
@@ -58,9 +59,10 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
     kSentinelFeedback = 6,
   };
 
-  // Reads "TVXSessionSoftLimitOverride" and "TVXSessionIdleTimeOverride" once.
+  // Reads "TVXSessionSoftLimitOverride" and "TVXSessionIdleTimeOverride" once. `bag` (the bag
+  // controller) says whether a client's feedback is enabled; without one, all of it is.
   ClientSessionManager(Assembly& assembly, std::shared_ptr<TavixUserGUIDController> guidController,
-                       std::string identifier);
+                       std::shared_ptr<TVXInMemoryBagSource> bag, std::string identifier);
   ~ClientSessionManager();
   ClientSessionManager(const ClientSessionManager&) = delete;
   ClientSessionManager& operator=(const ClientSessionManager&) = delete;
@@ -112,6 +114,7 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
 
   Assembly& assembly_;
   std::shared_ptr<TavixUserGUIDController> guidController_;
+  std::shared_ptr<TVXInMemoryBagSource> bag_;
   std::string identifier_;
   std::shared_ptr<ClientSession> single_;         // open session (individual mode)
   std::shared_ptr<ClientSessionShared> shared_;   // open session (shared mode)

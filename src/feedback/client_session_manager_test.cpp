@@ -33,7 +33,7 @@ struct ManagerFixture {
                                              {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
     assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
     guid = std::make_shared<TavixUserGUIDController>(assembly);
-    manager = std::make_shared<ClientSessionManager>(assembly, guid, "tavix");
+    manager = std::make_shared<ClientSessionManager>(assembly, guid, nullptr, "tavix");
   }
   ~ManagerFixture() { pool.drain(); }
 

@@ -20,7 +20,7 @@
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/transactions.h"
@@ -123,8 +123,8 @@ std::optional<platform::TimePoint> creationDate(const fs::path& path, std::strin
 }  // namespace
 
 std::string sessionFileVersion(const DeviceInformation& device) {
-  return fmt::format("{} ({}; {} {}) {}", kTVXTavixdNameVersion, device.answer("ProductType"),
-                     device.answer("ProductName"), device.answer("ProductVersion"), kTVXTavixdNameVersion);
+  return fmt::format("{} ({}; {} {}) {}", kTVXTavixdNameVersion, device.answer("Model"),
+                     device.answer("OSName"), device.answer("OSVersion"), kTVXTavixdNameVersion);
 }
 
 const std::string& tavixdSessionFileVersion() {

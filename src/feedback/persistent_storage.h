@@ -50,8 +50,8 @@ class SessionFileIO {
 };
 
 // What a session file carries as its version: the daemon's name and version and the device text
-// of its user agent without the kernel release, "<daemon> (<ProductType>; <ProductName>
-// <ProductVersion>) <daemon>". A kernel update keeps the files waiting to be sent; a daemon
+// of its user agent without the kernel release, "<daemon> (<Model>; <OSName>
+// <OSVersion>) <daemon>". A kernel update keeps the files waiting to be sent; a daemon
 // upgrade (or a new OS release) discards them, since their records may differ.
 std::string sessionFileVersion(const DeviceInformation& device);
 // sessionFileVersion() of this machine, made once.

@@ -13,7 +13,7 @@
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "feedback/tavix_feedback.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/counters.h"
 #include "platform/defaults.h"

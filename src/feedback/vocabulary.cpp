@@ -1,4 +1,5 @@
 #include "feedback/vocabulary.h"
+#include "platform/strings.h"
 
 #include <fmt/core.h>
 
@@ -102,8 +103,7 @@ std::string sessionEndReasonName(int reason) {
 
 int featureTypeFromString(std::string_view text) {
   if (text == "domain" || text == "tld") return 0;
-  std::string lower(text);
-  std::transform(lower.begin(), lower.end(), lower.begin(), [](unsigned char c) { return std::tolower(c); });
+  const std::string lower = platform::asciiLowercased(text);
   if (lower == "mediatype" || text == "mt") return 1;
   if (text == "topic") return 2;
   return 3;

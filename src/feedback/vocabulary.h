@@ -176,6 +176,9 @@ enum TavixFeedbackTypeNumber : int {
   kFeedbackTypeResultEngagement = 7,
   kFeedbackTypeVisibleResults = 8,
   kFeedbackTypeCardEngagement = 10,
+  kFeedbackTypeNetworkSearchStart = 14,
+  kFeedbackTypeNetworkSearchEnd = 15,
+  kFeedbackTypeLocalSearchStart = 16,
   kFeedbackTypeError = 18,
   kFeedbackTypeSuggestionEngagement = 20,
   kFeedbackTypeCodableFallback = 21,  // what a record without its own type reports
@@ -183,6 +186,7 @@ enum TavixFeedbackTypeNumber : int {
   kFeedbackTypeSessionMissingSuggestions = 31,
   kFeedbackTypeConnectionInvalidated = 34,
   kFeedbackTypeSessionEnd = 36,
+  kFeedbackTypeSkipSearch = 38,
 };
 
 // The wire name of an event type number: "rank_sections" for both 3 and 4, "last_" for 103, and

@@ -43,6 +43,8 @@ class LocationManager;
 class MotionManager;
 class RoutineManager;
 class TVXBag;
+class TavixURLRequestBuilder;
+struct TVXLocation;
 
 // Who knows the bag endpoint: the bag controller.
 class TVXBagURLSource {
@@ -166,10 +168,37 @@ class TVXNetworkRequestFactory : public std::enable_shared_from_this<TVXNetworkR
  private:
   struct Context;
   class Delegate;
-  class Builder;
 
   TVXNetworkRequestFactory(Assembly& assembly, TVXRequestFactoryProviders providers);
   void start();
+
+  // ---- The request context (request_context.cpp), on the context queue.
+  void setNoLocationReason(std::string reason);
+  void initLocationServices();
+  bool hasRecentFix();
+  void startUpdatingLocation();
+  void startUpdatingMotionActivity();
+  void setLocation(const TVXLocation& fix);
+  void setLocationIfAllowedByBag(const TVXLocation& fix);
+  void setupDebuggingQueryItems();
+  void readDefaults();
+  bool updateLocaleContexts();
+  void notifyBagRefreshRequired();
+  void didGetBag(std::shared_ptr<const TVXBag> bag);
+  void loadInstalledDictionaries(bool quietWhenMissing);
+  void updateVisibility(const TVXBag& bag);
+  void onDefaultsChanged(const std::string& key);
+
+  // ---- The recipes' shared steps (request_factory.cpp), on the context queue.
+  void addLocaleItems(TavixURLRequestBuilder& b, const TVXRequest& request);
+  void addDictionaries(TavixURLRequestBuilder& b);
+  void addSilhouette(TavixURLRequestBuilder& b, const std::optional<TVXEngagedSuggestion>& engaged);
+  void addLocationItems(TavixURLRequestBuilder& b, const TVXBag& bag, std::uint64_t fieldMask);
+  void addTrailingItems(TavixURLRequestBuilder& b, const TVXRequest& request, const TVXBag& bag, const std::string& userGuid);
+  std::optional<TavixURLRequestBuilder> begin(const std::optional<std::string>& url);
+  void addRequestAndDebugItems(TavixURLRequestBuilder& b, const TVXRequest& request);
+  void addGeoMetadata(TavixURLRequestBuilder& b);
+  Request bagRequest(TVXBagURLSource& source, const std::optional<std::string>& userAgent, const std::optional<std::string>& version, bool forCache);
 
   Assembly& assembly_;
   TVXRequestFactoryProviders providers_;

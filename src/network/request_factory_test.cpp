@@ -5,10 +5,11 @@
 #include <atomic>
 #include <map>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "context/location.h"
 #include "context/motion.h"
 #include "core/assembly.h"
+#include "platform/http/url.h"
 #include "network/url_request_builder.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
@@ -85,7 +86,7 @@ std::map<std::string, std::string> queryOf(const std::string& url, std::vector<s
     std::string part = query.substr(pos, amp == std::string::npos ? std::string::npos : amp - pos);
     auto eq = part.find('=');
     std::string name = part.substr(0, eq);
-    items[name] = eq == std::string::npos ? "" : TVXPercentDecode(part.substr(eq + 1));
+    items[name] = eq == std::string::npos ? "" : platform::http::percentDecode(part.substr(eq + 1));
     if (names) names->push_back(name);
     if (amp == std::string::npos) break;
     pos = amp + 1;

@@ -19,8 +19,8 @@ namespace tavix {
 
 class TavixURLRequestBuilder {
  public:
-  // Parses an absolute URL (scheme "://" authority [path] [?query] [#fragment]) and forces every
-  // query item it already carries (percent-decoded). Empty when the URL does not parse.
+  // Parses an absolute URL (platform::http::URL) and forces every query item it already carries
+  // (percent-decoded). Empty when the URL does not parse.
   static std::optional<TavixURLRequestBuilder> requestBuilderWithURL(std::string_view url);
 
   void forceQueryItem(const TVXQueryItem& item);
@@ -51,10 +51,5 @@ class TavixURLRequestBuilder {
   std::map<std::string, std::optional<std::string>> queryItems_;
   platform::http::HeaderFields httpHeaders_;
 };
-
-// Percent-encodes every byte but ASCII letters, digits and "-_.~".
-std::string TVXPercentEncode(std::string_view text);
-// Decodes %XX escapes; a malformed escape is kept as it stands.
-std::string TVXPercentDecode(std::string_view text);
 
 }  // namespace tavix

@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include "platform/http/url.h"
+
 namespace tavix {
 namespace {
 
@@ -16,7 +18,7 @@ TEST(TavixURLRequestBuilder, SortsByNameAndEncodesStrictly) {
   b->forceQueryItemWithName("q", "a b+c&d=e/f~g-h_i.j\xc3\xa9");
   b->forceQueryItemWithName("flag", std::nullopt);
   EXPECT_EQ(urlOf(*b), "https://s.example/search?Z=0&a=1&b=2&flag&q=a%20b%2Bc%26d%3De%2Ff~g-h_i.j%C3%A9");
-  EXPECT_EQ(TVXPercentEncode("*'()!"), "%2A%27%28%29%21");
+  EXPECT_EQ(platform::http::percentEncode("*'()!"), "%2A%27%28%29%21");
 }
 
 TEST(TavixURLRequestBuilder, DefaultKeepsTheFirstAndForceTakesTheLast) {
@@ -50,7 +52,7 @@ TEST(TavixURLRequestBuilder, ParsesOnlyAbsoluteURLs) {
   auto plain = TavixURLRequestBuilder::requestBuilderWithURL("http://127.0.0.1:8080");
   ASSERT_TRUE(plain);
   EXPECT_EQ(urlOf(*plain), "http://127.0.0.1:8080");
-  EXPECT_EQ(TVXPercentDecode("a%2Bb%zz%4"), "a+b%zz%4");
+  EXPECT_EQ(platform::http::percentDecode("a%2Bb%zz%4"), "a+b%zz%4");
 }
 
 }  // namespace

@@ -55,7 +55,12 @@ bool UserDefaults::save(const Dictionary& values) {
     if (log_) log_->error("cannot create defaults folder {}: {}", folder_.string(), ec.message());
     return false;
   }
-  if (auto ec = writeFileAtomically(filePath(), toXmlPlist(PropertyValue(values)), 0600)) {
+  const PropertyValue plist(values);
+  if (!plistCanHold(plist)) {
+    if (log_) log_->error("cannot write defaults {}: a string holds U+0000", filePath().string());
+    return false;
+  }
+  if (auto ec = writeFileAtomically(filePath(), toXmlPlist(plist), 0600)) {
     if (log_) log_->error("cannot write defaults {}: {}", filePath().string(), ec.message());
     return false;
   }

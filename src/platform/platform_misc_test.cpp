@@ -22,6 +22,7 @@ TEST(PropertyList, BinaryAndXmlRoundTripEveryType) {
       {"real", PropertyValue(-2.5)},
       {"flag", PropertyValue(false)},
       {"text", PropertyValue("ü & <x>")},
+      {"controls", PropertyValue("tab\t cr\r lf\n bell\x07 unit\x1f")},
       {"when", PropertyValue(Date{fromUnixSeconds(1767225600)})},
       {"blob", PropertyValue(PropertyValue::Data{1, 2, 3, 4})},
       {"list", PropertyValue(PropertyValue::Array{PropertyValue(Dictionary{}), PropertyValue(PropertyValue::Array{})})},
@@ -32,6 +33,11 @@ TEST(PropertyList, BinaryAndXmlRoundTripEveryType) {
   auto fromBinary = parsePlist(toBinaryPlist(value));
   ASSERT_TRUE(fromBinary);
   EXPECT_EQ(*fromBinary, value);
+
+  // Neither form keeps U+0000: such values are refused, not cut short.
+  EXPECT_TRUE(plistCanHold(value));
+  EXPECT_FALSE(plistCanHold(PropertyValue(PropertyValue::Array{PropertyValue(std::string("a\0b", 3))})));
+  EXPECT_FALSE(plistCanHold(PropertyValue(Dictionary{{std::string("k\0y", 3), PropertyValue(1)}})));
 }
 
 TEST(PropertyList, GarbageDeepNestingAndNulsAreRejectedWithoutAborting) {

@@ -87,13 +87,23 @@ std::string base64(const PropertyValue::Data& data) {
   return out;
 }
 
+// Control characters go as character references, which read back as they were (a raw one would
+// make the file malformed, and a raw CR would come back as LF). U+0000 has no XML form at all:
+// plistCanHold refuses it before anything is written.
 void escape(std::string& out, std::string_view text) {
   for (char c : text) {
     switch (c) {
       case '&': out += "&amp;"; break;
       case '<': out += "&lt;"; break;
       case '>': out += "&gt;"; break;
-      default: out += c;
+      case '\t':
+      case '\n': out += c; break;
+      default:
+        if (static_cast<unsigned char>(c) < 0x20) {
+          out += fmt::format("&#x{:x};", static_cast<unsigned char>(c));
+        } else {
+          out += c;
+        }
     }
   }
 }
@@ -261,6 +271,24 @@ std::optional<PropertyValue> fromNode(plist_t node, int depth) {
 }
 
 }  // namespace
+
+bool plistCanHold(const PropertyValue& value) {
+  constexpr std::string_view kNul("\0", 1);
+  switch (value.type()) {
+    case PropertyValue::Type::String: return value.string()->find(kNul) == std::string::npos;
+    case PropertyValue::Type::Array:
+      for (const auto& item : *value.array()) {
+        if (!plistCanHold(item)) return false;
+      }
+      return true;
+    case PropertyValue::Type::Dictionary:
+      for (const auto& [key, item] : *value.dictionary()) {
+        if (key.find(kNul) != std::string::npos || !plistCanHold(item)) return false;
+      }
+      return true;
+    default: return true;
+  }
+}
 
 std::string toXmlPlist(const PropertyValue& value) {
   std::string out =

@@ -66,6 +66,10 @@ class PropertyValue {
 using Dictionary = PropertyValue::Dictionary;
 
 // Property-list files. XML is what people edit (defaults); binary is compact (caches).
+// Neither form can keep a string or key that holds U+0000 (libplist's strings end there, XML has
+// no way to write it): writers of values from outside ask plistCanHold first and refuse, rather
+// than store a string cut short.
+bool plistCanHold(const PropertyValue& value);
 std::string toXmlPlist(const PropertyValue& value);
 std::string toBinaryPlist(const PropertyValue& value);
 // Reads either form; empty for anything that is not a well-formed property list.

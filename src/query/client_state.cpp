@@ -6,14 +6,14 @@
 #include <chrono>
 
 #include "bag/tavix_bag_controller.h"
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "cache/query_cache.h"
 #include "context/user_guid_controller.h"
 #include "core/assembly.h"
 #include "core/logging.h"
 #include "core/names.h"
 #include "feedback/client_session_manager.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
@@ -55,7 +55,7 @@ ClientState::ClientState(Assembly& assembly, std::string identifier)
     guidController_ = std::make_shared<TavixUserGUIDController>(assembly_);
     sessionLog().debug("Tavix is using individual instance of guid controller {}",
                        static_cast<const void*>(guidController_.get()));
-    sessionManager_ = std::make_shared<ClientSessionManager>(assembly_, guidController_, identifier_);
+    sessionManager_ = std::make_shared<ClientSessionManager>(assembly_, guidController_, assembly_.bagController, identifier_);
   }
 }
 
@@ -93,7 +93,7 @@ std::optional<platform::TimePoint> ClientState::lastNetworkRequest() const {
 }
 
 void ClientState::markNetworkRequest() {
-  const auto now = assembly_.clock ? assembly_.clock->now() : platform::TimePoint{};
+  const auto now = assembly_.clock->now();
   std::lock_guard lock(mutex_);
   lastNetworkRequest_ = now;
 }

@@ -51,6 +51,8 @@ struct URLSessionTaskMetrics;
 
 // The domain of the error that comes with a reply body that is not JSON.
 inline constexpr const char* kTVXJSONErrorDomain = "TavixJSONErrorDomain";
+// Its one code: the text could not be read as the JSON expected.
+inline constexpr long kTVXJSONErrorCodeNotJSON = 3840;
 // The domain of a server's HTTP status that failed a request (the code is the status), kept apart
 // from kTVXErrorDomain, whose codes are the daemon's own.
 inline constexpr const char* kTVXHTTPStatusErrorDomain = "TavixHTTPStatusErrorDomain";
@@ -164,8 +166,41 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   std::optional<std::string> geoSessionEntityString();
   std::string currentUserGuid();
 
+  // ---- The steps of search() (client_state_search.cpp)
+  // The engaged completions for the input: the first is kept for the keystroke (and remembered
+  // for the next ones), the rest go back with the reply.
+  struct LocalCompletions {
+    std::vector<std::string> kept;
+    std::vector<std::string> others;
+  };
+  LocalCompletions localCompletionsForSearch(const TVXSearchRequest& request, const TVXBag& bag);
+  // Answers from the query cache when it holds this request; records the hit.
+  bool answerSearchFromQueryCache(const TVXSearchRequest& request, const platform::http::URLRequest& httpRequest,
+                                  const std::vector<std::string>& localSuggestions, const TVXReplyBlock& reply);
+  void sendSearch(std::shared_ptr<const TVXSearchRequest> request, TVXReplyBlock reply,
+                  std::shared_ptr<const platform::http::URLRequest> httpRequest,
+                  std::vector<std::string> localSuggestions);
+  struct SearchResponse {
+    std::string data;
+    std::optional<platform::http::HTTPURLResponse> response;
+    std::optional<platform::http::URLError> error;
+  };
+  void searchResponseArrived(const TVXSearchRequest& request, const TVXReplyBlock& reply,
+                             const platform::http::URLRequest& httpRequest, const StartRecord& start,
+                             const std::vector<std::string>& localSuggestions, const SearchResponse& answer,
+                             const platform::http::URLSessionTaskMetrics& timing);
+
   // ---- The kinds besides search (client_state_queries.cpp)
   void performQuery(const ClientStateQueryKind& kind, std::shared_ptr<const TVXRequest> request, TVXReplyBlock reply);
+  // The steps of performQuery(). The bag to build with; false when the query was answered
+  // already (no bag could be had, or the bag is disabled).
+  bool bagForQuery(const ClientStateQueryKind& kind, const TVXRequest& request, const TVXReplyBlock& reply,
+                   std::shared_ptr<const TVXBag>* bag);
+  StartRecord startRecordForQuery(const ClientStateQueryKind& kind, const TVXRequest& request,
+                                  const platform::http::URLRequest& httpRequest);
+  void queryResponseArrived(const ClientStateQueryKind& kind, const TVXRequest& request, const TVXReplyBlock& reply,
+                            const platform::http::URLRequest& httpRequest, const StartRecord& start,
+                            SearchResponse answer, const platform::http::URLSessionTaskMetrics& timing);
   void debugFlightSearch(const TVXFlightSearchRequest& request, const TVXReplyBlock& reply);
 
   Assembly& assembly_;

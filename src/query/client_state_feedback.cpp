@@ -6,7 +6,7 @@
 #include <cctype>
 
 #include "bag/tavix_bag_controller.h"
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "context/location.h"
 #include "context/user_guid_controller.h"
 #include "core/assembly.h"
@@ -17,13 +17,14 @@
 #include "feedback/vocabulary.h"
 #include "network/request_factory.h"
 #include "network/retryable_request.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/http/url_session.h"
 #include "platform/json_value.h"
 #include "query/client_state.h"
 #include "query/client_state_internal.h"
 #include "tavix_proto/feedback_records.pb.h"
+#include "platform/strings.h"
 
 namespace tavix {
 
@@ -86,8 +87,7 @@ void ClientState::recordSkipSearch(int reason, const std::string& input, std::ui
 void ClientState::recordDidGoToSearch(const TVXRequest& request, const std::string& input) {
   const auto agent = userAgent();
   if (!agent || request.triggerEvent != proto::TriggerSearchRequestEvent::return_key) return;
-  std::string lower = *agent;
-  std::transform(lower.begin(), lower.end(), lower.begin(), [](unsigned char c) { return std::tolower(c); });
+  const std::string lower = platform::asciiLowercased(*agent);
   if (lower.find("messages") == std::string::npos) return;
   proto::CTDidGoToSearchFeedback didGo;
   didGo.set_timestamp(eventTimestamp(assembly_));
@@ -202,7 +202,7 @@ void ClientState::warm() {
     searchLog().debug("warm not required, bag fetch in process");
     return;
   }
-  const auto now = assembly_.clock ? assembly_.clock->now() : platform::TimePoint{};
+  const auto now = assembly_.clock->now();
   {
     std::lock_guard lock(mutex_);
     if (lastNetworkRequest_ && now - *lastNetworkRequest_ < platform::seconds(30)) {

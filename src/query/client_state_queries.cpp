@@ -8,7 +8,7 @@
 #include <fstream>
 #include <sstream>
 
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "core/assembly.h"
 #include "core/logging.h"
 #include "core/names.h"
@@ -17,6 +17,7 @@
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
+#include "platform/http/url.h"
 #include "platform/http/url_session.h"
 #include "platform/json_value.h"
 #include "query/client_state.h"
@@ -64,26 +65,15 @@ namespace {
 
 std::string emptyInput(const TVXRequest&, const URLRequest&) { return {}; }
 
-// The value of the "q" item of the built URL, decoded.
+// The value of the "q" item of the built URL, decoded ("+" is a blank).
 std::string queryItemQ(const TVXRequest&, const URLRequest& http) {
-  const auto question = http.url.find('?');
-  if (question == std::string::npos) return {};
-  std::istringstream items(http.url.substr(question + 1));
-  for (std::string item; std::getline(items, item, '&');) {
-    if (item.rfind("q=", 0) != 0) continue;
-    std::string out;
-    for (std::size_t i = 2; i < item.size(); ++i) {
-      if (item[i] == '+') {
-        out += ' ';
-      } else if (item[i] == '%' && i + 2 < item.size() && std::isxdigit(static_cast<unsigned char>(item[i + 1])) &&
-                 std::isxdigit(static_cast<unsigned char>(item[i + 2]))) {
-        out += static_cast<char>(std::stoi(item.substr(i + 1, 2), nullptr, 16));
-        i += 2;
-      } else {
-        out += item[i];
-      }
-    }
-    return out;
+  const auto url = platform::http::URL::parse(http.url);
+  const auto query = url ? url->query() : std::nullopt;
+  if (!query) return {};
+  std::string plusAsBlank = *query;
+  for (std::size_t at = 0; (at = plusAsBlank.find('+', at)) != std::string::npos;) plusAsBlank.replace(at, 1, "%20");
+  for (const auto& [name, value] : platform::http::decodedQueryItems(plusAsBlank)) {
+    if (name == "q") return value.value_or("");
   }
   return {};
 }
@@ -123,32 +113,10 @@ void ClientState::flightSearch(std::shared_ptr<const TVXFlightSearchRequest> req
 void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr<const TVXRequest> request,
                                TVXReplyBlock reply) {
   auto& log = TavixLogForCategory(kind.category);
-  const std::uint64_t queryId = request->queryId;
   log.notice(fmt::runtime(kind.performing), identifier_, static_cast<const void*>(&reply));
 
   std::shared_ptr<const TVXBag> bag;
-  if (kind.ensuresBag) {
-    // The recorded input of these kinds does not depend on the built request.
-    const std::string input = kind.input(*request, URLRequest{});
-    if (!ensureBag()) {
-      log.error(fmt::runtime(kind.bagFailed));
-      recordSkipSearch(proto::SkipSearchType::bag_fetch_failed, input, queryId);
-      reply(queryId, std::nullopt, TVXError{kTVXErrorDomain, 1, "timeout"});
-      return;
-    }
-    bag = currentBag();
-    if (!bag->isEnabled()) {
-      log.notice(fmt::runtime(kind.bagDisabled));
-      recordSkipSearch(proto::SkipSearchType::bag_disabled, input, queryId);
-      reply(queryId, std::nullopt, std::nullopt);
-      return;
-    }
-  } else {
-    // These kinds follow a result the client already has, so they never wait for a bag: without
-    // one there is no URL to ask.
-    bag = currentBag();
-  }
-
+  if (!bagForQuery(kind, *request, reply, &bag)) return;
   auto built = assembly_.requestFactory && bag
                    ? kind.build(*assembly_.requestFactory, *request, *bag, currentUserGuid())
                    : std::nullopt;
@@ -159,101 +127,18 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
   const auto httpRequest = std::make_shared<const URLRequest>(std::move(*built));
   TavixLogForCategory(TavixLoggingCategoryProtocol)
       .info(fmt::runtime(kind.requestLog), httpRequest->url, query_internal::headersText(httpRequest->headers));
-  const std::string input = kind.input(*request, *httpRequest);
-  if (kind.messagesRule) recordDidGoToSearch(*request, input);
+  if (kind.messagesRule) recordDidGoToSearch(*request, kind.input(*request, *httpRequest));
 
-  StartRecord start;
-  if (kind.startWithoutUUID) {
-    start = std::make_shared<proto::CTStartNetworkSearchFeedback>();
-    start->set_timestamp(query_internal::eventTimestamp(assembly_));
-    start->set_url(httpRequest->url);
-    for (const auto& [name, value] : httpRequest->headers.all()) (*start->mutable_headers())[name] = value;
-  } else {
-    start = startSearchEventForRequest(*httpRequest);
-  }
-  start->set_input(input);
-  start->set_trigger_event(
-      static_cast<proto::TriggerSearchRequestEvent::Value>(kind.triggerEvent.value_or(request->triggerEvent)));
-  start->set_endpoint_type(static_cast<proto::EndpointType::Value>(kind.endpoint));
-  if (const auto* lookup = dynamic_cast<const TVXLookupRequest*>(request.get())) {
-    start->set_lookup_selection_type(lookup->lookupSelectionType == TVXLookupSelectionTypeExplicit
-                                         ? proto::LookupSelectionType::lookup_explicit
-                                     : lookup->lookupSelectionType == TVXLookupSelectionTypeHint
-                                         ? proto::LookupSelectionType::lookup_hint_tap
-                                         : proto::LookupSelectionType::lookup_default);
-  }
-  addCodable(*start, queryId, false);
+  const StartRecord start = startRecordForQuery(kind, *request, *httpRequest);
+  addCodable(*start, request->queryId, false);
   if (kind.dispatching[0] != '\0') log.notice(fmt::runtime(kind.dispatching));
 
   auto self = shared_from_this();
   auto completion = [self, &kind, request, reply, httpRequest, start](
                         std::string data, std::optional<HTTPURLResponse> response, std::optional<URLError> error,
                         const platform::http::URLSessionTaskMetrics& timing) {
-    auto& log = TavixLogForCategory(kind.category);
-    const std::uint64_t queryId = request->queryId;
-    const long status = response ? response->statusCode : 0;
-    if (response) self->recordSearchResult(status);
-    if (kind.gotResponse[0] != '\0') log.notice(fmt::runtime(kind.gotResponse));
-    TavixLogForCategory(TavixLoggingCategoryProtocol)
-        .info("resp: {}", response ? fmt::format("{} {}", status, response->url) : std::string("none"));
-
-    std::optional<TVXError> transport;
-    if (error) transport = TVXError{error->domain, error->code, error->description};
-    std::optional<TVXError> jsonError;
-    if (kind.requiresListWith200) {
-      if (error || status != 200) {
-        log.error("{}", fmt::format(fmt::runtime(kind.fetchFailed), status,
-                                    error ? error->description : std::string("none")));
-        // The server's status is not one of the daemon's own codes: it travels in a domain of its own.
-        const TVXError statusError{kTVXHTTPStatusErrorDomain, status, fmt::format("statusCode {}", status)};
-        reply(queryId, std::nullopt, transport ? *transport : statusError);
-        self->failSearchFeedback(transport, *request, start, data.size(), status, timing);
-        return;
-      }
-      std::string parseError;
-      const auto parsed = platform::parseJson(data, &parseError);
-      if (!parsed || !parsed->array()) {
-        log.error("Failed to deserialize card details for into a dictionary. Error: {}. Response data: \"{}\"",
-                  parsed ? std::string("not a list") : parseError, data);
-        reply(queryId, std::nullopt, TVXError{kTVXJSONErrorDomain, 3840, "not a list"});
-        self->failSearchFeedback(std::nullopt, *request, start, data.size(), status, timing);
-        return;
-      }
-      self->endNetworkFeedback(start, data, data.size(), 200, timing, queryId);
-    } else {
-      if (error || data.empty()) {
-        log.error("error with request {}", httpRequest->url);
-        reply(queryId, std::nullopt, transport);
-        self->failSearchFeedback(transport, *request, start, data.size(), status, timing);
-        return;
-      }
-      if (!response) {
-        log.error("not http response? {}", httpRequest->url);
-        TVXError failure{kTVXErrorDomain, 500, "invalid response class"};
-        reply(queryId, std::nullopt, failure);
-        self->failSearchFeedback(failure, *request, start, data.size(), status, timing);
-        return;
-      }
-      // Flight answers are not JSON; the others pass a body that does not parse on to the client
-      // with the parse error, as a search does.
-      if (kind.endpoint != proto::EndpointType::tavix_flight) {
-        std::string parseError;
-        if (!platform::parseJson(data, &parseError)) {
-          jsonError = TVXError{kTVXJSONErrorDomain, 3840, parseError.empty() ? "not JSON" : parseError};
-        }
-      }
-      self->endNetworkFeedback(start, data, data.size(), status, timing, queryId);
-    }
-
-    TVXReply answer;
-    answer.scale = request->scale;
-    if (request->verboseReply) {
-      answer.httpRequest = *httpRequest;
-      answer.httpResponse = response;
-    }
-    answer.data = std::move(data);
-    answer.geoSessionEntityString = self->geoSessionEntityString();
-    reply(queryId, std::move(answer), jsonError);
+    self->queryResponseArrived(kind, *request, reply, *httpRequest, start,
+                               SearchResponse{std::move(data), std::move(response), std::move(error)}, timing);
   };
 
   const auto proxy = proxyForTask();
@@ -272,6 +157,132 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
   task->resume();
   if (kind.setsPerformedSearch) setPerformedSearch();
   markNetworkRequest();
+}
+
+bool ClientState::bagForQuery(const ClientStateQueryKind& kind, const TVXRequest& request, const TVXReplyBlock& reply,
+                              std::shared_ptr<const TVXBag>* bag) {
+  if (!kind.ensuresBag) {
+    // These kinds follow a result the client already has, so they never wait for a bag: without
+    // one there is no URL to ask.
+    *bag = currentBag();
+    return true;
+  }
+  auto& log = TavixLogForCategory(kind.category);
+  // The recorded input of these kinds does not depend on the built request.
+  const std::string input = kind.input(request, URLRequest{});
+  if (!ensureBag()) {
+    log.error(fmt::runtime(kind.bagFailed));
+    recordSkipSearch(proto::SkipSearchType::bag_fetch_failed, input, request.queryId);
+    reply(request.queryId, std::nullopt, TVXError{kTVXErrorDomain, 1, "timeout"});
+    return false;
+  }
+  *bag = currentBag();
+  if (!(*bag)->isEnabled()) {
+    log.notice(fmt::runtime(kind.bagDisabled));
+    recordSkipSearch(proto::SkipSearchType::bag_disabled, input, request.queryId);
+    reply(request.queryId, std::nullopt, std::nullopt);
+    return false;
+  }
+  return true;
+}
+
+ClientState::StartRecord ClientState::startRecordForQuery(const ClientStateQueryKind& kind, const TVXRequest& request,
+                                                          const URLRequest& httpRequest) {
+  StartRecord start;
+  if (kind.startWithoutUUID) {
+    start = std::make_shared<proto::CTStartNetworkSearchFeedback>();
+    start->set_timestamp(query_internal::eventTimestamp(assembly_));
+    start->set_url(httpRequest.url);
+    for (const auto& [name, value] : httpRequest.headers.all()) (*start->mutable_headers())[name] = value;
+  } else {
+    start = startSearchEventForRequest(httpRequest);
+  }
+  start->set_input(kind.input(request, httpRequest));
+  start->set_trigger_event(
+      static_cast<proto::TriggerSearchRequestEvent::Value>(kind.triggerEvent.value_or(request.triggerEvent)));
+  start->set_endpoint_type(static_cast<proto::EndpointType::Value>(kind.endpoint));
+  if (const auto* lookup = dynamic_cast<const TVXLookupRequest*>(&request)) {
+    start->set_lookup_selection_type(lookup->lookupSelectionType == TVXLookupSelectionTypeExplicit
+                                         ? proto::LookupSelectionType::lookup_explicit
+                                     : lookup->lookupSelectionType == TVXLookupSelectionTypeHint
+                                         ? proto::LookupSelectionType::lookup_hint_tap
+                                         : proto::LookupSelectionType::lookup_default);
+  }
+  return start;
+}
+
+void ClientState::queryResponseArrived(const ClientStateQueryKind& kind, const TVXRequest& request,
+                                       const TVXReplyBlock& reply, const URLRequest& httpRequest,
+                                       const StartRecord& start, SearchResponse answer,
+                                       const platform::http::URLSessionTaskMetrics& timing) {
+  auto& log = TavixLogForCategory(kind.category);
+  const std::uint64_t queryId = request.queryId;
+  const auto& response = answer.response;
+  const auto& error = answer.error;
+  std::string& data = answer.data;
+  const long status = response ? response->statusCode : 0;
+  if (response) recordSearchResult(status);
+  if (kind.gotResponse[0] != '\0') log.notice(fmt::runtime(kind.gotResponse));
+  TavixLogForCategory(TavixLoggingCategoryProtocol)
+      .info("resp: {}", response ? fmt::format("{} {}", status, response->url) : std::string("none"));
+
+  std::optional<TVXError> transport;
+  if (error) transport = TVXError{error->domain, error->code, error->description};
+  std::optional<TVXError> jsonError;
+  if (kind.requiresListWith200) {
+    if (error || status != 200) {
+      log.error("{}", fmt::format(fmt::runtime(kind.fetchFailed), status,
+                                  error ? error->description : std::string("none")));
+      // The server's status is not one of the daemon's own codes: it travels in a domain of its own.
+      const TVXError statusError{kTVXHTTPStatusErrorDomain, status, fmt::format("statusCode {}", status)};
+      reply(queryId, std::nullopt, transport ? *transport : statusError);
+      failSearchFeedback(transport, request, start, data.size(), status, timing);
+      return;
+    }
+    std::string parseError;
+    const auto parsed = platform::parseJson(data, &parseError);
+    if (!parsed || !parsed->array()) {
+      log.error("Failed to deserialize card details for into a dictionary. Error: {}. Response data: \"{}\"",
+                parsed ? std::string("not a list") : parseError, data);
+      reply(queryId, std::nullopt, TVXError{kTVXJSONErrorDomain, kTVXJSONErrorCodeNotJSON, "not a list"});
+      failSearchFeedback(std::nullopt, request, start, data.size(), status, timing);
+      return;
+    }
+    endNetworkFeedback(start, data, data.size(), 200, timing, queryId);
+  } else {
+    if (error || data.empty()) {
+      log.error("error with request {}", httpRequest.url);
+      reply(queryId, std::nullopt, transport);
+      failSearchFeedback(transport, request, start, data.size(), status, timing);
+      return;
+    }
+    if (!response) {
+      log.error("not http response? {}", httpRequest.url);
+      TVXError failure{kTVXErrorDomain, 500, "invalid response class"};
+      reply(queryId, std::nullopt, failure);
+      failSearchFeedback(failure, request, start, data.size(), status, timing);
+      return;
+    }
+    // Flight answers are not JSON; the others pass a body that does not parse on to the client
+    // with the parse error, as a search does.
+    if (kind.endpoint != proto::EndpointType::tavix_flight) {
+      std::string parseError;
+      if (!platform::parseJson(data, &parseError)) {
+        jsonError = TVXError{kTVXJSONErrorDomain, kTVXJSONErrorCodeNotJSON, parseError.empty() ? "not JSON" : parseError};
+      }
+    }
+    endNetworkFeedback(start, data, data.size(), status, timing, queryId);
+  }
+
+  TVXReply result;
+  result.scale = request.scale;
+  if (request.verboseReply) {
+    result.httpRequest = httpRequest;
+    result.httpResponse = response;
+  }
+  result.data = std::move(data);
+  result.geoSessionEntityString = geoSessionEntityString();
+  reply(queryId, std::move(result), jsonError);
 }
 
 // Answers from a local JSON file instead of the server: a list (or a single object) of flights,
@@ -296,7 +307,7 @@ void ClientState::debugFlightSearch(const TVXFlightSearchRequest& request, const
   const auto parsed = platform::parseJson(text.str(), &parseError);
   if (!parsed || (!parsed->array() && !parsed->dictionary())) {
     log.error("Failed to parse flight test data json. Error: {}", parseError.empty() ? "not a list" : parseError);
-    reply(request.queryId, std::nullopt, TVXError{kTVXJSONErrorDomain, 3840, "flight test data is not JSON"});
+    reply(request.queryId, std::nullopt, TVXError{kTVXJSONErrorDomain, kTVXJSONErrorCodeNotJSON, "flight test data is not JSON"});
     return;
   }
   auto squeeze = [](std::string s) {

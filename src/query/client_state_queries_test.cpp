@@ -9,7 +9,7 @@
 #include "core/diagnostics.h"
 #include "platform/counters.h"
 #include "core/names.h"
-#include "query/query_fixture.h"
+#include "support/query_fixture.h"
 
 namespace tavix::query_testing {
 namespace {
@@ -121,9 +121,9 @@ TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
   }
   // Every request left a start record and either an end record or an error and end record, and
   // none was answered twice.
-  auto starts = recordsOfType(*state, 14, outcomes.size());
+  auto starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart, outcomes.size());
   EXPECT_EQ(starts.size(), outcomes.size());
-  auto ends = recordsOfType(*state, 15, outcomes.size());
+  auto ends = recordsOfType(*state, kFeedbackTypeNetworkSearchEnd, outcomes.size());
   EXPECT_EQ(ends.size(), outcomes.size());
   for (auto& outcome : outcomes) EXPECT_EQ(outcome.replies->count(), 1u) << outcome.what;
 }
@@ -143,7 +143,7 @@ TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
   auto call = noBag.first(0);
   ASSERT_TRUE(call.error) << "answered at once";
   EXPECT_EQ(call.error->domain, platform::http::kURLErrorDomain);
-  EXPECT_EQ(recordsOfType(*state, 18).size(), 1u);
+  EXPECT_EQ(recordsOfType(*state, kFeedbackTypeError).size(), 1u);
   ASSERT_TRUE(state->ensureBag());
 
   // A transport failure is not retried: no deadline, no retry. It is counted against the client.
@@ -156,7 +156,7 @@ TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
   EXPECT_EQ(received("/more").size(), 1u);
   EXPECT_TRUE(testing::waitFor(
       [&] { return TavixDiagnosticDataReporter::store().value(noConnection) == before + 2; }, 5000));
-  EXPECT_EQ(recordsOfType(*state, 18, 2).size(), 2u);
+  EXPECT_EQ(recordsOfType(*state, kFeedbackTypeError, 2).size(), 2u);
 
   card->queryId = 40;
   card->triggerEvent = 14;
@@ -166,7 +166,7 @@ TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
   ASSERT_TRUE(call.reply);
   EXPECT_EQ(call.reply->data.front(), '[');
   // The more-results record takes its input from the "q" of the URL the bag gives.
-  auto starts = recordsOfType(*state, 14, 2);
+  auto starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart, 2);
   ASSERT_EQ(starts.size(), 2u);
   EXPECT_EQ(starts[0].payload().network_search_start().input(), "camera bag");
   EXPECT_EQ(starts[0].payload().network_search_start().endpoint_type(), 6);
@@ -186,11 +186,11 @@ TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
   EXPECT_EQ(call.error->code, 404);
   // A failure without a transport error: an empty error record and the end record with the
   // status, but the connection is not counted as lost.
-  auto errors = recordsOfType(*state, 18, 3);
+  auto errors = recordsOfType(*state, kFeedbackTypeError, 3);
   ASSERT_EQ(errors.size(), 3u);
   EXPECT_EQ(errors[2].query_id(), 41);
   EXPECT_EQ(errors[2].payload().error().code(), 0);
-  auto ends = recordsOfType(*state, 15, 3);
+  auto ends = recordsOfType(*state, kFeedbackTypeNetworkSearchEnd, 3);
   ASSERT_EQ(ends.size(), 3u);
   EXPECT_EQ(ends[1].payload().network_search_end().status_code(), 200);
   EXPECT_EQ(ends[2].payload().network_search_end().status_code(), 404);
@@ -203,7 +203,7 @@ TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
   Replies notAList;
   state->moreResults(more, notAList.block());
   EXPECT_TRUE(notAList.first().error);
-  EXPECT_EQ(recordsOfType(*state, 18, 4).size(), 4u);
+  EXPECT_EQ(recordsOfType(*state, kFeedbackTypeError, 4).size(), 4u);
   EXPECT_EQ(received("/more").size(), 2u);
 }
 
@@ -234,7 +234,7 @@ TEST_F(QueriesTest, LookupsFlightsAndZeroKeywordRecordWhatTheyAskedFor) {
   state->flightSearch(flight, flights.block());
   EXPECT_TRUE(flights.first().reply);
 
-  auto starts = recordsOfType(*state, 14, 3);
+  auto starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart, 3);
   ASSERT_EQ(starts.size(), 3u);
   EXPECT_EQ(starts[0].payload().network_search_start().input(), "serendipity");
   EXPECT_EQ(starts[0].payload().network_search_start().trigger_event(), 11);
@@ -248,7 +248,7 @@ TEST_F(QueriesTest, LookupsFlightsAndZeroKeywordRecordWhatTheyAskedFor) {
   EXPECT_EQ(starts[2].payload().network_search_start().trigger_event(), 20);
   EXPECT_EQ(starts[2].payload().network_search_start().endpoint_type(), 13);
   // These replies' first element has a status but no duration: the end record says so.
-  auto ends = recordsOfType(*state, 15, 3);
+  auto ends = recordsOfType(*state, kFeedbackTypeNetworkSearchEnd, 3);
   ASSERT_EQ(ends.size(), 3u);
   for (int i = 0; i < 2; ++i) {
     EXPECT_EQ(ends[i].payload().network_search_end().tavix_status(), "ok") << i;
@@ -356,11 +356,11 @@ TEST_F(VirtualTimeTest, TwoWarmsWithin30SecondsSendOneRequest) {
   auto state = make("com.norvel.seekara", "Seekara/1.0");
   state->warm();
   state->warm();
-  auto ends = recordsOfType(*state, 15);
+  auto ends = recordsOfType(*state, kFeedbackTypeNetworkSearchEnd);
   ASSERT_EQ(ends.size(), 1u);
   EXPECT_EQ(ends[0].payload().network_search_end().status_code(), 204);
   EXPECT_EQ(ends[0].payload().network_search_end().endpoint_type(), 12);
-  auto starts = recordsOfType(*state, 14);
+  auto starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart);
   ASSERT_EQ(starts.size(), 1u);
   EXPECT_EQ(starts[0].query_id(), 0);
   EXPECT_EQ(starts[0].payload().network_search_start().trigger_event(), 19);
@@ -372,7 +372,7 @@ TEST_F(VirtualTimeTest, TwoWarmsWithin30SecondsSendOneRequest) {
   state->warm();
   virtualClock.advance(platform::seconds(2));
   state->warm();
-  EXPECT_EQ(recordsOfType(*state, 15, 2).size(), 2u);
+  EXPECT_EQ(recordsOfType(*state, kFeedbackTypeNetworkSearchEnd, 2).size(), 2u);
   EXPECT_EQ(received("/warm").size(), 2u);
 }
 

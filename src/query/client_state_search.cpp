@@ -3,7 +3,7 @@
 #include <fmt/format.h>
 
 #include "bag/tavix_bag_controller.h"
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "cache/engaged_completion_cache.h"
 #include "cache/query_cache.h"
 #include "core/assembly.h"
@@ -62,51 +62,9 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
     return;
   }
 
-  // Local completions: the browser's and, for suggestion-bearing keystrokes, the search screen's.
-  std::vector<std::string> localSuggestions;
-  std::vector<std::string> kept;
+  const auto local = localCompletionsForSearch(*request, *bag);
   const auto length = static_cast<std::int64_t>(queryLength(input));
-  const std::int64_t smartMinimum = bag->smartHistoryMinimumQueryLength();
-  const std::string clientName = bag->clientName().value_or("");
-  const bool seekaraTrigger = request->triggerEvent == proto::TriggerSearchRequestEvent::suggest_queries ||
-                              request->triggerEvent == 24;
-  if ((smartMinimum == 0 || length >= smartMinimum - 1) && bag->smartHistoryEnabled() &&
-      (clientName == "brovane" || (clientName == "seekara" && seekaraTrigger))) {
-    proto::CTStartLocalSearchFeedback start;
-    start.set_timestamp(query_internal::eventTimestamp(assembly_));
-    start.set_input(input);
-    start.set_trigger_event(length < smartMinimum ? proto::TriggerSearchRequestEvent::warm
-                                                  : proto::TriggerSearchRequestEvent::new_character);
-    start.set_index_type(proto::IndexType::engaged_completion_cache);
-    start.set_query_id(queryId);
-    addCodable(start, queryId, true);
-
-    const bool brovane = clientName == "brovane";
-    const unsigned long client = brovane ? 1 : 2;
-    unsigned long count = 1;
-    if (!brovane) {
-      const auto asked = bag->smartHistoryCompletionReturnCount();
-      count = asked > 0 ? static_cast<unsigned long>(asked) : 3;
-    }
-    const auto timeout = static_cast<unsigned long>(std::max<std::int64_t>(bag->smartHistoryTimeout(), 0));
-    auto found = EngagedCompletionCache::sharedInstance(assembly_)->completionsForInput(input, client, count, timeout);
-    if (!found || found->empty()) {
-      TavixLogForCategory(TavixLoggingCategoryDefault).notice("Local completion not found: input {}", input);
-    } else {
-      kept.push_back(found->front().suggestion);
-      for (std::size_t i = 1; i < found->size(); ++i) localSuggestions.push_back((*found)[i].suggestion);
-      if (found->size() > 1) {
-        searchLog().notice("{} Total completions found for {}, {} remaining", found->size(), input,
-                           localSuggestions.size());
-      }
-    }
-    std::lock_guard lock(mutex_);
-    completionCacheSuggestions_ = kept;
-  } else {
-    kept = completionCacheSuggestions();
-  }
-
-  if (length < bag->minimumQueryLength() && kept.empty()) {
+  if (length < bag->minimumQueryLength() && local.kept.empty()) {
     searchLog().notice("query[{}] input '{}' less than {}", queryId, input, bag->minimumQueryLength());
     reply(queryId, std::nullopt, std::nullopt);
     recordSkipSearch(proto::SkipSearchType::less_than_minimum_query_length, input, queryId);
@@ -124,109 +82,173 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
   }
   const auto httpRequest = std::make_shared<const URLRequest>(std::move(*built));
   protocolLog().info("request: {} header: {}", httpRequest->url, query_internal::headersText(httpRequest->headers));
+  if (answerSearchFromQueryCache(*request, *httpRequest, local.others, reply)) return;
+  sendSearch(std::move(request), std::move(reply), httpRequest, local.others);
+}
 
-  if (queryCache_) {
-    CacheSearchRequest lookup{input, request->scale, {}};
-    for (const auto& item : request->queryItems) lookup.queryItems.emplace_back(item.name, item.value);
-    if (auto hit = queryCache_->getRequest(lookup, httpRequest.get())) {
-      TVXReply cached;
-      cached.scale = request->scale;
-      cached.data = hit->data();
-      cached.geoSessionEntityString = geoSessionEntityString();
-      cached.localSuggestions = localSuggestions;
-      reply(queryId, std::move(cached), std::nullopt);
-      if (clientShortName_) {
-        TavixDiagnosticDataReporter::addValue(1, createCounterKey(*clientShortName_, "ondevicecachehits"));
-      }
-      proto::CTCacheHitFeedback cacheHit;
-      cacheHit.set_timestamp(query_internal::eventTimestamp(assembly_));
-      cacheHit.set_input(input);
-      cacheHit.set_uuid(request->uuid);
-      cacheHit.set_reason(proto::SkipSearchType::cache_hit);
-      addCodable(cacheHit, queryId, false);
-      return;
+ClientState::LocalCompletions ClientState::localCompletionsForSearch(const TVXSearchRequest& request,
+                                                                     const TVXBag& bag) {
+  // The browser's completions, and the search screen's for suggestion-bearing keystrokes.
+  const std::string& input = request.queryString;
+  const auto length = static_cast<std::int64_t>(queryLength(input));
+  const std::int64_t smartMinimum = bag.smartHistoryMinimumQueryLength();
+  const std::string clientName = bag.clientName().value_or("");
+  const bool seekaraTrigger = request.triggerEvent == proto::TriggerSearchRequestEvent::suggest_queries ||
+                              request.triggerEvent == TVXTriggerEventSuggestWithResults;
+  LocalCompletions local;
+  if (!((smartMinimum == 0 || length >= smartMinimum - 1) && bag.smartHistoryEnabled() &&
+        (clientName == "brovane" || (clientName == "seekara" && seekaraTrigger)))) {
+    local.kept = completionCacheSuggestions();
+    return local;
+  }
+  proto::CTStartLocalSearchFeedback start;
+  start.set_timestamp(query_internal::eventTimestamp(assembly_));
+  start.set_input(input);
+  start.set_trigger_event(length < smartMinimum ? proto::TriggerSearchRequestEvent::warm
+                                                : proto::TriggerSearchRequestEvent::new_character);
+  start.set_index_type(proto::IndexType::engaged_completion_cache);
+  start.set_query_id(request.queryId);
+  addCodable(start, request.queryId, true);
+
+  const bool brovane = clientName == "brovane";
+  const unsigned long client = brovane ? kEngagedCompletionClientBrovane : kEngagedCompletionClientSeekara;
+  unsigned long count = 1;
+  if (!brovane) {
+    const auto asked = bag.smartHistoryCompletionReturnCount();
+    count = asked > 0 ? static_cast<unsigned long>(asked) : 3;
+  }
+  const auto timeout = static_cast<unsigned long>(std::max<std::int64_t>(bag.smartHistoryTimeout(), 0));
+  auto found = assembly_.engagedCompletionCache->completionsForInput(input, client, count, timeout);
+  if (!found || found->empty()) {
+    TavixLogForCategory(TavixLoggingCategoryDefault).notice("Local completion not found: input {}", input);
+  } else {
+    local.kept.push_back(found->front().suggestion);
+    for (std::size_t i = 1; i < found->size(); ++i) local.others.push_back((*found)[i].suggestion);
+    if (found->size() > 1) {
+      searchLog().notice("{} Total completions found for {}, {} remaining", found->size(), input, local.others.size());
     }
   }
+  std::lock_guard lock(mutex_);
+  completionCacheSuggestions_ = local.kept;
+  return local;
+}
 
+bool ClientState::answerSearchFromQueryCache(const TVXSearchRequest& request, const URLRequest& httpRequest,
+                                             const std::vector<std::string>& localSuggestions,
+                                             const TVXReplyBlock& reply) {
+  if (!queryCache_) return false;
+  CacheSearchRequest lookup{request.queryString, request.scale, {}};
+  for (const auto& item : request.queryItems) lookup.queryItems.emplace_back(item.name, item.value);
+  auto hit = queryCache_->getRequest(lookup, &httpRequest);
+  if (!hit) return false;
+  TVXReply cached;
+  cached.scale = request.scale;
+  cached.data = hit->data();
+  cached.geoSessionEntityString = geoSessionEntityString();
+  cached.localSuggestions = localSuggestions;
+  reply(request.queryId, std::move(cached), std::nullopt);
+  if (clientShortName_) {
+    TavixDiagnosticDataReporter::addValue(1, createCounterKey(*clientShortName_, "ondevicecachehits"));
+  }
+  proto::CTCacheHitFeedback cacheHit;
+  cacheHit.set_timestamp(query_internal::eventTimestamp(assembly_));
+  cacheHit.set_input(request.queryString);
+  cacheHit.set_uuid(request.uuid);
+  cacheHit.set_reason(proto::SkipSearchType::cache_hit);
+  addCodable(cacheHit, request.queryId, false);
+  return true;
+}
+
+void ClientState::sendSearch(std::shared_ptr<const TVXSearchRequest> request, TVXReplyBlock reply,
+                             std::shared_ptr<const URLRequest> httpRequest, std::vector<std::string> localSuggestions) {
+  const std::uint64_t queryId = request->queryId;
   auto start = startSearchEventForRequest(*httpRequest);
-  start->set_input(input);
+  start->set_input(request->queryString);
   start->set_trigger_event(static_cast<proto::TriggerSearchRequestEvent::Value>(request->triggerEvent));
   start->set_endpoint_type(proto::EndpointType::tavix_search);
   addCodable(*start, queryId, false);
-  searchLog().notice("Dispatching network request for (id, query): ({}, {})", queryId, input);
+  searchLog().notice("Dispatching network request for (id, query): ({}, {})", queryId, request->queryString);
 
   auto self = shared_from_this();
   auto task = dataTaskWithTiming(
       assembly_.urlSession(), *httpRequest,
-      [self, request, reply, httpRequest, start, localSuggestions](
+      [self, request, reply, httpRequest, start, localSuggestions = std::move(localSuggestions)](
           std::string data, std::optional<HTTPURLResponse> response, std::optional<URLError> error,
           const platform::http::URLSessionTaskMetrics& timing) {
-        const std::uint64_t queryId = request->queryId;
-        const std::string& input = request->queryString;
-        const long status = response ? response->statusCode : 0;
-        if (response) self->recordSearchResult(status);
-        searchLog().notice("Got network response for (id, query): ({}, {})", queryId, input);
-        protocolLog().info("resp: {}", response ? fmt::format("{} {}", status, response->url) : std::string("none"));
-
-        if (error || data.empty()) {
-          searchLog().error("error with request {}", httpRequest->url);
-          std::optional<TVXError> failure;
-          if (error) failure = TVXError{error->domain, error->code, error->description};
-          reply(queryId, std::nullopt, failure);
-          self->failSearchFeedback(failure, *request, start, data.size(), status, timing);
-          return;
-        }
-        if (!response) {
-          searchLog().error("not http response? {}", httpRequest->url);
-          TVXError failure{kTVXErrorDomain, 500, "invalid response class"};
-          reply(queryId, std::nullopt, failure);
-          self->failSearchFeedback(failure, *request, start, data.size(), status, timing);
-          return;
-        }
-
-        std::string parseError;
-        const auto parsed = platform::parseJson(data, &parseError);
-        std::optional<TVXError> jsonError;
-        if (!parsed) {
-          jsonError = TVXError{kTVXJSONErrorDomain, 3840, parseError.empty() ? "not JSON" : parseError};
-        } else if (self->queryCache_) {
-          // The server's reply is a list; its first dictionary names the completed query.
-          const platform::Dictionary* first = parsed->dictionary();
-          if (const auto* list = parsed->array(); list && !list->empty()) first = list->front().dictionary();
-          if (first) {
-            auto now = self->assembly_.clock ? self->assembly_.clock->now() : platform::TimePoint{};
-            self->queryCache_->set(Ref<CachedResultSet>(
-                new CachedResultSet(input, httpRequest.get(), *first, request->uuid, data, now)));
-          }
-        }
-        self->endNetworkFeedback(start, data, data.size(), status, timing, queryId);
-
-        TVXReply answer;
-        answer.scale = request->scale;
-        if (request->verboseReply) {
-          answer.httpRequest = *httpRequest;
-          answer.httpResponse = *response;
-        }
-        answer.data = data;
-        answer.geoSessionEntityString = self->geoSessionEntityString();
-        answer.localSuggestions = localSuggestions;
-        reply(queryId, std::move(answer), jsonError);
-
-        if (auto forceFetch = response->headers.get("X-Norvel-ForceFetch")) {
-          const auto value = platform::parseJson(*forceFetch);
-          if (value && value->dictionary()) {
-            if (self->assembly_.bagController) self->assembly_.bagController->forceFetchBag(*value->dictionary());
-          } else {
-            searchLog().error("Failed to deserialize X-Norvel-ForceFetch header data into a dictionary: {}",
-                              *forceFetch);
-          }
-        }
+        self->searchResponseArrived(*request, reply, *httpRequest, start, localSuggestions,
+                                    SearchResponse{std::move(data), std::move(response), std::move(error)}, timing);
       });
   if (auto proxy = proxyForTask()) task->setProxy(*proxy);
   task->resume();
   TavixDiagnosticDataReporter::addValue(1, TavixSearchCounterKey);
   setPerformedSearch();
   markNetworkRequest();
+}
+
+void ClientState::searchResponseArrived(const TVXSearchRequest& request, const TVXReplyBlock& reply,
+                                        const URLRequest& httpRequest, const StartRecord& start,
+                                        const std::vector<std::string>& localSuggestions, const SearchResponse& answer,
+                                        const platform::http::URLSessionTaskMetrics& timing) {
+  const std::uint64_t queryId = request.queryId;
+  const std::string& input = request.queryString;
+  const std::string& data = answer.data;
+  const auto& response = answer.response;
+  const long status = response ? response->statusCode : 0;
+  if (response) recordSearchResult(status);
+  searchLog().notice("Got network response for (id, query): ({}, {})", queryId, input);
+  protocolLog().info("resp: {}", response ? fmt::format("{} {}", status, response->url) : std::string("none"));
+
+  if (answer.error || data.empty()) {
+    searchLog().error("error with request {}", httpRequest.url);
+    std::optional<TVXError> failure;
+    if (answer.error) failure = TVXError{answer.error->domain, answer.error->code, answer.error->description};
+    reply(queryId, std::nullopt, failure);
+    failSearchFeedback(failure, request, start, data.size(), status, timing);
+    return;
+  }
+  if (!response) {
+    searchLog().error("not http response? {}", httpRequest.url);
+    TVXError failure{kTVXErrorDomain, 500, "invalid response class"};
+    reply(queryId, std::nullopt, failure);
+    failSearchFeedback(failure, request, start, data.size(), status, timing);
+    return;
+  }
+
+  std::string parseError;
+  const auto parsed = platform::parseJson(data, &parseError);
+  std::optional<TVXError> jsonError;
+  if (!parsed) {
+    jsonError = TVXError{kTVXJSONErrorDomain, kTVXJSONErrorCodeNotJSON, parseError.empty() ? "not JSON" : parseError};
+  } else if (queryCache_) {
+    // The server's reply is a list; its first dictionary names the completed query.
+    const platform::Dictionary* first = parsed->dictionary();
+    if (const auto* list = parsed->array(); list && !list->empty()) first = list->front().dictionary();
+    if (first) {
+      auto now = assembly_.clock->now();
+      queryCache_->set(Ref<CachedResultSet>(new CachedResultSet(input, &httpRequest, *first, request.uuid, data, now)));
+    }
+  }
+  endNetworkFeedback(start, data, data.size(), status, timing, queryId);
+
+  TVXReply result;
+  result.scale = request.scale;
+  if (request.verboseReply) {
+    result.httpRequest = httpRequest;
+    result.httpResponse = *response;
+  }
+  result.data = data;
+  result.geoSessionEntityString = geoSessionEntityString();
+  result.localSuggestions = localSuggestions;
+  reply(queryId, std::move(result), jsonError);
+
+  if (auto forceFetch = response->headers.get("X-Norvel-ForceFetch")) {
+    const auto value = platform::parseJson(*forceFetch);
+    if (value && value->dictionary()) {
+      if (assembly_.bagController) assembly_.bagController->forceFetchBag(*value->dictionary());
+    } else {
+      searchLog().error("Failed to deserialize X-Norvel-ForceFetch header data into a dictionary: {}", *forceFetch);
+    }
+  }
 }
 
 }  // namespace tavix

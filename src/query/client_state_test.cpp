@@ -9,7 +9,7 @@
 #include <thread>
 
 #include "bag/tavix_bag_controller.h"
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 #include "cache/query_cache.h"
 #include "core/assembly.h"
 #include "devserver/devserver.h"

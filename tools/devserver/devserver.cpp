@@ -1,6 +1,8 @@
 #include "devserver/devserver.h"
 #include "devserver/feedback_routes.h"
 #include "platform/json_value.h"
+#include "platform/http/url.h"
+#include "platform/strings.h"
 
 #include <httplib.h>
 #include <sys/socket.h>
@@ -72,26 +74,6 @@ std::string gzipOfBlanks(std::size_t size) {
     if (result == Z_STREAM_END || (flush == Z_FINISH && result != Z_OK)) break;
   }
   deflateEnd(&z);
-  return out;
-}
-
-std::string lowercase(std::string s) {
-  std::transform(s.begin(), s.end(), s.begin(), [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
-  return s;
-}
-
-std::string percentEncode(const std::string& s) {
-  static const char* hex = "0123456789ABCDEF";
-  std::string out;
-  for (unsigned char c : s) {
-    if (std::isalnum(c) || c == '-' || c == '_' || c == '.' || c == '~') {
-      out += static_cast<char>(c);
-    } else {
-      out += '%';
-      out += hex[c >> 4];
-      out += hex[c & 15];
-    }
-  }
   return out;
 }
 
@@ -182,7 +164,7 @@ struct DevServer::Impl {
     for (const auto& [name, value] : req.params) params[name] = value;
     json headers = json::object();
     for (const auto& [name, value] : req.headers) {
-      const std::string key = lowercase(name);
+      const std::string key = platform::asciiLowercased(name);
       // The server's own notes about the socket, not sent by the client.
       if (key == "remote_addr" || key == "remote_port" || key == "local_addr" || key == "local_port") continue;
       headers[key] = headers.contains(key) ? headers[key].get<std::string>() + ", " + value : value;
@@ -330,13 +312,13 @@ struct DevServer::Impl {
   json search(const httplib::Request& req) {
     const auto started = std::chrono::steady_clock::now();
     const std::string q = req.get_param_value("q");
-    const std::string needle = lowercase(q);
+    const std::string needle = platform::asciiLowercased(q);
     std::string completion = q;
     json results = json::array();
     for (const auto& line : corpus) {
-      if (needle.empty() || lowercase(line).rfind(needle, 0) != 0) continue;
+      if (needle.empty() || platform::asciiLowercased(line).rfind(needle, 0) != 0) continue;
       if (results.empty()) completion = line;
-      if (results.size() < 5) results.push_back({{"title", line}, {"url", base() + "/card?id=" + percentEncode(line)}});
+      if (results.size() < 5) results.push_back({{"title", line}, {"url", base() + "/card?id=" + platform::http::percentEncode(line)}});
     }
     const double score = completion.empty() ? 0.0 : double(q.size()) / double(completion.size());
     std::string partialIp = req.remote_addr;
@@ -367,13 +349,13 @@ struct DevServer::Impl {
 
   // The results after the first five for "q".
   json moreResults(const httplib::Request& req) const {
-    const std::string needle = lowercase(req.get_param_value("q"));
+    const std::string needle = platform::asciiLowercased(req.get_param_value("q"));
     json results = json::array();
     std::size_t matched = 0;
     for (const auto& line : corpus) {
-      if (needle.empty() || lowercase(line).rfind(needle, 0) != 0) continue;
+      if (needle.empty() || platform::asciiLowercased(line).rfind(needle, 0) != 0) continue;
       if (++matched <= 5 || results.size() >= 20) continue;
-      results.push_back({{"title", line}, {"url", base() + "/card?id=" + percentEncode(line)}});
+      results.push_back({{"title", line}, {"url", base() + "/card?id=" + platform::http::percentEncode(line)}});
     }
     return json::array({{{"status", "ok"}, {"results", results}}});
   }

@@ -7,6 +7,8 @@
 #include <memory>
 
 #include "platform/json_value.h"
+#include "platform/raw_deflate.h"
+#include "platform/strings.h"
 
 namespace tavix::devserver {
 
@@ -15,16 +17,6 @@ namespace {
 using json = nlohmann::json;
 
 constexpr const char* kHeldEncodingHeader = "X-Devserver-Content-Encoding";
-
-std::string hex(const unsigned char* bytes, std::size_t size) {
-  static constexpr char kHex[] = "0123456789abcdef";
-  std::string out;
-  for (std::size_t i = 0; i < size; ++i) {
-    out += kHex[bytes[i] >> 4];
-    out += kHex[bytes[i] & 0xf];
-  }
-  return out;
-}
 
 }  // namespace
 
@@ -53,25 +45,7 @@ std::string expectedFeedbackDigest(std::string_view plain, std::size_t chunkSize
   unsigned char digest[64];
   unsigned int size = 0;
   EVP_DigestFinal_ex(sha.get(), digest, &size);
-  return hex(digest, size);
-}
-
-bool inflateRaw(std::string_view compressed, std::string* out) {
-  z_stream zs{};
-  if (inflateInit2(&zs, -15) != Z_OK) return false;
-  zs.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(compressed.data()));
-  zs.avail_in = static_cast<uInt>(compressed.size());
-  char buffer[16384];
-  int status = Z_OK;
-  while (status == Z_OK) {
-    zs.next_out = reinterpret_cast<Bytef*>(buffer);
-    zs.avail_out = sizeof buffer;
-    status = inflate(&zs, Z_NO_FLUSH);
-    out->append(buffer, sizeof buffer - zs.avail_out);
-    if (status == Z_BUF_ERROR && zs.avail_in == 0) break;  // input ended before the final block
-  }
-  inflateEnd(&zs);
-  return status == Z_STREAM_END;
+  return tavix::platform::hexString(std::string_view(reinterpret_cast<const char*>(digest), size));
 }
 
 bool FeedbackStore::add(json entry, const std::string& digest) {
@@ -109,13 +83,14 @@ void addFeedbackRoutes(httplib::Server& server, FeedbackStore& store, const Rout
   auto upload = [&store](const httplib::Request& req, httplib::Response& res) {
     const std::string digest = req.get_header_value("X-Norvel-Digest");
     const std::string encoding = req.get_header_value(kHeldEncodingHeader);
-    std::string plain;
     auto reject = [&res](const std::string& why) {
       res.status = 400;
       res.set_content(json{{"error", why}}.dump(), "application/json");
     };
     if (encoding != "deflate") return reject("expected Content-Encoding: deflate");
-    if (!inflateRaw(req.body, &plain)) return reject("body is not raw DEFLATE");
+    const auto inflated = platform::inflateRaw(req.body);
+    if (!inflated) return reject("body is not raw DEFLATE");
+    const std::string& plain = *inflated;
     const std::string expected = expectedFeedbackDigest(plain);
     if (digest != expected) return reject("digest mismatch");
     json entry = {{"path", req.path},

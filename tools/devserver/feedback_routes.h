@@ -23,9 +23,6 @@ namespace tavix::devserver {
 // the 4096-byte output buffer more than once being hashed once per pass. Lower-case hex.
 std::string expectedFeedbackDigest(std::string_view plain, std::size_t chunkSize = 8192);
 
-// Raw DEFLATE → bytes; false on a corrupt stream.
-bool inflateRaw(std::string_view compressed, std::string* out);
-
 class FeedbackStore {
  public:
   // `dataDir` (may be empty) receives feedback.jsonl, one line per accepted upload.

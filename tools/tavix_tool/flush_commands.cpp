@@ -11,6 +11,8 @@
 #include "platform/ipc/unix_socket.h"
 #include "tavix/client.h"
 #include "tavix_proto/flusher.pb.h"
+#include "platform/raw_deflate.h"
+#include "platform/strings.h"
 
 namespace tavix::tool {
 
@@ -63,46 +65,16 @@ bool readMessages(int fd, Handler handle) {
   }
 }
 
-std::optional<std::string> inflateRaw(const std::string& compressed) {
-  z_stream zs{};
-  if (inflateInit2(&zs, -15) != Z_OK) return std::nullopt;
-  zs.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(compressed.data()));
-  zs.avail_in = static_cast<uInt>(compressed.size());
-  std::string out;
-  char chunk[16384];
-  int status = Z_OK;
-  while (status == Z_OK) {
-    zs.next_out = reinterpret_cast<Bytef*>(chunk);
-    zs.avail_out = sizeof chunk;
-    status = inflate(&zs, Z_NO_FLUSH);
-    out.append(chunk, sizeof chunk - zs.avail_out);
-    if (status == Z_BUF_ERROR) break;
-  }
-  inflateEnd(&zs);
-  if (status != Z_STREAM_END) return std::nullopt;
-  return out;
-}
-
-std::string hex(const std::string& bytes) {
-  static constexpr char kHex[] = "0123456789abcdef";
-  std::string out;
-  for (unsigned char c : bytes) {
-    out += kHex[c >> 4];
-    out += kHex[c & 0xf];
-  }
-  return out;
-}
-
 // One upload body as a JSON line: its size and bytes, or (inflated) the JSON it carries.
 void printUpload(const std::string& body, bool inflate) {
   if (inflate) {
-    if (auto json = inflateRaw(body)) {
+    if (auto json = tavix::platform::inflateRaw(body)) {
       std::printf("{\"compressed_size\":%zu,\"json\":%s}\n", body.size(), json->c_str());
     } else {
       std::printf("{\"compressed_size\":%zu,\"error\":\"not raw DEFLATE\"}\n", body.size());
     }
   } else {
-    std::printf("{\"compressed_size\":%zu,\"deflate_hex\":\"%s\"}\n", body.size(), hex(body).c_str());
+    std::printf("{\"compressed_size\":%zu,\"deflate_hex\":\"%s\"}\n", body.size(), tavix::platform::hexString(body).c_str());
   }
   std::fflush(stdout);
 }

@@ -1,4 +1,5 @@
 #include "platform/http/response_cache.h"
+#include "platform/strings.h"
 
 #include <cctype>
 #include <charconv>
@@ -13,27 +14,15 @@ struct CacheControl {
   std::optional<double> maxAge;
 };
 
-std::string lowercase(std::string_view s) {
-  std::string out(s);
-  for (char& c : out) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
-  return out;
-}
-
-std::string_view trim(std::string_view s) {
-  while (!s.empty() && std::isspace(static_cast<unsigned char>(s.front()))) s.remove_prefix(1);
-  while (!s.empty() && std::isspace(static_cast<unsigned char>(s.back()))) s.remove_suffix(1);
-  return s;
-}
-
 CacheControl parseCacheControl(const HeaderFields& headers) {
   CacheControl cc;
   const auto value = headers.get("Cache-Control");
   if (!value) return cc;
-  const std::string text = lowercase(*value);
+  const std::string text = asciiLowercased(*value);
   std::string_view rest = text;
   while (!rest.empty()) {
     const auto comma = rest.find(',');
-    const std::string_view directive = trim(rest.substr(0, comma));
+    const std::string_view directive = trimmedWhitespace(rest.substr(0, comma));
     rest = comma == std::string_view::npos ? std::string_view{} : rest.substr(comma + 1);
     if (directive == "no-store") {
       cc.noStore = true;

@@ -1,15 +1,10 @@
 #include "platform/http/url_request.h"
+#include "platform/strings.h"
 
 #include <algorithm>
 #include <cctype>
 
 namespace tavix::platform::http {
-
-bool equalsIgnoringCase(std::string_view a, std::string_view b) {
-  return a.size() == b.size() && std::equal(a.begin(), a.end(), b.begin(), [](char x, char y) {
-           return std::tolower(static_cast<unsigned char>(x)) == std::tolower(static_cast<unsigned char>(y));
-         });
-}
 
 bool isValidHeaderValue(std::string_view value) {
   return std::none_of(value.begin(), value.end(), [](char c) {
@@ -25,6 +20,15 @@ bool isValidHeaderName(std::string_view name) {
   });
 }
 
+std::string HeaderFields::description() const {
+  std::string out = "{";
+  for (const auto& [name, value] : fields_) {
+    if (out.size() > 1) out += ", ";
+    out += name + ": " + value;
+  }
+  return out + "}";
+}
+
 void HeaderFields::set(std::string_view name, std::string value) {
   remove(name);
   fields_.emplace_back(std::string(name), std::move(value));
@@ -34,13 +38,13 @@ void HeaderFields::add(std::string name, std::string value) { fields_.emplace_ba
 
 void HeaderFields::remove(std::string_view name) {
   fields_.erase(std::remove_if(fields_.begin(), fields_.end(),
-                               [&](const auto& f) { return equalsIgnoringCase(f.first, name); }),
+                               [&](const auto& f) { return equalsIgnoringASCIICase(f.first, name); }),
                 fields_.end());
 }
 
 std::optional<std::string> HeaderFields::get(std::string_view name) const {
   for (const auto& [n, v] : fields_) {
-    if (equalsIgnoringCase(n, name)) return v;
+    if (equalsIgnoringASCIICase(n, name)) return v;
   }
   return std::nullopt;
 }

@@ -22,12 +22,12 @@ class HeaderFields {
   bool contains(std::string_view name) const { return get(name).has_value(); }
   const std::vector<std::pair<std::string, std::string>>& all() const { return fields_; }
   bool empty() const { return fields_.empty(); }
+  // "{Name: value, Name: value}", for logs.
+  std::string description() const;
 
  private:
   std::vector<std::pair<std::string, std::string>> fields_;
 };
-
-bool equalsIgnoringCase(std::string_view a, std::string_view b);
 
 // Whether `value` may stand as a header field's value: no control characters but the tab, so that
 // nothing can end the field early (CR LF) and smuggle in another. URL sessions refuse requests

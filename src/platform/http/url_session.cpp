@@ -17,6 +17,7 @@
 #include "platform/dispatch.h"
 #include "platform/http/response_cache.h"
 #include "platform/log.h"
+#include "platform/strings.h"
 
 namespace tavix::platform::http {
 namespace {
@@ -88,12 +89,6 @@ std::string protocolName(long version) {
   }
 }
 
-std::string lowercased(std::string_view text) {
-  std::string out(text);
-  for (char& c : out) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
-  return out;
-}
-
 // The codings of an Accept-Encoding or Content-Encoding value, lower-case, without parameters.
 std::vector<std::string> codings(std::string_view value) {
   std::vector<std::string> out;
@@ -102,9 +97,8 @@ std::vector<std::string> codings(std::string_view value) {
     std::string_view item = value.substr(0, comma);
     value = comma == std::string_view::npos ? std::string_view{} : value.substr(comma + 1);
     item = item.substr(0, item.find(';'));
-    while (!item.empty() && (item.front() == ' ' || item.front() == '\t')) item.remove_prefix(1);
-    while (!item.empty() && (item.back() == ' ' || item.back() == '\t')) item.remove_suffix(1);
-    if (!item.empty()) out.push_back(lowercased(item));
+    item = trimmedWhitespace(item);
+    if (!item.empty()) out.push_back(asciiLowercased(item));
   }
   return out;
 }
@@ -318,7 +312,7 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
       // Only the codings the request asked for are decoded; a body in any other (a small gzip
       // stream that inflates to gigabytes, say) is refused before a byte of it is read.
       const bool finalHead = task->headStatus >= 200 && (task->headStatus < 300 || task->headStatus >= 400);
-      if (finalHead && equalsIgnoringCase(name, "Content-Encoding")) {
+      if (finalHead && equalsIgnoringASCIICase(name, "Content-Encoding")) {
         for (const auto& coding : codings(value)) {
           if (coding == "identity" ||
               std::find(task->acceptedEncodings.begin(), task->acceptedEncodings.end(), coding) !=
@@ -371,7 +365,7 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
     // Waiting for a connection that may multiplex pays only where the TLS handshake (ALPN) says
     // soon whether it will. Over plain HTTP it is said by the first response, so one slow or hung
     // answer would hold every other request to its host.
-    const bool tls = request.url.size() >= 8 && equalsIgnoringCase(std::string_view(request.url).substr(0, 8), "https://");
+    const bool tls = request.url.size() >= 8 && equalsIgnoringASCIICase(std::string_view(request.url).substr(0, 8), "https://");
     curl_easy_setopt(easy, CURLOPT_PIPEWAIT, config.multiplexing && tls ? 1L : 0L);
     if (auto asked = request.headers.get("Accept-Encoding"); asked && !asked->empty()) {
       // curl sends the field from this option and decodes what it names.
@@ -415,7 +409,7 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
     }
     for (const HeaderFields* fields : {&request.headers, static_cast<const HeaderFields*>(&task->conditionalHeaders)}) {
       for (const auto& [name, value] : fields->all()) {
-        if (equalsIgnoringCase(name, "Accept-Encoding")) continue;  // set above
+        if (equalsIgnoringASCIICase(name, "Accept-Encoding")) continue;  // set above
         // "Name;" is curl's way to send a header with an empty value.
         const std::string line = value.empty() ? name + ";" : name + ": " + value;
         task->headerList = curl_slist_append(task->headerList, line.c_str());

@@ -17,15 +17,15 @@ class UserDefaults;
 // The daemon's name/version token: the client part of the daemon's own user agent.
 inline constexpr const char* kTVXTavixdNameVersion = "tavixd/0.1";
 
-// The device-information answers under the keys "ProductType", "ProductName", "ProductVersion"
-// and "BuildVersion". On Linux they come from:
-//   ProductType    the DMI product name (/sys/class/dmi/id/product_name), else "Linux"
-//   ProductName    NAME of /etc/os-release, else "Linux"
-//   ProductVersion VERSION_ID of /etc/os-release, else "0"
-//   BuildVersion   the kernel release (/proc/sys/kernel/osrelease), else "0"
-// Each is overridden by a non-empty string default "TVXDevice" + key ("TVXDeviceProductType",
-// "TVXDeviceProductName", "TVXDeviceProductVersion", "TVXDeviceBuildVersion").
-// "ProductVersion" is read once and kept, the others on every call, so an edited default or a
+// The device-information answers under the keys "Model", "OSName", "OSVersion"
+// and "OSBuild". On Linux they come from:
+//   Model     the DMI product name (/sys/class/dmi/id/product_name), else "Linux"
+//   OSName    NAME of /etc/os-release, else "Linux"
+//   OSVersion VERSION_ID of /etc/os-release, else "0"
+//   OSBuild   the kernel release (/proc/sys/kernel/osrelease), else "0"
+// Each is overridden by a non-empty string default "TVXDevice" + key ("TVXDeviceModel",
+// "TVXDeviceOSName", "TVXDeviceOSVersion", "TVXDeviceOSBuild").
+// "OSVersion" is read once and kept, the others on every call, so an edited default or a
 // kernel update shows in the next request without a restart.
 //
 // Threading: safe from any thread.
@@ -44,10 +44,10 @@ class DeviceInformation {
   const platform::UserDefaults* defaults_;
   const std::filesystem::path root_;
   mutable std::once_flag versionOnce_;
-  mutable std::string productVersion_;
+  mutable std::string osVersion_;
 };
 
-// "<token> (<ProductType>; <ProductName> <ProductVersion> <BuildVersion>) <clientAgent>".
+// "<token> (<Model>; <OSName> <OSVersion> <OSBuild>) <clientAgent>".
 // Empty when `clientAgent` is an empty string; a missing client agent (nullopt) repeats the token.
 std::optional<std::string> createUserAgentString(std::optional<std::string_view> clientAgent,
                                                  const DeviceInformation& device);

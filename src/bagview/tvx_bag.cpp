@@ -1,11 +1,11 @@
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 
 #include <cmath>
 
 #include <fmt/core.h>
 
 #include "core/names.h"
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 #include "platform/notification_center.h"
 
 namespace tavix {

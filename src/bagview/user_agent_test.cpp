@@ -1,4 +1,4 @@
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 
 #include <gtest/gtest.h>
 
@@ -35,13 +35,13 @@ TEST(UserAgent, BuildsFromSystemFilesAndDefaultsOverrideThem) {
             "tavixd/0.1 (ThinkPad X1; Debian GNU/Linux 12 6.1.0-18-amd64) tavixd/0.1");
   EXPECT_FALSE(createUserAgentString("", device));
 
-  defaults.setObject("TVXDeviceProductType", "Tablet7");
-  defaults.setObject("TVXDeviceProductVersion", "99");  // too late: the version is read once
+  defaults.setObject("TVXDeviceModel", "Tablet7");
+  defaults.setObject("TVXDeviceOSVersion", "99");  // too late: the version is read once
   sys.write("proc/sys/kernel/osrelease", "6.5.0\n");
   EXPECT_EQ(createUserAgentString("x", device), "tavixd/0.1 (Tablet7; Debian GNU/Linux 12 6.5.0) x");
 
   DeviceInformation fresh(&defaults, sys.root);
-  EXPECT_EQ(fresh.answer("ProductVersion"), "99");
+  EXPECT_EQ(fresh.answer("OSVersion"), "99");
   EXPECT_EQ(fresh.answer("Serial"), "");
 }
 

@@ -1,4 +1,4 @@
-#include "network/user_agent.h"
+#include "bagview/user_agent.h"
 
 #include <fmt/core.h>
 
@@ -6,18 +6,13 @@
 
 #include "platform/defaults.h"
 #include "platform/files.h"
+#include "platform/strings.h"
 
 namespace tavix {
 
 namespace {
 
-std::string trim(std::string s) {
-  const char* blanks = " \t\r\n";
-  auto begin = s.find_first_not_of(blanks);
-  if (begin == std::string::npos) return {};
-  auto end = s.find_last_not_of(blanks);
-  return s.substr(begin, end - begin + 1);
-}
+std::string trim(std::string_view s) { return std::string(platform::trimmedWhitespace(s)); }
 
 // One field of an os-release file; quotes around the value are dropped.
 std::string osReleaseField(const std::string& text, std::string_view field) {
@@ -39,14 +34,6 @@ std::string osReleaseField(const std::string& text, std::string_view field) {
   return {};
 }
 
-std::string lowercased(std::string_view s) {
-  std::string out(s);
-  for (char& c : out) {
-    if (c >= 'A' && c <= 'Z') c = static_cast<char>(c - 'A' + 'a');
-  }
-  return out;
-}
-
 constexpr std::array<const char*, 9> kClientNames = {
     "brovane", "seekara", "vocly", "lookup", "messages", "news", "suggestions", "flightinfo", "tavixd"};
 
@@ -56,11 +43,11 @@ DeviceInformation::DeviceInformation(const platform::UserDefaults* defaults, std
     : defaults_(defaults), root_(std::move(root)) {}
 
 std::string DeviceInformation::answer(std::string_view key) const {
-  if (key == "ProductVersion") {
-    std::call_once(versionOnce_, [this] { productVersion_ = read("ProductVersion"); });
-    return productVersion_;
+  if (key == "OSVersion") {
+    std::call_once(versionOnce_, [this] { osVersion_ = read("OSVersion"); });
+    return osVersion_;
   }
-  if (key == "ProductType" || key == "ProductName" || key == "BuildVersion") return read(key);
+  if (key == "Model" || key == "OSName" || key == "OSBuild") return read(key);
   return {};
 }
 
@@ -70,41 +57,41 @@ std::string DeviceInformation::read(std::string_view key) const {
     if (override && !override->empty()) return *override;
   }
   std::string text;
-  if (key == "ProductType") {
+  if (key == "Model") {
     if (!platform::readFile(root_ / "sys/class/dmi/id/product_name", &text)) {
       text = trim(text);
       if (!text.empty()) return text;
     }
     return "Linux";
   }
-  if (key == "BuildVersion") {
+  if (key == "OSBuild") {
     if (!platform::readFile(root_ / "proc/sys/kernel/osrelease", &text)) {
       text = trim(text);
       if (!text.empty()) return text;
     }
     return "0";
   }
-  // ProductName and ProductVersion come from os-release, with its documented fallback file.
+  // OSName and OSVersion come from os-release, with its documented fallback file.
   if (platform::readFile(root_ / "etc/os-release", &text)) {
     text.clear();
     platform::readFile(root_ / "usr/lib/os-release", &text);
   }
-  std::string value = osReleaseField(text, key == "ProductName" ? "NAME" : "VERSION_ID");
+  std::string value = osReleaseField(text, key == "OSName" ? "NAME" : "VERSION_ID");
   if (!value.empty()) return value;
-  return key == "ProductName" ? "Linux" : "0";
+  return key == "OSName" ? "Linux" : "0";
 }
 
 std::optional<std::string> createUserAgentString(std::optional<std::string_view> clientAgent,
                                                  const DeviceInformation& device) {
   if (clientAgent && clientAgent->empty()) return std::nullopt;
-  std::string devicePart = fmt::format("{}; {} {} {}", device.answer("ProductType"), device.answer("ProductName"),
-                                       device.answer("ProductVersion"), device.answer("BuildVersion"));
+  std::string devicePart = fmt::format("{}; {} {} {}", device.answer("Model"), device.answer("OSName"),
+                                       device.answer("OSVersion"), device.answer("OSBuild"));
   return fmt::format("{} ({}) {}", kTVXTavixdNameVersion, devicePart,
                      clientAgent ? *clientAgent : std::string_view(kTVXTavixdNameVersion));
 }
 
 std::optional<std::string> extractClientNameFromString(std::string_view userAgent) {
-  std::string lower = lowercased(userAgent);
+  std::string lower = platform::asciiLowercased(userAgent);
   for (const char* name : kClientNames) {
     if (lower.find(name) != std::string::npos) return std::string(name);
   }
@@ -113,7 +100,7 @@ std::optional<std::string> extractClientNameFromString(std::string_view userAgen
 
 std::string getClientFromUserAgent(std::optional<std::string_view> userAgent) {
   if (!userAgent) return "unknown";
-  std::string lower = lowercased(*userAgent);
+  std::string lower = platform::asciiLowercased(*userAgent);
   if (lower.find("brovane") != std::string::npos) return "brovane";
   if (lower.find("seekara") != std::string::npos) return "seekara";
   return "unknown";

@@ -34,6 +34,14 @@ platform::Dictionary bagChangeUserInfo(const TVXBag& bag);
 std::shared_ptr<const TVXBag> bagOfNotification(const platform::Notification& notification,
                                                 std::string userAgent = {});
 
+// The bag in memory, read without waiting for the network. The bag controller answers it; the
+// layers below the controller (feedback) see the controller only through this.
+class TVXInMemoryBagSource {
+ public:
+  virtual ~TVXInMemoryBagSource() = default;
+  virtual std::shared_ptr<const TVXBag> inMemoryBag() = 0;
+};
+
 class TVXBag {
  public:
   TVXBag(std::shared_ptr<const platform::Dictionary> rawBag, std::string userAgent);

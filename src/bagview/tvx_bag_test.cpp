@@ -1,4 +1,4 @@
-#include "bag/tvx_bag.h"
+#include "bagview/tvx_bag.h"
 
 #include <gtest/gtest.h>
 

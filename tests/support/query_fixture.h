@@ -20,6 +20,7 @@
 #include "devserver/devserver.h"
 #include "feedback/client_session_manager.h"
 #include "feedback/persistent_storage.h"
+#include "feedback/vocabulary.h"
 #include "network/request_factory.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
@@ -30,6 +31,7 @@
 #include "query/client_state.h"
 #include "support/temp_home.h"
 #include "tavix_proto/feedback_session.pb.h"
+#include "cache/engaged_completion_cache.h"
 
 namespace tavix::query_testing {
 
@@ -86,11 +88,13 @@ class QueryFixture : public ::testing::Test {
     assembly.userDefaults = defaults;
     assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
     assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+    assembly.engagedCompletionCache =
+        EngagedCompletionCache::create({assembly.cachesFolder(), clock_, &pool, defaults.get()});
     assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
     // The daemon's own session manager (warm-up records); clients keep sessions of their own.
     assembly.guidController = std::make_shared<TavixUserGUIDController>(assembly);
     assembly.clientSessionManager =
-        std::make_shared<ClientSessionManager>(assembly, assembly.guidController, "tavix");
+        std::make_shared<ClientSessionManager>(assembly, assembly.guidController, nullptr, "tavix");
   }
   ~QueryFixture() override {
     states.clear();
