@@ -7,7 +7,7 @@
 #include "platform/counters.h"
 #include "core/names.h"
 #include "feedback/vocabulary.h"
-#include "query/query_fixture.h"
+#include "support/query_fixture.h"
 
 namespace tavix::query_testing {
 namespace {
@@ -26,7 +26,7 @@ TEST_F(SearchTest, ABagWithoutASearchURLFailsAsTheTransportWouldAndRecordsIt) {
   EXPECT_EQ(std::pair(error->domain, error->code),
             std::pair(std::string(platform::http::kURLErrorDomain),
                       std::int64_t{platform::http::URLErrorUnsupportedURL}));
-  auto errors = recordsOfType(*state, 18);
+  auto errors = recordsOfType(*state, kFeedbackTypeError);
   ASSERT_EQ(errors.size(), 1u);
   EXPECT_EQ(errors[0].query_id(), 12);
   EXPECT_EQ(errors[0].payload().error().code(), platform::http::URLErrorUnsupportedURL);
@@ -43,7 +43,7 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
   auto call = skipped.first();
   EXPECT_FALSE(call.reply);
   EXPECT_FALSE(call.error);
-  auto skips = recordsOfType(*seekara, 38);
+  auto skips = recordsOfType(*seekara, kFeedbackTypeSkipSearch);
   ASSERT_EQ(skips.size(), 1u);
   EXPECT_EQ(skips[0].payload().skip_tavix_search().reason(), 1);
   EXPECT_EQ(skips[0].payload().skip_tavix_search().input(), "zq");
@@ -51,7 +51,7 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
 
   // Engaged completions for "zq": the browser gets one and no more, kept for the keystroke;
   // with it the short input goes to the network after all.
-  auto engaged = EngagedCompletionCache::sharedInstance(assembly);
+  auto engaged = assembly.engagedCompletionCache;
   for (const char* completion : {"zqalpha", "zqbeta", "zqgamma", "zqdelta"}) {
     engaged->addCompletion(completion, "zq", 0, 1);
     engaged->addCompletion(completion, "zq", 0, 2);
@@ -64,7 +64,7 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
   EXPECT_TRUE(call.reply->localSuggestions.empty());
   EXPECT_EQ(brovane->completionCacheSuggestions().size(), 1u);
   EXPECT_EQ(received("/search").size(), 1u);
-  auto localStart = recordsOfType(*brovane, 16);
+  auto localStart = recordsOfType(*brovane, kFeedbackTypeLocalSearchStart);
   ASSERT_EQ(localStart.size(), 1u);
   EXPECT_EQ(localStart[0].payload().local_search_start().input(), "zq");
   EXPECT_EQ(localStart[0].payload().local_search_start().trigger_event(), 1);
@@ -83,7 +83,7 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
   Replies shorter;
   seekara->search(request<TVXSearchRequest>(4, "z", 21), shorter.block());
   shorter.first();
-  localStart = recordsOfType(*seekara, 16, 2);
+  localStart = recordsOfType(*seekara, kFeedbackTypeLocalSearchStart, 2);
   ASSERT_EQ(localStart.size(), 2u);
   EXPECT_EQ(localStart[1].payload().local_search_start().trigger_event(), 19);
 }
@@ -102,8 +102,8 @@ TEST_F(SearchTest, TheSameKeystrokeTwiceIsServedFromTheQueryCache) {
   EXPECT_FALSE(call.error);
   EXPECT_NE(call.reply->data.find("\"status\":\"ok\""), std::string::npos);
   // The end record carries the server's own account of the request and the transport's timing.
-  auto ends = recordsOfType(*state, 15);
-  auto starts = recordsOfType(*state, 14);
+  auto ends = recordsOfType(*state, kFeedbackTypeNetworkSearchEnd);
+  auto starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart);
   ASSERT_EQ(starts.size(), 1u);
   ASSERT_EQ(ends.size(), 1u);
   const auto& start = starts[0].payload().network_search_start();
@@ -174,7 +174,7 @@ TEST_F(SearchTest, TheServerCanAskForANewerBagAndTheBagCanRouteThroughItsProxy) 
   EXPECT_TRUE(direct.first().reply);
   EXPECT_EQ(received("/search").size(), 1u);
   EXPECT_TRUE(testing::waitFor([&] { return received("/bag").size() == 2; }, 5000));
-  auto starts = recordsOfType(*state, 14);
+  auto starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart);
   ASSERT_FALSE(starts.empty());
   EXPECT_FALSE(starts.back().payload().network_search_start().has_marvola_status());
 
@@ -185,7 +185,7 @@ TEST_F(SearchTest, TheServerCanAskForANewerBagAndTheBagCanRouteThroughItsProxy) 
   proxied.first();
   EXPECT_EQ(received("/search").size(), 1u);
   EXPECT_EQ(received(server.baseURL() + "/search", &proxy).size(), 1u);
-  starts = recordsOfType(*state, 14, 2);
+  starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart, 2);
   ASSERT_EQ(starts.size(), 2u);
   EXPECT_EQ(starts.back().payload().network_search_start().marvola_status(), 1);
 
