@@ -120,7 +120,6 @@ TEST(IpcDaemon, SecondConnectionFromOneProcessIsWarnedAboutAndServed) {
     Client second(options(d));
     ASSERT_FALSE(first.connect());
     ASSERT_FALSE(second.connect());
-    EXPECT_TRUE(d.waitForLog("new connection from ipc_integration_tests (" + me + ")")) << d.log();
     EXPECT_TRUE(d.waitForLog("too many connections 2 from pid " + me)) << d.log();
 
     // Both are served: without a bag (its fetches go nowhere here) a search answers the "timeout"
@@ -142,7 +141,6 @@ TEST(IpcDaemon, SecondConnectionFromOneProcessIsWarnedAboutAndServed) {
       EXPECT_EQ(error->reason, "timeout");
     }
   }
-  EXPECT_TRUE(d.waitForLog("connection from ipc_integration_tests (" + me + ") invalidated")) << d.log();
 }
 
 TEST(IpcDaemon, BadFramesAndVanishingClientsDoNotStopTheDaemon) {
