@@ -29,7 +29,7 @@ using namespace tavix::platform;
 class BagDaemonTest : public ::testing::Test {
  protected:
   std::size_t bagFetches() {
-    auto recorded = parseJson(tavix::testing::devserverCall(session, server.base, "/_recorded", "GET", {}));
+    auto recorded = parseJson(tavix::testing::devserverCall(session, server.base, "/_recorded"));
     std::size_t n = 0;
     for (const auto& entry : *recorded->array()) n += *entry.dictionary()->at("path").string() == "/bag";
     return n;

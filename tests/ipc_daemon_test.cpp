@@ -111,38 +111,6 @@ int runTool(const std::string& args, std::string* out) {
   return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
-TEST(IpcDaemon, SecondConnectionFromOneProcessIsWarnedAboutAndServed) {
-  tavix::testing::TempHome home;
-  Daemon d(home);
-  const std::string me = std::to_string(getpid());
-  {
-    Client first(options(d));
-    Client second(options(d));
-    ASSERT_FALSE(first.connect());
-    ASSERT_FALSE(second.connect());
-    EXPECT_TRUE(d.waitForLog("too many connections 2 from pid " + me)) << d.log();
-
-    // Both are served: without a bag (its fetches go nowhere here) a search answers the "timeout"
-    // error, echoing the query id.
-    for (Client* c : {&first, &second}) {
-      tavix::proto::TVXRequest request;
-      request.set_query_id(42);
-      request.mutable_search();
-      std::promise<std::tuple<std::uint64_t, bool, std::optional<tavix::client::Error>>> done;
-      c->request(request, [&](std::uint64_t id, auto reply, auto error) { done.set_value({id, reply.has_value(), error}); });
-      auto future = done.get_future();
-      ASSERT_EQ(future.wait_for(std::chrono::seconds(5)), std::future_status::ready);
-      auto [id, hasReply, error] = future.get();
-      EXPECT_EQ(id, 42u);
-      EXPECT_FALSE(hasReply);
-      ASSERT_TRUE(error);
-      EXPECT_EQ(error->domain, "kTVXErrorDomain");
-      EXPECT_EQ(error->code, 1);
-      EXPECT_EQ(error->reason, "timeout");
-    }
-  }
-}
-
 TEST(IpcDaemon, BadFramesAndVanishingClientsDoNotStopTheDaemon) {
   tavix::testing::TempHome home;
   Daemon d(home);
