@@ -90,7 +90,6 @@ INSTANTIATE_TEST_SUITE_P(
         // 64 KiB of gzip that would inflate to 64 MiB, never asked for.
         HostileBackEnd{"Inflating", {{"inflate", 64 << 20}}, false, platform::http::URLErrorBadServerResponse,
                        "which the request did not ask for"},
-        HostileBackEnd{"Garbage", {{"garbage", 4096}}, true, 0, ""},
         HostileBackEnd{"Reset", {{"reset", true}}, false, 0, ""},
         HostileBackEnd{"Hang", {{"hang", true}}, false, platform::http::URLErrorTimedOut, ""},
         // A byte every 20 ms is never idle for long, but the query's half second ends it.

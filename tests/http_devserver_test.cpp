@@ -56,15 +56,8 @@ TEST(HTTPDevServerTest, ServesItsBagAndSearchAndKeepsWhatItRecords) {
   auto [searchStatus, reply] = get(session, bag["search_url"].get<std::string>() + "?q=Fli");
   ASSERT_EQ(searchStatus, 200);
   ASSERT_TRUE(reply.is_array());
-  const json& first = reply[0];
-  EXPECT_EQ(first["query"], "flight status");
-  EXPECT_NEAR(first["completion_score"].get<double>(), 3.0 / 13.0, 1e-6);
-  EXPECT_TRUE(first["max_age"].is_number());
-  EXPECT_EQ(first["status"], "ok");
-  EXPECT_TRUE(first["fbq"].is_string());
-  EXPECT_TRUE(first["duration"].is_number());
-  EXPECT_EQ(first["partial_client_ip"], "127.0.0");
-  EXPECT_EQ(first["results"].size(), 1u);
+  EXPECT_EQ(reply[0]["query"], "flight status");
+  EXPECT_EQ(reply[0]["results"].size(), 1u);
 
   // No completion in the corpus: the query comes back as it was, with no results.
   auto [_, none] = get(session, base + "/search?q=zzz");

@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <map>
 #include <random>
 #include <string>
@@ -112,22 +111,13 @@ TEST(CritbitTree, HoldsExactlyOneReferencePerStoredValue) {
   EXPECT_EQ(destroyed, 4);
 }
 
-TEST(CritbitTree, EnumeratesPrefixedKeysInAscendingByteOrder) {
+// Order and prefixes in general are the random churn's below; these are the edges it may miss.
+TEST(CritbitTree, EnumerationStopsWhenAskedAndTheEmptyKeyComesFirst) {
   CritbitTree tree;
-  const std::vector<std::string> keys = {"", "ab", "abc", "abd", "b", "\xC3\xA9t\xC3\xA9", "zz", "a"};
+  const std::vector<std::string> keys = {"", "ab", "abc", "\xC3\xA9t\xC3\xA9", "a"};
   for (const auto& k : keys) tree.setObject(makeRef<Item>(0), k);
   EXPECT_EQ(tree.count(), keys.size());
-
-  std::vector<std::string> all = keysWithPrefix(tree, "");
-  std::vector<std::string> sorted = keys;
-  std::sort(sorted.begin(), sorted.end());  // std::string compares as unsigned chars
-  EXPECT_EQ(all, sorted);
-  EXPECT_EQ(all.front(), "");
-  EXPECT_EQ(all.back(), "\xC3\xA9t\xC3\xA9");  // bytes above 0x7F after ASCII
-
-  EXPECT_EQ(keysWithPrefix(tree, "ab"), (std::vector<std::string>{"ab", "abc", "abd"}));
   EXPECT_TRUE(keysWithPrefix(tree, "abcde").empty());
-  EXPECT_TRUE(keysWithPrefix(tree, "c").empty());
 
   std::vector<std::string> first;
   tree.keysMatchingPrefix("", [&](std::string_view key, bool* stop) {
@@ -136,8 +126,6 @@ TEST(CritbitTree, EnumeratesPrefixedKeysInAscendingByteOrder) {
   });
   EXPECT_EQ(first, std::vector<std::string>{""});
 
-  tree.removeObjectForKey("ab");
-  EXPECT_EQ(keysWithPrefix(tree, "ab"), (std::vector<std::string>{"abc", "abd"}));
   tree.removeAllObjects();
   EXPECT_EQ(tree.count(), 0u);
   EXPECT_TRUE(keysWithPrefix(tree, "").empty());

@@ -31,6 +31,11 @@ TEST_F(VirtualClockTest, WorkScheduled900SecondsAheadFiresOnceWhenTimePassesIt) 
     fired++;
     firedAt = clock.now();
   });
+  // Cancelling through a copy of the handle cancels the one timer they share.
+  TimerHandle cancelled = clock.after(seconds(5), queue, [&] { fired += 100; });
+  TimerHandle copy = cancelled;
+  copy.cancel();
+  EXPECT_TRUE(cancelled.isCancelled());
   clock.advance(seconds(899.999));
   EXPECT_EQ(fired, 0);
   clock.advance(1ms);
@@ -52,16 +57,6 @@ TEST_F(VirtualClockTest, FiresInDueOrderWithTiesInOrderSetAndFollowsTimersSetByT
   clock.after(seconds(20), queue, [&] { order.push_back("c@20"); });
   clock.advance(seconds(30));
   EXPECT_EQ(order, (std::vector<std::string>{"a@10", "nested@15", "b@20", "c@20"}));
-}
-
-TEST_F(VirtualClockTest, CancelledTimerNeverRuns) {
-  int fired = 0;
-  TimerHandle handle = clock.after(seconds(5), queue, [&] { fired++; });
-  TimerHandle copy = handle;
-  copy.cancel();
-  EXPECT_TRUE(handle.isCancelled());
-  clock.advance(seconds(10));
-  EXPECT_EQ(fired, 0);
 }
 
 TEST_F(VirtualClockTest, AWaitEndsWhenItsConditionHoldsOrWhenTimeReachesItsDeadline) {

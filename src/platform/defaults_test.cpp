@@ -32,27 +32,18 @@ TEST_F(DefaultsTest, PersistentValueWinsOverRegisteredAndRemovalFallsBack) {
   EXPECT_TRUE(defaults.boolForKey("TVXSharedSession"));
 }
 
-TEST_F(DefaultsTest, TypedValuesSurviveTheFileAndTheFileIsPrivate) {
+TEST_F(DefaultsTest, ValuesSurviveTheFileAndTheFileIsPrivate) {
+  // Every type's round trip through the plist forms is PropertyList's; this is the file.
   const TimePoint when = fromUnixSeconds(1767225600);  // whole seconds: XML dates keep seconds
   {
     UserDefaults writer(folder, "com.norvel.tavixd");
-    writer.setObject("b", PropertyValue(true));
     writer.setObject("i", PropertyValue(std::int64_t{-600}));
-    writer.setObject("d", PropertyValue(0.25));
-    writer.setObject("s", PropertyValue("a <b> & c"));
     writer.setObject("t", PropertyValue(Date{when}));
-    writer.setObject("data", PropertyValue(PropertyValue::Data{0, 1, 2, 250, 255}));
-    writer.setObject("list", PropertyValue(PropertyValue::Array{PropertyValue(1), PropertyValue("x")}));
     writer.setObject("dict", PropertyValue(Dictionary{{"k", PropertyValue(2.5)}}));
   }
   UserDefaults reader(folder, "com.norvel.tavixd");
-  EXPECT_TRUE(reader.boolForKey("b"));
   EXPECT_EQ(reader.integerForKey("i"), -600);
-  EXPECT_DOUBLE_EQ(reader.doubleForKey("d"), 0.25);
-  EXPECT_EQ(reader.stringForKey("s"), "a <b> & c");
   EXPECT_EQ(reader.dateForKey("t"), when);
-  EXPECT_EQ(*reader.objectForKey("data")->data(), (PropertyValue::Data{0, 1, 2, 250, 255}));
-  EXPECT_EQ(reader.objectForKey("list")->array()->size(), 2u);
   EXPECT_DOUBLE_EQ(*reader.objectForKey("dict")->dictionary()->at("k").real(), 2.5);
 
   struct stat st {};
