@@ -340,11 +340,17 @@ std::optional<proto::CTClientSession> FileContainer::unarchiveObject() {
         hi = mid - 1;
       }
     }
-    if (!found || best.feedbacks_size() == 0) {
+    if (!found) {
       log().error("File contents did not deserialize into a _CTClientSession.");
       return std::nullopt;
     }
     session = std::move(best);
+  }
+  // Events are appended only after the whole header, so a file without one whole event may hold
+  // a header cut short at a field boundary (no agent, no user id): nothing worth sending.
+  if (session.feedbacks_size() == 0) {
+    log().error("File contents did not deserialize into a _CTClientSession.");
+    return std::nullopt;
   }
   if (session.version() != version_) {
     log().error("Discarding feedback because of version mismatch. File version {} not equal to current version {}.",

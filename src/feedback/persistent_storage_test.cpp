@@ -169,6 +169,14 @@ TEST(FileContainer, CutOffOrEmptyFilesKeepOnlyWhatIsWhole) {
   fs::resize_file(url, head.ByteSizeLong() + 2);  // first event cut off: nothing to send
   EXPECT_FALSE(container->readRecord().has_value());
 
+  // Cut at a field boundary inside the header: it parses, but without its agent.
+  proto::CTClientSession versionOnly;
+  versionOnly.set_version(head.version());
+  versionOnly.set_session_start(head.session_start());
+  ASSERT_LT(versionOnly.ByteSizeLong(), head.ByteSizeLong());
+  fs::resize_file(url, versionOnly.ByteSizeLong());
+  EXPECT_FALSE(container->readRecord().has_value());
+
   fs::resize_file(url, 0);
   EXPECT_FALSE(container->readRecord().has_value());
 }
