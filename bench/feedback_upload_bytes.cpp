@@ -20,7 +20,7 @@
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
 #include "platform/log.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 #include "tavix_proto/feedback_session.pb.h"
 
 namespace {
@@ -135,21 +135,10 @@ struct Day {
   }
 };
 
-struct Fixture {
-  testing::TempHome home;
-  platform::DispatchPool pool;
-  platform::VirtualClock clock;
-  Assembly assembly;
-
-  Fixture() {
+struct Fixture : testing::TestAssembly {
+  Fixture() : testing::TestAssembly(0) {
     platform::setLogLevel(platform::LogLevel::Error);
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.paths.cacheHome = home.cache();
-    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
-    assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
-                                             {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})}});
-    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+    makeStorage();
   }
   ~Fixture() { pool.drain(); }
 };

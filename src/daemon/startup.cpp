@@ -123,7 +123,8 @@ void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform
   assembly.engagedCompletionCache =
       EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, assembly.userDefaults.get()});
   assembly.uploadManager = UploadManager::create(assembly);
-  assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+  assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(TavixPersistentStorage::Environment{
+      assembly.cachesFolder(), &pool, &clock, assembly.userDefaults.get(), assembly.transactions});
 }
 
 // Topic weights a person or another program left for us; any property-list value, sent as JSON.

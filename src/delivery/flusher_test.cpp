@@ -77,7 +77,8 @@ class FlusherTest : public ::testing::Test {
     bag.update(extra);
     control.Post("/_faults", json{{"path", "/bag"}, {"body", bag.dump()}}.dump(), "application/json");
     control.Post("/_reset_recordings", "", "application/json");
-    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(TavixPersistentStorage::Environment{
+        assembly.cachesFolder(), &pool, &clock, assembly.userDefaults.get(), &transactions});
     session = BackgroundUploadSession::create(transport, home.cache() / "journal", pool);
     assembly.uploadManager = UploadManager::create(assembly, session);
     assembly.bagController = TavixBagController::create(assembly);

@@ -8,7 +8,7 @@
 #include "feedback/client_session.h"
 #include "feedback/persistent_storage.h"
 #include "platform/defaults.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 
 namespace tavix {
 namespace {
@@ -163,17 +163,9 @@ TEST(CBAFilter, EngagementsAreGradedAgainstEarlierWebResultsOfTheirQuery) {
 }
 
 TEST(CBAFilter, OnlyBrowserSessionsAreFilteredOnTheirWayOut) {
-  testing::TempHome home;
-  platform::DispatchPool pool{2};
-  platform::VirtualClock clock;
-  Assembly assembly;
-  assembly.dispatchPool = &pool;
-  assembly.clock = &clock;
-  assembly.paths.cacheHome = home.cache();
-  assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
-  assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
-                                           {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})}});
-  assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+  testing::TestAssembly f;
+  f.makeStorage();
+  Assembly& assembly = f.assembly;
 
   auto upload = [&](const std::string& agent) {
     auto first = visible(4, {{kWebIndex, "https://a.com/x"}});

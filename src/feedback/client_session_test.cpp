@@ -13,27 +13,15 @@
 #include "platform/counters.h"
 #include "platform/defaults.h"
 #include "platform/log.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 
 namespace tavix {
 namespace {
 
 constexpr const char* kGuid = "0C9E0C3F-7B1B-4E42-A7B2-0E2A8C1F3D11";
 
-struct SessionFixture {
-  testing::TempHome home;
-  platform::DispatchPool pool{2};
-  platform::VirtualClock clock;
-  Assembly assembly;
-  SessionFixture() {
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.paths.cacheHome = home.cache();
-    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
-    assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
-                                             {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})}});
-    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
-  }
+struct SessionFixture : testing::TestAssembly {
+  SessionFixture() { makeStorage(); }
   proto::CTClientSession readBack(ClientSession& session) {
     session.sessionComplete();
     auto handles = assembly.persistentStorage->getAvailableSessionHandles();

@@ -7,7 +7,7 @@
 #include "platform/counters.h"
 #include "core/names.h"
 #include "feedback/vocabulary.h"
-#include "query/query_fixture.h"
+#include "support/query_fixture.h"
 
 namespace tavix::query_testing {
 namespace {
@@ -51,7 +51,7 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
 
   // Engaged completions for "zq": the browser gets one and no more, kept for the keystroke;
   // with it the short input goes to the network after all.
-  auto engaged = EngagedCompletionCache::sharedInstance(assembly);
+  auto engaged = assembly.engagedCompletionCache;
   for (const char* completion : {"zqalpha", "zqbeta", "zqgamma", "zqdelta"}) {
     engaged->addCompletion(completion, "zq", 0, 1);
     engaged->addCompletion(completion, "zq", 0, 2);
