@@ -122,7 +122,9 @@ void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform
   assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
   assembly.engagedCompletionCache =
       EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, assembly.userDefaults.get()});
-  assembly.uploadManager = UploadManager::create(assembly);
+  auto uploads = BackgroundUploadSession::create(assembly.uploadURLSession(), assembly.cachesFolder() / "UploadJournal", pool);
+  assembly.uploadManager =
+      UploadManager::create(pool, *assembly.notificationCenter, assembly.requestFactory, std::move(uploads));
   assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(TavixPersistentStorage::Environment{
       assembly.cachesFolder(), &pool, &clock, assembly.userDefaults.get(), assembly.transactions});
 }

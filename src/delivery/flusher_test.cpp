@@ -80,7 +80,7 @@ class FlusherTest : public ::testing::Test {
     assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(TavixPersistentStorage::Environment{
         assembly.cachesFolder(), &pool, &clock, assembly.userDefaults.get(), &transactions});
     session = BackgroundUploadSession::create(transport, home.cache() / "journal", pool);
-    assembly.uploadManager = UploadManager::create(assembly, session);
+    assembly.uploadManager = UploadManager::create(pool, *assembly.notificationCenter, assembly.requestFactory, session);
     assembly.bagController = TavixBagController::create(assembly);
     assembly.bagController->currentBag();
     ASSERT_TRUE(waitFor([&] { return assembly.uploadManager->feedbackEndpoint().has_value(); }));
