@@ -35,7 +35,7 @@ class BagFeedbackTest : public ::testing::Test, protected testing::TestAssembly 
     defaults->registerDefaults({{"TVXSessionSoftLimitOverride", platform::PropertyValue(std::int64_t{600})},
                                 {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
     defaults->setObject("TVXBagURL", server.baseURL() + "/bag");
-    assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+    makeRequestFactory();
     makeStorage();
     assembly.guidController = makeGUIDController();
     assembly.bagController = TavixBagController::create(assembly);

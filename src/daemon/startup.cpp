@@ -119,7 +119,11 @@ void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform
   assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
   assembly.locationManager = std::make_shared<DefaultsLocationManager>(defaults, clock, pool);
   assembly.motionManager = std::make_shared<DefaultsMotionManager>(defaults, pool);
-  assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+  TVXRequestFactoryProviders providers;
+  providers.locationManager = assembly.locationManager;
+  providers.motionManager = assembly.motionManager;
+  assembly.requestFactory = TVXNetworkRequestFactory::create(
+      {&pool, &clock, assembly.userDefaults, assembly.notificationCenter, assembly.cachesFolder()}, std::move(providers));
   assembly.engagedCompletionCache =
       EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, assembly.userDefaults.get()});
   auto uploads = BackgroundUploadSession::create(assembly.uploadURLSession(), assembly.cachesFolder() / "UploadJournal", pool);

@@ -69,7 +69,7 @@ class UploadManagerTest : public ::testing::Test, protected testing::TestAssembl
  protected:
   UploadManagerTest() : testing::TestAssembly(0) {
     home.exportEnvironment();
-    assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+    makeRequestFactory();
     std::string error;
     EXPECT_TRUE(server.start({}, &error)) << error;
   }

@@ -85,7 +85,7 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
     makeStorage();
     assembly.engagedCompletionCache =
         EngagedCompletionCache::create({assembly.cachesFolder(), clock_, &pool, defaults.get()});
-    assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+    makeRequestFactory();
     // The daemon's own session manager (warm-up records); clients keep sessions of their own.
     assembly.guidController = makeGUIDController();
     assembly.clientSessionManager =

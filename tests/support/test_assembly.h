@@ -9,6 +9,7 @@
 #include "context/user_guid_controller.h"
 #include "core/assembly.h"
 #include "feedback/persistent_storage.h"
+#include "network/request_factory.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
@@ -45,6 +46,14 @@ class TestAssembly {
   std::shared_ptr<TavixPersistentStorage> makeStorage(std::shared_ptr<SessionFileIO> io = nullptr) {
     assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(storageEnvironment(), std::move(io));
     return assembly.persistentStorage;
+  }
+  TVXNetworkRequestFactory::Environment requestFactoryEnvironment() {
+    return {&pool, assembly.clock, defaults, center, assembly.cachesFolder()};
+  }
+  // The request factory, also set as the assembly's.
+  std::shared_ptr<TVXNetworkRequestFactory> makeRequestFactory(TVXRequestFactoryProviders providers = {}) {
+    assembly.requestFactory = TVXNetworkRequestFactory::create(requestFactoryEnvironment(), std::move(providers));
+    return assembly.requestFactory;
   }
   // A new GUID controller announcing on the assembly's centre.
   std::shared_ptr<TavixUserGUIDController> makeGUIDController() {
