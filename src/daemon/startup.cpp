@@ -314,7 +314,8 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   platform::ipc::LaunchEventRegistry launchEvents(ipcEventQueue);
   TavixService service(assembly, &launchEvents);
   // After the service: a client state shares the service's GUID controller and session manager.
-  assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
+  assembly.clientStateManager = std::make_shared<ClientStateManager>(
+      pool, defaults, [&assembly](const std::string& identifier) { return ClientState::create(assembly, identifier); });
   assembly.flusherIPCListener = makeFlusherChannel(assembly, service);
 
   // The orderly end, on every way out once the services exist.

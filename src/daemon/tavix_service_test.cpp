@@ -34,7 +34,7 @@ TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
   {
     TavixService service(assembly);
     EXPECT_TRUE(assembly.sharedSession);
-    assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
+    assembly.clientStateManager = f.makeClientStateManager();
     std::error_code ec;
     auto listener = ipc::IpcListener::listen(pool, (home.runtime() / "socket").string(), log, &ec);
     ASSERT_TRUE(listener);

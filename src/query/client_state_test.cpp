@@ -178,7 +178,7 @@ TEST_F(ClientStateTest, NewUserAgentRelabelsTheBagAndEmptiesTheQueryCache) {
 
 TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
   startController();
-  auto manager = std::make_shared<ClientStateManager>(assembly);
+  auto manager = makeClientStateManager();
   EXPECT_EQ(manager->stateForClientIdentifier(""), nullptr);
 
   std::shared_ptr<ClientState> a, b;
@@ -203,7 +203,7 @@ TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
                       platform::Dictionary{{"identifier", "com.norvel.brovane"}, {"agent", "brovane/7"}},
                       platform::Dictionary{{"identifier", "com.norvel.news"}},
                   });
-  auto loaded = std::make_shared<ClientStateManager>(assembly);
+  auto loaded = makeClientStateManager();
   auto sessions = loaded->sessions();
   ASSERT_EQ(sessions.size(), 1u);
   EXPECT_EQ(*sessions[0].dictionary()->at("agent").string(), "brovane/7");
