@@ -143,7 +143,14 @@ void applySilhouette(const platform::UserDefaults& defaults, TVXNetworkRequestFa
 // The flush command channel: it flushes each connected client's session, and hears every
 // feedback event of the daemon's own session manager.
 std::shared_ptr<TavixFlusherIPC> makeFlusherChannel(Assembly& assembly, TavixService& service) {
-  auto channel = TavixFlusherIPC::create(assembly, [&service, &assembly] {
+  TavixFlusherIPC::Environment env;
+  env.pool = assembly.dispatchPool;
+  env.defaults = assembly.userDefaults;
+  env.sharedSession = assembly.sharedSession;
+  env.flushFeedback = [&assembly](std::function<void()> done) {
+    TavixFeedbackFlusher::create(assembly)->forceFlushWithCompletion(std::move(done));
+  };
+  env.getClientConnections = [&service, &assembly] {
     std::vector<TavixFlusherIPC::ClientConnectionHandle> handles;
     for (const auto& client : service.getClientConnections()) {
       TavixFlusherIPC::ClientConnectionHandle handle;
@@ -163,7 +170,8 @@ std::shared_ptr<TavixFlusherIPC> makeFlusherChannel(Assembly& assembly, TavixSer
       handles.push_back(std::move(handle));
     }
     return handles;
-  });
+  };
+  auto channel = TavixFlusherIPC::create(std::move(env));
   std::weak_ptr<TavixFlusherIPC> weak = channel;
   assembly.clientSessionManager->setFeedbackObserver([weak](const proto::CTTavixFeedback& feedback) {
     if (auto c = weak.lock()) c->sendDataToReceivingStreamListener(feedback);
