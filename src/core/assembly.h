@@ -74,9 +74,6 @@ class Assembly {
   // built. Empty until then.
   std::shared_ptr<ResourceVersionsProvider> resourceVersions;
 
-  // The bag controller asks before it reads or writes its disk cache; always true.
-  bool diskBagCacheEnabled() const { return true; }
-
   // The assembly's four URL sessions (queries, bag, resource downloads, feedback uploads). Each is
   // made on the first call of its accessor and the same session is returned ever after; safe from
   // any thread. urlSession reads "TVXNoParallax" from userDefaults once, when it is made.
