@@ -1,5 +1,8 @@
-// The daemon's one container of long-lived service objects. Every service object is made with a
-// reference to the Assembly and finds its peers through it instead of through globals.
+// The daemon's one container of long-lived service objects, filled by start-up. Persistent
+// storage, the GUID controller, the query cache, the request factory, the upload manager, the
+// client state manager and the flush command channel are handed what they use when they are
+// made; the bag controller, feedback sessions and their manager, the flushers, client states,
+// client connections and the service still find their peers through it.
 //
 // Fields are set during start-up on the main thread, in the order of start-up, before any client
 // can connect, and only read afterwards: no locking. An object may use, in its constructor, only

@@ -111,9 +111,9 @@ void createCustomFeedbackDirectories(const platform::Paths& paths) {
 
 namespace {
 
-// The services, made and wired in the order start-up needs: each finds in the assembly the ones it
-// reads in its constructor. Uploads left unsent by the last run resume with the upload manager;
-// endpoints come with the bag.
+// The services, made and wired in the order start-up needs: each is handed, or finds in the
+// assembly, the ones it reads in its constructor. Uploads left unsent by the last run resume with
+// the upload manager; endpoints come with the bag.
 void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform::Clock& clock) {
   auto& defaults = *assembly.userDefaults;
   assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
