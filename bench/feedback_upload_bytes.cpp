@@ -155,7 +155,7 @@ void BM_UploadBytesPerEvent(benchmark::State& state) {
     compressed = json = 0;
     for (std::size_t first = 0; first < total;) {
       const std::size_t last = perSession == 0 ? total : std::min(total, first + perSession);
-      auto session = ClientSession::open(f.assembly, std::make_shared<proto::CTTavixFeedback>(*day.events[first]));
+      auto session = ClientSession::open(feedbackEnvironment(f.assembly), std::make_shared<proto::CTTavixFeedback>(*day.events[first]));
       for (std::size_t i = first + 1; i < last; ++i) {
         session->addFeedback(std::make_shared<proto::CTTavixFeedback>(*day.events[i]));
       }
@@ -167,7 +167,7 @@ void BM_UploadBytesPerEvent(benchmark::State& state) {
       auto record = file->readRecord();
       f.assembly.persistentStorage->deleteSessionWithFileContainer(file);
       if (!record) continue;
-      const std::string body = ClientSession::fromRecord(f.assembly, std::move(*record))->getFeedbacksToSend();
+      const std::string body = ClientSession::fromRecord(feedbackEnvironment(f.assembly), std::move(*record))->getFeedbacksToSend();
       auto sink = std::make_shared<NullStream>();
       CompressedOutputStream stream(sink);
       stream.open();

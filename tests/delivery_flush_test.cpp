@@ -70,7 +70,7 @@ void writeSessions(const testing::TempHome& home, const std::vector<std::string>
     event.set_code(500);
     event.set_domain("tests");
     event.set_reason("from " + agent);
-    auto session = ClientSession::open(assembly, makeTavixFeedbackWithCodable(event, 0, "", agent));
+    auto session = ClientSession::open(feedbackEnvironment(assembly), makeTavixFeedbackWithCodable(event, 0, "", agent));
     event.set_reason("again from " + agent);
     session->addFeedback(makeTavixFeedbackWithCodable(event, 0, "", agent));
     session->sessionComplete();

@@ -395,7 +395,7 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
 
   // The fetch is a feedback session of its own: start, end and, on failure, the error.
   const auto start = bagFetchStartRecord(*request, hostTicks(*assembly_.clock));
-  auto session = ClientSession::open(assembly_, wrapFetchRecord(start));
+  auto session = ClientSession::open(feedbackEnvironment(assembly_), wrapFetchRecord(start));
 
   // Through the network-service proxy when the last bag asked for one, on every attempt.
   auto retryable = std::make_shared<const TVXRetryableNetworkRequest>(*request, std::nullopt, true,

@@ -93,7 +93,7 @@ class FlusherTest : public ::testing::Test, protected testing::TestAssembly {
     error.set_code(500);
     error.set_domain("test");
     error.set_reason("first");
-    auto s = ClientSession::open(assembly, makeTavixFeedbackWithCodable(error, 0, "", agent));
+    auto s = ClientSession::open(feedbackEnvironment(assembly), makeTavixFeedbackWithCodable(error, 0, "", agent));
     for (int i = 1; i < events; ++i) {
       error.set_reason("event " + std::to_string(i));
       s->addFeedback(makeTavixFeedbackWithCodable(error, 0, "", agent));

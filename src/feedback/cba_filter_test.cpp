@@ -170,7 +170,7 @@ TEST(CBAFilter, OnlyBrowserSessionsAreFilteredOnTheirWayOut) {
   auto upload = [&](const std::string& agent) {
     auto first = visible(4, {{kWebIndex, "https://a.com/x"}});
     first->set_user_agent(agent);
-    auto session = ClientSession::open(assembly, first);
+    auto session = ClientSession::open(feedbackEnvironment(assembly), first);
     auto matched = cba(4, "https://a.com/x", 1);
     auto unmatched = cba(4, "https://nowhere.com/", 2);
     matched->set_user_agent(agent);
@@ -181,7 +181,7 @@ TEST(CBAFilter, OnlyBrowserSessionsAreFilteredOnTheirWayOut) {
     auto handles = assembly.persistentStorage->getAvailableSessionHandles();
     auto record = handles.back()->readRecord();
     EXPECT_TRUE(record.has_value());
-    auto back = ClientSession::fromRecord(assembly, record.value_or(proto::CTClientSession()));
+    auto back = ClientSession::fromRecord(feedbackEnvironment(assembly), record.value_or(proto::CTClientSession()));
     return nlohmann::json::parse(back->getFeedbacksToSend())["fb"];
   };
 
