@@ -11,7 +11,6 @@
 
 #include "cache/critbit.h"
 #include "cache/query_cache.h"
-#include "core/assembly.h"
 #include "platform/clock.h"
 #include "platform/dispatch.h"
 #include "platform/http/url_request.h"
@@ -97,11 +96,8 @@ BENCHMARK(BM_MapPrefix);
 void BM_QueryCacheGetRequest(benchmark::State& state) {
   platform::DispatchPool pool(2);
   platform::VirtualClock clock;
-  Assembly assembly;
-  assembly.dispatchPool = &pool;
-  assembly.clock = &clock;
-  assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
-  auto cache = QueryCache::create(assembly);
+  platform::NotificationCenter center;
+  auto cache = QueryCache::create(pool, clock, center);
   platform::http::URLRequest request;
   request.url = "https://s.example/search?q=x&qtype=web";
   auto keys = makeKeys(1000, 11);

@@ -22,7 +22,7 @@
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
 #include "platform/log.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 
 namespace {
 
@@ -30,26 +30,18 @@ using namespace tavix;
 
 constexpr int kEventsPerSession = 1000;
 
-struct Fixture {
-  testing::TempHome home;
-  platform::DispatchPool pool;  // the daemon's size: nested sync hops park threads
-  platform::VirtualClock clock;  // no session ever reaches its soft limit during a run
-  Assembly assembly;
+// The daemon's pool size (nested sync hops park threads) and a virtual clock: no session ever
+// reaches its soft limit during a run.
+struct Fixture : testing::TestAssembly {
   std::shared_ptr<ClientSessionManager> manager;
 
-  explicit Fixture(bool shared) {
+  explicit Fixture(bool shared) : testing::TestAssembly(0) {
     platform::setLogLevel(platform::LogLevel::Error);
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
     assembly.sharedSession = shared;
-    assembly.paths.cacheHome = home.cache();
-    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
-    assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
-                                             {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})},
-                                             {"TVXSessionSoftLimitOverride", platform::PropertyValue(std::int64_t{600})},
-                                             {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
-    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
-    assembly.guidController = std::make_shared<TavixUserGUIDController>(assembly);
+    defaults->registerDefaults({{"TVXSessionSoftLimitOverride", platform::PropertyValue(std::int64_t{600})},
+                                {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
+    makeStorage();
+    assembly.guidController = makeGUIDController();
     manager = std::make_shared<ClientSessionManager>(assembly, assembly.guidController, nullptr, "tavix");
   }
   ~Fixture() { pool.drain(); }

@@ -20,7 +20,7 @@
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
 #include "platform/log.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 #include "tavix_proto/feedback_session.pb.h"
 
 namespace {
@@ -135,21 +135,10 @@ struct Day {
   }
 };
 
-struct Fixture {
-  testing::TempHome home;
-  platform::DispatchPool pool;
-  platform::VirtualClock clock;
-  Assembly assembly;
-
-  Fixture() {
+struct Fixture : testing::TestAssembly {
+  Fixture() : testing::TestAssembly(0) {
     platform::setLogLevel(platform::LogLevel::Error);
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.paths.cacheHome = home.cache();
-    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
-    assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
-                                             {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})}});
-    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+    makeStorage();
   }
   ~Fixture() { pool.drain(); }
 };
@@ -166,7 +155,7 @@ void BM_UploadBytesPerEvent(benchmark::State& state) {
     compressed = json = 0;
     for (std::size_t first = 0; first < total;) {
       const std::size_t last = perSession == 0 ? total : std::min(total, first + perSession);
-      auto session = ClientSession::open(f.assembly, std::make_shared<proto::CTTavixFeedback>(*day.events[first]));
+      auto session = ClientSession::open(feedbackEnvironment(f.assembly), std::make_shared<proto::CTTavixFeedback>(*day.events[first]));
       for (std::size_t i = first + 1; i < last; ++i) {
         session->addFeedback(std::make_shared<proto::CTTavixFeedback>(*day.events[i]));
       }
@@ -178,7 +167,7 @@ void BM_UploadBytesPerEvent(benchmark::State& state) {
       auto record = file->readRecord();
       f.assembly.persistentStorage->deleteSessionWithFileContainer(file);
       if (!record) continue;
-      const std::string body = ClientSession::fromRecord(f.assembly, std::move(*record))->getFeedbacksToSend();
+      const std::string body = ClientSession::fromRecord(feedbackEnvironment(f.assembly), std::move(*record))->getFeedbacksToSend();
       auto sink = std::make_shared<NullStream>();
       CompressedOutputStream stream(sink);
       stream.open();

@@ -21,30 +21,23 @@
 #include "platform/http/url_session.h"
 #include "platform/notification_center.h"
 #include "support/temp_home.h"
+#include "support/test_assembly.h"
 
 namespace tavix {
 namespace {
 
 using tavix::testing::waitFor;
 
-class BagFeedbackTest : public ::testing::Test {
+class BagFeedbackTest : public ::testing::Test, protected testing::TestAssembly {
  protected:
-  BagFeedbackTest() {
+  BagFeedbackTest() : testing::TestAssembly(4) {
     EXPECT_TRUE(server.start({}, nullptr));
-    auto defaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
-    defaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
-                                {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})},
-                                {"TVXSessionSoftLimitOverride", platform::PropertyValue(std::int64_t{600})},
+    defaults->registerDefaults({{"TVXSessionSoftLimitOverride", platform::PropertyValue(std::int64_t{600})},
                                 {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
     defaults->setObject("TVXBagURL", server.baseURL() + "/bag");
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.paths = platform::Paths{home.cache(), home.config(), home.runtime()};
-    assembly.userDefaults = defaults;
-    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
-    assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
-    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
-    assembly.guidController = std::make_shared<TavixUserGUIDController>(assembly);
+    makeRequestFactory();
+    makeStorage();
+    assembly.guidController = makeGUIDController();
     assembly.bagController = TavixBagController::create(assembly);
     assembly.clientSessionManager =
         std::make_shared<ClientSessionManager>(assembly, assembly.guidController, assembly.bagController, "tavix");
@@ -94,11 +87,7 @@ class BagFeedbackTest : public ::testing::Test {
     return makeTavixFeedbackWithCodable(hit, 3, "", agent);
   }
 
-  testing::TempHome home;
   devserver::DevServer server;
-  platform::DispatchPool pool{4};
-  platform::VirtualClock clock;
-  Assembly assembly;
   std::shared_ptr<platform::http::URLSession> control = std::make_shared<platform::http::URLSession>();
 };
 

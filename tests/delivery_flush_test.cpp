@@ -63,13 +63,14 @@ void writeSessions(const testing::TempHome& home, const std::vector<std::string>
   assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config() / "scratch", "scratch");
   assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
                                            {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})}});
-  assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+  assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(TavixPersistentStorage::Environment{
+      assembly.cachesFolder(), &pool, &clock, assembly.userDefaults.get()});
   for (const auto& agent : agents) {
     proto::CTErrorFeedback event;
     event.set_code(500);
     event.set_domain("tests");
     event.set_reason("from " + agent);
-    auto session = ClientSession::open(assembly, makeTavixFeedbackWithCodable(event, 0, "", agent));
+    auto session = ClientSession::open(feedbackEnvironment(assembly), makeTavixFeedbackWithCodable(event, 0, "", agent));
     event.set_reason("again from " + agent);
     session->addFeedback(makeTavixFeedbackWithCodable(event, 0, "", agent));
     session->sessionComplete();

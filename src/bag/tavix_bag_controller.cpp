@@ -395,7 +395,7 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
 
   // The fetch is a feedback session of its own: start, end and, on failure, the error.
   const auto start = bagFetchStartRecord(*request, hostTicks(*assembly_.clock));
-  auto session = ClientSession::open(assembly_, wrapFetchRecord(start));
+  auto session = ClientSession::open(feedbackEnvironment(assembly_), wrapFetchRecord(start));
 
   // Through the network-service proxy when the last bag asked for one, on every attempt.
   auto retryable = std::make_shared<const TVXRetryableNetworkRequest>(*request, std::nullopt, true,
@@ -471,10 +471,6 @@ Dictionary TavixBagController::cacheBagDictionary(const Dictionary& dictionary) 
   augmented[kExpirationKey] = PropertyValue(platform::toUnixSeconds(assembly_.clock->now()) + kBagLifetimeSeconds);
   if (auto url = currentBagCacheURL()) augmented[kBagURLKey] = PropertyValue(*url);
 
-  if (!assembly_.diskBagCacheEnabled()) {
-    bagLog().info("skipping writing bag to disk because the flag is disabled");
-    return augmented;
-  }
   std::error_code ec;
   auto path = pathToCachedBag(&ec);
   if (!path) {
@@ -513,10 +509,6 @@ std::optional<platform::fs::path> TavixBagController::pathToCachedBag(std::error
 }
 
 std::optional<Dictionary> TavixBagController::diskCachedBagDictionary() {
-  if (!assembly_.diskBagCacheEnabled()) {
-    bagLog().info("skipping check for bag on disk because the flag is disabled");
-    return std::nullopt;
-  }
   auto path = pathToCachedBag(nullptr);
   if (!path) return std::nullopt;
   std::string bytes;

@@ -21,7 +21,7 @@
 #include "platform/http/url_session.h"
 #include "platform/log.h"
 #include "platform/notification_center.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 
 namespace tavix {
 namespace {
@@ -30,19 +30,13 @@ using platform::Dictionary;
 using platform::PropertyValue;
 using tavix::testing::waitFor;
 
-class BagControllerTest : public ::testing::Test {
+class BagControllerTest : public ::testing::Test, protected testing::TestAssembly {
  protected:
   BagControllerTest() {
     EXPECT_TRUE(server.start({}, nullptr));
-    defaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
     defaults->setObject("TVXLocale", "fr_FR");
     defaults->setObject("TVXBagURL", server.baseURL() + "/bag");
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.paths = platform::Paths{home.cache(), home.config(), home.runtime()};
-    assembly.userDefaults = defaults;
-    assembly.notificationCenter = center;
-    assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+    makeRequestFactory();
     changes = center->addObserver(kTVXBagChangeNotification, nullptr, nullptr, [this](const platform::Notification& n) {
       std::lock_guard hold(lock);
       EXPECT_EQ(n.sender, nullptr);
@@ -111,14 +105,8 @@ class BagControllerTest : public ::testing::Test {
     return posted.size();
   }
 
-  testing::TempHome home;
   devserver::DevServer server;
-  platform::DispatchPool pool{2};
-  platform::VirtualClock clock;
-  std::shared_ptr<platform::UserDefaults> defaults;
-  std::shared_ptr<platform::NotificationCenter> center = std::make_shared<platform::NotificationCenter>();
   std::shared_ptr<platform::http::URLSession> control = std::make_shared<platform::http::URLSession>();
-  Assembly assembly;
   std::shared_ptr<TavixBagController> controller;
 
   std::mutex lock;

@@ -8,7 +8,6 @@
 #include <cstdlib>
 #include <set>
 
-#include "core/assembly.h"
 #include "core/logging.h"
 #include "core/names.h"
 #include "platform/http/url_request.h"
@@ -75,32 +74,32 @@ CachedResultSet::CachedResultSet(const std::string& input, const platform::http:
   }
 }
 
-std::shared_ptr<QueryCache> QueryCache::create(Assembly& assembly) {
-  std::shared_ptr<QueryCache> cache(new QueryCache(assembly));
-  cache->registerNotifications();
+std::shared_ptr<QueryCache> QueryCache::create(platform::DispatchPool& pool, platform::Clock& clock,
+                                               platform::NotificationCenter& center) {
+  std::shared_ptr<QueryCache> cache(new QueryCache(pool, clock));
+  cache->registerNotifications(center);
   return cache;
 }
 
-QueryCache::QueryCache(Assembly& assembly)
-    : assembly_(assembly), queue_(*assembly.dispatchPool, "com.norvel.tavix.queryCache") {}
+QueryCache::QueryCache(platform::DispatchPool& pool, platform::Clock& clock)
+    : clock_(clock), queue_(pool, "com.norvel.tavix.queryCache") {}
 
 QueryCache::~QueryCache() {
   registrations_.clear();
   source_.reset();
 }
 
-void QueryCache::registerNotifications() {
+void QueryCache::registerNotifications(platform::NotificationCenter& center) {
   static constexpr const char* names[] = {
       kTVXUserGUIDChangeNotification,     kTVXSessionSoftLimitNotification,    kTVXSessionMaxLimitNotification,
       kCountryCodeDidChangeNotification,  kSystemTimeZoneDidChangeNotification, kCurrentLocaleDidChangeNotification,
       kManagedSettingsDidChangeNotification, kAccountStoreDidChangeNotification,
       kAccountCredentialsDidChangeNotification,
   };
-  if (!assembly_.notificationCenter) return;
   std::weak_ptr<QueryCache> weak = weak_from_this();
   for (const char* name : names) {
     registrations_.push_back(
-        assembly_.notificationCenter->addObserver(name, nullptr, nullptr, [weak](const platform::Notification&) {
+        center.addObserver(name, nullptr, nullptr, [weak](const platform::Notification&) {
           // Strong only for the dispatched block.
           if (auto self = weak.lock()) self->queue_.async([self] { self->clearCache(); });
         }));
@@ -150,7 +149,7 @@ Ref<CachedResultSet> QueryCache::getRequest(const CacheSearchRequest& request,
   const std::size_t inputLength = queryLength(input);
   Ref<CachedResultSet> choice;
   queue_.sync([&] {
-    const platform::TimePoint now = assembly_.clock->now();
+    const platform::TimePoint now = clock_.now();
     std::vector<Ref<CachedResultSet>> candidates;
     std::set<std::string> expired;
     tree_.keysMatchingPrefix(input, [&](std::string_view key, bool*) {

@@ -24,7 +24,6 @@
 
 namespace tavix {
 
-class Assembly;
 namespace platform {
 class MemoryPressureSource;
 namespace http {
@@ -93,8 +92,10 @@ class QueryCache : public std::enable_shared_from_this<QueryCache> {
   static constexpr std::uint64_t kMaximumCost = 0x200000;
   static constexpr std::uint32_t kMemoryPressureMask = 0x20;
 
-  // Needs the assembly's dispatch pool, clock and notification centre; they must outlive it.
-  static std::shared_ptr<QueryCache> create(Assembly& assembly);
+  // The pool, clock and centre must outlive it. Whatever changes the answers a search would get
+  // (a new user identifier, locale, time zone, account, ...) is posted on `center` and empties it.
+  static std::shared_ptr<QueryCache> create(platform::DispatchPool& pool, platform::Clock& clock,
+                                            platform::NotificationCenter& center);
   ~QueryCache();
   QueryCache(const QueryCache&) = delete;
   QueryCache& operator=(const QueryCache&) = delete;
@@ -115,15 +116,15 @@ class QueryCache : public std::enable_shared_from_this<QueryCache> {
   bool listensForMemoryPressure();
 
  private:
-  explicit QueryCache(Assembly& assembly);
-  void registerNotifications();
+  QueryCache(platform::DispatchPool& pool, platform::Clock& clock);
+  void registerNotifications(platform::NotificationCenter& center);
   void clearCache();
   void didBecomeNonEmpty();
   void didBecomeEmpty();
   void listenForMemoryPressure();
   void stopListeningForMemoryPressure();
 
-  Assembly& assembly_;
+  platform::Clock& clock_;
   platform::SerialQueue queue_;
   std::unique_ptr<platform::MemoryPressureSource> source_;
   CritbitTree tree_;

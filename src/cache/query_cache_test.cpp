@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include "core/assembly.h"
 #include "platform/http/url_request.h"
 #include "platform/log.h"
 #include "platform/memory_pressure.h"
@@ -14,12 +13,7 @@ using platform::seconds;
 
 class QueryCacheTest : public ::testing::Test {
  protected:
-  QueryCacheTest() : pool_(2) {
-    assembly_.dispatchPool = &pool_;
-    assembly_.clock = &clock_;
-    assembly_.notificationCenter = std::make_shared<platform::NotificationCenter>();
-    cache_ = QueryCache::create(assembly_);
-  }
+  QueryCacheTest() : pool_(2) { cache_ = QueryCache::create(pool_, clock_, center_); }
 
   Ref<CachedResultSet> entry(const std::string& input, const std::string& query, platform::Dictionary reply = {},
                              std::string url = "https://s.example/search?q=x", std::size_t bytes = 10,
@@ -47,7 +41,7 @@ class QueryCacheTest : public ::testing::Test {
 
   platform::DispatchPool pool_;
   platform::VirtualClock clock_;
-  Assembly assembly_;
+  platform::NotificationCenter center_;
   std::shared_ptr<QueryCache> cache_;
 };
 
@@ -139,12 +133,12 @@ TEST_F(QueryCacheTest, ClearsOnNotificationsAndMemoryPressure) {
                            kAccountCredentialsDidChangeNotification}) {
     store(entry("a", "abc"));
     EXPECT_TRUE(cache_->listensForMemoryPressure());
-    assembly_.notificationCenter->post(name);
+    center_.post(name);
     EXPECT_EQ(cache_->count(), 0u) << name;
     EXPECT_EQ(cache_->currentCost(), 0u);
     EXPECT_FALSE(cache_->listensForMemoryPressure());
   }
-  assembly_.notificationCenter->post("SomethingElse");
+  center_.post("SomethingElse");
 
   store(entry("a", "abc"));
   platform::raiseMemoryPressure(platform::MemoryPressureWarn);  // not in the mask

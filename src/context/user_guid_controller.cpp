@@ -8,7 +8,6 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "platform/notification_center.h"
 
@@ -57,18 +56,21 @@ bool isValidUUIDString(const std::string& text) {
   return true;
 }
 
-TavixUserGUIDController::TavixUserGUIDController(Assembly& assembly)
-    : assembly_(assembly),
-      queue_(*assembly.dispatchPool, "com.norvel.tavix.guid"),
+TavixUserGUIDController::TavixUserGUIDController(platform::DispatchPool& pool, platform::Clock& clock,
+                                                 std::shared_ptr<platform::NotificationCenter> center)
+    : pool_(pool),
+      clock_(clock),
+      center_(std::move(center)),
+      queue_(pool, "com.norvel.tavix.guid"),
       lastKnownUserGUID_(makeRandomUUIDString()),
-      lastKnownUserGUIDExpirationDate_(assembly.clock->now() + platform::seconds(kTavixUserGUIDLifetimeSeconds)) {}
+      lastKnownUserGUIDExpirationDate_(clock.now() + platform::seconds(kTavixUserGUIDLifetimeSeconds)) {}
 
 TavixUserGUIDController::~TavixUserGUIDController() = default;
 
 std::string TavixUserGUIDController::currentUserGUID() {
   std::string guid;
   queue_.sync([&] {
-    if (lastKnownUserGUIDExpirationDate_ <= assembly_.clock->now()) rollGUID();
+    if (lastKnownUserGUIDExpirationDate_ <= clock_.now()) rollGUID();
     guid = lastKnownUserGUID_;
   });
   return guid;
@@ -84,12 +86,12 @@ void TavixUserGUIDController::reset() {
 void TavixUserGUIDController::rollGUID() {
   queue_.assertCurrent("rollGUID");
   lastKnownUserGUID_ = makeRandomUUIDString();
-  lastKnownUserGUIDExpirationDate_ = assembly_.clock->now() + platform::seconds(kTavixUserGUIDLifetimeSeconds);
+  lastKnownUserGUIDExpirationDate_ = clock_.now() + platform::seconds(kTavixUserGUIDLifetimeSeconds);
   // Announced from a separate block off this queue, so an observer that reads the identifier
   // (a synchronous hop onto this queue) sees the new one instead of waiting on itself.
-  assembly_.dispatchPool->post([center = assembly_.notificationCenter] {
+  pool_.post([center = center_] {
     TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.userguid");
-    if (center) center->post(kTVXUserGUIDChangeNotification);
+    center->post(kTVXUserGUIDChangeNotification);
   });
 }
 

@@ -17,7 +17,11 @@
 
 namespace tavix {
 
-class Assembly;
+namespace platform {
+class Clock;
+class DispatchPool;
+class NotificationCenter;
+}  // namespace platform
 
 inline constexpr double kTavixUserGUIDLifetimeSeconds = 900;
 
@@ -28,10 +32,11 @@ bool isValidUUIDString(const std::string& text);
 
 class TavixUserGUIDController : public std::enable_shared_from_this<TavixUserGUIDController> {
  public:
-  // Needs assembly.dispatchPool and assembly.clock; the notification centre may be absent (then
-  // nothing is posted). Creation posts nothing. Own it with a std::shared_ptr: a reset queued
+  // The pool and clock must outlive it; each new identifier is announced on `center`.
+  // Creation posts nothing. Own it with a std::shared_ptr: a reset queued
   // before the controller goes finds it gone and does nothing.
-  explicit TavixUserGUIDController(Assembly& assembly);
+  TavixUserGUIDController(platform::DispatchPool& pool, platform::Clock& clock,
+                          std::shared_ptr<platform::NotificationCenter> center);
   TavixUserGUIDController(const TavixUserGUIDController&) = delete;
   TavixUserGUIDController& operator=(const TavixUserGUIDController&) = delete;
   ~TavixUserGUIDController();
@@ -45,7 +50,10 @@ class TavixUserGUIDController : public std::enable_shared_from_this<TavixUserGUI
  private:
   void rollGUID();  // on queue_
 
-  Assembly& assembly_;
+  platform::DispatchPool& pool_;
+  platform::Clock& clock_;
+  // Shared: the announcement runs on the pool and may outlive the controller.
+  std::shared_ptr<platform::NotificationCenter> center_;
   platform::SerialQueue queue_;
   std::string lastKnownUserGUID_;
   platform::TimePoint lastKnownUserGUIDExpirationDate_;

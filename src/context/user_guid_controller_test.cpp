@@ -5,33 +5,25 @@
 #include <atomic>
 #include <latch>
 
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "platform/counters.h"
 #include "platform/notification_center.h"
+#include "support/test_assembly.h"
 
 namespace tavix {
 namespace {
 
-struct GuidFixture {
-  platform::DispatchPool pool{2};
-  platform::VirtualClock clock;
-  Assembly assembly;
+struct GuidFixture : testing::TestAssembly {
   std::atomic<int> posts{0};
-  platform::NotificationCenter::Registration registration;
-  GuidFixture() {
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
-    registration = assembly.notificationCenter->addObserver(kTVXUserGUIDChangeNotification, nullptr, nullptr,
-                                                            [this](const platform::Notification&) { ++posts; });
-  }
+  platform::NotificationCenter::Registration registration =
+      center->addObserver(kTVXUserGUIDChangeNotification, nullptr, nullptr,
+                          [this](const platform::Notification&) { ++posts; });
 };
 
 TEST(TavixUserGUIDController, IdentifierLivesExactly900Seconds) {
   GuidFixture f;
   const auto counterBefore = TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.userguid");
-  auto controller = std::make_shared<TavixUserGUIDController>(f.assembly);
+  auto controller = f.makeGUIDController();
   const std::string first = controller->currentUserGUID();
   EXPECT_TRUE(isValidUUIDString(first));
   EXPECT_EQ(first.find_first_of("abcdef"), std::string::npos);
@@ -52,7 +44,7 @@ TEST(TavixUserGUIDController, IdentifierLivesExactly900Seconds) {
 
 TEST(TavixUserGUIDController, EachResetRollsAndAnnounces) {
   GuidFixture f;
-  auto controller = std::make_shared<TavixUserGUIDController>(f.assembly);
+  auto controller = f.makeGUIDController();
   const std::string first = controller->currentUserGUID();
   controller->reset();
   const std::string second = controller->currentUserGUID();
@@ -78,20 +70,13 @@ TEST(TavixUserGUIDController, EachResetRollsAndAnnounces) {
 }
 
 TEST(TavixUserGUIDController, ObserverMayReadTheNewIdentifier) {
-  platform::DispatchPool pool{2};
-  platform::VirtualClock clock;
-  Assembly assembly;
-  assembly.dispatchPool = &pool;
-  assembly.clock = &clock;
-  assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
-  auto controller = std::make_shared<TavixUserGUIDController>(assembly);
+  testing::TestAssembly f;
+  auto controller = f.makeGUIDController();
   std::string seen;
-  auto reg = assembly.notificationCenter->addObserver(kTVXUserGUIDChangeNotification, nullptr, nullptr,
-                                                      [&](const platform::Notification&) {
-                                                        seen = controller->currentUserGUID();
-                                                      });
+  auto reg = f.center->addObserver(kTVXUserGUIDChangeNotification, nullptr, nullptr,
+                                   [&](const platform::Notification&) { seen = controller->currentUserGUID(); });
   controller->reset();
-  pool.drain();
+  f.pool.drain();
   EXPECT_EQ(seen, controller->currentUserGUID());
   EXPECT_FALSE(isValidUUIDString("not-a-uuid"));
 }

@@ -9,8 +9,6 @@
 
 namespace tavix {
 
-bool Assembly::useMarvola() const { return userDefaults && userDefaults->boolForKey("TVXUseMarvola"); }
-
 namespace {
 
 using platform::http::URLSession;

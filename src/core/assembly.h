@@ -1,5 +1,8 @@
-// The daemon's one container of long-lived service objects. Every service object is made with a
-// reference to the Assembly and finds its peers through it instead of through globals.
+// The daemon's one container of long-lived service objects, filled by start-up. Persistent
+// storage, the GUID controller, the query cache, the request factory, the upload manager, the
+// client state manager and the flush command channel are handed what they use when they are
+// made; the bag controller, feedback sessions and their manager, the flushers, client states,
+// client connections and the service still find their peers through it.
 //
 // Fields are set during start-up on the main thread, in the order of start-up, before any client
 // can connect, and only read afterwards: no locking. An object may use, in its constructor, only
@@ -73,12 +76,6 @@ class Assembly {
   // The resource versions each new feedback session records; the download manager's, once it is
   // built. Empty until then.
   std::shared_ptr<ResourceVersionsProvider> resourceVersions;
-
-  // The bag controller asks before it reads or writes its disk cache; always true.
-  bool diskBagCacheEnabled() const { return true; }
-
-  // The current "TVXUseMarvola" default, read on every call so a change needs no restart.
-  bool useMarvola() const;
 
   // The assembly's four URL sessions (queries, bag, resource downloads, feedback uploads). Each is
   // made on the first call of its accessor and the same session is returned ever after; safe from

@@ -183,17 +183,15 @@ ClientConnection::~ClientConnection() {
 }
 
 void ClientConnection::start() {
-  if (assembly_.notificationCenter) {
-    std::weak_ptr<ClientConnection> weak = weak_from_this();
-    downloadObserver_ = assembly_.notificationCenter->addObserver(
-        kTVXFileDownloadCompletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
-          if (auto self = weak.lock()) self->relayResourceNotification(n, true);
-        });
-    deleteObserver_ = assembly_.notificationCenter->addObserver(
-        kTVXFileDeletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
-          if (auto self = weak.lock()) self->relayResourceNotification(n, false);
-        });
-  }
+  std::weak_ptr<ClientConnection> weak = weak_from_this();
+  downloadObserver_ = assembly_.notificationCenter->addObserver(
+      kTVXFileDownloadCompletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
+        if (auto self = weak.lock()) self->relayResourceNotification(n, true);
+      });
+  deleteObserver_ = assembly_.notificationCenter->addObserver(
+      kTVXFileDeletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
+        if (auto self = weak.lock()) self->relayResourceNotification(n, false);
+      });
   openOrExtendTransaction();
 }
 
@@ -330,9 +328,7 @@ void ClientConnection::listSessions(std::uint64_t callId) {
   ensureState();
   proto::Envelope out;
   auto* answer = out.mutable_list_sessions_reply();
-  if (assembly_.clientStateManager) {
-    for (const auto& session : assembly_.clientStateManager->sessions()) answer->add_sessions(platform::toJson(session));
-  }
+  for (const auto& session : assembly_.clientStateManager->sessions()) answer->add_sessions(platform::toJson(session));
   reply(callId, out);
 }
 
@@ -391,7 +387,6 @@ void ClientConnection::ensureState() {
     if (state_->identifier() != configuration_->identifier) sessionLog().fault("session identifier must match");
     return;
   }
-  if (!assembly_.clientStateManager) return;
   std::string fullUserAgent;
   if (!configuration_->userAgent.empty()) {
     // The factory's device answers are the process's: the system's version is read once.
@@ -478,14 +473,14 @@ void ClientConnection::bagDidLoad(const std::shared_ptr<const TVXBag>& bag, cons
   if (!bag && !error) out.mutable_bag_did_load();
   send(0, out);
   if (bag) setEngagedCompletionCacheValues(*bag);
-  if (!bagObserver_ && assembly_.notificationCenter) {
+  if (!bagObserver_) {
     std::weak_ptr<ClientConnection> weak = weak_from_this();
     bagObserver_ = assembly_.notificationCenter->addObserver(
         kTVXBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
           if (auto self = weak.lock()) self->bagChangeNotification(n);
         });
   }
-  if (assembly_.clientStateManager) assembly_.clientStateManager->saveState();
+  assembly_.clientStateManager->saveState();
 }
 
 void ClientConnection::bagChangeNotification(const platform::Notification& notification) {

@@ -20,7 +20,7 @@
 #include "cache/query_cache.h"
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 #include "tavix_proto/ipc.pb.h"
 #include "cache/engaged_completion_cache.h"
 
@@ -30,33 +30,21 @@ namespace {
 namespace ipc = platform::ipc;
 
 // A ClientConnection on one end of a socket pair; the test plays the client on the other.
-struct Harness {
-  // First: transactions still held by pending timers end when the clock goes.
-  platform::TransactionTracker transactions;
-  platform::DispatchPool pool{2};
-  platform::VirtualClock clock;
+struct Harness : testing::TestAssembly {
   platform::SerialQueue activityQueue{pool, "test.activities"};
   platform::ActivityScheduler activities{clock, activityQueue, transactions};
   platform::SerialQueue eventQueue{pool, "test.events"};
   ipc::LaunchEventRegistry events{eventQueue};
   platform::Logger log{"test", "connection"};
-  testing::TempHome home;
-  Assembly assembly;
   ipc::UniqueFd client;
   std::shared_ptr<ipc::IpcConnection> connection;
   std::shared_ptr<ClientConnection> subject;
   ipc::FrameDecoder decoder;
 
   explicit Harness(std::size_t maxFrame = ipc::kMaxFrameSize) {
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.transactions = &transactions;
     assembly.activityScheduler = &activities;
-    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
-    assembly.paths = platform::Paths{home.cache(), home.config(), home.runtime()};
-    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
     assembly.engagedCompletionCache = EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, nullptr});
-    assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
+    assembly.clientStateManager = makeClientStateManager();
     int fds[2];
     EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
     client.reset(fds[1]);

@@ -123,7 +123,7 @@ std::vector<const proto::CTSearchResultForFeedback*> listedResults(const proto::
 void ClientConnection::reportFeedbackPayloadData(const std::string& data, std::uint64_t argumentQueryId) {
   ensureState();
   auto reportError = [this](const std::string& reason) {
-    ClientSession::createFeedbackSessionFromError(500, kTVXErrorDomain, reason, assembly_);
+    ClientSession::createFeedbackSessionFromError(500, kTVXErrorDomain, reason, feedbackEnvironment(assembly_));
   };
   if (!state_) {
     reportError("client state nil");

@@ -111,19 +111,26 @@ void createCustomFeedbackDirectories(const platform::Paths& paths) {
 
 namespace {
 
-// The services, made and wired in the order start-up needs: each finds in the assembly the ones it
-// reads in its constructor. Uploads left unsent by the last run resume with the upload manager;
-// endpoints come with the bag.
+// The services, made and wired in the order start-up needs: each is handed, or finds in the
+// assembly, the ones it reads in its constructor. Uploads left unsent by the last run resume with
+// the upload manager; endpoints come with the bag.
 void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform::Clock& clock) {
   auto& defaults = *assembly.userDefaults;
   assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
   assembly.locationManager = std::make_shared<DefaultsLocationManager>(defaults, clock, pool);
   assembly.motionManager = std::make_shared<DefaultsMotionManager>(defaults, pool);
-  assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+  TVXRequestFactoryProviders providers;
+  providers.locationManager = assembly.locationManager;
+  providers.motionManager = assembly.motionManager;
+  assembly.requestFactory = TVXNetworkRequestFactory::create(
+      {&pool, &clock, assembly.userDefaults, assembly.notificationCenter, assembly.cachesFolder()}, std::move(providers));
   assembly.engagedCompletionCache =
       EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, assembly.userDefaults.get()});
-  assembly.uploadManager = UploadManager::create(assembly);
-  assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+  auto uploads = BackgroundUploadSession::create(assembly.uploadURLSession(), assembly.cachesFolder() / "UploadJournal", pool);
+  assembly.uploadManager =
+      UploadManager::create(pool, *assembly.notificationCenter, assembly.requestFactory, std::move(uploads));
+  assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(TavixPersistentStorage::Environment{
+      assembly.cachesFolder(), &pool, &clock, assembly.userDefaults.get(), assembly.transactions});
 }
 
 // Topic weights a person or another program left for us; any property-list value, sent as JSON.
@@ -136,7 +143,14 @@ void applySilhouette(const platform::UserDefaults& defaults, TVXNetworkRequestFa
 // The flush command channel: it flushes each connected client's session, and hears every
 // feedback event of the daemon's own session manager.
 std::shared_ptr<TavixFlusherIPC> makeFlusherChannel(Assembly& assembly, TavixService& service) {
-  auto channel = TavixFlusherIPC::create(assembly, [&service, &assembly] {
+  TavixFlusherIPC::Environment env;
+  env.pool = assembly.dispatchPool;
+  env.defaults = assembly.userDefaults;
+  env.sharedSession = assembly.sharedSession;
+  env.flushFeedback = [&assembly](std::function<void()> done) {
+    TavixFeedbackFlusher::create(assembly)->forceFlushWithCompletion(std::move(done));
+  };
+  env.getClientConnections = [&service, &assembly] {
     std::vector<TavixFlusherIPC::ClientConnectionHandle> handles;
     for (const auto& client : service.getClientConnections()) {
       TavixFlusherIPC::ClientConnectionHandle handle;
@@ -156,7 +170,8 @@ std::shared_ptr<TavixFlusherIPC> makeFlusherChannel(Assembly& assembly, TavixSer
       handles.push_back(std::move(handle));
     }
     return handles;
-  });
+  };
+  auto channel = TavixFlusherIPC::create(std::move(env));
   std::weak_ptr<TavixFlusherIPC> weak = channel;
   assembly.clientSessionManager->setFeedbackObserver([weak](const proto::CTTavixFeedback& feedback) {
     if (auto c = weak.lock()) c->sendDataToReceivingStreamListener(feedback);
@@ -307,7 +322,8 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   platform::ipc::LaunchEventRegistry launchEvents(ipcEventQueue);
   TavixService service(assembly, &launchEvents);
   // After the service: a client state shares the service's GUID controller and session manager.
-  assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
+  assembly.clientStateManager = std::make_shared<ClientStateManager>(
+      pool, defaults, [&assembly](const std::string& identifier) { return ClientState::create(assembly, identifier); });
   assembly.flusherIPCListener = makeFlusherChannel(assembly, service);
 
   // The orderly end, on every way out once the services exist.

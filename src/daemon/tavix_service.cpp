@@ -29,7 +29,8 @@ TavixService::TavixService(Assembly& assembly, platform::ipc::LaunchEventRegistr
       queue_(*assembly.dispatchPool, "com.norvel.tavix.serviceQueue"),
       self_(std::make_shared<TavixService*>(this)) {
   assembly_.sharedSession = assembly_.userDefaults->boolForKey("TVXSharedSession");
-  assembly_.guidController = std::make_shared<TavixUserGUIDController>(assembly_);
+  assembly_.guidController = std::make_shared<TavixUserGUIDController>(*assembly_.dispatchPool, *assembly_.clock,
+                                                                     assembly_.notificationCenter);
   assembly_.clientSessionManager =
       std::make_shared<ClientSessionManager>(assembly_, assembly_.guidController, assembly_.bagController, "tavix");
   // A malformed message is logged once by the connection; protobuf's own parse complaints would

@@ -12,7 +12,7 @@
 #include "platform/log.h"
 #include "platform/transactions.h"
 #include "query/client_state_manager.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 #include "tavix_proto/ipc.pb.h"
 
 namespace tavix {
@@ -21,24 +21,20 @@ namespace {
 namespace ipc = platform::ipc;
 
 TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
-  testing::TempHome home;
-  // First: transactions still held by pending timers end when the clock and the pool go.
-  platform::TransactionTracker transactions;
-  platform::DispatchPool pool(2);
-  platform::VirtualClock clock;
   platform::LogCapture capture;
-  Assembly assembly;
-  assembly.dispatchPool = &pool;
-  assembly.clock = &clock;
-  assembly.transactions = &transactions;
-  assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
-  assembly.userDefaults->registerDefaults({{"TVXSharedSession", platform::PropertyValue(true)}});
+  testing::TestAssembly f;
+  auto& home = f.home;
+  auto& pool = f.pool;
+  auto& clock = f.clock;
+  auto& transactions = f.transactions;
+  auto& assembly = f.assembly;
+  f.defaults->registerDefaults({{"TVXSharedSession", platform::PropertyValue(true)}});
   platform::Logger log("test", "listener");
 
   {
     TavixService service(assembly);
     EXPECT_TRUE(assembly.sharedSession);
-    assembly.clientStateManager = std::make_shared<ClientStateManager>(assembly);
+    assembly.clientStateManager = f.makeClientStateManager();
     std::error_code ec;
     auto listener = ipc::IpcListener::listen(pool, (home.runtime() / "socket").string(), log, &ec);
     ASSERT_TRUE(listener);

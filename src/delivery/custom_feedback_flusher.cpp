@@ -33,7 +33,7 @@ void reportOversizeItem(Assembly& assembly, std::uint64_t size, const std::strin
   auto& info = *error.mutable_user_info()->mutable_fields();
   info["size"].set_number_value(static_cast<double>(size));
   info["type"].set_string_value(type);
-  ClientSession::createFeedbackSessionFromError(std::move(error), assembly);
+  ClientSession::createFeedbackSessionFromError(std::move(error), feedbackEnvironment(assembly));
 }
 
 // Whether an item was written to so recently that its writer may not be done with it. A time in

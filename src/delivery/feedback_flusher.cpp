@@ -79,7 +79,7 @@ void TavixFeedbackFlusher::forceFlushWithCompletion(std::function<void()> comple
       auto claimed = storage->claimSessionWithFileContainer(file);
       if (!claimed) return;
       std::shared_ptr<ClientSession> session;
-      if (auto record = claimed->readRecord()) session = ClientSession::fromRecord(self->assembly_, std::move(*record));
+      if (auto record = claimed->readRecord()) session = ClientSession::fromRecord(feedbackEnvironment(self->assembly_), std::move(*record));
       if (!session) {
         // Unreadable files (too large, another version, empty, corrupt) go: they never would be.
         storage->deleteSessionWithFileContainer(claimed);

@@ -5,9 +5,7 @@
 
 #include <atomic>
 
-#include "core/assembly.h"
 #include "core/logging.h"
-#include "delivery/feedback_flusher.h"
 #include "feedback/tavix_feedback.h"
 #include "platform/defaults.h"
 #include "platform/ipc/server.h"
@@ -37,15 +35,14 @@ void send(const std::shared_ptr<platform::ipc::IpcConnection>& remote, const pro
 
 }  // namespace
 
-std::shared_ptr<TavixFlusherIPC> TavixFlusherIPC::create(Assembly& assembly, GetClientConnections getClientConnections) {
-  auto channel = std::shared_ptr<TavixFlusherIPC>(new TavixFlusherIPC(assembly, std::move(getClientConnections)));
+std::shared_ptr<TavixFlusherIPC> TavixFlusherIPC::create(Environment env) {
+  auto channel = std::shared_ptr<TavixFlusherIPC>(new TavixFlusherIPC(std::move(env)));
   flusherLog().debug("started accepting connections :{}", "socket pairs");
   return channel;
 }
 
-TavixFlusherIPC::TavixFlusherIPC(Assembly& assembly, GetClientConnections getClientConnections)
-    : assembly_(assembly), getClientConnections_(std::move(getClientConnections)),
-      flusherIpcQueue_(*assembly.dispatchPool, "com.norvel.tavixd.flusherIPCQueue") {}
+TavixFlusherIPC::TavixFlusherIPC(Environment env)
+    : env_(std::move(env)), flusherIpcQueue_(*env_.pool, "com.norvel.tavixd.flusherIPCQueue") {}
 
 TavixFlusherIPC::~TavixFlusherIPC() {
   for (const auto& connection : connections_) connection->invalidate();
@@ -65,7 +62,7 @@ platform::ipc::UniqueFd TavixFlusherIPC::endpoint() {
 void TavixFlusherIPC::accept(platform::ipc::UniqueFd fd) {
   platform::ipc::PeerCredentials peer;
   platform::ipc::peerCredentials(fd.get(), &peer);
-  auto remote = platform::ipc::IpcConnection::make(*assembly_.dispatchPool, std::move(fd), peer,
+  auto remote = platform::ipc::IpcConnection::make(*env_.pool, std::move(fd), peer,
                                                    "com.norvel.tavixd.flusherIPC.connection", flusherLog());
   std::weak_ptr<TavixFlusherIPC> weak = weak_from_this();
   std::weak_ptr<platform::ipc::IpcConnection> weakRemote = remote;
@@ -153,10 +150,8 @@ void TavixFlusherIPC::initiateConnectionWithIntent(std::uint64_t intent) {
         break;
       case kStopFlushing:
         flusherLog().notice("flushing stopped; dump command will start flushing again");
-        if (self->assembly_.userDefaults) {
-          self->assembly_.userDefaults->setObject(kFlushDisabledKey, platform::PropertyValue(true));
-          self->assembly_.userDefaults->synchronize();
-        }
+        self->env_.defaults->setObject(kFlushDisabledKey, platform::PropertyValue(true));
+        self->env_.defaults->synchronize();
         sendWorkDone(self->remoteObject_);
         break;
       case kDump:
@@ -176,10 +171,10 @@ void TavixFlusherIPC::dump() {
     sendingStreamListener_ = remoteObject_;
   }
   flusherLog().notice("new listener for flusher client sessions, delegate: {}", describe(sendingStreamListener_));
-  auto defaults = assembly_.userDefaults;
-  if (!getClientConnections_) {
+  auto defaults = env_.defaults;
+  if (!env_.getClientConnections) {
     flusherLog().notice("Can't get client connections. Flushed nothing.");
-    if (defaults) defaults->removeObject(kFlushDisabledKey);
+    defaults->removeObject(kFlushDisabledKey);
     sendWorkDone(remoteObject_);
     return;
   }
@@ -190,19 +185,18 @@ void TavixFlusherIPC::dump() {
     sessionLog().notice("dump command complete, calling -workDone");
     sendWorkDone(self->remoteObject_);
   });
-  Assembly& assembly = assembly_;
-  for (const auto& connection : getClientConnections_()) {
+  for (const auto& connection : env_.getClientConnections()) {
     group->enter();
     const std::string agent = connection.userAgent;
-    connection.flushSession([&assembly, group, agent, defaults] {
+    connection.flushSession([flush = env_.flushFeedback, group, agent, defaults] {
       sessionLog().notice("session flushed because of dump command {}", agent);
-      TavixFeedbackFlusher::create(assembly)->forceFlushWithCompletion([group, defaults] {
-        if (defaults) defaults->removeObject(kFlushDisabledKey);
+      flush([group, defaults] {
+        defaults->removeObject(kFlushDisabledKey);
         group->leave();
       });
     });
     // One flush closes the shared session of every client.
-    if (assembly_.sharedSession) break;
+    if (env_.sharedSession) break;
   }
   group->leave();
 }

@@ -21,7 +21,9 @@
 
 namespace tavix {
 
-class Assembly;
+namespace platform {
+class UserDefaults;
+}
 
 namespace proto {
 class CTTavixFeedback;
@@ -48,9 +50,20 @@ class TavixFlusherIPC : public std::enable_shared_from_this<TavixFlusherIPC> {
     kDump = 3,
   };
 
-  // `getClientConnections` may be empty (a dump then flushes nothing). Uses the assembly's
-  // dispatchPool, userDefaults and sharedSession, and runs flushers over it.
-  static std::shared_ptr<TavixFlusherIPC> create(Assembly& assembly, GetClientConnections getClientConnections);
+  // Sends every closed session now and calls its argument once they are on their way.
+  using FlushFeedback = std::function<void(std::function<void()> done)>;
+
+  // What the channel works with. The pool must outlive it. `getClientConnections` may be empty (a
+  // dump then flushes nothing).
+  struct Environment {
+    platform::DispatchPool* pool = nullptr;
+    std::shared_ptr<platform::UserDefaults> defaults;  // keeps "TVXFeedbackFlushDisabled"
+    bool sharedSession = false;  // one flush then closes the session of every client
+    GetClientConnections getClientConnections;
+    FlushFeedback flushFeedback;
+  };
+
+  static std::shared_ptr<TavixFlusherIPC> create(Environment env);
   // Ends every tool connection.
   ~TavixFlusherIPC();
   TavixFlusherIPC(const TavixFlusherIPC&) = delete;
@@ -73,15 +86,14 @@ class TavixFlusherIPC : public std::enable_shared_from_this<TavixFlusherIPC> {
  private:
   using Remote = std::shared_ptr<platform::ipc::IpcConnection>;
 
-  TavixFlusherIPC(Assembly& assembly, GetClientConnections getClientConnections);
+  explicit TavixFlusherIPC(Environment env);
   void accept(platform::ipc::UniqueFd fd);
   void handleMessage(const std::string& payload);
   void removeRemote(const Remote& remote);  // asynchronously on the queue
   void dump();                              // on the queue
   static void sendWorkDone(const Remote& remote);
 
-  Assembly& assembly_;
-  GetClientConnections getClientConnections_;
+  Environment env_;
   platform::SerialQueue flusherIpcQueue_;
   // On the queue:
   Remote remoteObject_;

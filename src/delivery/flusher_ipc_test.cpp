@@ -5,14 +5,14 @@
 
 #include <optional>
 
-#include "core/assembly.h"
+#include "delivery/feedback_flusher.h"
 #include "feedback/tavix_feedback.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
 #include "platform/ipc/frame.h"
 #include "platform/log.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 #include "tavix_proto/feedback_records.pb.h"
 #include "tavix_proto/flusher.pb.h"
 
@@ -59,19 +59,21 @@ class ToolEnd {
   platform::ipc::FrameDecoder decoder_;
 };
 
-class FlusherIPCTest : public ::testing::Test {
+class FlusherIPCTest : public ::testing::Test, protected testing::TestAssembly {
  protected:
-  FlusherIPCTest() {
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.sharedSession = true;
-    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
-  }
+  FlusherIPCTest() : testing::TestAssembly(0) {}
   ~FlusherIPCTest() override {
     channel.reset();
     pool.drain();
   }
-  bool flushDisabled() { return assembly.userDefaults->boolForKey("TVXFeedbackFlushDisabled"); }
+  bool flushDisabled() { return defaults->boolForKey("TVXFeedbackFlushDisabled"); }
+
+  // A channel over the daemon's real flusher, with every client sharing one session or not.
+  std::shared_ptr<TavixFlusherIPC> make(TavixFlusherIPC::GetClientConnections clients, bool sharedSession = true) {
+    return TavixFlusherIPC::create({&pool, defaults, sharedSession, std::move(clients), [this](std::function<void()> done) {
+                                      TavixFeedbackFlusher::create(assembly)->forceFlushWithCompletion(std::move(done));
+                                    }});
+  }
 
   // Connections that record their flushes; the flush itself finishes at once.
   TavixFlusherIPC::GetClientConnections connections(std::vector<std::string> agents) {
@@ -87,16 +89,13 @@ class FlusherIPCTest : public ::testing::Test {
     };
   }
 
-  testing::TempHome home;
-  platform::DispatchPool pool;
-  platform::VirtualClock clock;
-  Assembly assembly;
   std::atomic<int> flushes{0};
   std::shared_ptr<TavixFlusherIPC> channel;
 };
 
 TEST_F(FlusherIPCTest, StopFlushingAndDumpToggleTheFlagAndAnswerWorkDone) {
-  channel = TavixFlusherIPC::create(assembly, connections({"seekara/1", "brovane/2"}));
+  auto clients = connections({"seekara/1", "brovane/2"});
+  channel = make(clients);
   ToolEnd tool(channel->endpoint());
   ASSERT_TRUE(tool.valid());
 
@@ -117,7 +116,8 @@ TEST_F(FlusherIPCTest, StopFlushingAndDumpToggleTheFlagAndAnswerWorkDone) {
   EXPECT_EQ(logs.count("no listener for sending stream at dump time"), 1u);
 
   // Individual sessions: every connection is flushed.
-  assembly.sharedSession = false;
+  channel = make(clients, false);
+  tool = ToolEnd(channel->endpoint());
   tool.send(TavixFlusherIPC::kDump);
   reply = tool.next();
   ASSERT_TRUE(reply && reply->has_work_done());
@@ -132,7 +132,7 @@ TEST_F(FlusherIPCTest, StopFlushingAndDumpToggleTheFlagAndAnswerWorkDone) {
 }
 
 TEST_F(FlusherIPCTest, ADumpWithoutClientsLeavesFlushingDisabled) {
-  channel = TavixFlusherIPC::create(assembly, connections({}));
+  channel = make(connections({}));
   ToolEnd tool(channel->endpoint());
   tool.send(TavixFlusherIPC::kStopFlushing);
   ASSERT_TRUE(tool.next());
@@ -143,7 +143,7 @@ TEST_F(FlusherIPCTest, ADumpWithoutClientsLeavesFlushingDisabled) {
   EXPECT_EQ(flushes.load(), 0);
 
   // No way to list clients at all: nothing flushed, but flushing is on again.
-  channel = TavixFlusherIPC::create(assembly, nullptr);
+  channel = make(nullptr);
   ToolEnd other(channel->endpoint());
   other.send(TavixFlusherIPC::kDump);
   reply = other.next();
@@ -152,7 +152,7 @@ TEST_F(FlusherIPCTest, ADumpWithoutClientsLeavesFlushingDisabled) {
 }
 
 TEST_F(FlusherIPCTest, SubscribersGetFeedbackAndUploadBodiesUntilTheyGo) {
-  channel = TavixFlusherIPC::create(assembly, connections({}));
+  channel = make(connections({}));
   proto::CTErrorFeedback error;
   error.set_code(404);
   error.set_domain("tests");

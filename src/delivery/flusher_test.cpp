@@ -29,7 +29,7 @@
 #include "platform/log.h"
 #include "platform/notification_center.h"
 #include "platform/transactions.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 #include "tavix_proto/feedback_records.pb.h"
 
 namespace tavix {
@@ -42,24 +42,16 @@ constexpr const char* kActivity = "com.norvel.tavixd.flusher.background";
 
 // The whole delivery path over real files and real HTTP: session files in a temporary caches
 // folder, the devserver as the server, a bag fetched from it.
-class FlusherTest : public ::testing::Test {
+// Flushes chain synchronous hops: the default, deep enough, pool.
+class FlusherTest : public ::testing::Test, protected testing::TestAssembly {
  protected:
-  FlusherTest() {
+  FlusherTest() : testing::TestAssembly(0) {
     home.exportEnvironment();
     std::string error;
     EXPECT_TRUE(server.start({}, &error)) << error;
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.transactions = &transactions;
     assembly.activityScheduler = &activities;
-    assembly.paths = platform::Paths::fromEnvironment();
-    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
-    assembly.userDefaults->setObject("TVXBagURL", server.baseURL() + "/bag");
-    // What the daemon registers at start.
-    assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
-                                             {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})}});
-    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
-    assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+    defaults->setObject("TVXBagURL", server.baseURL() + "/bag");
+    makeRequestFactory();
   }
   ~FlusherTest() override {
     pool.drain();
@@ -77,9 +69,9 @@ class FlusherTest : public ::testing::Test {
     bag.update(extra);
     control.Post("/_faults", json{{"path", "/bag"}, {"body", bag.dump()}}.dump(), "application/json");
     control.Post("/_reset_recordings", "", "application/json");
-    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+    makeStorage();
     session = BackgroundUploadSession::create(transport, home.cache() / "journal", pool);
-    assembly.uploadManager = UploadManager::create(assembly, session);
+    assembly.uploadManager = UploadManager::create(pool, *center, assembly.requestFactory, session);
     assembly.bagController = TavixBagController::create(assembly);
     assembly.bagController->currentBag();
     ASSERT_TRUE(waitFor([&] { return assembly.uploadManager->feedbackEndpoint().has_value(); }));
@@ -101,7 +93,7 @@ class FlusherTest : public ::testing::Test {
     error.set_code(500);
     error.set_domain("test");
     error.set_reason("first");
-    auto s = ClientSession::open(assembly, makeTavixFeedbackWithCodable(error, 0, "", agent));
+    auto s = ClientSession::open(feedbackEnvironment(assembly), makeTavixFeedbackWithCodable(error, 0, "", agent));
     for (int i = 1; i < events; ++i) {
       error.set_reason("event " + std::to_string(i));
       s->addFeedback(makeTavixFeedbackWithCodable(error, 0, "", agent));
@@ -122,14 +114,9 @@ class FlusherTest : public ::testing::Test {
   }
   static std::int64_t counter(const std::string& key) { return TavixDiagnosticDataReporter::store().value(key); }
 
-  testing::TempHome home;
   devserver::DevServer server;
-  platform::DispatchPool pool;  // flushes chain synchronous hops: the default, deep enough, pool
-  platform::VirtualClock clock;
-  platform::TransactionTracker transactions;
   platform::SerialQueue activityQueue{pool, "activities"};
   platform::ActivityScheduler activities{clock, activityQueue, transactions};
-  Assembly assembly;
   std::shared_ptr<platform::http::URLSession> transport =
       std::make_shared<platform::http::URLSession>(platform::http::URLSessionConfiguration{});
   std::shared_ptr<BackgroundUploadSession> session;

@@ -10,9 +10,7 @@
 #include <random>
 #include <nlohmann/json.hpp>
 
-#include "bag/tavix_bag_controller.h"
 #include "bagview/tvx_bag.h"
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "core/names.h"
@@ -81,27 +79,25 @@ std::string appendingQueryItem(std::string_view url, std::string_view name, std:
 
 // ---- UploadManager
 
-std::shared_ptr<UploadManager> UploadManager::create(Assembly& assembly, std::shared_ptr<BackgroundUploadSession> session) {
-  if (!session) {
-    session = BackgroundUploadSession::create(assembly.uploadURLSession(), assembly.cachesFolder() / "UploadJournal",
-                                              *assembly.dispatchPool);
-  }
-  auto manager = std::shared_ptr<UploadManager>(new UploadManager(assembly, session));
+std::shared_ptr<UploadManager> UploadManager::create(platform::DispatchPool& pool, platform::NotificationCenter& center,
+                                                     std::shared_ptr<TVXNetworkRequestFactory> requestFactory,
+                                                     std::shared_ptr<BackgroundUploadSession> session) {
+  auto manager = std::shared_ptr<UploadManager>(new UploadManager(pool, std::move(requestFactory), session));
   session->setDelegate(manager);
-  if (assembly.notificationCenter) {
-    std::weak_ptr<UploadManager> weak = manager;
-    manager->bagObserver_ = assembly.notificationCenter->addObserver(
-        kTVXBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& notification) {
-          if (auto self = weak.lock()) self->bagDidChange(notification);
-        });
-  }
-  if (assembly.bagController) manager->takeEndpointsFromBag(assembly.bagController->inMemoryBag().get());
+  std::weak_ptr<UploadManager> weak = manager;
+  manager->bagObserver_ = center.addObserver(kTVXBagChangeNotification, nullptr, nullptr,
+                                             [weak](const platform::Notification& notification) {
+                                               if (auto self = weak.lock()) self->bagDidChange(notification);
+                                             });
   session->resumePendingTasks();
   return manager;
 }
 
-UploadManager::UploadManager(Assembly& assembly, std::shared_ptr<BackgroundUploadSession> session)
-    : assembly_(assembly), session_(std::move(session)), queue_(*assembly.dispatchPool, "com.norvel.tavixd.uploadmanager") {}
+UploadManager::UploadManager(platform::DispatchPool& pool, std::shared_ptr<TVXNetworkRequestFactory> requestFactory,
+                             std::shared_ptr<BackgroundUploadSession> session)
+    : requestFactory_(std::move(requestFactory)),
+      session_(std::move(session)),
+      queue_(pool, "com.norvel.tavixd.uploadmanager") {}
 
 UploadManager::~UploadManager() = default;
 
@@ -222,9 +218,7 @@ std::shared_ptr<TempFile> UploadManager::uploadJSONFeedback(std::string_view jso
     finish(outcomeWithoutEndpoint());
     return file;
   }
-  auto request = assembly_.requestFactory
-                     ? assembly_.requestFactory->flusherUploadRequest(*url, kUploadTimeoutSeconds, stream.dataDigestForStream())
-                     : std::nullopt;
+  auto request = requestFactory_->flusherUploadRequest(*url, kUploadTimeoutSeconds, stream.dataDigestForStream());
   if (!request) {
     finish(UploadOutcome::kNotNow);
     return file;
@@ -283,9 +277,7 @@ void UploadManager::uploadFeedback(const platform::fs::path& source, const std::
   }
   std::error_code ec;
   if (lastRead != -1 && stream.status() == 1 && platform::fs::exists(file->path(), ec)) {
-    auto request = assembly_.requestFactory
-                       ? assembly_.requestFactory->flusherUploadRequest(*url, kUploadTimeoutSeconds, stream.dataDigestForStream())
-                       : std::nullopt;
+    auto request = requestFactory_->flusherUploadRequest(*url, kUploadTimeoutSeconds, stream.dataDigestForStream());
     if (request) {
       enqueueRequest(std::move(*request), file, 0, std::move(done));
       return;

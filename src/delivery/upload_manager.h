@@ -25,8 +25,8 @@
 
 namespace tavix {
 
-class Assembly;
 class TVXBag;
+class TVXNetworkRequestFactory;
 
 // A temporary file, removed (and its descriptor closed) when the last holder lets it go: by then
 // its contents are in the upload journal, or the upload was given up.
@@ -65,12 +65,12 @@ class UploadManager : public std::enable_shared_from_this<UploadManager>, public
   // Uploads pending in the session beyond which new ones are dropped.
   static constexpr std::size_t kMaximumPendingUploads = 100;
 
-  // Observes the bag and takes both endpoints from the current bag (when the assembly has a bag
-  // controller). `session` defaults to a journalled session over the assembly's
-  // uploadURLSession(), journal in "<caches>/com.norvel.tavixd/UploadJournal"; its pending
-  // uploads from an earlier run are resumed.
-  static std::shared_ptr<UploadManager> create(Assembly& assembly,
-                                               std::shared_ptr<BackgroundUploadSession> session = nullptr);
+  // Takes both endpoints from each bag posted on `center` (there is none until the first). The
+  // pool and centre must outlive it; `requestFactory` makes the upload requests. The pending
+  // uploads `session` kept from an earlier run are resumed.
+  static std::shared_ptr<UploadManager> create(platform::DispatchPool& pool, platform::NotificationCenter& center,
+                                               std::shared_ptr<TVXNetworkRequestFactory> requestFactory,
+                                               std::shared_ptr<BackgroundUploadSession> session);
   ~UploadManager() override;
   UploadManager(const UploadManager&) = delete;
   UploadManager& operator=(const UploadManager&) = delete;
@@ -112,7 +112,8 @@ class UploadManager : public std::enable_shared_from_this<UploadManager>, public
                        std::int64_t totalBytesExpectedToSend) override;
 
  private:
-  UploadManager(Assembly& assembly, std::shared_ptr<BackgroundUploadSession> session);
+  UploadManager(platform::DispatchPool& pool, std::shared_ptr<TVXNetworkRequestFactory> requestFactory,
+                std::shared_ptr<BackgroundUploadSession> session);
   void bagDidChange(const platform::Notification& notification);
   void takeEndpointsFromBag(const TVXBag* bag);
   std::optional<std::string> urlForEndpoint(int endpoint, const std::string& type);
@@ -121,7 +122,7 @@ class UploadManager : public std::enable_shared_from_this<UploadManager>, public
   void enqueueRequest(platform::http::URLRequest request, std::shared_ptr<TempFile> file,
                       std::optional<std::int64_t> numberOfFeedbacks, UploadCompletion done);
 
-  Assembly& assembly_;
+  std::shared_ptr<TVXNetworkRequestFactory> requestFactory_;
   std::shared_ptr<BackgroundUploadSession> session_;
   platform::SerialQueue queue_;
   std::optional<std::string> feedbackEndpoint_;       // on queue_

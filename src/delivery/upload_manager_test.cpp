@@ -27,7 +27,7 @@
 #include "platform/log.h"
 #include "platform/notification_center.h"
 #include "platform/raw_deflate.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 
 namespace tavix {
 namespace {
@@ -64,16 +64,12 @@ class BlackHole {
   int port_ = 0;
 };
 
-class UploadManagerTest : public ::testing::Test {
+// The default, deep enough, pool: flushes chain synchronous hops.
+class UploadManagerTest : public ::testing::Test, protected testing::TestAssembly {
  protected:
-  UploadManagerTest() {
+  UploadManagerTest() : testing::TestAssembly(0) {
     home.exportEnvironment();
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.paths = platform::Paths::fromEnvironment();
-    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
-    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
-    assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+    makeRequestFactory();
     std::string error;
     EXPECT_TRUE(server.start({}, &error)) << error;
   }
@@ -86,12 +82,12 @@ class UploadManagerTest : public ::testing::Test {
 
   void make(std::string journal = "journal") {
     session = BackgroundUploadSession::create(transport, home.cache() / journal, pool);
-    manager = UploadManager::create(assembly, session);
+    manager = UploadManager::create(pool, *center, assembly.requestFactory, session);
   }
 
   void postBag(json raw) {
     auto bag = std::make_shared<const TVXBag>(*platform::parseJson(raw.dump())->dictionary(), "tavixd/1");
-    assembly.notificationCenter->post(kTVXBagChangeNotification, nullptr, {}, bagChangeUserInfo(*bag));
+    center->post(kTVXBagChangeNotification, nullptr, {}, bagChangeUserInfo(*bag));
   }
   json devserverBag(const std::string& base) {
     return {{"feedback_enabled", true}, {"feedback_url", base + "/feedback"}, {"crowdsourcing_url", base + "/crowdsourcing"}};
@@ -109,10 +105,6 @@ class UploadManagerTest : public ::testing::Test {
   }
   static std::int64_t counter(const std::string& key) { return TavixDiagnosticDataReporter::store().value(key); }
 
-  testing::TempHome home;
-  platform::DispatchPool pool;  // flushes chain synchronous hops: the default, deep enough, pool
-  platform::VirtualClock clock;
-  Assembly assembly;
   devserver::DevServer server;
   std::shared_ptr<platform::http::URLSession> transport =
       std::make_shared<platform::http::URLSession>(platform::http::URLSessionConfiguration{});
@@ -152,7 +144,7 @@ TEST_F(UploadManagerTest, EndpointsFollowTheBag) {
 
   // A notification without a bag changes nothing.
   postBag(devserverBag(server.baseURL()));
-  assembly.notificationCenter->post(kTVXBagChangeNotification);
+  center->post(kTVXBagChangeNotification);
   EXPECT_EQ(manager->feedbackEndpoint(), server.baseURL() + "/feedback?v=2");
 }
 

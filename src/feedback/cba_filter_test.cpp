@@ -8,7 +8,7 @@
 #include "feedback/client_session.h"
 #include "feedback/persistent_storage.h"
 #include "platform/defaults.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 
 namespace tavix {
 namespace {
@@ -163,22 +163,14 @@ TEST(CBAFilter, EngagementsAreGradedAgainstEarlierWebResultsOfTheirQuery) {
 }
 
 TEST(CBAFilter, OnlyBrowserSessionsAreFilteredOnTheirWayOut) {
-  testing::TempHome home;
-  platform::DispatchPool pool{2};
-  platform::VirtualClock clock;
-  Assembly assembly;
-  assembly.dispatchPool = &pool;
-  assembly.clock = &clock;
-  assembly.paths.cacheHome = home.cache();
-  assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
-  assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
-                                           {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})}});
-  assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+  testing::TestAssembly f;
+  f.makeStorage();
+  Assembly& assembly = f.assembly;
 
   auto upload = [&](const std::string& agent) {
     auto first = visible(4, {{kWebIndex, "https://a.com/x"}});
     first->set_user_agent(agent);
-    auto session = ClientSession::open(assembly, first);
+    auto session = ClientSession::open(feedbackEnvironment(assembly), first);
     auto matched = cba(4, "https://a.com/x", 1);
     auto unmatched = cba(4, "https://nowhere.com/", 2);
     matched->set_user_agent(agent);
@@ -189,7 +181,7 @@ TEST(CBAFilter, OnlyBrowserSessionsAreFilteredOnTheirWayOut) {
     auto handles = assembly.persistentStorage->getAvailableSessionHandles();
     auto record = handles.back()->readRecord();
     EXPECT_TRUE(record.has_value());
-    auto back = ClientSession::fromRecord(assembly, record.value_or(proto::CTClientSession()));
+    auto back = ClientSession::fromRecord(feedbackEnvironment(assembly), record.value_or(proto::CTClientSession()));
     return nlohmann::json::parse(back->getFeedbacksToSend())["fb"];
   };
 

@@ -48,38 +48,44 @@ std::optional<std::string> firstUseKeyForAgent(std::string_view agent) {
   return std::nullopt;
 }
 
-ClientSession::ClientSession(Assembly& assembly)
-    : assembly_(assembly), sessionQueue_(*assembly.dispatchPool, "com.norvel.tavixd.clientSessionQueue") {
-  backingStore_.set_session_start(platform::toUnixSeconds(assembly.clock->now()));
+FeedbackEnvironment feedbackEnvironment(const Assembly& assembly) {
+  return {assembly.dispatchPool,   assembly.clock,          assembly.userDefaults,
+          assembly.persistentStorage, assembly.guidController, assembly.resourceVersions};
+}
+
+ClientSession::ClientSession(FeedbackEnvironment env)
+    : env_(std::move(env)), sessionQueue_(*env_.pool, "com.norvel.tavixd.clientSessionQueue") {
+  backingStore_.set_session_start(platform::toUnixSeconds(env_.clock->now()));
   backingStore_.set_version(tavixdSessionFileVersion());
 }
 
-FeedbackRef makeDaemonErrorFeedback(proto::CTErrorFeedback error, Assembly& assembly) {
-  error.set_timestamp(hostTicksNow(assembly.clock));
-  const std::string guid = assembly.guidController ? assembly.guidController->currentUserGUID() : std::string();
+FeedbackRef makeDaemonErrorFeedback(proto::CTErrorFeedback error, const FeedbackEnvironment& env) {
+  error.set_timestamp(hostTicksNow(env.clock));
+  const std::string guid = env.guid ? env.guid->currentUserGUID() : std::string();
   return makeTavixFeedbackWithCodable(error, 0, guid, tavixdUserAgent());
 }
 
 FeedbackRef makeDaemonErrorFeedback(std::int64_t code, const std::string& domain, const std::string& reason,
-                                    Assembly& assembly) {
+                                    const FeedbackEnvironment& env) {
   proto::CTErrorFeedback error;
   error.set_code(static_cast<std::int32_t>(code));
   error.set_domain(domain);
   error.set_reason(reason);
-  return makeDaemonErrorFeedback(std::move(error), assembly);
+  return makeDaemonErrorFeedback(std::move(error), env);
 }
 
-void ClientSession::createFeedbackSessionFromError(proto::CTErrorFeedback error, Assembly& assembly) {
-  if (auto session = open(assembly, makeDaemonErrorFeedback(std::move(error), assembly))) session->sessionComplete();
+void ClientSession::createFeedbackSessionFromError(proto::CTErrorFeedback error, const FeedbackEnvironment& env) {
+  if (auto session = open(env, makeDaemonErrorFeedback(std::move(error), env))) session->sessionComplete();
 }
 
 void ClientSession::createFeedbackSessionFromError(std::int64_t code, const std::string& domain,
-                                                   const std::string& reason, Assembly& assembly) {
-  if (auto session = open(assembly, makeDaemonErrorFeedback(code, domain, reason, assembly))) session->sessionComplete();
+                                                   const std::string& reason, const FeedbackEnvironment& env) {
+  if (auto session = open(env, makeDaemonErrorFeedback(code, domain, reason, env))) session->sessionComplete();
 }
 
-std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackRef first, int previousSessionEndReason) {
-  auto session = std::make_shared<ClientSession>(assembly);
+std::shared_ptr<ClientSession> ClientSession::open(const FeedbackEnvironment& env, FeedbackRef first,
+                                                   int previousSessionEndReason) {
+  auto session = std::make_shared<ClientSession>(env);
   auto& store = session->backingStore_;
   if (first && !first->user_agent().empty()) store.set_agent(first->user_agent());
   if (first && !first->user_guid().empty()) store.set_user_guid_string(first->user_guid());
@@ -89,31 +95,31 @@ std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackR
   if (first && feedbackType(*first) == kFeedbackTypeSuggestionEngagement) store.set_remove_timestamps(true);
 
   if (auto key = firstUseKeyForAgent(store.agent())) {
-    const auto date = assembly.userDefaults->dateForKey(*key);
+    const auto date = env.defaults->dateForKey(*key);
     if (date) {
       store.set_first_use_date(platform::toUnixSeconds(*date));
     } else {
       TavixLogForCategory(TavixLoggingCategoryFeedbackErrors)
           .error("Found something other than a date in defaults for key {}.", *key);
-      assembly.userDefaults->removeObject(*key);
+      env.defaults->removeObject(*key);
     }
   }
   if (!store.agent().empty()) {
     const auto name = extractClientNameFromString(store.agent());
     TavixDiagnosticDataReporter::addValue(1, createCounterKey(name.value_or("(null)"), "sessions"));
-    const platform::TimePoint now = assembly.clock->now();
+    const platform::TimePoint now = env.clock->now();
     if (!store.has_first_use_date() || !sameLocalDay(platform::fromUnixSeconds(store.first_use_date()), now)) {
       session->recordFirstUse(now);
     }
   }
-  if (assembly.resourceVersions) {
-    for (auto& [name, version] : assembly.resourceVersions->resourceVersions()) {
+  if (env.resourceVersions) {
+    for (auto& [name, version] : env.resourceVersions->resourceVersions()) {
       (*store.mutable_resource_versions())[name] = version;
     }
   }
 
-  if (assembly.persistentStorage) {
-    auto handle = assembly.persistentStorage->createFileContainerForWriting();
+  if (env.storage) {
+    auto handle = env.storage->createFileContainerForWriting();
     std::atomic_store(&session->storageHandle_, handle);
     if (handle) handle->writeSessionHeader(store);
   }
@@ -121,8 +127,8 @@ std::shared_ptr<ClientSession> ClientSession::open(Assembly& assembly, FeedbackR
   return session;
 }
 
-std::shared_ptr<ClientSession> ClientSession::fromRecord(Assembly& assembly, proto::CTClientSession record) {
-  auto session = std::make_shared<ClientSession>(assembly);
+std::shared_ptr<ClientSession> ClientSession::fromRecord(const FeedbackEnvironment& env, proto::CTClientSession record) {
+  auto session = std::make_shared<ClientSession>(env);
   session->backingStore_ = std::move(record);
   session->takeUserGuid();
   return session;
@@ -136,8 +142,8 @@ void ClientSession::recordFirstUse(platform::TimePoint time) {
   }
   backingStore_.set_first_use_date(platform::toUnixSeconds(time));
   backingStore_.set_first_use_of_the_day(true);
-  assembly_.userDefaults->setObject(*key, platform::PropertyValue(platform::Date{time}));
-  assembly_.userDefaults->synchronize();
+  env_.defaults->setObject(*key, platform::PropertyValue(platform::Date{time}));
+  env_.defaults->synchronize();
   if (auto name = extractClientNameFromString(*key)) {
     TavixDiagnosticDataReporter::addValue(1, createCounterKey(*name, "dailyactiveusers"));
   }
@@ -152,7 +158,7 @@ void ClientSession::addFeedback(const FeedbackRef& feedback) {
   if (handle) handle->writeFeedback(*feedback);
   if (backingStore_.has_user_guid_string() && feedback->user_guid() != backingStore_.user_guid_string()) {
     proto::CTErrorFeedback error;
-    error.set_timestamp(hostTicksNow(assembly_.clock));
+    error.set_timestamp(hostTicksNow(env_.clock));
     error.set_domain(kTVXErrorDomain);
     error.set_code(500);
     error.set_reason("different guid in session");
@@ -164,11 +170,11 @@ void ClientSession::addFeedback(const FeedbackRef& feedback) {
 void ClientSession::sessionComplete() {
   sessionQueue_.sync([&] {
     auto handle = storageHandle();
-    if (!handle || !assembly_.persistentStorage) {
+    if (!handle || !env_.storage) {
       sessionLog().fault("Storage Handle nil major error");
       return;
     }
-    assembly_.persistentStorage->closeSessionWithFileContainer(handle);
+    env_.storage->closeSessionWithFileContainer(handle);
   });
 }
 

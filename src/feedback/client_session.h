@@ -22,6 +22,29 @@ namespace tavix {
 
 class Assembly;
 class FileContainer;
+class ResourceVersionsProvider;
+class TavixPersistentStorage;
+class TavixUserGUIDController;
+namespace platform {
+class UserDefaults;
+}
+
+// What a feedback session works with. The pool and clock must outlive every session.
+struct FeedbackEnvironment {
+  platform::DispatchPool* pool = nullptr;
+  platform::Clock* clock = nullptr;
+  std::shared_ptr<platform::UserDefaults> defaults;  // first-use dates
+  // Where sessions are written. Null: a session is kept in memory only (read-back and tests).
+  std::shared_ptr<TavixPersistentStorage> storage;
+  // Stamps the daemon's own error events; null: they carry no GUID.
+  std::shared_ptr<TavixUserGUIDController> guid;
+  // The versions each new session records; null until a download manager provides them.
+  std::shared_ptr<ResourceVersionsProvider> resourceVersions;
+};
+
+// The assembly's current services, for the objects that still find their peers there. Built at
+// each call: start-up makes the GUID controller after some of its users.
+FeedbackEnvironment feedbackEnvironment(const Assembly& assembly);
 
 // "TavixFirstUseOfTheDay_<client>" for the first of brovane, seekara, lookup, messages, news,
 // vocly that the lower-cased agent contains; none otherwise.
@@ -29,28 +52,28 @@ std::optional<std::string> firstUseKeyForAgent(std::string_view agent);
 
 // An error event of the daemon itself: query id 0, the current GUID, the daemon's user agent,
 // stamped now.
-FeedbackRef makeDaemonErrorFeedback(proto::CTErrorFeedback error, Assembly& assembly);
+FeedbackRef makeDaemonErrorFeedback(proto::CTErrorFeedback error, const FeedbackEnvironment& env);
 FeedbackRef makeDaemonErrorFeedback(std::int64_t code, const std::string& domain, const std::string& reason,
-                                    Assembly& assembly);
+                                    const FeedbackEnvironment& env);
 
 class ClientSession {
  public:
   // A bare session: sessionStart = now, version = tavixdSessionFileVersion(). Used for read-back.
-  explicit ClientSession(Assembly& assembly);
+  explicit ClientSession(FeedbackEnvironment env);
   ClientSession(const ClientSession&) = delete;
   ClientSession& operator=(const ClientSession&) = delete;
 
   // Opens a session: header from the first event, first-use bookkeeping, a new session file
   // with the header written, then the first event (when given) added.
-  static std::shared_ptr<ClientSession> open(Assembly& assembly, FeedbackRef first, int previousSessionEndReason = 1);
+  static std::shared_ptr<ClientSession> open(const FeedbackEnvironment& env, FeedbackRef first, int previousSessionEndReason = 1);
   // A session of its own whose first event is an error (query id 0, the current GUID, the
   // daemon's user agent), completed at once: how a failure that belongs to no client's session
   // is reported.
   static void createFeedbackSessionFromError(std::int64_t code, const std::string& domain, const std::string& reason,
-                                             Assembly& assembly);
-  static void createFeedbackSessionFromError(proto::CTErrorFeedback error, Assembly& assembly);
+                                             const FeedbackEnvironment& env);
+  static void createFeedbackSessionFromError(proto::CTErrorFeedback error, const FeedbackEnvironment& env);
   // A session read back from a file.
-  static std::shared_ptr<ClientSession> fromRecord(Assembly& assembly, proto::CTClientSession record);
+  static std::shared_ptr<ClientSession> fromRecord(const FeedbackEnvironment& env, proto::CTClientSession record);
 
   // Appends to the session file; an event whose GUID differs from the session's is followed by
   // a "different guid in session" error event (code 500).
@@ -83,7 +106,7 @@ class ClientSession {
   void recordFirstUse(platform::TimePoint time);
   void takeUserGuid();
 
-  Assembly& assembly_;
+  FeedbackEnvironment env_;
   proto::CTClientSession backingStore_;
   std::string userGuid_;
   std::shared_ptr<FileContainer> storageHandle_;

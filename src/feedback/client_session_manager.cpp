@@ -31,7 +31,7 @@ ClientSessionShared::ClientSessionShared(Assembly& assembly, FeedbackRef first, 
       queue_(*assembly.dispatchPool, "com.norvel.tavixd.clientSessionSharedQueue") {
   if (first && !first->user_guid().empty()) userGuid_ = first->user_guid();
   const std::string agent = first ? first->user_agent() : std::string();
-  sessionMap_[agent] = ClientSession::open(assembly, first, previousSessionEndReason);
+  sessionMap_[agent] = ClientSession::open(feedbackEnvironment(assembly), first, previousSessionEndReason);
 }
 
 void ClientSessionShared::addFeedback(const FeedbackRef& feedback) {
@@ -41,7 +41,7 @@ void ClientSessionShared::addFeedback(const FeedbackRef& feedback) {
     if (it != sessionMap_.end()) {
       it->second->addFeedback(feedback);
     } else {
-      sessionMap_[feedback->user_agent()] = ClientSession::open(assembly_, feedback, previousSessionEndReason_);
+      sessionMap_[feedback->user_agent()] = ClientSession::open(feedbackEnvironment(assembly_), feedback, previousSessionEndReason_);
     }
   });
 }
@@ -143,7 +143,7 @@ void ClientSessionManager::flushSessionInvalidationWithAgent(const std::string& 
 void ClientSessionManager::reportErrorAsTavixdFeedback(int code, const std::string& domain, const std::string& reason,
                                                        Assembly& assembly) {
   if (!assembly.clientSessionManager) return;
-  assembly.clientSessionManager->addTavixFeedback(makeDaemonErrorFeedback(code, domain, reason, assembly));
+  assembly.clientSessionManager->addTavixFeedback(makeDaemonErrorFeedback(code, domain, reason, feedbackEnvironment(assembly)));
 }
 
 bool ClientSessionManager::feedbackEnabledFor(const std::string& userAgent) const {
@@ -251,7 +251,7 @@ void ClientSessionManager::setNewSession(const FeedbackRef& feedback) {
   if (assembly_.sharedSession) {
     shared_ = std::make_shared<ClientSessionShared>(assembly_, feedback, flushReason_);
   } else {
-    single_ = ClientSession::open(assembly_, feedback, flushReason_);
+    single_ = ClientSession::open(feedbackEnvironment(assembly_), feedback, flushReason_);
   }
   log().notice("new session id {} {}", sessionCounter_, identifier_);
   // Fixed at 600 s whatever the soft-limit override: the override only moves maxTime.

@@ -7,32 +7,21 @@
 #include "feedback/persistent_storage.h"
 #include "platform/defaults.h"
 #include "platform/notification_center.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 
 namespace tavix {
 namespace {
 
-struct ManagerFixture {
-  testing::TempHome home;
-  platform::DispatchPool pool{4};
-  platform::VirtualClock clock;
-  Assembly assembly;
+struct ManagerFixture : testing::TestAssembly {
   std::shared_ptr<TavixUserGUIDController> guid;
   std::shared_ptr<ClientSessionManager> manager;
 
-  explicit ManagerFixture(bool shared = false, std::int64_t softLimit = 600) {
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
+  explicit ManagerFixture(bool shared = false, std::int64_t softLimit = 600) : testing::TestAssembly(4) {
     assembly.sharedSession = shared;
-    assembly.paths.cacheHome = home.cache();
-    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
-    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
-    assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
-                                             {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})},
-                                             {"TVXSessionSoftLimitOverride", platform::PropertyValue(softLimit)},
-                                             {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
-    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
-    guid = std::make_shared<TavixUserGUIDController>(assembly);
+    defaults->registerDefaults({{"TVXSessionSoftLimitOverride", platform::PropertyValue(softLimit)},
+                                {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
+    makeStorage();
+    guid = makeGUIDController();
     manager = std::make_shared<ClientSessionManager>(assembly, guid, nullptr, "tavix");
   }
   ~ManagerFixture() { pool.drain(); }

@@ -13,27 +13,15 @@
 #include "platform/counters.h"
 #include "platform/defaults.h"
 #include "platform/log.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 
 namespace tavix {
 namespace {
 
 constexpr const char* kGuid = "0C9E0C3F-7B1B-4E42-A7B2-0E2A8C1F3D11";
 
-struct SessionFixture {
-  testing::TempHome home;
-  platform::DispatchPool pool{2};
-  platform::VirtualClock clock;
-  Assembly assembly;
-  SessionFixture() {
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.paths.cacheHome = home.cache();
-    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
-    assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
-                                             {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})}});
-    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
-  }
+struct SessionFixture : testing::TestAssembly {
+  SessionFixture() { makeStorage(); }
   proto::CTClientSession readBack(ClientSession& session) {
     session.sessionComplete();
     auto handles = assembly.persistentStorage->getAvailableSessionHandles();
@@ -55,29 +43,29 @@ TEST(ClientSession, FirstUseOfTheDayAndCountersFollowTheClient) {
   platform::LogCapture logs;
   const auto sessionsBefore = TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.brovane.sessions");
   const auto dailyBefore = TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.brovane.dailyactiveusers");
-  auto first = ClientSession::open(f.assembly, engagement("a", 1));
+  auto first = ClientSession::open(feedbackEnvironment(f.assembly), engagement("a", 1));
   EXPECT_TRUE(first->firstUseOfTheDay());
   EXPECT_TRUE(logs.contains("Found something other than a date in defaults for key TavixFirstUseOfTheDay_brovane."));
   EXPECT_TRUE(f.assembly.userDefaults->dateForKey("TavixFirstUseOfTheDay_brovane").has_value());
 
   f.clock.advance(platform::seconds(60));
-  auto second = ClientSession::open(f.assembly, engagement("b", 2));
+  auto second = ClientSession::open(feedbackEnvironment(f.assembly), engagement("b", 2));
   EXPECT_FALSE(second->firstUseOfTheDay());
   EXPECT_EQ(TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.brovane.sessions"), sessionsBefore + 2);
   EXPECT_EQ(TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.brovane.dailyactiveusers"), dailyBefore + 1);
 
   f.clock.advance(platform::seconds(86400));
-  EXPECT_TRUE(ClientSession::open(f.assembly, engagement("c", 3))->firstUseOfTheDay());
+  EXPECT_TRUE(ClientSession::open(feedbackEnvironment(f.assembly), engagement("c", 3))->firstUseOfTheDay());
 
   const auto nullBefore = TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.(null).sessions");
-  auto other = ClientSession::open(f.assembly, engagement("d", 4, kGuid, "SomethingElse/1"));
+  auto other = ClientSession::open(feedbackEnvironment(f.assembly), engagement("d", 4, kGuid, "SomethingElse/1"));
   EXPECT_FALSE(other->firstUseOfTheDay());
   EXPECT_EQ(TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.(null).sessions"), nullBefore + 1);
 }
 
 TEST(ClientSession, EventsReachTheFileAndAForeignGuidIsFlagged) {
   SessionFixture f;
-  auto session = ClientSession::open(f.assembly, engagement("a", 1), 3);
+  auto session = ClientSession::open(feedbackEnvironment(f.assembly), engagement("a", 1), 3);
   session->addFeedback(engagement("b", 2, "11111111-2222-4333-8444-555555555555"));
   session->addFeedback(nullptr);
   auto record = f.readBack(*session);
@@ -99,9 +87,9 @@ TEST(ClientSession, UploadRecordIsPrivacyFilteredWithMissingObjectsFirst) {
   proto::CTSuggestionEngagementFeedback suggestion;
   suggestion.set_timestamp(5000000);
   suggestion.mutable_suggestion()->set_id("server-suggestion-42");
-  auto session = ClientSession::open(f.assembly, makeTavixFeedbackWithCodable(suggestion, 1, kGuid, "seekara/3"), 2);
+  auto session = ClientSession::open(feedbackEnvironment(f.assembly), makeTavixFeedbackWithCodable(suggestion, 1, kGuid, "seekara/3"), 2);
   session->addFeedback(engagement("device-result-7", 1005, kGuid, "seekara/3"));
-  auto back = ClientSession::fromRecord(f.assembly, f.readBack(*session));
+  auto back = ClientSession::fromRecord(feedbackEnvironment(f.assembly), f.readBack(*session));
 
   auto upload = nlohmann::json::parse(back->getFeedbacksToSend());
   EXPECT_EQ(upload.size(), 7u);
@@ -128,10 +116,10 @@ TEST(ClientSession, EventsWithoutTimeStampsAllSitAtZero) {
     record.set_trigger_event(how);
     return makeTavixFeedbackWithCodable(record, 0, kGuid, "news/1");
   };
-  auto session = ClientSession::open(f.assembly, appear(proto::AppearEvent::swipe_down));
+  auto session = ClientSession::open(feedbackEnvironment(f.assembly), appear(proto::AppearEvent::swipe_down));
   session->addFeedback(appear(proto::AppearEvent::orb));
   session->addFeedback(appear(proto::AppearEvent::back));
-  auto upload = nlohmann::json::parse(ClientSession::fromRecord(f.assembly, f.readBack(*session))->getFeedbacksToSend());
+  auto upload = nlohmann::json::parse(ClientSession::fromRecord(feedbackEnvironment(f.assembly), f.readBack(*session))->getFeedbacksToSend());
   ASSERT_EQ(upload["fb"].size(), 3u);
   for (const auto& event : upload["fb"]) EXPECT_EQ(event["timestamp"], 0) << event;
 }
@@ -141,7 +129,7 @@ TEST(ClientSession, BaseTimeIsTheTruncatedStartOrNothingForADamagedOne) {
   auto baseTime = [&](double start) {
     proto::CTClientSession record;
     record.set_session_start(start);
-    return nlohmann::json::parse(ClientSession::fromRecord(f.assembly, record)->getFeedbacksToSend())["base_time"];
+    return nlohmann::json::parse(ClientSession::fromRecord(feedbackEnvironment(f.assembly), record)->getFeedbacksToSend())["base_time"];
   };
   EXPECT_EQ(baseTime(1767225600.9), 1767225600);
   EXPECT_EQ(baseTime(2.8e246), 0);

@@ -17,7 +17,6 @@
 #include <deque>
 #include <thread>
 
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "bagview/user_agent.h"
@@ -411,14 +410,15 @@ struct TavixPersistentStorage::Syncer {
   }
 };
 
-TavixPersistentStorage::TavixPersistentStorage(Assembly& assembly, std::shared_ptr<SessionFileIO> io)
-    : assembly_(assembly),
+TavixPersistentStorage::TavixPersistentStorage(Environment env, std::shared_ptr<SessionFileIO> io)
+    : clock_(*env.clock),
+      transactions_(env.transactions),
       io_(std::move(io)),
-      queue_(*assembly.dispatchPool, "com.norvel.tavixd.persistentStorageQueue"),
-      cachesUrl_(assembly.cachesFolder()),
+      queue_(*env.pool, "com.norvel.tavixd.persistentStorageQueue"),
+      cachesUrl_(std::move(env.folder)),
       version_(tavixdSessionFileVersion()),
-      maxFileSize_(static_cast<std::uint64_t>(assembly.userDefaults->integerForKey("TVXSessionSizeLimit"))),
-      maxFileAge_(assembly.userDefaults->integerForKey("TVXSessionMaxAge")),
+      maxFileSize_(static_cast<std::uint64_t>(env.defaults->integerForKey("TVXSessionSizeLimit"))),
+      maxFileAge_(env.defaults->integerForKey("TVXSessionMaxAge")),
       syncer_(std::make_unique<Syncer>()) {
   scanDirectory();
 }
@@ -453,7 +453,7 @@ void TavixPersistentStorage::scanDirectory() {
     if (::rename(path.c_str(), waiting.c_str()) != 0) log().error("file renaming error {}", errnoText(errno));
   }
   it = fs::directory_iterator(cachesUrl_, ec);
-  const platform::TimePoint now = assembly_.clock->now();
+  const platform::TimePoint now = clock_.now();
   std::int64_t largest = -1;
   for (const auto& entry : it) {
     const fs::path url = entry.path();
@@ -497,13 +497,13 @@ std::shared_ptr<FileContainer> TavixPersistentStorage::createFileContainerForWri
   }
   ::fchmod(fd, 0600);  // the umask must not widen or narrow it
   log().debug("new file url {}", url.string());
-  return std::make_shared<FileContainer>(fd, url, version(), queue_, maxFileSize_, assembly_.transactions, io_.get());
+  return std::make_shared<FileContainer>(fd, url, version(), queue_, maxFileSize_, transactions_, io_.get());
 }
 
 std::shared_ptr<FileContainer> TavixPersistentStorage::makeContainer(fs::path url) {
   const std::string v = version();
   return std::make_shared<FileContainer>(std::move(url), v.empty() ? tavixdSessionFileVersion() : v, queue_,
-                                         maxFileSize_, assembly_.transactions, io_.get());
+                                         maxFileSize_, transactions_, io_.get());
 }
 
 void TavixPersistentStorage::syncDirectory() {

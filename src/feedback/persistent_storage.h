@@ -24,14 +24,15 @@
 
 namespace tavix {
 
-class Assembly;
 namespace proto {
 class CTClientSession;
 class CTTavixFeedback;
 }  // namespace proto
 namespace platform {
+class Clock;
 class TransactionTracker;
-}
+class UserDefaults;
+}  // namespace platform
 
 class DeviceInformation;
 
@@ -119,12 +120,22 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
 
 class TavixPersistentStorage {
  public:
-  // Reads "TVXSessionSizeLimit" and "TVXSessionMaxAge" from the assembly's defaults and scans
-  // the caches folder on the calling thread: files older than the age limit are deleted, the
+  // What the storage works with. The pool, clock and defaults must outlive it; `transactions`
+  // may be null (then no transaction is held while a file is written).
+  struct Environment {
+    platform::fs::path folder;  // where the session files live
+    platform::DispatchPool* pool = nullptr;
+    platform::Clock* clock = nullptr;
+    platform::UserDefaults* defaults = nullptr;
+    platform::TransactionTracker* transactions = nullptr;
+  };
+
+  // Reads "TVXSessionSizeLimit" and "TVXSessionMaxAge" from the defaults and scans
+  // the folder on the calling thread: files older than the age limit are deleted, the
   // others are listed as waiting sessions and new files are numbered after the largest found.
   // Files of a flush that stopped half-way ("claimed.session.N") are waiting sessions again.
   // `io` (for tests) replaces the system calls that write and sync the files.
-  explicit TavixPersistentStorage(Assembly& assembly, std::shared_ptr<SessionFileIO> io = nullptr);
+  explicit TavixPersistentStorage(Environment env, std::shared_ptr<SessionFileIO> io = nullptr);
   ~TavixPersistentStorage();
   TavixPersistentStorage(const TavixPersistentStorage&) = delete;
   TavixPersistentStorage& operator=(const TavixPersistentStorage&) = delete;
@@ -171,7 +182,8 @@ class TavixPersistentStorage {
 
   struct Syncer;  // the thread closed files are made durable on
 
-  Assembly& assembly_;
+  platform::Clock& clock_;
+  platform::TransactionTracker* transactions_;
   std::shared_ptr<SessionFileIO> io_;
   platform::SerialQueue queue_;
   platform::fs::path cachesUrl_;

@@ -10,7 +10,6 @@
 #include <limits>
 #include <mutex>
 
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "feedback/tavix_feedback.h"
 #include "bagview/user_agent.h"
@@ -18,7 +17,7 @@
 #include "platform/counters.h"
 #include "platform/defaults.h"
 #include "platform/transactions.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 #include "tavix_proto/feedback_session.pb.h"
 
 namespace tavix {
@@ -28,21 +27,9 @@ namespace fs = std::filesystem;
 
 std::int64_t counter(const char* key) { return TavixDiagnosticDataReporter::store().value(key); }
 
-struct StorageFixture {
-  testing::TempHome home;
-  platform::DispatchPool pool{2};
-  platform::VirtualClock clock;
-  platform::TransactionTracker transactions;
-  Assembly assembly;
-
+struct StorageFixture : testing::TestAssembly {
   explicit StorageFixture(std::int64_t sizeLimit = 2097152) {
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.transactions = &transactions;
-    assembly.paths.cacheHome = home.cache();
-    assembly.userDefaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
-    assembly.userDefaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(sizeLimit)},
-                                             {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})}});
+    defaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(sizeLimit)}});
   }
   fs::path folder() const { return assembly.cachesFolder(); }
   void touch(const std::string& name, double ageSeconds = 0) {
@@ -81,7 +68,7 @@ TEST(TavixPersistentStorage, ScanListsSessionsAndNumbersNewFilesAfterTheLargest)
   f.touch("session.notanumber");
   f.touch(".session.40");
   f.touch("other.40");
-  TavixPersistentStorage storage(f.assembly);
+  TavixPersistentStorage storage(f.storageEnvironment());
   EXPECT_EQ(storage.getAvailableSessionHandles().size(), 3u);
   auto container = storage.createFileContainerForWriting();
   ASSERT_NE(container, nullptr);
@@ -114,7 +101,7 @@ TEST(TavixPersistentStorage, FilesPastTheAgeLimitAreDeletedAtStart) {
   f.touch("session.3", 172801);
   f.touch("session.4", 172799);
   const auto before = counter("com.norvel.tavixd.filetooold");
-  TavixPersistentStorage storage(f.assembly);
+  TavixPersistentStorage storage(f.storageEnvironment());
   EXPECT_FALSE(fs::exists(f.folder() / "session.3"));
   EXPECT_TRUE(fs::exists(f.folder() / "session.4"));
   EXPECT_EQ(counter("com.norvel.tavixd.filetooold"), before + 1);
@@ -124,7 +111,7 @@ TEST(TavixPersistentStorage, FilesPastTheAgeLimitAreDeletedAtStart) {
 
 TEST(TavixPersistentStorage, SessionWrittenEventByEventReadsBackAndDeletes) {
   StorageFixture f;
-  TavixPersistentStorage storage(f.assembly);
+  TavixPersistentStorage storage(f.storageEnvironment());
   auto container = storage.createFileContainerForWriting();
   container->writeSessionHeader(header(storage.version()));
   for (int i = 1; i <= 3; ++i) container->writeFeedback(*event(i));
@@ -151,7 +138,7 @@ TEST(TavixPersistentStorage, SessionWrittenEventByEventReadsBackAndDeletes) {
 
 TEST(FileContainer, CutOffOrEmptyFilesKeepOnlyWhatIsWhole) {
   StorageFixture f;
-  TavixPersistentStorage storage(f.assembly);
+  TavixPersistentStorage storage(f.storageEnvironment());
   auto container = storage.createFileContainerForWriting();
   const auto head = header(storage.version());
   container->writeSessionHeader(head);
@@ -188,7 +175,7 @@ TEST(FileContainer, SizeLimitRefusesReachingItButReadsAFileOfExactlyIt) {
 
   {
     StorageFixture f(static_cast<std::int64_t>(limit));
-    TavixPersistentStorage storage(f.assembly);
+    TavixPersistentStorage storage(f.storageEnvironment());
     auto container = storage.createFileContainerForWriting();
     const auto before = counter("com.norvel.tavixd.filesizeexceeded");
     container->writeSessionHeader(head);
@@ -201,7 +188,7 @@ TEST(FileContainer, SizeLimitRefusesReachingItButReadsAFileOfExactlyIt) {
   }
   {
     StorageFixture f(static_cast<std::int64_t>(limit + 1));
-    TavixPersistentStorage storage(f.assembly);
+    TavixPersistentStorage storage(f.storageEnvironment());
     auto container = storage.createFileContainerForWriting();
     container->writeSessionHeader(head);
     container->writeFeedback(*one);
@@ -252,7 +239,7 @@ class FillingDisk : public SessionFileIO {
 TEST(FileContainer, AFullDiskLosesNoEventItAcknowledged) {
   StorageFixture f;
   auto disk = std::make_shared<FillingDisk>();
-  TavixPersistentStorage storage(f.assembly, disk);
+  TavixPersistentStorage storage(f.storageEnvironment(), disk);
   auto container = storage.createFileContainerForWriting();
   container->writeSessionHeader(header(storage.version()));
   std::vector<std::string> acknowledged;
@@ -296,7 +283,7 @@ TEST(FileContainer, AFullDiskLosesNoEventItAcknowledged) {
 
 TEST(TavixPersistentStorage, AClaimedSessionIsTakenOnceAndWaitsAgainAfterACrash) {
   StorageFixture f;
-  auto storage = std::make_unique<TavixPersistentStorage>(f.assembly);
+  auto storage = std::make_unique<TavixPersistentStorage>(f.storageEnvironment());
   for (int i = 0; i < 2; ++i) {
     auto container = storage->createFileContainerForWriting();
     container->writeSessionHeader(header(storage->version()));
@@ -324,7 +311,7 @@ TEST(TavixPersistentStorage, AClaimedSessionIsTakenOnceAndWaitsAgainAfterACrash)
   for (const auto& handle : storage->getAvailableSessionHandles()) ASSERT_TRUE(storage->claimSessionWithFileContainer(handle));
   EXPECT_TRUE(storage->getAvailableSessionHandles().empty());
   storage.reset();
-  TavixPersistentStorage restarted(f.assembly);
+  TavixPersistentStorage restarted(f.storageEnvironment());
   EXPECT_EQ(restarted.getAvailableSessionHandles().size(), 2u);
   EXPECT_TRUE(fs::exists(name));
   EXPECT_GE(restarted.nextHandleId(), 2);

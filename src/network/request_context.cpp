@@ -6,7 +6,7 @@
 
 #include "bagview/tvx_bag.h"
 #include "bagview/user_agent.h"
-#include "core/assembly.h"
+#include "platform/defaults.h"
 #include "core/names.h"
 #include "network/request_factory.h"
 #include "network/request_factory_internal.h"
@@ -145,28 +145,28 @@ void TVXNetworkRequestFactory::start() {
   // The list a past run downloaded still says what is installed.
   loadInstalledDictionaries(true);
   std::weak_ptr<TVXNetworkRequestFactory> weak = weak_from_this();
-  context_->defaultsSubscription = assembly_.userDefaults->addObserver([weak](const std::string& key) {
+  context_->defaultsSubscription = env_.defaults->addObserver([weak](const std::string& key) {
     auto self = weak.lock();
     if (!self) return;
     self->context_->queue.async([weak, key] {
       if (auto inner = weak.lock()) inner->onDefaultsChanged(key);
     });
   });
-  context_->bagRegistration = assembly_.notificationCenter->addObserver(
+  context_->bagRegistration = env_.center->addObserver(
       kTVXBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
         auto self = weak.lock();
         if (!self) return;
         // The daemon's own view: the proxy and the location sources are not a client's to choose.
         if (auto bag = bagOfNotification(n, self->userAgent_.value_or(""))) self->didGetBag(std::move(bag));
       });
-  context_->downloadRegistration = assembly_.notificationCenter->addObserver(
+  context_->downloadRegistration = env_.center->addObserver(
       kTVXFileDownloadCompletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
         const auto it = n.userInfo.find("identifier");
         if (it == n.userInfo.end() || it->second != PropertyValue(kTVXKnownDictionariesList)) return;
         if (auto self = weak.lock()) self->loadInstalledDictionaries(false);
       });
   // A new user identifier starts a new maps user session, so "X-Norvel-GeoSession" follows it.
-  context_->guidRegistration = assembly_.notificationCenter->addObserver(
+  context_->guidRegistration = env_.center->addObserver(
       kTVXUserGUIDChangeNotification, nullptr, nullptr, [weak](const platform::Notification&) {
         auto self = weak.lock();
         if (!self || !self->providers_.locationManager) return;
@@ -195,7 +195,7 @@ void TVXNetworkRequestFactory::initLocationServices() {
 bool TVXNetworkRequestFactory::hasRecentFix() {
   Context& c = *context_;
   if (!c.geoLocation) return false;
-  double age = platform::toUnixSeconds(assembly_.clock->now()) - platform::toUnixSeconds(c.geoLocation->timestamp);
+  double age = platform::toUnixSeconds(env_.clock->now()) - platform::toUnixSeconds(c.geoLocation->timestamp);
   return age < kLocationMaxAge;
 }
 
@@ -248,7 +248,7 @@ void TVXNetworkRequestFactory::setLocationIfAllowedByBag(const TVXLocation& fix)
 
 void TVXNetworkRequestFactory::setupDebuggingQueryItems() {
   Context& c = *context_;
-  std::string text = assembly_.userDefaults->stringForKey("TVXDebugParameters").value_or("");
+  std::string text = env_.defaults->stringForKey("TVXDebugParameters").value_or("");
   requestLog().debug("processing debug parameters: ({})", text);
   if (text.empty()) return;  // an emptied default keeps the items already in force
   bool ok = false;
@@ -257,7 +257,7 @@ void TVXNetworkRequestFactory::setupDebuggingQueryItems() {
 
 void TVXNetworkRequestFactory::readDefaults() {
   Context& c = *context_;
-  const auto& defaults = *assembly_.userDefaults;
+  const auto& defaults = *env_.defaults;
   c.alwaysSendTophit = defaults.boolForKey("TVXAlwaysOnTophit");
   c.isManagedAccount = defaults.boolForKey("TVXManagedAccount");
   bool restricted = defaults.boolForKey("TVXDeviceRestricted");
@@ -271,7 +271,7 @@ void TVXNetworkRequestFactory::readDefaults() {
 // True when something the bag's identity rests on changed.
 bool TVXNetworkRequestFactory::updateLocaleContexts() {
   Context& c = *context_;
-  TVXLocaleSettings settings = TVXCurrentLocaleSettings(assembly_.userDefaults.get());
+  TVXLocaleSettings settings = TVXCurrentLocaleSettings(env_.defaults.get());
   bool changed = false;
   if (!(settings == c.localeSettings) || c.locale.localeIdentifier.empty()) {
     TVXLocaleContext locale = TVXComputeLocaleContext(settings);
@@ -291,9 +291,9 @@ bool TVXNetworkRequestFactory::updateLocaleContexts() {
 
 void TVXNetworkRequestFactory::notifyBagRefreshRequired() {
   // Never from inside the context queue: observers may come back into the factory.
-  auto center = assembly_.notificationCenter;
+  auto center = env_.center;
   const void* sender = this;
-  assembly_.dispatchPool->post([center, sender] { center->post(kTVXBagRefreshRequiredNotification, sender); });
+  env_.pool->post([center, sender] { center->post(kTVXBagRefreshRequiredNotification, sender); });
 }
 
 void TVXNetworkRequestFactory::didGetBag(std::shared_ptr<const TVXBag> bag) {
@@ -312,7 +312,7 @@ void TVXNetworkRequestFactory::didGetBag(std::shared_ptr<const TVXBag> bag) {
       self->setNoLocationReason(fmt::format("{}.{}", kNoLocationBag, "all"));
     }
   });
-  assembly_.dispatchPool->post([weak, bag] {
+  env_.pool->post([weak, bag] {
     if (auto self = weak.lock()) self->updateVisibility(*bag);
   });
   auto configuration = bag->marvolaConfiguration();
@@ -328,7 +328,7 @@ void TVXNetworkRequestFactory::didGetBag(std::shared_ptr<const TVXBag> bag) {
 // The installed subset of the known dictionaries, as "dicts" sends it: their identifiers, in the
 // list's order, joined by commas. `quietWhenMissing` at start, when no list has come yet.
 void TVXNetworkRequestFactory::loadInstalledDictionaries(bool quietWhenMissing) {
-  const auto path = assembly_.cachesFolder() / kTVXKnownDictionariesList;
+  const auto path = env_.cachesFolder / kTVXKnownDictionariesList;
   std::string text;
   if (auto ec = platform::readFile(path, &text)) {
     if (!(quietWhenMissing && ec == std::errc::no_such_file_or_directory)) {
@@ -360,7 +360,7 @@ void TVXNetworkRequestFactory::loadInstalledDictionaries(bool quietWhenMissing) 
 // clients. Managed configuration has no Linux counterpart; its settings live in a defaults suite
 // that those programs read.
 void TVXNetworkRequestFactory::updateVisibility(const TVXBag& bag) {
-  auto managed = assembly_.userDefaults->suite(kTVXManagedConfigurationDomain);
+  auto managed = env_.defaults->suite(kTVXManagedConfigurationDomain);
   const bool newsAllowed = TVXBag(bag.sharedRawBag(), "news").isEnabled();
   managed->setObject(kTVXFeatureSeekaraNewsAllowed, platform::PropertyValue(newsAllowed));
   requestLog().notice("set effective visibility setting for {} to {}", kTVXFeatureSeekaraNewsAllowed,
@@ -447,7 +447,7 @@ void TVXNetworkRequestFactory::setInstalledDictionaries(std::optional<std::strin
 void TVXNetworkRequestFactory::flushContextAccessQueue() { context_->queue.sync([] {}); }
 
 int TVXNetworkRequestFactory::proxyGetStatus() {
-  if (!assembly_.useMarvola()) return 0;
+  if (!useMarvola()) return 0;
   bool on = false;
   context_->queue.sync([&] {
     const Dictionary& c = context_->proxyConfiguration;

@@ -7,7 +7,6 @@
 
 #include "bagview/tvx_bag.h"
 #include "bagview/user_agent.h"
-#include "core/assembly.h"
 #include "core/names.h"
 #include "network/language_identifier.h"
 #include "network/request_factory_internal.h"
@@ -53,23 +52,17 @@ void addLocalSuggestions(TavixURLRequestBuilder& b, const TVXSearchRequest& requ
 
 }  // namespace
 
-std::shared_ptr<TVXNetworkRequestFactory> TVXNetworkRequestFactory::create(Assembly& assembly,
+std::shared_ptr<TVXNetworkRequestFactory> TVXNetworkRequestFactory::create(Environment env,
                                                                            TVXRequestFactoryProviders providers) {
-  std::shared_ptr<TVXNetworkRequestFactory> factory(new TVXNetworkRequestFactory(assembly, std::move(providers)));
+  std::shared_ptr<TVXNetworkRequestFactory> factory(new TVXNetworkRequestFactory(std::move(env), std::move(providers)));
   factory->start();
   return factory;
 }
 
-TVXNetworkRequestFactory::TVXNetworkRequestFactory(Assembly& assembly, TVXRequestFactoryProviders providers)
-    : assembly_(assembly), providers_(std::move(providers)), context_(std::make_unique<Context>(*assembly.dispatchPool)) {
-  if (!providers_.locationManager) providers_.locationManager = assembly.locationManager;
-  if (!providers_.motionManager) providers_.motionManager = assembly.motionManager;
-  if (!providers_.routineManager && assembly.userDefaults) {
-    providers_.routineManager = std::make_shared<DefaultsRoutineManager>(*assembly.userDefaults);
-  }
-  if (!providers_.deviceInformation) {
-    providers_.deviceInformation = std::make_shared<DeviceInformation>(assembly.userDefaults.get());
-  }
+TVXNetworkRequestFactory::TVXNetworkRequestFactory(Environment env, TVXRequestFactoryProviders providers)
+    : env_(std::move(env)), providers_(std::move(providers)), context_(std::make_unique<Context>(*env_.pool)) {
+  if (!providers_.routineManager) providers_.routineManager = std::make_shared<DefaultsRoutineManager>(*env_.defaults);
+  if (!providers_.deviceInformation) providers_.deviceInformation = std::make_shared<DeviceInformation>(env_.defaults.get());
   if (!providers_.isDictionaryInstalled) {
     providers_.isDictionaryInstalled = [](const std::string& identifier) {
       // A name that could leave the folder is no dictionary of ours.
@@ -83,6 +76,8 @@ TVXNetworkRequestFactory::TVXNetworkRequestFactory(Assembly& assembly, TVXReques
   }
   userAgent_ = createUserAgentString(std::nullopt, *providers_.deviceInformation);
 }
+
+bool TVXNetworkRequestFactory::useMarvola() const { return env_.defaults->boolForKey("TVXUseMarvola"); }
 
 // The items and headers that every request of the search family carries, after its own.
 void TVXNetworkRequestFactory::addLocaleItems(TavixURLRequestBuilder& b, const TVXRequest& request) {
@@ -104,7 +99,7 @@ void TVXNetworkRequestFactory::addLocaleItems(TavixURLRequestBuilder& b, const T
 }
 
 void TVXNetworkRequestFactory::addDictionaries(TavixURLRequestBuilder& b) {
-  if (assembly_.userDefaults->boolForKey("TVXLookupDisabled")) {
+  if (env_.defaults->boolForKey("TVXLookupDisabled")) {
     b.defaultQueryItemWithName("dicts", "off");
   } else if (nonEmpty(context_->installedDictionaries)) {
     b.defaultQueryItemWithName("dicts", context_->installedDictionaries);
@@ -168,7 +163,7 @@ void TVXNetworkRequestFactory::addTrailingItems(TavixURLRequestBuilder& b, const
   if (c.isManagedAccount || c.deviceRestricted) b.defaultQueryItemWithName("mode", "managed");
   if (nonEmpty(c.storeFrontIdentifier)) b.defaultQueryItemWithName("storefront", c.storeFrontIdentifier);
   if (c.subscriptionInfo) b.defaultHttpHeaderWithName(TavixHTTPHeaderNameSubscriptions, *c.subscriptionInfo);
-  if (assembly_.userDefaults->boolForKey("TVXDiagnosticsSubmissionAllowed")) b.defaultQueryItemWithName("du_enabled", "1");
+  if (env_.defaults->boolForKey("TVXDiagnosticsSubmissionAllowed")) b.defaultQueryItemWithName("du_enabled", "1");
   b.defaultHttpHeaderWithName(TavixHTTPHeaderNameUserGUID, userGuid);
   if (!bag.userAgent().empty()) b.defaultHttpHeaderWithName(TavixHTTPHeaderNameUserAgent, bag.userAgent());
   if (request.scale > 0) b.defaultHttpHeaderWithName(TavixHTTPHeaderNameUIScale, fmt::format("{:.1f}", request.scale));
@@ -220,7 +215,7 @@ TVXNetworkRequestFactory::Request TVXNetworkRequestFactory::bagRequest(TVXBagURL
   b->defaultQueryItemWithName("locale", c.locale.localeIdentifier);
   if (nonEmpty(c.locale.effectiveSystemLanguage)) b->defaultQueryItemWithName("esl", c.locale.effectiveSystemLanguage);
   if (nonEmpty(c.geoDeviceCountryCode)) b->defaultQueryItemWithName("cc", c.geoDeviceCountryCode);
-  b->defaultQueryItemWithName("marvola", assembly_.useMarvola() ? "1" : "0");
+  b->defaultQueryItemWithName("marvola", useMarvola() ? "1" : "0");
   if (forCache) {
     if (nonEmpty(userAgent)) b->defaultQueryItemWithName("agent", userAgent);
   } else {
@@ -379,7 +374,7 @@ TVXNetworkRequestFactory::Request TVXNetworkRequestFactory::flightSearchRequest(
     b->forceQueryItemWithName("q", request.flightQuery);
     addRequestAndDebugItems(*b, request);
     b->defaultQueryItemWithName("key", kAccessKey);
-    b->defaultQueryItemWithName("timestamp", fmt::format("{}", platform::toUnixSeconds(assembly_.clock->now())));
+    b->defaultQueryItemWithName("timestamp", fmt::format("{}", platform::toUnixSeconds(env_.clock->now())));
     b->forceHttpHeaderWithName("Accept", "application/x-protobuf");
     if (request.bundleIdentifier) b->defaultQueryItemWithName("context", request.bundleIdentifier);
     addLocaleItems(*b, request);

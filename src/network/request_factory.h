@@ -8,7 +8,7 @@
 // reads enter it synchronously (never call them from that queue); observers and setters update it
 // asynchronously; flushContextAccessQueue() waits for the updates queued so far.
 //
-// Observed: "TVXBagChangeNotification" on the assembly's notification centre (its user info's
+// Observed: "TVXBagChangeNotification" on its notification centre (its user info's
 // "bag"), "TVXFileDownloadCompletedNotification" for the known-dictionaries list, and the
 // defaults keys it reads. Posted: "TVXBagRefreshRequired" (sender: the factory, from a pool
 // thread) when the locale context or the device country code changes.
@@ -32,12 +32,19 @@
 #include <vector>
 
 #include "core/requests.h"
+#include "platform/files.h"
 #include "platform/http/url_request.h"
 #include "platform/property_value.h"
 
 namespace tavix {
 
-class Assembly;
+namespace platform {
+class Clock;
+class DispatchPool;
+class NotificationCenter;
+class UserDefaults;
+}  // namespace platform
+
 class DeviceInformation;
 class LocationManager;
 class MotionManager;
@@ -80,9 +87,8 @@ inline constexpr const char* kTVXSTSAppBundleIdentifier = "com.norvel.messages.h
 // identifiers, kept by the download manager as a file of that name in the caches folder.
 inline constexpr const char* kTVXKnownDictionariesList = "dictionary_resources_url";
 
-// The collaborators the factory reads. Empty members are taken from the assembly (location and
-// motion managers) or made from its defaults (device information, routine); the rest stay absent,
-// and what they would feed is then not sent.
+// The collaborators the factory reads. Empty members are made from its defaults (device
+// information, routine) or stay absent, and what they would feed is then not sent.
 struct TVXRequestFactoryProviders {
   std::shared_ptr<LocationManager> locationManager;
   std::shared_ptr<MotionManager> motionManager;
@@ -99,12 +105,23 @@ struct TVXRequestFactoryProviders {
 
 class TVXNetworkRequestFactory : public std::enable_shared_from_this<TVXNetworkRequestFactory> {
  public:
-  // The assembly's dispatch pool, clock, defaults and notification centre must be set and must
-  // outlive the factory.
-  static std::shared_ptr<TVXNetworkRequestFactory> create(Assembly& assembly, TVXRequestFactoryProviders providers = {});
+  // What the factory works with besides its providers. The pool and clock must outlive it.
+  struct Environment {
+    platform::DispatchPool* pool = nullptr;
+    platform::Clock* clock = nullptr;
+    std::shared_ptr<platform::UserDefaults> defaults;
+    // Bag, download and user-identifier changes arrive here; bag refreshes are asked for here.
+    std::shared_ptr<platform::NotificationCenter> center;
+    platform::fs::path cachesFolder;  // holds the known-dictionaries list
+  };
+
+  static std::shared_ptr<TVXNetworkRequestFactory> create(Environment env, TVXRequestFactoryProviders providers = {});
   ~TVXNetworkRequestFactory();
   TVXNetworkRequestFactory(const TVXNetworkRequestFactory&) = delete;
   TVXNetworkRequestFactory& operator=(const TVXNetworkRequestFactory&) = delete;
+
+  // The current "TVXUseMarvola" default, read on every call so a change needs no restart.
+  bool useMarvola() const;
 
   using Request = std::optional<platform::http::URLRequest>;
 
@@ -169,7 +186,7 @@ class TVXNetworkRequestFactory : public std::enable_shared_from_this<TVXNetworkR
   struct Context;
   class Delegate;
 
-  TVXNetworkRequestFactory(Assembly& assembly, TVXRequestFactoryProviders providers);
+  TVXNetworkRequestFactory(Environment env, TVXRequestFactoryProviders providers);
   void start();
 
   // ---- The request context (request_context.cpp), on the context queue.
@@ -200,7 +217,7 @@ class TVXNetworkRequestFactory : public std::enable_shared_from_this<TVXNetworkR
   void addGeoMetadata(TavixURLRequestBuilder& b);
   Request bagRequest(TVXBagURLSource& source, const std::optional<std::string>& userAgent, const std::optional<std::string>& version, bool forCache);
 
-  Assembly& assembly_;
+  Environment env_;
   TVXRequestFactoryProviders providers_;
   std::optional<std::string> userAgent_;
   std::unique_ptr<Context> context_;  // owns the queue and the fields on it

@@ -8,7 +8,6 @@
 #include "bagview/tvx_bag.h"
 #include "context/location.h"
 #include "context/motion.h"
-#include "core/assembly.h"
 #include "platform/http/url.h"
 #include "network/url_request_builder.h"
 #include "platform/clock.h"
@@ -18,7 +17,7 @@
 #include "platform/json_value.h"
 #include "platform/log.h"
 #include "platform/notification_center.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 
 namespace tavix {
 namespace {
@@ -94,18 +93,12 @@ std::map<std::string, std::string> queryOf(const std::string& url, std::vector<s
   return items;
 }
 
-class RequestFactoryTest : public ::testing::Test {
+class RequestFactoryTest : public ::testing::Test, protected testing::TestAssembly {
  protected:
   RequestFactoryTest() {
-    defaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
     defaults->setObject("TVXLocale", "fr_FR");
     defaults->setObject("TVXPreferredLanguages", PropertyValue::Array{"fr-FR", "en-GB", "de", "it", "es"});
     defaults->setObject("TVXTimeZone", "Europe/Paris");
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.paths = platform::Paths{home.cache(), home.config(), home.runtime()};
-    assembly.userDefaults = defaults;
-    assembly.notificationCenter = center;
     providers.locationManager = location;
     providers.routineManager = routine;
   }
@@ -114,18 +107,12 @@ class RequestFactoryTest : public ::testing::Test {
     pool.drain();
   }
 
-  void make() { factory = TVXNetworkRequestFactory::create(assembly, providers); }
+  void make() { factory = TVXNetworkRequestFactory::create(requestFactoryEnvironment(), providers); }
 
   static TVXBag bag(const char* json, std::string agent = "Seekara/1 (test)") {
     return TVXBag(*platform::parseJson(json)->dictionary(), std::move(agent));
   }
 
-  testing::TempHome home;
-  platform::DispatchPool pool{2};
-  platform::VirtualClock clock;
-  std::shared_ptr<platform::UserDefaults> defaults;
-  std::shared_ptr<platform::NotificationCenter> center = std::make_shared<platform::NotificationCenter>();
-  Assembly assembly;
   std::shared_ptr<FakeLocationManager> location = std::make_shared<FakeLocationManager>();
   std::shared_ptr<FakeRoutine> routine = std::make_shared<FakeRoutine>();
   TVXRequestFactoryProviders providers;

@@ -42,7 +42,7 @@ ClientState::ClientState(Assembly& assembly, std::string identifier)
       waitQueue_(std::make_unique<platform::SerialQueue>(*assembly.dispatchPool, "com.norvel.tavixd.clientState")),
       retryQueue_(std::make_unique<platform::SerialQueue>(*assembly.dispatchPool, "com.norvel.tavixd.clientState.retry")) {
   if (!assembly_.userDefaults || !assembly_.userDefaults->boolForKey("TVXNoQueryCache")) {
-    queryCache_ = QueryCache::create(assembly_);
+    queryCache_ = QueryCache::create(*assembly_.dispatchPool, *assembly_.clock, *assembly_.notificationCenter);
     cachingLog().debug("query cache ON for {}", identifier_);
   } else {
     cachingLog().debug("query cache OFF for {}", identifier_);
@@ -52,7 +52,8 @@ ClientState::ClientState(Assembly& assembly, std::string identifier)
     guidController_ = assembly_.guidController;
     sessionManager_ = assembly_.clientSessionManager;
   } else {
-    guidController_ = std::make_shared<TavixUserGUIDController>(assembly_);
+    guidController_ = std::make_shared<TavixUserGUIDController>(*assembly_.dispatchPool, *assembly_.clock,
+                                                                assembly_.notificationCenter);
     sessionLog().debug("Tavix is using individual instance of guid controller {}",
                        static_cast<const void*>(guidController_.get()));
     sessionManager_ = std::make_shared<ClientSessionManager>(assembly_, guidController_, assembly_.bagController, identifier_);

@@ -110,7 +110,7 @@ ClientState::StartRecord ClientState::startSearchEventForRequest(const platform:
   auto& headers = *start->mutable_headers();
   for (const auto& [name, value] : request.headers.all()) headers[name] = value;
   start->set_uuid(makeRandomUUIDString());
-  if (assembly_.useMarvola() && assembly_.requestFactory) {
+  if (assembly_.requestFactory && assembly_.requestFactory->useMarvola()) {
     start->set_marvola_status(assembly_.requestFactory->proxyGetStatus());
   }
   return start;

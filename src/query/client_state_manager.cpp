@@ -1,6 +1,5 @@
 #include "query/client_state_manager.h"
 
-#include "core/assembly.h"
 #include "core/logging.h"
 #include "platform/defaults.h"
 #include "query/client_state.h"
@@ -19,10 +18,12 @@ std::optional<std::string> stringEntry(const platform::Dictionary& dictionary, c
 
 }  // namespace
 
-ClientStateManager::ClientStateManager(Assembly& assembly)
-    : assembly_(assembly),
-      persistSessions_(assembly.userDefaults && assembly.userDefaults->boolForKey("TVXPersistSessions")),
-      stateCacheQueue_(*assembly.dispatchPool, "com.norvel.tavixd.stateCache") {
+ClientStateManager::ClientStateManager(platform::DispatchPool& pool, std::shared_ptr<platform::UserDefaults> defaults,
+                                       MakeState makeState)
+    : defaults_(std::move(defaults)),
+      makeState_(std::move(makeState)),
+      persistSessions_(defaults_->boolForKey("TVXPersistSessions")),
+      stateCacheQueue_(pool, "com.norvel.tavixd.stateCache") {
   loadState();
 }
 
@@ -34,7 +35,7 @@ std::shared_ptr<ClientState> ClientStateManager::stateForClientIdentifier(const 
   std::shared_ptr<ClientState> state;
   stateCacheQueue_.sync([&] {
     auto& slot = stateCache_[identifier];
-    if (!slot) slot = ClientState::create(assembly_, identifier);
+    if (!slot) slot = makeState_(identifier);
     state = slot;
   });
   sessionLog().info("using client state: {}", identifier);
@@ -43,13 +44,13 @@ std::shared_ptr<ClientState> ClientStateManager::stateForClientIdentifier(const 
 
 void ClientStateManager::loadState() {
   if (!persistSessions_) return;
-  auto value = assembly_.userDefaults->objectForKey("sessions");
+  auto value = defaults_->objectForKey("sessions");
   if (!value || !value->array()) return;
   for (const auto& element : *value->array()) {
     if (!element.dictionary()) continue;
     auto identifier = stringEntry(*element.dictionary(), "identifier");
     if (!identifier) continue;
-    auto state = ClientState::create(assembly_, *identifier);
+    auto state = makeState_(*identifier);
     state->setUserAgent(stringEntry(*element.dictionary(), "agent"));
     stateCache_[*identifier] = std::move(state);
   }
@@ -77,8 +78,8 @@ void ClientStateManager::saveState() {
   stateCacheQueue_.async([weak] {
     auto self = weak.lock();
     if (!self) return;
-    self->assembly_.userDefaults->setObject("sessions", self->sessionsOnQueue());
-    self->assembly_.userDefaults->synchronize();
+    self->defaults_->setObject("sessions", self->sessionsOnQueue());
+    self->defaults_->synchronize();
   });
 }
 

@@ -8,6 +8,7 @@
 // saveState() asynchronously (only while the manager is held by a shared_ptr).
 #pragma once
 
+#include <functional>
 #include <map>
 #include <memory>
 #include <string>
@@ -18,13 +19,20 @@
 
 namespace tavix {
 
-class Assembly;
 class ClientState;
+namespace platform {
+class UserDefaults;
+}
 
 class ClientStateManager : public std::enable_shared_from_this<ClientStateManager> {
  public:
-  // Needs the assembly's dispatch pool and defaults. Loads the persisted states.
-  explicit ClientStateManager(Assembly& assembly);
+  // Makes the state of a client identifier. A function rather than the state's own peers: the
+  // manager only keeps states and never looks inside one.
+  using MakeState = std::function<std::shared_ptr<ClientState>(const std::string& identifier)>;
+
+  // The pool must outlive it. Loads the persisted states.
+  ClientStateManager(platform::DispatchPool& pool, std::shared_ptr<platform::UserDefaults> defaults,
+                     MakeState makeState);
   ClientStateManager(const ClientStateManager&) = delete;
   ClientStateManager& operator=(const ClientStateManager&) = delete;
 
@@ -44,7 +52,8 @@ class ClientStateManager : public std::enable_shared_from_this<ClientStateManage
  private:
   platform::PropertyValue::Array sessionsOnQueue();
 
-  Assembly& assembly_;
+  std::shared_ptr<platform::UserDefaults> defaults_;
+  MakeState makeState_;
   const int connectSemaphore_ = 10;
   const bool persistSessions_;
   platform::SerialQueue stateCacheQueue_;

@@ -20,7 +20,7 @@
 #include "platform/http/url_session.h"
 #include "platform/notification_center.h"
 #include "query/client_state_manager.h"
-#include "support/temp_home.h"
+#include "support/test_assembly.h"
 
 namespace tavix {
 namespace {
@@ -48,18 +48,12 @@ struct BagAnswer {
 };
 
 // The bag wait runs on virtual time; the bag itself comes from the development server.
-class ClientStateTest : public ::testing::Test {
+class ClientStateTest : public ::testing::Test, protected testing::TestAssembly {
  protected:
-  ClientStateTest() {
+  ClientStateTest() : testing::TestAssembly(4) {
     EXPECT_TRUE(server.start({}, nullptr));
-    defaults = std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
     defaults->setObject("TVXBagURL", server.baseURL() + "/bag");
-    assembly.dispatchPool = &pool;
-    assembly.clock = &clock;
-    assembly.paths = platform::Paths{home.cache(), home.config(), home.runtime()};
-    assembly.userDefaults = defaults;
-    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
-    assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+    makeRequestFactory();
   }
   // After any fault on /bag has been set, so that no fetch slips by it.
   void startController() { assembly.bagController = TavixBagController::create(assembly); }
@@ -90,12 +84,7 @@ class ClientStateTest : public ::testing::Test {
     return states.back();
   }
 
-  testing::TempHome home;
   devserver::DevServer server;
-  platform::DispatchPool pool{4};
-  platform::VirtualClock clock;
-  std::shared_ptr<platform::UserDefaults> defaults;
-  Assembly assembly;
   std::vector<std::shared_ptr<ClientState>> states;
 };
 
@@ -189,7 +178,7 @@ TEST_F(ClientStateTest, NewUserAgentRelabelsTheBagAndEmptiesTheQueryCache) {
 
 TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
   startController();
-  auto manager = std::make_shared<ClientStateManager>(assembly);
+  auto manager = makeClientStateManager();
   EXPECT_EQ(manager->stateForClientIdentifier(""), nullptr);
 
   std::shared_ptr<ClientState> a, b;
@@ -214,7 +203,7 @@ TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
                       platform::Dictionary{{"identifier", "com.norvel.brovane"}, {"agent", "brovane/7"}},
                       platform::Dictionary{{"identifier", "com.norvel.news"}},
                   });
-  auto loaded = std::make_shared<ClientStateManager>(assembly);
+  auto loaded = makeClientStateManager();
   auto sessions = loaded->sessions();
   ASSERT_EQ(sessions.size(), 1u);
   EXPECT_EQ(*sessions[0].dictionary()->at("agent").string(), "brovane/7");

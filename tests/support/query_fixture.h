@@ -30,6 +30,7 @@
 #include "platform/notification_center.h"
 #include "query/client_state.h"
 #include "support/temp_home.h"
+#include "support/test_assembly.h"
 #include "tavix_proto/feedback_session.pb.h"
 #include "cache/engaged_completion_cache.h"
 
@@ -71,28 +72,22 @@ class Replies {
   std::vector<Call> calls_;
 };
 
-class QueryFixture : public ::testing::Test {
+// The assembly runs on the system clock unless the test hands in another.
+class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
  protected:
-  explicit QueryFixture(platform::Clock* clock = nullptr) {
+  explicit QueryFixture(platform::Clock* testClock = nullptr) : testing::TestAssembly(8) {
     EXPECT_TRUE(server.start({}, nullptr));
-    clock_ = clock ? clock : &systemClock;
-    defaults = std::make_shared<platform::UserDefaults>(home.config(), kTavixdDomain);
-    defaults->registerDefaults({{"TVXSessionSizeLimit", platform::PropertyValue(std::int64_t{2097152})},
-                                {"TVXSessionMaxAge", platform::PropertyValue(std::int64_t{172800})},
-                                {"TVXSessionSoftLimitOverride", platform::PropertyValue(std::int64_t{600})},
+    clock_ = testClock ? testClock : &systemClock;
+    assembly.clock = clock_;
+    defaults->registerDefaults({{"TVXSessionSoftLimitOverride", platform::PropertyValue(std::int64_t{600})},
                                 {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
     defaults->setObject("TVXBagURL", server.baseURL() + "/bag");
-    assembly.dispatchPool = &pool;
-    assembly.clock = clock_;
-    assembly.paths = platform::Paths{home.cache(), home.config(), home.runtime()};
-    assembly.userDefaults = defaults;
-    assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
-    assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(assembly);
+    makeStorage();
     assembly.engagedCompletionCache =
         EngagedCompletionCache::create({assembly.cachesFolder(), clock_, &pool, defaults.get()});
-    assembly.requestFactory = TVXNetworkRequestFactory::create(assembly);
+    makeRequestFactory();
     // The daemon's own session manager (warm-up records); clients keep sessions of their own.
-    assembly.guidController = std::make_shared<TavixUserGUIDController>(assembly);
+    assembly.guidController = makeGUIDController();
     assembly.clientSessionManager =
         std::make_shared<ClientSessionManager>(assembly, assembly.guidController, nullptr, "tavix");
   }
@@ -213,16 +208,12 @@ class QueryFixture : public ::testing::Test {
     return r;
   }
 
-  testing::TempHome home;
   devserver::DevServer server;
   // The test's own requests to the devserver, on connections of their own: the query paths'
   // session then never reuses a connection the test opened.
   std::shared_ptr<platform::http::URLSession> control = std::make_shared<platform::http::URLSession>();
-  platform::DispatchPool pool{8};
   platform::SystemClock systemClock{pool};
   platform::Clock* clock_ = nullptr;
-  std::shared_ptr<platform::UserDefaults> defaults;
-  Assembly assembly;
   std::vector<std::shared_ptr<ClientState>> states;
   std::vector<proto::CTTavixFeedback> collected;
 };
