@@ -304,7 +304,8 @@ struct IpcListener::Impl : std::enable_shared_from_this<IpcListener::Impl> {
   void armAccept() {
     auto self = shared_from_this();
     socket.async_wait(asio::posix::stream_descriptor::wait_read, [self](const asio::error_code& ec) {
-      if (ec) return;  // closed by the destructor
+      // Closed by the destructor; a wait that had already completed can still run after the close.
+      if (ec || !self->socket.is_open()) return;
       self->acceptAll();
       self->armAccept();
     });
