@@ -4,7 +4,6 @@
 // random tail, as a torn write would leave it. The test prints its seed; TAVIX_TEST_SEED replays it.
 #include <signal.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -23,6 +22,7 @@
 #include "bagview/user_agent.h"
 #include "platform/dispatch.h"
 #include "support/daemon_process.h"
+#include "support/raw_frames.h"
 #include "support/test_seed.h"
 #include "tavix_proto/feedback_session.pb.h"
 #include "tavix_proto/ipc.pb.h"
@@ -45,25 +45,10 @@ struct Daemon : testing::DaemonProcess {
 // Connects, says who it is, waits for the answer and hangs up: the daemon then records the
 // connection's invalidation as feedback of that agent. False when the daemon is not there.
 bool connectAndLeave(const std::string& path, const std::string& agent) {
-  const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path.c_str());
-  if (::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
-    ::close(fd);
-    return false;
-  }
-  timeval tv{2, 0};
-  ::setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
-  proto::Envelope e;
-  e.set_call_id(1);
-  e.mutable_configure()->mutable_configuration()->set_identifier("reliability");
-  e.mutable_configure()->mutable_configuration()->set_user_agent(agent);
-  const std::string payload = e.SerializeAsString();
-  const auto n = static_cast<std::uint32_t>(payload.size());
-  std::string frame{static_cast<char>(n >> 24), static_cast<char>(n >> 16), static_cast<char>(n >> 8),
-                    static_cast<char>(n)};
-  frame += payload;
+  const int fd = testing::rawConnect(path, 2);
+  if (fd < 0) return false;
+  // Not rawSend: a daemon killed mid-conversation is expected here, not a failure.
+  const std::string frame = testing::rawFrame(testing::configureFrame("reliability", agent, 1));
   bool ok = ::send(fd, frame.data(), frame.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(frame.size());
   char buf[256];
   if (ok) ok = ::recv(fd, buf, sizeof buf, 0) > 0;  // the configure reply
