@@ -7,7 +7,6 @@
 #include <gtest/gtest.h>
 
 #include <fstream>
-#include <future>
 #include <nlohmann/json.hpp>
 
 #include "platform/dispatch.h"

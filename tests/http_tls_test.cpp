@@ -5,7 +5,6 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
-#include <future>
 #include <thread>
 
 #include "platform/dispatch.h"
