@@ -66,6 +66,11 @@ std::map<int, std::string> reportedFiles(const std::string& log) {
   return files;
 }
 
+// A session file read back as the flusher will read it.
+auto readSession(const platform::fs::path& path, platform::SerialQueue& queue) {
+  return FileContainer(path, tavixdSessionFileVersion(), queue, kMaxFileSize).readRecord();
+}
+
 struct Verdict {
   int accepted = 0;
   int discarded = 0;
@@ -91,8 +96,7 @@ Verdict checkFolder(const platform::fs::path& folder, platform::SerialQueue& que
   for (const auto& entry : platform::fs::directory_iterator(folder)) {
     const std::string name = entry.path().filename().string();
     if (name.rfind("session.", 0) != 0) continue;
-    FileContainer container(entry.path(), tavixdSessionFileVersion(), queue, kMaxFileSize);
-    auto record = container.readRecord();
+    auto record = readSession(entry.path(), queue);
     if (!record) {
       ++v.discarded;
       continue;
@@ -164,11 +168,11 @@ TEST(FeedbackReliability, SessionFilesSurviveAKillAtAnyPoint) {
       auto it = reported.begin();
       std::advance(it, std::uniform_int_distribution<std::size_t>(0, reported.size() - 1)(random));
       const platform::fs::path victim = it->second;
-      auto before = FileContainer(victim, tavixdSessionFileVersion(), queue, kMaxFileSize).readRecord();
+      auto before = readSession(victim, queue);
       const auto size = platform::fs::file_size(victim);
       if (before && size > 0) {
         platform::fs::resize_file(victim, std::uniform_int_distribution<std::uintmax_t>(0, size - 1)(random));
-        auto after = FileContainer(victim, tavixdSessionFileVersion(), queue, kMaxFileSize).readRecord();
+        auto after = readSession(victim, queue);
         if (after) {
           EXPECT_LE(after->feedbacks_size(), before->feedbacks_size());
           for (int i = 0; i < after->feedbacks_size(); ++i) {
