@@ -4,7 +4,6 @@
 // random tail, as a torn write would leave it. The test prints its seed; TAVIX_TEST_SEED replays it.
 #include <signal.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -23,6 +22,7 @@
 #include "bagview/user_agent.h"
 #include "platform/dispatch.h"
 #include "support/daemon_process.h"
+#include "support/raw_frames.h"
 #include "support/test_seed.h"
 #include "tavix_proto/feedback_session.pb.h"
 #include "tavix_proto/ipc.pb.h"
@@ -45,25 +45,10 @@ struct Daemon : testing::DaemonProcess {
 // Connects, says who it is, waits for the answer and hangs up: the daemon then records the
 // connection's invalidation as feedback of that agent. False when the daemon is not there.
 bool connectAndLeave(const std::string& path, const std::string& agent) {
-  const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path.c_str());
-  if (::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
-    ::close(fd);
-    return false;
-  }
-  timeval tv{2, 0};
-  ::setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
-  proto::Envelope e;
-  e.set_call_id(1);
-  e.mutable_configure()->mutable_configuration()->set_identifier("reliability");
-  e.mutable_configure()->mutable_configuration()->set_user_agent(agent);
-  const std::string payload = e.SerializeAsString();
-  const auto n = static_cast<std::uint32_t>(payload.size());
-  std::string frame{static_cast<char>(n >> 24), static_cast<char>(n >> 16), static_cast<char>(n >> 8),
-                    static_cast<char>(n)};
-  frame += payload;
+  const int fd = testing::rawConnect(path, 2);
+  if (fd < 0) return false;
+  // Not rawSend: a daemon killed mid-conversation is expected here, not a failure.
+  const std::string frame = testing::rawFrame(testing::configureFrame("reliability", agent, 1));
   bool ok = ::send(fd, frame.data(), frame.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(frame.size());
   char buf[256];
   if (ok) ok = ::recv(fd, buf, sizeof buf, 0) > 0;  // the configure reply
@@ -79,6 +64,11 @@ std::map<int, std::string> reportedFiles(const std::string& log) {
     files[std::stoi((*it)[2])] = (*it)[1];
   }
   return files;
+}
+
+// A session file read back as the flusher will read it.
+auto readSession(const platform::fs::path& path, platform::SerialQueue& queue) {
+  return FileContainer(path, tavixdSessionFileVersion(), queue, kMaxFileSize).readRecord();
 }
 
 struct Verdict {
@@ -106,8 +96,7 @@ Verdict checkFolder(const platform::fs::path& folder, platform::SerialQueue& que
   for (const auto& entry : platform::fs::directory_iterator(folder)) {
     const std::string name = entry.path().filename().string();
     if (name.rfind("session.", 0) != 0) continue;
-    FileContainer container(entry.path(), tavixdSessionFileVersion(), queue, kMaxFileSize);
-    auto record = container.readRecord();
+    auto record = readSession(entry.path(), queue);
     if (!record) {
       ++v.discarded;
       continue;
@@ -179,11 +168,11 @@ TEST(FeedbackReliability, SessionFilesSurviveAKillAtAnyPoint) {
       auto it = reported.begin();
       std::advance(it, std::uniform_int_distribution<std::size_t>(0, reported.size() - 1)(random));
       const platform::fs::path victim = it->second;
-      auto before = FileContainer(victim, tavixdSessionFileVersion(), queue, kMaxFileSize).readRecord();
+      auto before = readSession(victim, queue);
       const auto size = platform::fs::file_size(victim);
       if (before && size > 0) {
         platform::fs::resize_file(victim, std::uniform_int_distribution<std::uintmax_t>(0, size - 1)(random));
-        auto after = FileContainer(victim, tavixdSessionFileVersion(), queue, kMaxFileSize).readRecord();
+        auto after = readSession(victim, queue);
         if (after) {
           EXPECT_LE(after->feedbacks_size(), before->feedbacks_size());
           for (int i = 0; i < after->feedbacks_size(); ++i) {

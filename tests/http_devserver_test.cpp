@@ -7,12 +7,12 @@
 #include <gtest/gtest.h>
 
 #include <fstream>
-#include <future>
 #include <nlohmann/json.hpp>
 
 #include "platform/dispatch.h"
 #include "platform/http/url_session.h"
 #include "support/devserver_process.h"
+#include "support/http_helpers.h"
 #include "support/temp_home.h"
 
 namespace {
@@ -21,14 +21,9 @@ using namespace tavix::platform;
 using namespace tavix::platform::http;
 using json = nlohmann::json;
 
-
 std::pair<long, json> get(URLSession& session, const std::string& url) {
-  std::promise<std::pair<long, json>> done;
-  auto task = session.dataTask({url}, [&](std::string data, auto response, auto error) {
-    done.set_value({response ? response->statusCode : 0, json::parse(data, nullptr, false)});
-  });
-  task->resume();
-  return done.get_future().get();
+  auto outcome = tavix::testing::fetch(session, {url});
+  return {outcome.response ? outcome.response->statusCode : 0, json::parse(outcome.data, nullptr, false)};
 }
 
 TEST(HTTPDevServerTest, ServesItsBagAndSearchAndKeepsWhatItRecords) {

@@ -12,6 +12,7 @@
 #include "platform/dispatch.h"
 #include "platform/http/url_session.h"
 #include "platform/log.h"
+#include "support/http_helpers.h"
 #include "support/temp_home.h"
 
 namespace {
@@ -20,11 +21,7 @@ using namespace tavix::platform;
 using namespace tavix::platform::http;
 using json = nlohmann::json;
 
-struct Outcome {
-  std::string data;
-  std::optional<HTTPURLResponse> response;
-  std::optional<URLError> error;
-};
+using Outcome = tavix::testing::HTTPOutcome;
 
 class HTTPSessionTest : public ::testing::Test {
  protected:
@@ -37,18 +34,9 @@ class HTTPSessionTest : public ::testing::Test {
 
   // Runs one task to its end and checks that the completion came exactly once.
   Outcome run(URLSession& session, URLRequest request, std::shared_ptr<URLSessionDataTask>* keep = nullptr) {
-    auto calls = std::make_shared<std::atomic<int>>(0);
-    std::promise<Outcome> done;
-    auto task = session.dataTask(std::move(request), [&done, calls](std::string data, auto response, auto error) {
-      if (++*calls == 1) done.set_value({std::move(data), std::move(response), std::move(error)});
-    });
-    task->resume();
-    auto future = done.get_future();
-    EXPECT_EQ(future.wait_for(std::chrono::seconds(10)), std::future_status::ready);
-    Outcome outcome = future.get();
+    Outcome outcome = tavix::testing::fetch(session, std::move(request), keep);
     pool.drain();
-    EXPECT_EQ(calls->load(), 1);
-    if (keep) *keep = task;
+    EXPECT_EQ(outcome.completions->load(), 1);
     return outcome;
   }
 

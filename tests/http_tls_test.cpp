@@ -5,11 +5,11 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
-#include <future>
 #include <thread>
 
 #include "platform/dispatch.h"
 #include "platform/http/url_session.h"
+#include "support/http_helpers.h"
 #include "support/temp_home.h"
 
 namespace {
@@ -17,23 +17,7 @@ namespace {
 using namespace tavix::platform;
 using namespace tavix::platform::http;
 
-struct Outcome {
-  std::optional<HTTPURLResponse> response;
-  std::optional<URLError> error;
-  URLSessionTaskMetrics metrics;
-};
-
-Outcome get(URLSession& session, const std::string& url) {
-  std::promise<Outcome> done;
-  std::shared_ptr<URLSessionDataTask> task;
-  task = session.dataTask({url}, [&](std::string, auto response, auto error) {
-    done.set_value({response, error, {}});
-  });
-  task->resume();
-  Outcome outcome = done.get_future().get();
-  outcome.metrics = task->metrics();
-  return outcome;
-}
+using Outcome = tavix::testing::HTTPOutcome;
 
 TEST(HTTPTLSTest, PeersAreVerifiedAgainstTheTrustedCertificates) {
   tavix::testing::TempHome home;
@@ -66,7 +50,7 @@ TEST(HTTPTLSTest, PeersAreVerifiedAgainstTheTrustedCertificates) {
     URLSessionConfiguration untrusting;
     untrusting.delegatePool = &pool;
     URLSession strict(untrusting);
-    Outcome refused = get(strict, url);
+    Outcome refused = tavix::testing::fetch(strict, {url});
     ASSERT_TRUE(refused.error);
     EXPECT_EQ(refused.error->code, URLErrorSecureConnectionFailed);
     EXPECT_FALSE(refused.response);
@@ -75,7 +59,7 @@ TEST(HTTPTLSTest, PeersAreVerifiedAgainstTheTrustedCertificates) {
     trusting.delegatePool = &pool;
     trusting.trustedCertificatesFile = cert.string();
     URLSession session(trusting);
-    Outcome ok = get(session, url);
+    Outcome ok = tavix::testing::fetch(session, {url});
     ASSERT_FALSE(ok.error) << ok.error->description;
     EXPECT_EQ(ok.response->statusCode, 200);
     EXPECT_GT(ok.metrics.secureConnectionSeconds, ok.metrics.connectSeconds);
