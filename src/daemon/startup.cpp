@@ -10,6 +10,7 @@
 #include "cache/engaged_completion_cache.h"
 #include "context/location.h"
 #include "context/motion.h"
+#include "context/user_guid_controller.h"
 #include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
@@ -282,6 +283,24 @@ class Housekeeping {
 
 }  // namespace
 
+void assembleFeedbackServices(Assembly& assembly) {
+  assembly.sharedSession = assembly.userDefaults->boolForKey("TVXSharedSession");
+  assembly.guidController =
+      std::make_shared<TavixUserGUIDController>(*assembly.dispatchPool, *assembly.clock, assembly.notificationCenter);
+  assembly.clientSessionManager =
+      std::make_shared<ClientSessionManager>(assembly, assembly.guidController, assembly.bagController, "tavix");
+}
+
+TavixService::Environment serviceEnvironment(Assembly& assembly, platform::ipc::LaunchEventRegistry* launchEvents) {
+  TavixService::Environment env;
+  env.pool = assembly.dispatchPool;
+  env.urlSession = [&assembly] { return assembly.urlSession(); };
+  env.makeConnection = [&assembly, launchEvents](const std::shared_ptr<platform::ipc::IpcConnection>& connection) {
+    return std::make_shared<ClientConnection>(assembly, connection, launchEvents);
+  };
+  return env;
+}
+
 int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   platform::setLogLevel(options.logLevel);
   auto& log = TavixLogForCategory(TavixLoggingCategoryDefault);
@@ -318,10 +337,12 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   assembly.bagController = TavixBagController::create(assembly);
   applySilhouette(*defaults, *assembly.requestFactory);
 
+  assembleFeedbackServices(assembly);
+
   platform::SerialQueue ipcEventQueue(pool, "com.norvel.tavixd.ipc_event");
   platform::ipc::LaunchEventRegistry launchEvents(ipcEventQueue);
-  TavixService service(assembly, &launchEvents);
-  // After the service: a client state shares the service's GUID controller and session manager.
+  TavixService service(serviceEnvironment(assembly, &launchEvents));
+  // After the feedback services: a client state may share their GUID controller and session manager.
   assembly.clientStateManager = std::make_shared<ClientStateManager>(
       pool, defaults, [&assembly](const std::string& identifier) { return ClientState::create(assembly, identifier); });
   assembly.flusherIPCListener = makeFlusherChannel(assembly, service);
