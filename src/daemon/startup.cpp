@@ -143,13 +143,23 @@ void applySilhouette(const platform::UserDefaults& defaults, TVXNetworkRequestFa
 
 // The flush command channel: it flushes each connected client's session, and hears every
 // feedback event of the daemon's own session manager.
+// Built at each run: the flush channel is made after the first flushers are wired.
+TavixFeedbackFlusher::Environment feedbackFlusherEnvironment(const Assembly& assembly) {
+  return {feedbackEnvironment(assembly), assembly.uploadManager, assembly.flusherIPCListener, assembly.transactions};
+}
+
+TavixCustomFeedbackFlusher::Environment customFeedbackFlusherEnvironment(const Assembly& assembly) {
+  return {assembly.paths.cacheHome, assembly.cachesFolder(), feedbackEnvironment(assembly), assembly.bagController,
+          assembly.uploadManager};
+}
+
 std::shared_ptr<TavixFlusherIPC> makeFlusherChannel(Assembly& assembly, TavixService& service) {
   TavixFlusherIPC::Environment env;
   env.pool = assembly.dispatchPool;
   env.defaults = assembly.userDefaults;
   env.sharedSession = assembly.sharedSession;
   env.flushFeedback = [&assembly](std::function<void()> done) {
-    TavixFeedbackFlusher::create(assembly)->forceFlushWithCompletion(std::move(done));
+    TavixFeedbackFlusher::create(feedbackFlusherEnvironment(assembly))->forceFlushWithCompletion(std::move(done));
   };
   env.getClientConnections = [&service, &assembly] {
     std::vector<TavixFlusherIPC::ClientConnectionHandle> handles;
@@ -206,7 +216,8 @@ void registerLaunchEvents(platform::ipc::LaunchEventRegistry& launchEvents, Asse
 
 void checkInActivities(platform::ActivityScheduler& activities, Assembly& assembly, platform::Logger& log) {
   activities.checkIn(kFlusherActivity, platform::seconds(kFlusherIntervalSeconds), [&assembly](const auto& activity) {
-    TavixFeedbackFlusher::handlePeriodicFlushActivity(assembly, activity);
+    TavixFeedbackFlusher::handlePeriodicFlushActivity(*assembly.userDefaults, feedbackFlusherEnvironment(assembly),
+                                                      activity);
   });
   activities.checkIn(kCustomFeedbackActivity, platform::seconds(kCustomFeedbackIntervalSeconds),
                      [&assembly, &log](const std::shared_ptr<platform::Activity>& activity) {
@@ -215,7 +226,7 @@ void checkInActivities(platform::ActivityScheduler& activities, Assembly& assemb
                        if (!activity->setState(platform::ActivityState::Continue)) {
                          log.fault("Couldn't transition flusher activity to continue state.");
                        }
-                       TavixCustomFeedbackFlusher(assembly).flushCustomFeedbackWithCompletionHandler([activity, &log] {
+                       TavixCustomFeedbackFlusher(customFeedbackFlusherEnvironment(assembly)).flushCustomFeedbackWithCompletionHandler([activity, &log] {
                          if (!activity->setState(platform::ActivityState::Done)) {
                            log.fault("Couldn't transition flusher activity to done state.");
                          }
