@@ -40,7 +40,7 @@ class BagFeedbackTest : public ::testing::Test, protected testing::TestAssembly 
     assembly.guidController = makeGUIDController();
     assembly.bagController = TavixBagController::create(assembly);
     assembly.clientSessionManager =
-        std::make_shared<ClientSessionManager>(assembly, assembly.guidController, assembly.bagController, "tavix");
+        std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), assembly.guidController, assembly.bagController, "tavix");
   }
   ~BagFeedbackTest() override {
     assembly.bagController->invalidate();

@@ -299,7 +299,7 @@ void assembleFeedbackServices(Assembly& assembly) {
   assembly.guidController =
       std::make_shared<TavixUserGUIDController>(*assembly.dispatchPool, *assembly.clock, assembly.notificationCenter);
   assembly.clientSessionManager =
-      std::make_shared<ClientSessionManager>(assembly, assembly.guidController, assembly.bagController, "tavix");
+      std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), assembly.guidController, assembly.bagController, "tavix");
 }
 
 TavixService::Environment serviceEnvironment(Assembly& assembly, platform::ipc::LaunchEventRegistry* launchEvents) {

@@ -89,7 +89,7 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
     // The daemon's own session manager (warm-up records); clients keep sessions of their own.
     assembly.guidController = makeGUIDController();
     assembly.clientSessionManager =
-        std::make_shared<ClientSessionManager>(assembly, assembly.guidController, nullptr, "tavix");
+        std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), assembly.guidController, nullptr, "tavix");
   }
   ~QueryFixture() override {
     states.clear();
