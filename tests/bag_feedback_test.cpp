@@ -38,7 +38,7 @@ class BagFeedbackTest : public ::testing::Test, protected testing::TestAssembly 
     makeRequestFactory();
     makeStorage();
     assembly.guidController = makeGUIDController();
-    assembly.bagController = TavixBagController::create(assembly);
+    assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
     assembly.clientSessionManager =
         std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), assembly.guidController, assembly.bagController, "tavix");
   }

@@ -132,6 +132,8 @@ void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform
       UploadManager::create(pool, *assembly.notificationCenter, assembly.requestFactory, std::move(uploads));
   assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(TavixPersistentStorage::Environment{
       assembly.cachesFolder(), &pool, &clock, assembly.userDefaults.get(), assembly.transactions});
+  // Before the bag controller and the session manager, which stamp their feedback with its GUID.
+  assembly.guidController = std::make_shared<TavixUserGUIDController>(pool, clock, assembly.notificationCenter);
 }
 
 // Topic weights a person or another program left for us; any property-list value, sent as JSON.
@@ -141,8 +143,6 @@ void applySilhouette(const platform::UserDefaults& defaults, TVXNetworkRequestFa
   }
 }
 
-// The flush command channel: it flushes each connected client's session, and hears every
-// feedback event of the daemon's own session manager.
 // Built at each run: the flush channel is made after the first flushers are wired.
 TavixFeedbackFlusher::Environment feedbackFlusherEnvironment(const Assembly& assembly) {
   return {feedbackEnvironment(assembly), assembly.uploadManager, assembly.flusherIPCListener, assembly.transactions};
@@ -153,6 +153,8 @@ TavixCustomFeedbackFlusher::Environment customFeedbackFlusherEnvironment(const A
           assembly.uploadManager};
 }
 
+// The flush command channel: it flushes each connected client's session, and hears every
+// feedback event of the daemon's own session manager.
 std::shared_ptr<TavixFlusherIPC> makeFlusherChannel(Assembly& assembly, TavixService& service) {
   TavixFlusherIPC::Environment env;
   env.pool = assembly.dispatchPool;
@@ -296,8 +298,6 @@ class Housekeeping {
 
 void assembleFeedbackServices(Assembly& assembly) {
   assembly.sharedSession = assembly.userDefaults->boolForKey("TVXSharedSession");
-  assembly.guidController =
-      std::make_shared<TavixUserGUIDController>(*assembly.dispatchPool, *assembly.clock, assembly.notificationCenter);
   assembly.clientSessionManager =
       std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), assembly.guidController, assembly.bagController, "tavix");
 }
@@ -345,7 +345,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   auto& counters = TavixDiagnosticDataReporter::store();
   if (auto ec = counters.load(countersFile)) log.error("cannot read counters {}", describe(countersFile, ec));
   TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.launch");
-  assembly.bagController = TavixBagController::create(assembly);
+  assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
   applySilhouette(*defaults, *assembly.requestFactory);
 
   assembleFeedbackServices(assembly);

@@ -24,8 +24,8 @@ platform::Dictionary tavixdRegisteredDefaults();
 // Failures are logged and never stop start-up; a type folder that exists already is no error.
 void createCustomFeedbackDirectories(const platform::Paths& paths);
 
-// Reads "TVXSharedSession" and makes the GUID controller and the feedback session manager that
-// clients share when it is set. After the bag controller, which the manager reads.
+// Reads "TVXSharedSession" and makes the feedback session manager that clients share when it is
+// set. After the GUID controller and the bag controller, which the manager uses.
 void assembleFeedbackServices(Assembly& assembly);
 
 // The service's dependencies: the assembly's pool and query session, and connections bound to the

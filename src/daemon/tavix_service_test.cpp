@@ -33,6 +33,7 @@ TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
   platform::Logger log("test", "listener");
 
   {
+    assembly.guidController = f.makeGUIDController();
     assembleFeedbackServices(assembly);
     EXPECT_TRUE(assembly.sharedSession);
     TavixService service(serviceEnvironment(assembly, nullptr));

@@ -72,7 +72,7 @@ class FlusherTest : public ::testing::Test, protected testing::TestAssembly {
     makeStorage();
     session = BackgroundUploadSession::create(transport, home.cache() / "journal", pool);
     assembly.uploadManager = UploadManager::create(pool, *center, assembly.requestFactory, session);
-    assembly.bagController = TavixBagController::create(assembly);
+    assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
     assembly.bagController->currentBag();
     ASSERT_TRUE(waitFor([&] { return assembly.uploadManager->feedbackEndpoint().has_value(); }));
     // The fetch leaves a session of its own; the tests count only the sessions they write.

@@ -119,7 +119,7 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
   // Serves `bag` and starts the bag controller on it; waits until the controller holds it.
   void serveBag(const platform::Dictionary& bag) {
     fault("/bag", {{"body", platform::toJson(platform::PropertyValue(bag))}});
-    assembly.bagController = TavixBagController::create(assembly);
+    assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
     assembly.bagController->currentBag();
     ASSERT_TRUE(testing::waitFor([&] { return assembly.bagController->currentBag() != nullptr; }, 5000));
   }
