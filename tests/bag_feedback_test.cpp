@@ -38,9 +38,9 @@ class BagFeedbackTest : public ::testing::Test, protected testing::TestAssembly 
     makeRequestFactory();
     makeStorage();
     assembly.guidController = makeGUIDController();
-    assembly.bagController = TavixBagController::create(assembly);
+    assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
     assembly.clientSessionManager =
-        std::make_shared<ClientSessionManager>(assembly, assembly.guidController, assembly.bagController, "tavix");
+        std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), assembly.guidController, assembly.bagController, "tavix");
   }
   ~BagFeedbackTest() override {
     assembly.bagController->invalidate();

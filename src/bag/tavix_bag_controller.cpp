@@ -163,7 +163,7 @@ proto::CTEndNetworkSearchFeedback bagFetchEndRecord(const proto::CTStartNetworkS
 
 }  // namespace
 
-// The assembly's clock while the controller lives; afterwards pauses are dropped and pending ones
+// The controller's clock while it lives; afterwards pauses are dropped and pending ones
 // cancelled, so that a retry loop still on the wire ends quietly instead of reaching a queue, a
 // pool or a clock that shutdown has taken away.
 class TavixBagController::RetryClock final : public platform::Clock {
@@ -231,18 +231,18 @@ int compareNumericStrings(std::string_view a, std::string_view b) {
   return 0;
 }
 
-std::shared_ptr<TavixBagController> TavixBagController::create(Assembly& assembly) {
-  std::shared_ptr<TavixBagController> controller(new TavixBagController(assembly));
+std::shared_ptr<TavixBagController> TavixBagController::create(Environment env) {
+  std::shared_ptr<TavixBagController> controller(new TavixBagController(std::move(env)));
   controller->start();
   return controller;
 }
 
-TavixBagController::TavixBagController(Assembly& assembly)
-    : assembly_(assembly),
-      inMemoryBagCacheAccessQueue_(*assembly.dispatchPool, "com.norvel.tavixd.bagcontroller.cacheaccess"),
-      retryQueue_(*assembly.dispatchPool, "com.norvel.tavixd.bagcontroller.retry"),
-      retryClock_(std::make_shared<RetryClock>(*assembly.clock)) {
-  DeviceInformation device(assembly.userDefaults.get());
+TavixBagController::TavixBagController(Environment env)
+    : env_(std::move(env)),
+      inMemoryBagCacheAccessQueue_(*env_.feedback.pool, "com.norvel.tavixd.bagcontroller.cacheaccess"),
+      retryQueue_(*env_.feedback.pool, "com.norvel.tavixd.bagcontroller.retry"),
+      retryClock_(std::make_shared<RetryClock>(*env_.feedback.clock)) {
+  DeviceInformation device(env_.feedback.defaults.get());
   userAgent_ = createUserAgentString(std::nullopt, device);
 }
 
@@ -256,15 +256,15 @@ void TavixBagController::start() {
     cacheBagState(std::make_shared<const TVXBag>(std::move(*dictionary), userAgent_.value_or("")), true);
   }
   std::weak_ptr<TavixBagController> weak = weak_from_this();
-  refreshRegistration_ = assembly_.notificationCenter->addObserver(
-      kTVXBagRefreshRequiredNotification, assembly_.requestFactory.get(), nullptr,
+  refreshRegistration_ = env_.center->addObserver(
+      kTVXBagRefreshRequiredNotification, env_.requestFactory.get(), nullptr,
       [weak](const platform::Notification&) {
         if (auto self = weak.lock()) self->handleRefreshNotification();
       });
 }
 
 std::string TavixBagController::bagFetchURLWithCountry(std::string_view countryCode) {
-  const auto configured = assembly_.userDefaults->stringForKey(kBagURLDefaultsKey);
+  const auto configured = env_.feedback.defaults->stringForKey(kBagURLDefaultsKey);
   if (configured && !configured->empty()) {
     if (isUsableBagURL(*configured)) return *configured;
     bagLog().error("Malformed tavix bag URL in user defaults key {}", kBagURLDefaultsKey);
@@ -273,7 +273,7 @@ std::string TavixBagController::bagFetchURLWithCountry(std::string_view countryC
 }
 
 std::optional<std::string> TavixBagController::currentBagCacheURL() {
-  auto request = assembly_.requestFactory->bagCacheRequest(*this, userAgent_, std::nullopt);
+  auto request = env_.requestFactory->bagCacheRequest(*this, userAgent_, std::nullopt);
   if (!request) return std::nullopt;
   return request->url;
 }
@@ -285,7 +285,7 @@ bool TavixBagController::isRefreshRequiredForCachedBag(const Dictionary& rawBag)
   }
   double expiration = 0;
   if (auto it = rawBag.find(kExpirationKey); it != rawBag.end()) expiration = it->second.asReal().value_or(0);
-  const double remaining = expiration - platform::toUnixSeconds(assembly_.clock->now());
+  const double remaining = expiration - platform::toUnixSeconds(env_.feedback.clock->now());
   if (remaining < kRefreshMarginSeconds) {
     bagLog().info("bag expired: {:f}", remaining);
     TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.bag.expired");
@@ -325,7 +325,7 @@ std::shared_ptr<const TVXBag> TavixBagController::cachedBagState() {
   if (refresh) {
     // Not from inside the read: a fetch's completion takes the write side.
     std::weak_ptr<TavixBagController> weak = weak_from_this();
-    assembly_.dispatchPool->post([weak] {
+    env_.feedback.pool->post([weak] {
       if (auto self = weak.lock()) self->fetchBagStateWithVersion(std::nullopt);
     });
   }
@@ -372,12 +372,12 @@ bool TavixBagController::fetchBagStateWithVersion(std::optional<std::string> ver
 }
 
 void TavixBagController::runFetch(std::optional<std::string> version, Completion completion) {
-  if (assembly_.transactions) {
+  if (env_.transactions) {
     std::lock_guard hold(completionLock_);
-    fetchTransaction_ = std::make_unique<platform::TransactionTracker::Transaction>(assembly_.transactions->begin("bagFetch"));
+    fetchTransaction_ = std::make_unique<platform::TransactionTracker::Transaction>(env_.transactions->begin("bagFetch"));
   }
 
-  auto request = assembly_.requestFactory->bagFetchRequest(*this, userAgent_, version);
+  auto request = env_.requestFactory->bagFetchRequest(*this, userAgent_, version);
   if (!request) {
     // Only a URL that does not parse gets here; the endpoint logic falls back before that.
     bagLog().error("Error fetching bag: {}", "no request for the bag URL");
@@ -394,16 +394,16 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
       .notice("Initiating bag fetch attempt with request {} header {}", request->url, request->headers.description());
 
   // The fetch is a feedback session of its own: start, end and, on failure, the error.
-  const auto start = bagFetchStartRecord(*request, hostTicks(*assembly_.clock));
-  auto session = ClientSession::open(feedbackEnvironment(assembly_), wrapFetchRecord(start));
+  const auto start = bagFetchStartRecord(*request, hostTicks(*env_.feedback.clock));
+  auto session = ClientSession::open(env_.feedback, wrapFetchRecord(start));
 
   // Through the network-service proxy when the last bag asked for one, on every attempt.
   auto retryable = std::make_shared<const TVXRetryableNetworkRequest>(*request, std::nullopt, true,
-                                                                      assembly_.requestFactory->proxyURL());
+                                                                      env_.requestFactory->proxyURL());
   std::weak_ptr<TavixBagController> weak = weak_from_this();
   auto retryClock = retryClock_;
   auto task = dataTaskWithRetryableRequest(
-      assembly_.bagSession(), retryable, 1, kFetchRetries, *retryClock, retryQueue_,
+      env_.bagSession(), retryable, 1, kFetchRetries, *retryClock, retryQueue_,
       [weak, retryClock, session, start, completion = std::move(completion)](
           std::string data, std::optional<platform::http::HTTPURLResponse> response,
           std::optional<platform::http::URLError> error, const platform::http::URLSessionTaskMetrics& metrics) {
@@ -416,7 +416,7 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
         std::unique_lock hold(self->completionLock_);
         if (self->invalidated_.load()) return;
         const auto end = bagFetchEndRecord(start, data.size(), response ? response->statusCode : 0, metrics,
-                                           hostTicks(*self->assembly_.clock));
+                                           hostTicks(*self->env_.feedback.clock));
         session->addFeedback(self->wrapFetchRecord(end));
         std::shared_ptr<const TVXBag> bag;
         std::optional<TVXBagError> outcome;
@@ -443,7 +443,7 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
         }
         if (outcome) {
           proto::CTErrorFeedback failure;
-          failure.set_timestamp(hostTicks(*self->assembly_.clock));
+          failure.set_timestamp(hostTicks(*self->env_.feedback.clock));
           failure.set_domain(outcome->domain);
           failure.set_code(static_cast<std::int32_t>(outcome->code));
           failure.set_reason(outcome->reason);
@@ -462,13 +462,13 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
 }
 
 FeedbackRef TavixBagController::wrapFetchRecord(const google::protobuf::Message& record) {
-  const std::string guid = assembly_.guidController ? assembly_.guidController->currentUserGUID() : std::string();
+  const std::string guid = env_.feedback.guid ? env_.feedback.guid->currentUserGUID() : std::string();
   return makeTavixFeedbackWithCodable(record, 0, guid, userAgent_.value_or(""));
 }
 
 Dictionary TavixBagController::cacheBagDictionary(const Dictionary& dictionary) {
   Dictionary augmented = dictionary;
-  augmented[kExpirationKey] = PropertyValue(platform::toUnixSeconds(assembly_.clock->now()) + kBagLifetimeSeconds);
+  augmented[kExpirationKey] = PropertyValue(platform::toUnixSeconds(env_.feedback.clock->now()) + kBagLifetimeSeconds);
   if (auto url = currentBagCacheURL()) augmented[kBagURLKey] = PropertyValue(*url);
 
   std::error_code ec;
@@ -492,13 +492,13 @@ Dictionary TavixBagController::cacheBagDictionary(const Dictionary& dictionary) 
 }
 
 std::optional<platform::fs::path> TavixBagController::pathToCachedBag(std::error_code* error) {
-  std::error_code ec = platform::createDirectory(assembly_.paths.cacheHome, true, 0700);
+  std::error_code ec = platform::createDirectory(env_.cacheHome, true, 0700);
   if (ec) {
     bagLog().fault("error getting cache directory {}", ec.message());
     if (error) *error = ec;
     return std::nullopt;
   }
-  const auto folder = assembly_.cachesFolder();
+  const auto folder = env_.cachesFolder;
   ec = platform::createDirectory(folder, true, 0700);
   if (ec) {
     bagLog().fault("error creating agent-specific cache directory {}", ec.message());
@@ -530,7 +530,7 @@ std::optional<Dictionary> TavixBagController::diskCachedBagDictionary() {
   if (isRefreshRequiredForCachedBag(dictionary)) {
     // The stale bag still serves until the new one arrives.
     std::weak_ptr<TavixBagController> weak = weak_from_this();
-    assembly_.dispatchPool->post([weak] {
+    env_.feedback.pool->post([weak] {
       if (auto self = weak.lock()) self->fetchBagStateWithVersion(std::nullopt);
     });
   }
@@ -543,13 +543,23 @@ void TavixBagController::cacheBagState(std::shared_ptr<const TVXBag> bag, bool f
     const unsigned long oldNews = newsAvailability(inMemoryBag_);
     const unsigned long newNews = newsAvailability(bag);
     inMemoryBag_ = bag;
-    auto& center = *assembly_.notificationCenter;
+    auto& center = *env_.center;
     center.post(kTVXBagChangeNotification, nullptr, {}, bagChangeUserInfo(*bag));
     if (oldNews != newNews && !fromDisk) {
       bagLog().notice("setting Tavix News Available status to {}", newNews);
       center.post(newNews == 1 ? kTVXNotifyEnabled : kTVXNotifyDisabled, this);
     }
   });
+}
+
+TavixBagController::Environment bagControllerEnvironment(const Assembly& assembly) {
+  return {feedbackEnvironment(assembly),
+          assembly.transactions,
+          assembly.notificationCenter,
+          assembly.requestFactory,
+          [&assembly] { return assembly.bagSession(); },
+          assembly.paths.cacheHome,
+          assembly.cachesFolder()};
 }
 
 }  // namespace tavix

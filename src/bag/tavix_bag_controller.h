@@ -23,6 +23,7 @@
 
 #include "bagview/tvx_bag.h"
 #include "core/names.h"
+#include "feedback/client_session.h"
 #include "network/request_factory.h"
 #include "platform/dispatch.h"
 #include "platform/files.h"
@@ -31,6 +32,10 @@
 #include "platform/transactions.h"
 
 namespace tavix {
+
+namespace platform::http {
+class URLSession;
+}
 
 class Assembly;
 class TVXBag;
@@ -70,10 +75,22 @@ class TavixBagController final : public TVXBagURLSource,
  public:
   using Completion = std::function<void(std::shared_ptr<const TVXBag>, std::optional<TVXBagError>)>;
 
-  // The assembly's dispatch pool, clock, defaults, notification centre and request factory must
-  // be set and must outlive the controller. Loads the disk bag (installing it, and starting a
-  // fetch when it needs a refresh) and listens for the factory's refresh requests.
-  static std::shared_ptr<TavixBagController> create(Assembly& assembly);
+  struct Environment {
+    // Fetches are recorded as sessions of their own; the pool, clock and defaults are also the
+    // controller's, and the GUID controller (may be null) stamps the fetch records.
+    FeedbackEnvironment feedback;
+    platform::TransactionTracker* transactions = nullptr;  // may be null
+    std::shared_ptr<platform::NotificationCenter> center;
+    std::shared_ptr<TVXNetworkRequestFactory> requestFactory;
+    // Called at each fetch: the session is made on first use, and its owner cancels what is
+    // still on the wire before the services a completion reaches go.
+    std::function<std::shared_ptr<platform::http::URLSession>()> bagSession;
+    platform::fs::path cacheHome;     // the user's caches directory; made when missing
+    platform::fs::path cachesFolder;  // the daemon's folder in it, where the bag is kept
+  };
+  // The pool and clock must outlive the controller. Loads the disk bag (installing it, and
+  // starting a fetch when it needs a refresh) and listens for the factory's refresh requests.
+  static std::shared_ptr<TavixBagController> create(Environment env);
   ~TavixBagController() override;
   TavixBagController(const TavixBagController&) = delete;
   TavixBagController& operator=(const TavixBagController&) = delete;
@@ -116,7 +133,7 @@ class TavixBagController final : public TVXBagURLSource,
   std::optional<platform::fs::path> pathToCachedBag(std::error_code* error);
 
  private:
-  explicit TavixBagController(Assembly& assembly);
+  explicit TavixBagController(Environment env);
   void start();
 
   void runFetch(std::optional<std::string> version, Completion completion);
@@ -126,7 +143,7 @@ class TavixBagController final : public TVXBagURLSource,
   // controller's user agent.
   std::shared_ptr<proto::CTTavixFeedback> wrapFetchRecord(const google::protobuf::Message& record);
 
-  Assembly& assembly_;
+  Environment env_;
   platform::ReaderWriterQueue inMemoryBagCacheAccessQueue_;
   class RetryClock;
   // Pauses between retries of a fetch run here, timed by the retry clock. A retry loop may
@@ -144,5 +161,8 @@ class TavixBagController final : public TVXBagURLSource,
   std::unique_ptr<platform::TransactionTracker::Transaction> fetchTransaction_;
   platform::NotificationCenter::Registration refreshRegistration_;
 };
+
+// The assembly's services, for the callers that still find their peers there.
+TavixBagController::Environment bagControllerEnvironment(const Assembly& assembly);
 
 }  // namespace tavix

@@ -54,7 +54,7 @@ class BagControllerTest : public ::testing::Test, protected testing::TestAssembl
     assembly.requestFactory.reset();
   }
 
-  void make() { controller = TavixBagController::create(assembly); }
+  void make() { controller = TavixBagController::create(bagControllerEnvironment(assembly)); }
 
   std::string call(const std::string& path, const std::string& method = "GET", std::string body = {}) {
     platform::http::URLRequest r;
@@ -326,7 +326,7 @@ TEST_F(BagControllerTest, TriggersDuringAFetchMergeIntoItAndTransportFailuresAre
   EXPECT_EQ(postedCount(), 2u);
 
   // A controller that goes while its fetch waits to retry takes the retries with it.
-  controller = TavixBagController::create(assembly);
+  controller = TavixBagController::create(bagControllerEnvironment(assembly));
   fault({{"path", "/bag"}, {"drop", true}});
   ASSERT_TRUE(controller->fetchBagStateWithVersion(std::nullopt));
   ASSERT_TRUE(waitFor([&] { return clock.pendingTimers() == 1; }));

@@ -55,7 +55,7 @@ class Assembly {
   platform::ActivityScheduler* activityScheduler = nullptr;
   platform::Paths paths;
 
-  // Whether all clients share one feedback session; set by TavixService at start.
+  // Whether all clients share one feedback session; set at start from "TVXSharedSession".
   bool sharedSession = false;
 
   std::shared_ptr<platform::UserDefaults> userDefaults;

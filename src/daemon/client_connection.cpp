@@ -436,7 +436,9 @@ void ClientConnection::configure(std::uint64_t callId, const proto::Envelope& in
   }
   if (!state_) {
     configuration_.reset();
-    ClientSessionManager::reportErrorAsTavixdFeedback(500, kTVXErrorDomain, "invalid configuration", assembly_);
+    if (auto manager = assembly_.clientSessionManager) {
+      manager->reportErrorAsTavixdFeedback(500, kTVXErrorDomain, "invalid configuration");
+    }
     // No reply at all: the client learns of it by the closed connection.
     sessionLog().fault("invalid configuration, closing connection");
     connection_->invalidate();

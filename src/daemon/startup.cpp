@@ -10,6 +10,7 @@
 #include "cache/engaged_completion_cache.h"
 #include "context/location.h"
 #include "context/motion.h"
+#include "context/user_guid_controller.h"
 #include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
@@ -131,6 +132,8 @@ void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform
       UploadManager::create(pool, *assembly.notificationCenter, assembly.requestFactory, std::move(uploads));
   assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(TavixPersistentStorage::Environment{
       assembly.cachesFolder(), &pool, &clock, assembly.userDefaults.get(), assembly.transactions});
+  // Before the bag controller and the session manager, which stamp their feedback with its GUID.
+  assembly.guidController = std::make_shared<TavixUserGUIDController>(pool, clock, assembly.notificationCenter);
 }
 
 // Topic weights a person or another program left for us; any property-list value, sent as JSON.
@@ -138,6 +141,16 @@ void applySilhouette(const platform::UserDefaults& defaults, TVXNetworkRequestFa
   if (auto silhouette = defaults.objectForKey("silhouette")) {
     requestFactory.setSilhouetteTopics(silhouette->string() ? *silhouette->string() : platform::toJson(*silhouette));
   }
+}
+
+// Built at each run: the flush channel is made after the first flushers are wired.
+TavixFeedbackFlusher::Environment feedbackFlusherEnvironment(const Assembly& assembly) {
+  return {feedbackEnvironment(assembly), assembly.uploadManager, assembly.flusherIPCListener, assembly.transactions};
+}
+
+TavixCustomFeedbackFlusher::Environment customFeedbackFlusherEnvironment(const Assembly& assembly) {
+  return {assembly.paths.cacheHome, assembly.cachesFolder(), feedbackEnvironment(assembly), assembly.bagController,
+          assembly.uploadManager};
 }
 
 // The flush command channel: it flushes each connected client's session, and hears every
@@ -148,7 +161,7 @@ std::shared_ptr<TavixFlusherIPC> makeFlusherChannel(Assembly& assembly, TavixSer
   env.defaults = assembly.userDefaults;
   env.sharedSession = assembly.sharedSession;
   env.flushFeedback = [&assembly](std::function<void()> done) {
-    TavixFeedbackFlusher::create(assembly)->forceFlushWithCompletion(std::move(done));
+    TavixFeedbackFlusher::create(feedbackFlusherEnvironment(assembly))->forceFlushWithCompletion(std::move(done));
   };
   env.getClientConnections = [&service, &assembly] {
     std::vector<TavixFlusherIPC::ClientConnectionHandle> handles;
@@ -205,7 +218,8 @@ void registerLaunchEvents(platform::ipc::LaunchEventRegistry& launchEvents, Asse
 
 void checkInActivities(platform::ActivityScheduler& activities, Assembly& assembly, platform::Logger& log) {
   activities.checkIn(kFlusherActivity, platform::seconds(kFlusherIntervalSeconds), [&assembly](const auto& activity) {
-    TavixFeedbackFlusher::handlePeriodicFlushActivity(assembly, activity);
+    TavixFeedbackFlusher::handlePeriodicFlushActivity(*assembly.userDefaults, feedbackFlusherEnvironment(assembly),
+                                                      activity);
   });
   activities.checkIn(kCustomFeedbackActivity, platform::seconds(kCustomFeedbackIntervalSeconds),
                      [&assembly, &log](const std::shared_ptr<platform::Activity>& activity) {
@@ -214,7 +228,7 @@ void checkInActivities(platform::ActivityScheduler& activities, Assembly& assemb
                        if (!activity->setState(platform::ActivityState::Continue)) {
                          log.fault("Couldn't transition flusher activity to continue state.");
                        }
-                       TavixCustomFeedbackFlusher(assembly).flushCustomFeedbackWithCompletionHandler([activity, &log] {
+                       TavixCustomFeedbackFlusher(customFeedbackFlusherEnvironment(assembly)).flushCustomFeedbackWithCompletionHandler([activity, &log] {
                          if (!activity->setState(platform::ActivityState::Done)) {
                            log.fault("Couldn't transition flusher activity to done state.");
                          }
@@ -282,6 +296,22 @@ class Housekeeping {
 
 }  // namespace
 
+void assembleFeedbackServices(Assembly& assembly) {
+  assembly.sharedSession = assembly.userDefaults->boolForKey("TVXSharedSession");
+  assembly.clientSessionManager =
+      std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), assembly.guidController, assembly.bagController, "tavix");
+}
+
+TavixService::Environment serviceEnvironment(Assembly& assembly, platform::ipc::LaunchEventRegistry* launchEvents) {
+  TavixService::Environment env;
+  env.pool = assembly.dispatchPool;
+  env.urlSession = [&assembly] { return assembly.urlSession(); };
+  env.makeConnection = [&assembly, launchEvents](const std::shared_ptr<platform::ipc::IpcConnection>& connection) {
+    return std::make_shared<ClientConnection>(assembly, connection, launchEvents);
+  };
+  return env;
+}
+
 int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   platform::setLogLevel(options.logLevel);
   auto& log = TavixLogForCategory(TavixLoggingCategoryDefault);
@@ -315,13 +345,15 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   auto& counters = TavixDiagnosticDataReporter::store();
   if (auto ec = counters.load(countersFile)) log.error("cannot read counters {}", describe(countersFile, ec));
   TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.launch");
-  assembly.bagController = TavixBagController::create(assembly);
+  assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
   applySilhouette(*defaults, *assembly.requestFactory);
+
+  assembleFeedbackServices(assembly);
 
   platform::SerialQueue ipcEventQueue(pool, "com.norvel.tavixd.ipc_event");
   platform::ipc::LaunchEventRegistry launchEvents(ipcEventQueue);
-  TavixService service(assembly, &launchEvents);
-  // After the service: a client state shares the service's GUID controller and session manager.
+  TavixService service(serviceEnvironment(assembly, &launchEvents));
+  // After the feedback services: a client state may share their GUID controller and session manager.
   assembly.clientStateManager = std::make_shared<ClientStateManager>(
       pool, defaults, [&assembly](const std::string& identifier) { return ClientState::create(assembly, identifier); });
   assembly.flusherIPCListener = makeFlusherChannel(assembly, service);

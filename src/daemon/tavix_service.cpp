@@ -5,14 +5,9 @@
 
 #include <google/protobuf/stubs/logging.h>
 
-#include "context/user_guid_controller.h"
-#include "bag/tavix_bag_controller.h"
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "daemon/client_connection.h"
-#include "feedback/client_session_manager.h"
-#include "platform/defaults.h"
 #include "platform/http/url_session.h"
 #include "platform/ipc/server.h"
 #include "query/client_state.h"
@@ -23,16 +18,10 @@ namespace {
 platform::Logger& connectionLog() { return TavixLogForCategory(TavixLoggingCategoryConnection); }
 }  // namespace
 
-TavixService::TavixService(Assembly& assembly, platform::ipc::LaunchEventRegistry* launchEvents)
-    : assembly_(assembly),
-      launchEvents_(launchEvents),
-      queue_(*assembly.dispatchPool, "com.norvel.tavix.serviceQueue"),
+TavixService::TavixService(Environment env)
+    : env_(std::move(env)),
+      queue_(*env_.pool, "com.norvel.tavix.serviceQueue"),
       self_(std::make_shared<TavixService*>(this)) {
-  assembly_.sharedSession = assembly_.userDefaults->boolForKey("TVXSharedSession");
-  assembly_.guidController = std::make_shared<TavixUserGUIDController>(*assembly_.dispatchPool, *assembly_.clock,
-                                                                     assembly_.notificationCenter);
-  assembly_.clientSessionManager =
-      std::make_shared<ClientSessionManager>(assembly_, assembly_.guidController, assembly_.bagController, "tavix");
   // A malformed message is logged once by the connection; protobuf's own parse complaints would
   // let any peer write to our log at will.
   google::protobuf::SetLogHandler(nullptr);
@@ -57,7 +46,7 @@ bool TavixService::shouldAcceptConnection(const std::shared_ptr<platform::ipc::I
   const std::string clientID = clientIDForConnection(*connection).value_or("(null)");
   connectionLog().notice("new connection from {} ({})", clientID, pid);
 
-  auto client = std::make_shared<ClientConnection>(assembly_, connection, launchEvents_);
+  auto client = env_.makeConnection(connection);
   client->start();
 
   std::weak_ptr<TavixService*> weakService = self_;
@@ -102,7 +91,7 @@ void TavixService::connectionInvalidated(const std::shared_ptr<ClientConnection>
         connections_.erase(std::remove(connections_.begin(), connections_.end(), client), connections_.end());
         if (!connections_.empty()) return;
         // Replies cached for clients that have all gone are dead weight; the disk cache stays.
-        if (auto session = assembly_.urlSession()) {
+        if (auto session = env_.urlSession()) {
           TavixLogForCategory(TavixLoggingCategoryCaching).info("purging url cache");
           session->purgeMemoryCache();
         }

@@ -1,10 +1,10 @@
-// The IPC listener's delegate: completes the object graph at start, accepts every client
-// connection and keeps the list of live ones.
+// The IPC listener's delegate: accepts every client connection and keeps the list of live ones.
 //
 // Owns the serial queue "com.norvel.tavix.serviceQueue"; `connections` is touched only there.
 // accept() is safe from any thread; connection handlers run on each connection's own queue.
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -14,20 +14,27 @@
 
 namespace tavix {
 
-class Assembly;
 class ClientConnection;
 
+namespace platform::http {
+class URLSession;
+}
 namespace platform::ipc {
 class IpcConnection;
-class LaunchEventRegistry;
 }  // namespace platform::ipc
 
 class TavixService {
  public:
-  // Completes the assembly: sets `sharedSession` from the "TVXSharedSession" default.
-  // `launchEvents` (may be null) receives the launch events that clients hand in; it must
-  // outlive the service.
-  explicit TavixService(Assembly& assembly, platform::ipc::LaunchEventRegistry* launchEvents = nullptr);
+  struct Environment {
+    platform::DispatchPool* pool = nullptr;
+    // The query session, whose memory cache goes when the last client does. Called only then, so
+    // that a daemon no client ever reached does not make one.
+    std::function<std::shared_ptr<platform::http::URLSession>()> urlSession;
+    // Binds a new connection to a client; not yet started.
+    std::function<std::shared_ptr<ClientConnection>(const std::shared_ptr<platform::ipc::IpcConnection>&)>
+        makeConnection;
+  };
+  explicit TavixService(Environment env);
   ~TavixService();
   TavixService(const TavixService&) = delete;
   TavixService& operator=(const TavixService&) = delete;
@@ -48,8 +55,7 @@ class TavixService {
  private:
   void connectionInvalidated(const std::shared_ptr<ClientConnection>& client);
 
-  Assembly& assembly_;
-  platform::ipc::LaunchEventRegistry* launchEvents_;
+  Environment env_;
   platform::SerialQueue queue_;
   std::vector<std::shared_ptr<ClientConnection>> connections_;
   // Handlers hold this weakly, so that nothing runs into a destroyed service.

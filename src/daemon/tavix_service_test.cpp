@@ -5,6 +5,7 @@
 #include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "daemon/client_connection.h"
+#include "daemon/startup.h"
 #include "platform/counters.h"
 #include "platform/defaults.h"
 #include "platform/ipc/frame.h"
@@ -32,8 +33,10 @@ TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
   platform::Logger log("test", "listener");
 
   {
-    TavixService service(assembly);
+    assembly.guidController = f.makeGUIDController();
+    assembleFeedbackServices(assembly);
     EXPECT_TRUE(assembly.sharedSession);
+    TavixService service(serviceEnvironment(assembly, nullptr));
     assembly.clientStateManager = f.makeClientStateManager();
     std::error_code ec;
     auto listener = ipc::IpcListener::listen(pool, (home.runtime() / "socket").string(), log, &ec);

@@ -6,7 +6,6 @@
 
 #include "bag/tavix_bag_controller.h"
 #include "bagview/tvx_bag.h"
-#include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
@@ -26,14 +25,14 @@ namespace {
 platform::Logger& flusherLog() { return TavixLogForCategory(TavixLoggingCategoryFlusher); }
 
 // An oversize item is reported as a session of its own whose only event is the error.
-void reportOversizeItem(Assembly& assembly, std::uint64_t size, const std::string& type) {
+void reportOversizeItem(const FeedbackEnvironment& env, std::uint64_t size, const std::string& type) {
   proto::CTErrorFeedback error;
   error.set_code(4);
   error.set_domain(kTVXErrorDomain);
   auto& info = *error.mutable_user_info()->mutable_fields();
   info["size"].set_number_value(static_cast<double>(size));
   info["type"].set_string_value(type);
-  ClientSession::createFeedbackSessionFromError(std::move(error), feedbackEnvironment(assembly));
+  ClientSession::createFeedbackSessionFromError(std::move(error), env);
 }
 
 // Whether an item was written to so recently that its writer may not be done with it. A time in
@@ -75,9 +74,9 @@ const std::vector<std::string>& customFeedbackTypesInFlushOrder() {
   return types;
 }
 
-TavixCustomFeedbackFlusher::TavixCustomFeedbackFlusher(Assembly& assembly, std::shared_ptr<CrowdsourcingReportStore> reports)
-    : assembly_(assembly), mgr_(std::move(reports)) {
-  if (!mgr_) mgr_ = std::make_shared<CrowdsourcingReportStore>(assembly.cachesFolder() / "CrowdsourcingReports");
+TavixCustomFeedbackFlusher::TavixCustomFeedbackFlusher(Environment env, std::shared_ptr<CrowdsourcingReportStore> reports)
+    : env_(std::move(env)), mgr_(std::move(reports)) {
+  if (!mgr_) mgr_ = std::make_shared<CrowdsourcingReportStore>(env_.cachesFolder / "CrowdsourcingReports");
 }
 
 std::vector<platform::fs::path> TavixCustomFeedbackFlusher::reportsInDirectory(const platform::fs::path& directory) {
@@ -96,18 +95,18 @@ std::vector<platform::fs::path> TavixCustomFeedbackFlusher::reportsInDirectory(c
 }
 
 void TavixCustomFeedbackFlusher::flushCustomFeedbackWithCompletionHandler(const std::function<void()>& completion) {
-  const auto& caches = assembly_.paths.cacheHome;
+  const auto& caches = env_.cacheHome;
   if (auto ec = platform::createDirectory(caches, true, 0700)) {
     flusherLog().notice("Failed to get cache directory: {}", ec.message());
     return;
   }
-  const auto root = assembly_.cachesFolder() / kTVXCustomFeedbackDir;
+  const auto root = env_.cachesFolder / kTVXCustomFeedbackDir;
   std::error_code ec;
   if (root.empty() || !platform::fs::exists(root, ec)) {
     flusherLog().info("No custom feedback found. Nothing to flush.");
     return;
   }
-  auto bag = assembly_.bagController ? assembly_.bagController->currentBag() : nullptr;
+  auto bag = env_.bagController->currentBag();
   for (const auto& type : customFeedbackTypesInFlushOrder()) {
     const auto directory = root / type;
     // Start-up makes every folder; one missing means something else is wrong: stop here.
@@ -119,7 +118,7 @@ void TavixCustomFeedbackFlusher::flushCustomFeedbackWithCompletionHandler(const 
     }
     std::int64_t limit = bag ? bag->maximumSizeForFeedbackType(type) : 0;
     const std::uint64_t maximum = limit > 0 ? static_cast<std::uint64_t>(limit) : kDefaultCustomFeedbackLimit;
-    const platform::TimePoint now = assembly_.clock->now();
+    const platform::TimePoint now = env_.feedback.clock->now();
     for (const auto& item : items) {
       if (item.empty()) continue;
       // An item its writer may still be filling is left for a later run, not sent cut short.
@@ -131,18 +130,16 @@ void TavixCustomFeedbackFlusher::flushCustomFeedbackWithCompletionHandler(const 
       const std::uint64_t size = platform::fs::file_size(item, sizeError);
       if (sizeError) continue;
       if (size > maximum) {
-        reportOversizeItem(assembly_, size, type);
+        reportOversizeItem(env_.feedback, size, type);
         TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.customfeedback." + type + ".filetoolarge");
         flusherLog().error("Custom feedback item {} too big to process: {}", type, size);
         removeItem(item);
-      } else if (assembly_.uploadManager) {
+      } else {
         // Removed once its upload is journalled (or can never be sent); kept when it changed
         // while it was read or could not be taken this time.
-        assembly_.uploadManager->uploadFeedback(item, type, kFeedbackEndpoint, [item](UploadOutcome outcome) {
+        env_.uploads->uploadFeedback(item, type, kFeedbackEndpoint, [item](UploadOutcome outcome) {
           if (outcome != UploadOutcome::kSourceChanged && outcome != UploadOutcome::kNotNow) removeItem(item);
         });
-      } else {
-        removeItem(item);
       }
     }
   }
@@ -157,7 +154,7 @@ void TavixCustomFeedbackFlusher::flushDPFeedback() {
     return;
   }
   for (const auto& report : reports) {
-    if (assembly_.uploadManager) assembly_.uploadManager->uploadFeedback(report, "", kCrowdsourcingEndpoint);
+    env_.uploads->uploadFeedback(report, "", kCrowdsourcingEndpoint);
   }
   mgr_->retireReports(reports);
 }

@@ -14,11 +14,13 @@
 #include <string>
 #include <vector>
 
+#include "feedback/client_session.h"
 #include "platform/files.h"
 
 namespace tavix {
 
-class Assembly;
+class TavixBagController;
+class UploadManager;
 
 // The reports waiting for the crowdsourcing endpoint: the regular files of one folder (by
 // default "<caches>/com.norvel.tavixd/CrowdsourcingReports"), in name order. Retiring a report
@@ -44,9 +46,15 @@ inline constexpr double kCustomFeedbackSettleSeconds = 2;
 
 class TavixCustomFeedbackFlusher {
  public:
-  // Uses the assembly's paths, bagController and uploadManager. `reports` defaults to the store
-  // in the daemon's caches folder.
-  explicit TavixCustomFeedbackFlusher(Assembly& assembly, std::shared_ptr<CrowdsourcingReportStore> reports = nullptr);
+  struct Environment {
+    platform::fs::path cacheHome;     // the user's caches directory; made when missing
+    platform::fs::path cachesFolder;  // the daemon's folder in it
+    FeedbackEnvironment feedback;     // records oversize items; its clock dates the items
+    std::shared_ptr<TavixBagController> bagController;  // the size limits
+    std::shared_ptr<UploadManager> uploads;
+  };
+  // `reports` defaults to the store in the daemon's caches folder.
+  explicit TavixCustomFeedbackFlusher(Environment env, std::shared_ptr<CrowdsourcingReportStore> reports = nullptr);
 
   // One run. `completion` is called at the end, except when the caches or CustomFeedback folder
   // cannot be found, or a type folder is missing: the run then stops where it is.
@@ -59,7 +67,7 @@ class TavixCustomFeedbackFlusher {
   void flushDPFeedback();
 
  private:
-  Assembly& assembly_;
+  Environment env_;
   std::shared_ptr<CrowdsourcingReportStore> mgr_;
 };
 

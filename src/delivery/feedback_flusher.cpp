@@ -1,6 +1,5 @@
 #include "delivery/feedback_flusher.h"
 
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "delivery/flusher_ipc.h"
@@ -21,26 +20,26 @@ platform::Logger& flusherLog() { return TavixLogForCategory(TavixLoggingCategory
 
 }  // namespace
 
-std::shared_ptr<TavixFeedbackFlusher> TavixFeedbackFlusher::create(Assembly& assembly) {
-  return std::shared_ptr<TavixFeedbackFlusher>(new TavixFeedbackFlusher(assembly));
+std::shared_ptr<TavixFeedbackFlusher> TavixFeedbackFlusher::create(Environment env) {
+  return std::shared_ptr<TavixFeedbackFlusher>(new TavixFeedbackFlusher(std::move(env)));
 }
 
-TavixFeedbackFlusher::TavixFeedbackFlusher(Assembly& assembly)
-    : assembly_(assembly),
-      queueBuffer_(*assembly.dispatchPool, "com.norvel.tavixd.tavixDataBufferQueue"),
-      feedbackCountQueue_(*assembly.dispatchPool, "com.norvel.tavixd.feedbackCountQueue") {}
+TavixFeedbackFlusher::TavixFeedbackFlusher(Environment env)
+    : env_(std::move(env)),
+      queueBuffer_(*env_.feedback.pool, "com.norvel.tavixd.tavixDataBufferQueue"),
+      feedbackCountQueue_(*env_.feedback.pool, "com.norvel.tavixd.feedbackCountQueue") {}
 
 TavixFeedbackFlusher::~TavixFeedbackFlusher() = default;
 
-void TavixFeedbackFlusher::handlePeriodicFlushActivity(Assembly& assembly,
+void TavixFeedbackFlusher::handlePeriodicFlushActivity(const platform::UserDefaults& defaults, Environment env,
                                                        const std::shared_ptr<platform::Activity>& activity) {
-  if (assembly.userDefaults && assembly.userDefaults->boolForKey("TVXFeedbackFlushDisabled")) {
+  if (defaults.boolForKey("TVXFeedbackFlushDisabled")) {
     defaultLog().debug(
         "Flusher bailing because periodic flush is disabled. Dump feedback with tavix_tool to re-enable.");
     return;
   }
   defaultLog().debug("Flushing Tavix feedback.");
-  create(assembly)->performPeriodicFlushActivity(activity);
+  create(std::move(env))->performPeriodicFlushActivity(activity);
 }
 
 void TavixFeedbackFlusher::performPeriodicFlushActivity(const std::shared_ptr<platform::Activity>& activity) {
@@ -61,16 +60,16 @@ void TavixFeedbackFlusher::performPeriodicFlushActivity(const std::shared_ptr<pl
 
 void TavixFeedbackFlusher::forceFlushWithCompletion(std::function<void()> completion) {
   auto transaction = std::make_shared<platform::TransactionTracker::Transaction>();
-  if (assembly_.transactions) *transaction = assembly_.transactions->begin("com.norvel.tavixd.feedbackFlusherTx");
+  if (env_.transactions) *transaction = env_.transactions->begin("com.norvel.tavixd.feedbackFlusherTx");
   // One queue per run: files are read and deleted one at a time, in list order.
-  auto runQueue = std::make_shared<platform::SerialQueue>(*assembly_.dispatchPool, "com.norvel.tavixd.feedbackFlusherQueue");
+  auto runQueue = std::make_shared<platform::SerialQueue>(*env_.feedback.pool, "com.norvel.tavixd.feedbackFlusherQueue");
   // The run is over once every session it took is either on its way or given back.
   runGroup_ = std::make_shared<platform::DispatchGroup>(*runQueue, [runQueue, transaction, completion = std::move(completion)] {
     if (completion) completion();
     transaction->reset();
   });
-  auto channel = assembly_.flusherIPCListener;
-  auto storage = assembly_.persistentStorage;
+  auto channel = env_.channel.lock();
+  auto storage = env_.feedback.storage;
   const auto files = storage ? storage->getAvailableSessionHandles() : std::vector<std::shared_ptr<FileContainer>>{};
   auto self = shared_from_this();
   for (const auto& file : files) {
@@ -79,7 +78,7 @@ void TavixFeedbackFlusher::forceFlushWithCompletion(std::function<void()> comple
       auto claimed = storage->claimSessionWithFileContainer(file);
       if (!claimed) return;
       std::shared_ptr<ClientSession> session;
-      if (auto record = claimed->readRecord()) session = ClientSession::fromRecord(feedbackEnvironment(self->assembly_), std::move(*record));
+      if (auto record = claimed->readRecord()) session = ClientSession::fromRecord(self->env_.feedback, std::move(*record));
       if (!session) {
         // Unreadable files (too large, another version, empty, corrupt) go: they never would be.
         storage->deleteSessionWithFileContainer(claimed);
@@ -128,10 +127,9 @@ std::vector<std::string> TavixFeedbackFlusher::flushToWireWithObjectsReturned(bo
   queueBuffer_.assertCurrent("TavixFeedbackFlusher::flushToWireWithObjectsReturned");
   flusherLog().debug("Sessions Flushed {}", sessionBuffer_.size());
   std::vector<std::string> bodies;
-  auto uploads = assembly_.uploadManager;
-  auto storage = assembly_.persistentStorage;
+  auto uploads = env_.uploads;
+  auto storage = env_.feedback.storage;
   for (const auto& session : sessionBuffer_) {
-    if (!uploads) break;
     // A session read from a claimed file: the file goes once the upload is journalled (or can
     // never be sent), and is given back when the upload could not be taken this time. Either
     // way no crash loses it: a claimed file waits again at the next start.

@@ -17,29 +17,40 @@
 #include <string>
 #include <vector>
 
+#include "feedback/client_session.h"
 #include "platform/dispatch.h"
 
 namespace tavix {
 
-class Assembly;
-class ClientSession;
+class TavixFlusherIPC;
+class UploadManager;
 
 namespace platform {
 class Activity;
-}
+class TransactionTracker;
+class UserDefaults;
+}  // namespace platform
 
 class TavixFeedbackFlusher : public std::enable_shared_from_this<TavixFeedbackFlusher> {
  public:
-  // Uses the assembly's persistentStorage, uploadManager, flusherIPCListener (may be null) and
-  // transactions (may be null).
-  static std::shared_ptr<TavixFeedbackFlusher> create(Assembly& assembly);
+  struct Environment {
+    // How sessions read back from disk are made; its pool runs the flusher's queues and its
+    // storage holds the session files (null: nothing waits).
+    FeedbackEnvironment feedback;
+    std::shared_ptr<UploadManager> uploads;
+    // Weak: the channel makes flushers of its own, and goes first at shutdown.
+    std::weak_ptr<TavixFlusherIPC> channel;
+    platform::TransactionTracker* transactions = nullptr;  // may be null
+  };
+  static std::shared_ptr<TavixFeedbackFlusher> create(Environment env);
   ~TavixFeedbackFlusher();
   TavixFeedbackFlusher(const TavixFeedbackFlusher&) = delete;
   TavixFeedbackFlusher& operator=(const TavixFeedbackFlusher&) = delete;
 
   // The periodic activity's handler: nothing at all while "TVXFeedbackFlushDisabled" is set;
   // otherwise a new flusher runs performPeriodicFlushActivity().
-  static void handlePeriodicFlushActivity(Assembly& assembly, const std::shared_ptr<platform::Activity>& activity);
+  static void handlePeriodicFlushActivity(const platform::UserDefaults& defaults, Environment env,
+                                          const std::shared_ptr<platform::Activity>& activity);
 
   // Only from RUN: moves the activity to CONTINUE, flushes everything, then sets DONE.
   void performPeriodicFlushActivity(const std::shared_ptr<platform::Activity>& activity);
@@ -67,10 +78,10 @@ class TavixFeedbackFlusher : public std::enable_shared_from_this<TavixFeedbackFl
   int identifier() const { return identifier_; }
 
  private:
-  explicit TavixFeedbackFlusher(Assembly& assembly);
+  explicit TavixFeedbackFlusher(Environment env);
   std::vector<std::string> flushToWireWithObjectsReturned(bool returnObjects);  // on queueBuffer_
 
-  Assembly& assembly_;
+  Environment env_;
   std::vector<std::shared_ptr<ClientSession>> sessionBuffer_;  // on queueBuffer_
   platform::SerialQueue queueBuffer_;
   // The run under way (forceFlushWithCompletion); its uploads enter it until resolved.

@@ -71,7 +71,7 @@ class FlusherIPCTest : public ::testing::Test, protected testing::TestAssembly {
   // A channel over the daemon's real flusher, with every client sharing one session or not.
   std::shared_ptr<TavixFlusherIPC> make(TavixFlusherIPC::GetClientConnections clients, bool sharedSession = true) {
     return TavixFlusherIPC::create({&pool, defaults, sharedSession, std::move(clients), [this](std::function<void()> done) {
-                                      TavixFeedbackFlusher::create(assembly)->forceFlushWithCompletion(std::move(done));
+                                      TavixFeedbackFlusher::create({feedbackEnvironment(assembly), nullptr, {}, &transactions})->forceFlushWithCompletion(std::move(done));
                                     }});
   }
 

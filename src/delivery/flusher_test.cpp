@@ -72,7 +72,7 @@ class FlusherTest : public ::testing::Test, protected testing::TestAssembly {
     makeStorage();
     session = BackgroundUploadSession::create(transport, home.cache() / "journal", pool);
     assembly.uploadManager = UploadManager::create(pool, *center, assembly.requestFactory, session);
-    assembly.bagController = TavixBagController::create(assembly);
+    assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
     assembly.bagController->currentBag();
     ASSERT_TRUE(waitFor([&] { return assembly.uploadManager->feedbackEndpoint().has_value(); }));
     // The fetch leaves a session of its own; the tests count only the sessions they write.
@@ -100,6 +100,16 @@ class FlusherTest : public ::testing::Test, protected testing::TestAssembly {
     }
     s->sessionComplete();
   }
+
+  // The flushers' services, taken from the assembly as it stands.
+  TavixFeedbackFlusher::Environment feedbackFlusherEnvironment() {
+    return {feedbackEnvironment(assembly), assembly.uploadManager, assembly.flusherIPCListener, &transactions};
+  }
+  TavixCustomFeedbackFlusher::Environment customFeedbackFlusherEnvironment() {
+    return {home.cache(), assembly.cachesFolder(), feedbackEnvironment(assembly), assembly.bagController,
+            assembly.uploadManager};
+  }
+
   std::size_t waitingSessions() { return assembly.persistentStorage->getAvailableSessionHandles().size(); }
   std::size_t sessionFilesOnDisk() {
     std::size_t n = 0;
@@ -135,7 +145,7 @@ TEST_F(FlusherTest, PeriodicRunSendsEachSessionOnceAndDeletesItsFile) {
 
   platform::LogCapture logs;
   activities.checkIn(kActivity, platform::seconds(0), [this](const auto& activity) {
-    TavixFeedbackFlusher::handlePeriodicFlushActivity(assembly, activity);
+    TavixFeedbackFlusher::handlePeriodicFlushActivity(*defaults, feedbackFlusherEnvironment(), activity);
   });
   EXPECT_TRUE(waitFor([&] { return logs.contains("Bailing on periodic flush because background activity state != RUN"); }))
       << "the check-in call is not a run";
@@ -211,7 +221,7 @@ TEST_F(CustomFeedbackTest, ItemsUpToTheLimitAreUploadedLargerOnesReportedAndAllD
 
   platform::LogCapture logs;
   int completions = 0;
-  TavixCustomFeedbackFlusher(assembly, reports).flushCustomFeedbackWithCompletionHandler([&] { ++completions; });
+  TavixCustomFeedbackFlusher(customFeedbackFlusherEnvironment(), reports).flushCustomFeedbackWithCompletionHandler([&] { ++completions; });
   EXPECT_EQ(completions, 1);
   EXPECT_TRUE(waitFor([&] { return itemsLeft() == 1; })) << "each item goes once its upload is journalled";
   EXPECT_TRUE(platform::fs::exists(root() / kTVXEngagedCompletionDir / "fresh")) << "left for a later run";
@@ -231,7 +241,7 @@ TEST_F(CustomFeedbackTest, ItemsUpToTheLimitAreUploadedLargerOnesReportedAndAllD
   // The two oversize items became error sessions, waiting for the next feedback flush.
   ASSERT_TRUE(waitFor([&] { return waitingSessions() == 2; }));
   std::vector<std::string> bodies;
-  auto flusher = TavixFeedbackFlusher::create(assembly);
+  auto flusher = TavixFeedbackFlusher::create(feedbackFlusherEnvironment());
   bool done = false;
   flusher->forceFlushWithCompletion([&] { done = true; });
   ASSERT_TRUE(waitFor([&] { return done && received().size() == 5; }));
@@ -260,7 +270,7 @@ TEST_F(CustomFeedbackTest, AMissingTypeFolderEndsTheRunEarly) {
   std::ofstream(reports->folder() / "report-1") << "dp";
 
   int completions = 0;
-  TavixCustomFeedbackFlusher(assembly, reports).flushCustomFeedbackWithCompletionHandler([&] { ++completions; });
+  TavixCustomFeedbackFlusher(customFeedbackFlusherEnvironment(), reports).flushCustomFeedbackWithCompletionHandler([&] { ++completions; });
   EXPECT_EQ(completions, 0);
   EXPECT_TRUE(waitFor([&] { return !platform::fs::exists(root() / kTVXSeekaraResultFeaturesDir / "features"); }));
   EXPECT_TRUE(platform::fs::exists(root() / kTVXBrovaneAutoPlayDir / "play"));
@@ -272,7 +282,7 @@ TEST_F(CustomFeedbackTest, AMissingTypeFolderEndsTheRunEarly) {
 
   // No CustomFeedback folder at all: nothing to do, no completion either.
   platform::fs::remove_all(root());
-  TavixCustomFeedbackFlusher(assembly, reports).flushCustomFeedbackWithCompletionHandler([&] { ++completions; });
+  TavixCustomFeedbackFlusher(customFeedbackFlusherEnvironment(), reports).flushCustomFeedbackWithCompletionHandler([&] { ++completions; });
   EXPECT_EQ(completions, 0);
 }
 

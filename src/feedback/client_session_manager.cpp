@@ -25,13 +25,13 @@ constexpr std::int64_t kDefaultIdleTime = 180;
 
 // ---- ClientSessionShared --------------------------------------------------------------------
 
-ClientSessionShared::ClientSessionShared(Assembly& assembly, FeedbackRef first, int previousSessionEndReason)
-    : assembly_(assembly),
+ClientSessionShared::ClientSessionShared(FeedbackEnvironment env, FeedbackRef first, int previousSessionEndReason)
+    : env_(std::move(env)),
       previousSessionEndReason_(previousSessionEndReason),
-      queue_(*assembly.dispatchPool, "com.norvel.tavixd.clientSessionSharedQueue") {
+      queue_(*env_.pool, "com.norvel.tavixd.clientSessionSharedQueue") {
   if (first && !first->user_guid().empty()) userGuid_ = first->user_guid();
   const std::string agent = first ? first->user_agent() : std::string();
-  sessionMap_[agent] = ClientSession::open(feedbackEnvironment(assembly), first, previousSessionEndReason);
+  sessionMap_[agent] = ClientSession::open(env_, first, previousSessionEndReason);
 }
 
 void ClientSessionShared::addFeedback(const FeedbackRef& feedback) {
@@ -41,7 +41,7 @@ void ClientSessionShared::addFeedback(const FeedbackRef& feedback) {
     if (it != sessionMap_.end()) {
       it->second->addFeedback(feedback);
     } else {
-      sessionMap_[feedback->user_agent()] = ClientSession::open(feedbackEnvironment(assembly_), feedback, previousSessionEndReason_);
+      sessionMap_[feedback->user_agent()] = ClientSession::open(env_, feedback, previousSessionEndReason_);
     }
   });
 }
@@ -55,14 +55,14 @@ void ClientSessionShared::enumerateSessionsUsingBlock(const std::function<void(C
 
 // ---- ClientSessionManager -------------------------------------------------------------------
 
-ClientSessionManager::ClientSessionManager(Assembly& assembly, std::shared_ptr<TavixUserGUIDController> guidController,
+ClientSessionManager::ClientSessionManager(Environment env, std::shared_ptr<TavixUserGUIDController> guidController,
                                            std::shared_ptr<TVXInMemoryBagSource> bag, std::string identifier)
-    : assembly_(assembly),
+    : env_(std::move(env)),
       guidController_(std::move(guidController)),
       bag_(std::move(bag)),
       identifier_(std::move(identifier)),
-      sessionQueue_(*assembly.dispatchPool, "com.norvel.tavixd.clientSessionManagerQueue") {
-  const std::int64_t soft = assembly.userDefaults->integerForKey("TVXSessionSoftLimitOverride");
+      sessionQueue_(*env_.feedback.pool, "com.norvel.tavixd.clientSessionManagerQueue") {
+  const std::int64_t soft = env_.feedback.defaults->integerForKey("TVXSessionSoftLimitOverride");
   if (soft < 1) {
     log().error("Soft limit override value must be greater than 0 : {} defaulting to {}", soft, kDefaultSoftLimit);
     softLimitTime_ = kDefaultSoftLimit;
@@ -73,7 +73,7 @@ ClientSessionManager::ClientSessionManager(Assembly& assembly, std::shared_ptr<T
   } else {
     softLimitTime_ = soft;
   }
-  const std::int64_t idle = assembly.userDefaults->integerForKey("TVXSessionIdleTimeOverride");
+  const std::int64_t idle = env_.feedback.defaults->integerForKey("TVXSessionIdleTimeOverride");
   if (idle < 1) {
     log().error("Idle limit override value must be greater than 0 : {} defaulting to {}", idle, kDefaultIdleTime);
     idleTime_ = kDefaultIdleTime;
@@ -81,7 +81,7 @@ ClientSessionManager::ClientSessionManager(Assembly& assembly, std::shared_ptr<T
     idleTime_ = idle;
   }
   maxTime_ = kGuidExpiration - softLimitTime_;
-  if (assembly.sharedSession) {
+  if (env_.sharedSession) {
     log().info("Tavix is using shared session for all clients {}", identifier_);
   } else {
     log().info("Tavix is using individual session for clients {}", identifier_);
@@ -97,10 +97,10 @@ void ClientSessionManager::addTavixFeedback(FeedbackRef feedback) {
   if (!feedback) return;
   if (feedbackObserver_) feedbackObserver_(*feedback);
   auto transaction = std::make_shared<platform::TransactionTracker::Transaction>();
-  if (assembly_.transactions) *transaction = assembly_.transactions->begin("addFeedback");
+  if (env_.transactions) *transaction = env_.transactions->begin("addFeedback");
   sessionQueue_.async([self = shared_from_this(), feedback, transaction] {
     if (!self->feedbackEnabledFor(feedback->user_agent())) return;
-    const platform::TimePoint now = self->assembly_.clock->now();
+    const platform::TimePoint now = self->env_.feedback.clock->now();
     feedback->set_user_guid(self->guidController_ ? self->guidController_->currentUserGUID() : std::string());
     if (self->currentState_ != kNoSession && self->sessionGuid() != feedback->user_guid()) {
       self->updateState(kGuidChanged, feedback);
@@ -128,9 +128,9 @@ void ClientSessionManager::flushSession(std::function<void()> done) {
 
 void ClientSessionManager::flushSessionInvalidationWithAgent(const std::string& agent,
                                                              std::function<void(bool)> callback) {
-  if (assembly_.sharedSession) {
+  if (env_.sharedSession) {
     proto::CTConnectionInvalidatedFeedback invalidated;
-    invalidated.set_timestamp(hostTicksNow(assembly_.clock));
+    invalidated.set_timestamp(hostTicksNow(env_.feedback.clock));
     addTavixFeedback(makeTavixFeedbackWithCodable(invalidated, 0, "", agent));
     if (callback) callback(false);
     return;
@@ -140,10 +140,8 @@ void ClientSessionManager::flushSessionInvalidationWithAgent(const std::string& 
   });
 }
 
-void ClientSessionManager::reportErrorAsTavixdFeedback(int code, const std::string& domain, const std::string& reason,
-                                                       Assembly& assembly) {
-  if (!assembly.clientSessionManager) return;
-  assembly.clientSessionManager->addTavixFeedback(makeDaemonErrorFeedback(code, domain, reason, feedbackEnvironment(assembly)));
+void ClientSessionManager::reportErrorAsTavixdFeedback(int code, const std::string& domain, const std::string& reason) {
+  addTavixFeedback(makeDaemonErrorFeedback(code, domain, reason, env_.feedback));
 }
 
 bool ClientSessionManager::feedbackEnabledFor(const std::string& userAgent) const {
@@ -248,10 +246,10 @@ void ClientSessionManager::updateState(unsigned event, const FeedbackRef& feedba
 
 void ClientSessionManager::setNewSession(const FeedbackRef& feedback) {
   ++sessionCounter_;
-  if (assembly_.sharedSession) {
-    shared_ = std::make_shared<ClientSessionShared>(assembly_, feedback, flushReason_);
+  if (env_.sharedSession) {
+    shared_ = std::make_shared<ClientSessionShared>(env_.feedback, feedback, flushReason_);
   } else {
-    single_ = ClientSession::open(feedbackEnvironment(assembly_), feedback, flushReason_);
+    single_ = ClientSession::open(env_.feedback, feedback, flushReason_);
   }
   log().notice("new session id {} {}", sessionCounter_, identifier_);
   // Fixed at 600 s whatever the soft-limit override: the override only moves maxTime.
@@ -267,7 +265,7 @@ void ClientSessionManager::schedule(platform::Duration delay, std::function<void
   // A fired timer forgets its handle: the table holds only the timers still to come.
   const std::uint64_t id = ++lastTimerId_;
   std::weak_ptr<ClientSessionManager> weak = weak_from_this();
-  timers_[id] = assembly_.clock->after(delay, sessionQueue_, [weak, id, task = std::move(task)] {
+  timers_[id] = env_.feedback.clock->after(delay, sessionQueue_, [weak, id, task = std::move(task)] {
     auto self = weak.lock();
     if (!self) return;
     self->timers_.erase(id);
@@ -279,7 +277,7 @@ void ClientSessionManager::onSoftLimitReached() {
   if (!single_ && !shared_) return;
   updateState(kSoftLimitReachedEvent, nullptr);
   log().notice("soft limit reached, maxtimer session id {} {}", sessionCounter_, identifier_);
-  if (auto center = assembly_.notificationCenter) {
+  if (auto center = env_.center) {
     sessionQueue_.async([center] { center->post(kTVXSessionSoftLimitNotification); });
   }
   const std::uint64_t expected = sessionCounter_;
@@ -291,7 +289,7 @@ void ClientSessionManager::onSoftLimitReached() {
       self.updateState(kMaxTimerExpired, nullptr);
     }
     // Posted also for an earlier session's timer: listeners clear their caches at this point.
-    if (auto center = self.assembly_.notificationCenter) center->post(kTVXSessionMaxLimitNotification);
+    if (auto center = self.env_.center) center->post(kTVXSessionMaxLimitNotification);
   });
 }
 
@@ -301,7 +299,7 @@ void ClientSessionManager::flushSessionWithReason(int reason, std::function<void
     auto close = [this, reason](ClientSession& session) {
       if (reason != 0) {
         proto::CTSessionEndFeedback end;
-        end.set_timestamp(hostTicksNow(assembly_.clock));
+        end.set_timestamp(hostTicksNow(env_.feedback.clock));
         end.set_reason(static_cast<proto::SessionEndReason::Value>(reason));
         session.addFeedback(makeTavixFeedbackWithCodable(end, 0, session.userGuid(), session.agent()));
       }
@@ -327,6 +325,10 @@ void ClientSessionManager::currentSessionFeedbacks(std::function<void(std::vecto
     if (self->single_) gather(*self->single_);
     done(std::move(all));
   });
+}
+
+ClientSessionManager::Environment sessionManagerEnvironment(const Assembly& assembly) {
+  return {feedbackEnvironment(assembly), assembly.transactions, assembly.notificationCenter, assembly.sharedSession};
 }
 
 }  // namespace tavix

@@ -25,13 +25,18 @@ namespace tavix {
 class TavixUserGUIDController;
 class TVXInMemoryBagSource;
 
+namespace platform {
+class NotificationCenter;
+class TransactionTracker;
+}  // namespace platform
+
 
 // One session per client user agent, opened and closed together (shared sessions).
 // Owns the queue "com.norvel.tavixd.clientSessionSharedQueue", always entered after the
 // manager's queue, never the reverse.
 class ClientSessionShared {
  public:
-  ClientSessionShared(Assembly& assembly, FeedbackRef first, int previousSessionEndReason = 1);
+  ClientSessionShared(FeedbackEnvironment env, FeedbackRef first, int previousSessionEndReason = 1);
   // Asynchronous. Events without a user agent are dropped.
   void addFeedback(const FeedbackRef& feedback);
   // Synchronous; the block sees each member session.
@@ -39,7 +44,7 @@ class ClientSessionShared {
   const std::string& userGuid() const { return userGuid_; }
 
  private:
-  Assembly& assembly_;
+  FeedbackEnvironment env_;
   std::string userGuid_;
   int previousSessionEndReason_;
   std::map<std::string, std::shared_ptr<ClientSession>> sessionMap_;
@@ -61,7 +66,14 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
 
   // Reads "TVXSessionSoftLimitOverride" and "TVXSessionIdleTimeOverride" once. `bag` (the bag
   // controller) says whether a client's feedback is enabled; without one, all of it is.
-  ClientSessionManager(Assembly& assembly, std::shared_ptr<TavixUserGUIDController> guidController,
+  struct Environment {
+    // The sessions it opens; its pool, clock and defaults are the manager's too.
+    FeedbackEnvironment feedback;
+    platform::TransactionTracker* transactions = nullptr;   // may be null
+    std::shared_ptr<platform::NotificationCenter> center;   // null: limits are not announced
+    bool sharedSession = false;  // all clients in one session
+  };
+  ClientSessionManager(Environment env, std::shared_ptr<TavixUserGUIDController> guidController,
                        std::shared_ptr<TVXInMemoryBagSource> bag, std::string identifier);
   ~ClientSessionManager();
   ClientSessionManager(const ClientSessionManager&) = delete;
@@ -85,10 +97,8 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   // `done` runs on the session queue, with an empty list when no session is open.
   void currentSessionFeedbacks(std::function<void(std::vector<std::string>)> done);
 
-  // Wraps an error as daemon feedback (query id 0, current GUID, tavixdUserAgent()) and adds it
-  // through the assembly's manager.
-  static void reportErrorAsTavixdFeedback(int code, const std::string& domain, const std::string& reason,
-                                          Assembly& assembly);
+  // Wraps an error as daemon feedback (query id 0, current GUID, tavixdUserAgent()) and adds it.
+  void reportErrorAsTavixdFeedback(int code, const std::string& domain, const std::string& reason);
 
   // Synchronous readers (not from the manager's queue).
   unsigned currentState();
@@ -112,7 +122,7 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   // Whether the loaded bag, as the client with this user agent sees it, lets feedback through.
   bool feedbackEnabledFor(const std::string& userAgent) const;
 
-  Assembly& assembly_;
+  Environment env_;
   std::shared_ptr<TavixUserGUIDController> guidController_;
   std::shared_ptr<TVXInMemoryBagSource> bag_;
   std::string identifier_;
@@ -130,5 +140,8 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   platform::SerialQueue sessionQueue_;
   std::function<void(const proto::CTTavixFeedback&)> feedbackObserver_;
 };
+
+// The assembly's services, for the callers that still find their peers there.
+ClientSessionManager::Environment sessionManagerEnvironment(const Assembly& assembly);
 
 }  // namespace tavix

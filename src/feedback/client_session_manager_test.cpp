@@ -22,7 +22,7 @@ struct ManagerFixture : testing::TestAssembly {
                                 {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
     makeStorage();
     guid = makeGUIDController();
-    manager = std::make_shared<ClientSessionManager>(assembly, guid, nullptr, "tavix");
+    manager = std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), guid, nullptr, "tavix");
   }
   ~ManagerFixture() { pool.drain(); }
 

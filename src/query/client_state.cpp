@@ -56,7 +56,7 @@ ClientState::ClientState(Assembly& assembly, std::string identifier)
                                                                 assembly_.notificationCenter);
     sessionLog().debug("Tavix is using individual instance of guid controller {}",
                        static_cast<const void*>(guidController_.get()));
-    sessionManager_ = std::make_shared<ClientSessionManager>(assembly_, guidController_, assembly_.bagController, identifier_);
+    sessionManager_ = std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly_), guidController_, assembly_.bagController, identifier_);
   }
 }
 

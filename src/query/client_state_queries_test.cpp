@@ -298,7 +298,7 @@ class VirtualTimeTest : private VirtualClockHolder, public QueryFixture {
 TEST_F(VirtualTimeTest, WithoutABagInTimeASearchFailsAtTheEndOfTheWaitAndRecordsWhy) {
   // The bag never comes: the search waits the first-launch wait on this clock, no longer.
   fault("/bag", {{"hang", true}});
-  assembly.bagController = TavixBagController::create(assembly);
+  assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
   auto waiting = make("com.norvel.seekara", "Seekara/1.0");
   Replies timedOut;
   auto searching = std::async(std::launch::async,

@@ -56,7 +56,7 @@ class ClientStateTest : public ::testing::Test, protected testing::TestAssembly 
     makeRequestFactory();
   }
   // After any fault on /bag has been set, so that no fetch slips by it.
-  void startController() { assembly.bagController = TavixBagController::create(assembly); }
+  void startController() { assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly)); }
   ~ClientStateTest() override {
     states.clear();
     if (assembly.bagController) assembly.bagController->invalidate();

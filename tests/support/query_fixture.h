@@ -89,7 +89,7 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
     // The daemon's own session manager (warm-up records); clients keep sessions of their own.
     assembly.guidController = makeGUIDController();
     assembly.clientSessionManager =
-        std::make_shared<ClientSessionManager>(assembly, assembly.guidController, nullptr, "tavix");
+        std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), assembly.guidController, nullptr, "tavix");
   }
   ~QueryFixture() override {
     states.clear();
@@ -119,7 +119,7 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
   // Serves `bag` and starts the bag controller on it; waits until the controller holds it.
   void serveBag(const platform::Dictionary& bag) {
     fault("/bag", {{"body", platform::toJson(platform::PropertyValue(bag))}});
-    assembly.bagController = TavixBagController::create(assembly);
+    assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
     assembly.bagController->currentBag();
     ASSERT_TRUE(testing::waitFor([&] { return assembly.bagController->currentBag() != nullptr; }, 5000));
   }
