@@ -42,7 +42,7 @@ struct Fixture : testing::TestAssembly {
                                 {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
     makeStorage();
     assembly.guidController = makeGUIDController();
-    manager = std::make_shared<ClientSessionManager>(assembly, assembly.guidController, nullptr, "tavix");
+    manager = std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), assembly.guidController, nullptr, "tavix");
   }
   ~Fixture() { pool.drain(); }
 

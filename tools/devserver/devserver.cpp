@@ -105,10 +105,16 @@ struct DevServer::Impl {
   bool stopping = false;
   std::uint64_t resets = 0;  // a reset of the faults lets hung requests go
 
-  void hangUntilAbandoned(const httplib::Request& req) {
+  std::uint64_t resetGeneration() {
+    std::lock_guard guard(hangLock);
+    return resets;
+  }
+
+  // `generation` is read before the request is recorded: a reset that a test sends once it sees
+  // the request recorded must release it, even if it lands before the hang begins.
+  void hangUntilAbandoned(const httplib::Request& req, std::uint64_t generation) {
     const int fd = socketOf(req);
     std::unique_lock guard(hangLock);
-    const std::uint64_t generation = resets;
     while (!stopping && resets == generation) {
       hangWake.wait_for(guard, std::chrono::milliseconds(50));
       char byte;
@@ -191,11 +197,12 @@ struct DevServer::Impl {
   // Every served route goes through here: record, then apply the path's fault if any.
   httplib::Server::Handler served_(std::function<void(const httplib::Request&, httplib::Response&)> handler) {
     return [this, handler = std::move(handler)](const httplib::Request& req, httplib::Response& res) {
+      const std::uint64_t generation = resetGeneration();
       record(req);
       const auto fault = takeFault(req.path);
       if (fault && fault->delayMs > 0) std::this_thread::sleep_for(std::chrono::milliseconds(fault->delayMs));
       if (fault && fault->hang) {
-        hangUntilAbandoned(req);
+        hangUntilAbandoned(req, generation);
         // Released by a reset of the faults: answered, or with "reset" too, failed only now.
         if (!isStopping() && !fault->reset) return handler(req, res);
         if (!isStopping()) {
