@@ -208,6 +208,7 @@ struct IdleFigures {
 
 IdleFigures reportWindow(pid_t pid, int seconds) {
   const auto before = sampleThreads(pid);
+  // The idle window is wall-clock time by definition: the daemon is watched, not driven.
   std::this_thread::sleep_for(std::chrono::seconds(seconds));
   const auto after = sampleThreads(pid);
   const std::string status = readFile("/proc/" + std::to_string(pid) + "/status");
@@ -243,6 +244,7 @@ void reportSyscalls(pid_t pid, int seconds, const fs::path& root) {
     execlp("strace", "strace", "-q", "-c", "-f", "-p", target.c_str(), "-o", out.c_str(), static_cast<char*>(nullptr));
     _exit(127);
   }
+  // The same idle window, this time under strace.
   std::this_thread::sleep_for(std::chrono::seconds(seconds));
   kill(tracer, SIGINT);
   int status = 0;

@@ -352,6 +352,7 @@ class LoadProbe {
       runningSum_ += states.running;
       ++samples_;
       maxAcceptQueue_ = std::max(maxAcceptQueue_, acceptQueue(port_));
+      // The sampling period: often enough to see the load, rarely enough not to add to it.
       std::this_thread::sleep_for(std::chrono::milliseconds(50));
     }
   }

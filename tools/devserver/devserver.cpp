@@ -200,6 +200,7 @@ struct DevServer::Impl {
       const std::uint64_t generation = resetGeneration();
       record(req);
       const auto fault = takeFault(req.path);
+      // A slow back end is the fault being served: the delay is real time on purpose.
       if (fault && fault->delayMs > 0) std::this_thread::sleep_for(std::chrono::milliseconds(fault->delayMs));
       if (fault && fault->hang) {
         hangUntilAbandoned(req, generation);
@@ -287,6 +288,7 @@ struct DevServer::Impl {
           sink.done();
           return true;
         }
+        // The trickle is the fault: a server that sends one byte per period.
         std::this_thread::sleep_for(std::chrono::milliseconds(ms));
         return sink.is_writable() && sink.write(body.data() + offset, 1);
       });
