@@ -1,0 +1,117 @@
+// Look-up: keeps the hints store fed with the two downloaded hints files (weekly and monthly),
+// says whether look-up is enabled, and gives the download manager the version of a hints file.
+//
+// Linux has no text-scanning service, so the hints go to a store of our own: per source kind, a
+// copy of the pushed file and the signature it was pushed with, in the caches folder.
+//
+// Lookup owns the serial queue "com.norvel.tavix.Lookup"; the hints handling runs there, each piece
+// inside a keep-alive transaction. Logs under "Tavix_LookUp".
+#pragma once
+
+#include <map>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <string_view>
+
+#include "platform/dispatch.h"
+#include "platform/files.h"
+#include "platform/notification_center.h"
+
+namespace tavix {
+
+namespace platform {
+class TransactionTracker;
+class UserDefaults;
+}  // namespace platform
+
+class ResourceVersionsProvider;
+
+// What the text scanner holds per source kind.
+class LookupHintsStore {
+ public:
+  virtual ~LookupHintsStore() = default;
+  // Replaces the data of `sourceKind` with what `fd` reads from its start, recorded with
+  // `signature`; `fd` < 0 clears the kind. False when the data is unreadable or not a usable hints
+  // file (the kind is then left empty, with no signature), or when it cannot be stored.
+  virtual bool hintsSourcePushFile(int sourceKind, int fd, const std::string& signature) = 0;
+  // The signature of the data `sourceKind` holds; empty when it holds none.
+  virtual std::string hintsSourceGetClientSignature(int sourceKind) = 0;
+};
+
+// The store as files: "<folder>/hints.<kind>" and its signature in "<folder>/hints.<kind>.signature",
+// each written atomically, 0600, in a folder made 0700. The signature is written after the data and
+// removed before it changes, so a signature on disk always belongs to the data beside it. Safe from
+// any thread (calls are serialised).
+class FileLookupHintsStore final : public LookupHintsStore {
+ public:
+  explicit FileLookupHintsStore(platform::fs::path folder) : folder_(std::move(folder)) {}
+  bool hintsSourcePushFile(int sourceKind, int fd, const std::string& signature) override;
+  std::string hintsSourceGetClientSignature(int sourceKind) override;
+
+  platform::fs::path dataPath(int sourceKind) const;
+
+ private:
+  platform::fs::path signaturePath(int sourceKind) const;
+  void clear(int sourceKind);
+
+  const platform::fs::path folder_;
+  std::mutex lock_;
+};
+
+// Where the daemon keeps the store: "<caches folder>/LookupHints".
+inline constexpr const char* kLookupHintsStoreFolder = "LookupHints";
+
+// The defaults suite shared with the look-up panel, and its switch.
+inline constexpr const char* kLookupSharedSuite = "com.norvel.lookup.shared";
+inline constexpr const char* kLookupSuggestionsDisabledKey = "LookupSuggestionsDisabled";
+
+class Lookup : public std::enable_shared_from_this<Lookup> {
+ public:
+  // Everything must outlive the Lookup except what is shared. `resourceVersions` may be null (no
+  // download manager): every version is then unknown.
+  struct Environment {
+    platform::DispatchPool* pool = nullptr;
+    platform::TransactionTracker* transactions = nullptr;
+    std::shared_ptr<platform::NotificationCenter> center;
+    std::shared_ptr<const platform::UserDefaults> defaults;  // its folder also holds the shared suite
+    std::shared_ptr<const ResourceVersionsProvider> resourceVersions;
+    std::shared_ptr<LookupHintsStore> store;
+    platform::fs::path cachesFolder;  // where the download manager puts resource files
+  };
+
+  // Observes "TVXFileDownloadCompletedNotification" and "TVXFileDeletedNotification" (for the two
+  // hints resources) and "TVXStartup" (to push again any hints whose stored signature is stale).
+  static std::shared_ptr<Lookup> create(Environment env);
+  ~Lookup();
+  Lookup(const Lookup&) = delete;
+  Lookup& operator=(const Lookup&) = delete;
+
+  // True unless "LookupSuggestionsDisabled" is set in the suite "com.norvel.lookup.shared", read
+  // from disk on every call. Safe from any thread.
+  bool lookupEnabled() const;
+
+  // The version of a hints file served from `url` (see signatureFromURL in lookup_hints.h).
+  static std::string signatureFromURL(std::string_view url);
+
+  // Waits until the work queued so far on the queue has run. Not from the queue.
+  void drainQueue();
+
+ private:
+  explicit Lookup(Environment env);
+  void start();
+  void handleHintsFile(const platform::Notification& notification);
+  void handleHintsFile(const std::string& identifier, const std::string& location, int sourceKind);
+  bool pushHintsSourceFile(int fd, int sourceKind, const std::string& signature);
+  void reprocessHintsFiles();
+  void reprocessHintsFile(int sourceKind, const std::map<std::string, std::string>& versions);
+  std::map<std::string, std::string> versions() const;
+
+  Environment env_;
+  platform::SerialQueue queue_;
+  platform::NotificationCenter::Registration downloaded_;
+  platform::NotificationCenter::Registration deleted_;
+  platform::NotificationCenter::Registration startup_;
+};
+
+}  // namespace tavix
