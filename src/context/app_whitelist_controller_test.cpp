@@ -1,0 +1,112 @@
+#include "context/app_whitelist_controller.h"
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+
+#include "context/desktop_entries.h"
+#include "core/names.h"
+#include "platform/defaults.h"
+#include "platform/json_value.h"
+#include "platform/log.h"
+#include "platform/transactions.h"
+#include "support/temp_home.h"
+
+namespace tavix {
+namespace {
+
+namespace fs = platform::fs;
+
+class AppWhitelistControllerTest : public ::testing::Test {
+ protected:
+  AppWhitelistControllerTest() {
+    fs::create_directories(caches);
+    installApp("org.example.Maps");
+    installApp("org.example.Notes");
+  }
+
+  AppWhitelistController::Environment environment() {
+    return {&pool, &clock, &transactions, center, defaults, caches, folders};
+  }
+  void installApp(const std::string& id) {
+    fs::create_directories(folders[0]);
+    std::ofstream(folders[0] / (id + ".desktop")) << "[Desktop Entry]\nType=Application\nName=" << id << "\n";
+  }
+  // Places the whitelist resource and says it arrived, as the download manager does.
+  void deliverWhitelist(const std::string& bytes) {
+    std::ofstream(caches / kTVXInstalledAppWhitelist, std::ios::binary | std::ios::trunc) << bytes;
+    center->post(kTVXFileDownloadCompletedNotification, nullptr, {},
+                 {{"identifier", kTVXInstalledAppWhitelist},
+                  {"url", "file://" + (caches / kTVXInstalledAppWhitelist).string()}});
+  }
+  std::optional<std::string> stored() { return defaults->stringForKey(kTVXAppWhitelistSignatureKey); }
+
+  testing::TempHome home;
+  fs::path caches = home.cache() / "com.norvel.tavixd";
+  std::vector<fs::path> folders = applicationFolders(home.root() / "data", "");
+  platform::TransactionTracker transactions;
+  platform::DispatchPool pool{2};
+  platform::VirtualClock clock;
+  std::shared_ptr<platform::NotificationCenter> center = std::make_shared<platform::NotificationCenter>();
+  std::shared_ptr<platform::UserDefaults> defaults =
+      std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd");
+  const std::string whitelist = platform::toJson(platform::Dictionary{
+      {"apps", R"({"version":"0aff1b","apps":{"org.example.Maps":[{"encoding_id":1}],"org.other":[{"encoding_id":3}]}})"},
+      {"compression", "RLE"},
+      {"encoding", "bitmap"}});
+};
+
+TEST_F(AppWhitelistControllerTest, SignatureFollowsTheWhitelistAndOutlivesARestart) {
+  auto controller = AppWhitelistController::create(environment());
+  controller->drainQueue();
+  EXPECT_FALSE(controller->whitelistSignature());  // no whitelist downloaded yet
+
+  deliverWhitelist(whitelist);
+  controller->drainQueue();
+  const auto expected = processWhitelist(whitelist, installedApps(folders));
+  ASSERT_TRUE(expected);
+  EXPECT_EQ(controller->whitelistSignature(), expected);
+  EXPECT_EQ(stored(), expected);
+  EXPECT_EQ(transactions.openCount(), 0u);
+
+  // The next start has the stored signature at once and does not regenerate: the file it would
+  // read now says otherwise.
+  controller.reset();
+  std::ofstream(caches / kTVXInstalledAppWhitelist, std::ios::trunc) << "{}";
+  auto restarted = AppWhitelistController::create(environment());
+  restarted->drainQueue();
+  EXPECT_EQ(restarted->whitelistSignature(), expected);
+}
+
+TEST_F(AppWhitelistControllerTest, NoSignatureAndNoStoredDefaultForABadWhitelistOrNoMatch) {
+  auto controller = AppWhitelistController::create(environment());
+  deliverWhitelist(whitelist);
+  controller->drainQueue();
+  ASSERT_TRUE(stored());
+
+  platform::LogCapture logs;
+  const std::string truncated = whitelist.substr(0, whitelist.size() / 2);
+  for (const std::string& bad : {std::string("not json"), truncated, std::string(17 * 1024 * 1024, '\xff')}) {
+    deliverWhitelist(whitelist);
+    controller->drainQueue();
+    ASSERT_TRUE(controller->whitelistSignature());
+    deliverWhitelist(bad);
+    controller->drainQueue();
+    EXPECT_FALSE(controller->whitelistSignature()) << bad.size();
+    EXPECT_FALSE(stored());
+  }
+  EXPECT_EQ(logs.count("no installed app signature"), 2u);
+  EXPECT_EQ(logs.count("error reading app whitelist"), 1u);  // the oversized one is not even read
+
+  // The whitelisted app goes: nothing installed is on the whitelist any more.
+  deliverWhitelist(whitelist);
+  controller->drainQueue();
+  fs::remove(folders[0] / "org.example.Maps.desktop");
+  deliverWhitelist(whitelist);
+  controller->drainQueue();
+  EXPECT_FALSE(controller->whitelistSignature());
+  EXPECT_FALSE(stored());
+}
+
+}  // namespace
+}  // namespace tavix
