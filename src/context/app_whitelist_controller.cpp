@@ -88,8 +88,9 @@ void AppWhitelistController::generate() {
     signature = processWhitelist(*whitelist, installedApps(env_.applicationFolders), &why);
     if (!signature) log().notice("no installed app signature: {}", why);
   }
-  log().notice("installed app signature: {}", signature.value_or("(none)"));
+  const std::string shown = signature.value_or("(none)");
   setWhitelistSignature(std::move(signature));
+  log().notice("installed app signature: {}", shown);
 }
 
 void AppWhitelistController::setWhitelistSignature(std::optional<std::string> signature) {

@@ -1,5 +1,6 @@
 #include "context/subscription_manager.h"
 
+#include "core/logging.h"
 #include "core/names.h"
 #include "platform/clock.h"
 
@@ -87,6 +88,7 @@ void TavixSubscriptionManager::update() {
 
 void TavixSubscriptionManager::updateDelegate() {
   if (auto delegate = delegate_.lock()) delegate->didUpdateSubscriptionDictionaries(subscriptionsByProvider_);
+  TavixLogForCategory(TavixLoggingCategorySubscription).debug("{} subscription records passed on", subscriptionsByProvider_.size());
 }
 
 }  // namespace tavix

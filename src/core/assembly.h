@@ -39,6 +39,9 @@ class EngagedCompletionCache;
 class LocationManager;
 class MotionManager;
 class ResourceVersionsProvider;
+class AppWhitelistController;
+class TavixSubscriptionManager;
+class Lookup;
 
 class Assembly {
  public:
@@ -76,6 +79,10 @@ class Assembly {
   // The resource versions each new feedback session records; the download manager's, once it is
   // built. Empty until then.
   std::shared_ptr<ResourceVersionsProvider> resourceVersions;
+  // What requests and the look-up panel learn from downloaded resources and the user's providers.
+  std::shared_ptr<AppWhitelistController> appWhitelistController;
+  std::shared_ptr<TavixSubscriptionManager> subscriptionManager;
+  std::shared_ptr<Lookup> lookup;
 
   // The assembly's four URL sessions (queries, bag, resource downloads, feedback uploads). Each is
   // made on the first call of its accessor and the same session is returned ever after; safe from
