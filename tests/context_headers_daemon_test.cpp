@@ -36,13 +36,15 @@ TEST_F(QueryDaemonTest, SearchesCarryTheAppSignatureSubscriptionsAndStoreFront) 
   {
     platform::UserDefaults defaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
     const auto now = static_cast<std::int64_t>(std::time(nullptr));
+    // The second changed before the bag's TTL reaches back: it is not reported.
     defaults.setObject("TVXVideoSubscriptions",
-                       platform::PropertyValue::Array{platform::Dictionary{
-                           {"identifier", "com.example.tv"}, {"type", "app"}, {"modified", now - 10}}});
+                       platform::PropertyValue::Array{
+                           platform::Dictionary{{"identifier", "com.example.tv"}, {"type", "app"}, {"modified", now - 10}},
+                           platform::Dictionary{{"identifier", "com.example.old"}, {"modified", now - 86400 - 600}}});
     defaults.setObject("TVXMusicSubscriptionStatus", 3);
     defaults.setObject("TVXStorefrontIdentifier", "143441-1,29");
   }
-  serveBag({{"subscription_bundle_id_whitelist", {"com.example.tv"}},
+  serveBag({{"subscription_bundle_id_whitelist", {"com.example.tv", "com.example.old"}},
             {"subscription_domain_whitelist", json::array()},
             {"subscription_ttl_s", 86400}});
 
@@ -52,10 +54,14 @@ TEST_F(QueryDaemonTest, SearchesCarryTheAppSignatureSubscriptionsAndStoreFront) 
   ASSERT_TRUE(tavixd->waitForLog("2 subscription records passed on")) << tavixd->log();
   ASSERT_TRUE(send(request("weather")).reply);
 
-  json search;
-  for (const auto& r : json::parse(call("/_recorded"))) {
-    if (r["path"] == "/search") search = r;
-  }
+  auto lastSearch = [&] {
+    json search;
+    for (const auto& r : json::parse(call("/_recorded"))) {
+      if (r["path"] == "/search") search = r;
+    }
+    return search;
+  };
+  const json search = lastSearch();
   ASSERT_FALSE(search.is_null());
   const auto expected = processWhitelist(whitelist, {{"org.example.Maps", "1"}});
   ASSERT_TRUE(expected);
@@ -64,6 +70,15 @@ TEST_F(QueryDaemonTest, SearchesCarryTheAppSignatureSubscriptionsAndStoreFront) 
             json::parse(R"([{"provider":"com.example.tv","type":"app","active":true},
                             {"provider":"tarn","attribute":"premium","active":true}])"));
   EXPECT_EQ(search["query"].value("storefront", ""), "143441-1,29");
+
+  // A bag without the domain whitelist withdraws the subscriptions.
+  serveBag({{"version", "2"}, {"subscription_domain_whitelist", nullptr}});
+  fault({{"path", "/search"}, {"headers", {{"X-Norvel-ForceFetch", R"({"bag": 2})"}}}, {"times", 1}});
+  ASSERT_TRUE(send(request("forecast")).reply);
+  ASSERT_TRUE(tavixd->waitForLog("0 subscription records passed on")) << tavixd->log();
+  ASSERT_TRUE(send(request("news")).reply);
+  EXPECT_FALSE(lastSearch()["headers"].contains("x-norvel-subscriptions"));
+  EXPECT_TRUE(lastSearch()["headers"].contains("x-norvel-whitelisted-app-signature"));
 }
 
 }  // namespace
