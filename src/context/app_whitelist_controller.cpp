@@ -22,7 +22,7 @@ std::optional<std::string> readWhitelist(const platform::fs::path& path) {
   std::string bytes;
   if (!ec) ec = platform::readFile(path, &bytes);
   if (ec) {
-    log().error("error reading app whitelist {}", path.string() + ": " + ec.message());
+    log().notice("error reading app whitelist {}", path.string() + ": " + ec.message());
     return std::nullopt;
   }
   return bytes;
