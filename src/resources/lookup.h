@@ -1,8 +1,7 @@
 // Look-up: keeps the hints store fed with the two downloaded hints files (weekly and monthly),
 // says whether look-up is enabled, and gives the download manager the version of a hints file.
 //
-// Linux has no text-scanning service, so the hints go to a store of our own: per source kind, a
-// copy of the pushed file and the signature it was pushed with, in the caches folder.
+// The hints go to a LookupHintsStore (hints_store.h), Linux's stand-in for a text scanner.
 //
 // Lookup owns the serial queue "com.norvel.tavix.Lookup"; the hints handling runs there, each piece
 // inside a keep-alive transaction. Logs under "Tavix_LookUp".
@@ -10,13 +9,13 @@
 
 #include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <string_view>
 
 #include "platform/dispatch.h"
 #include "platform/files.h"
 #include "platform/notification_center.h"
+#include "resources/hints_store.h"
 
 namespace tavix {
 
@@ -26,41 +25,6 @@ class UserDefaults;
 }  // namespace platform
 
 class ResourceVersionsProvider;
-
-// What the text scanner holds per source kind.
-class LookupHintsStore {
- public:
-  virtual ~LookupHintsStore() = default;
-  // Replaces the data of `sourceKind` with what `fd` reads from its start, recorded with
-  // `signature`; `fd` < 0 clears the kind. False when the data is unreadable or not a usable hints
-  // file (the kind is then left empty, with no signature), or when it cannot be stored.
-  virtual bool hintsSourcePushFile(int sourceKind, int fd, const std::string& signature) = 0;
-  // The signature of the data `sourceKind` holds; empty when it holds none.
-  virtual std::string hintsSourceGetClientSignature(int sourceKind) = 0;
-};
-
-// The store as files: "<folder>/hints.<kind>" and its signature in "<folder>/hints.<kind>.signature",
-// each written atomically, 0600, in a folder made 0700. The signature is written after the data and
-// removed before it changes, so a signature on disk always belongs to the data beside it. Safe from
-// any thread (calls are serialised).
-class FileLookupHintsStore final : public LookupHintsStore {
- public:
-  explicit FileLookupHintsStore(platform::fs::path folder) : folder_(std::move(folder)) {}
-  bool hintsSourcePushFile(int sourceKind, int fd, const std::string& signature) override;
-  std::string hintsSourceGetClientSignature(int sourceKind) override;
-
-  platform::fs::path dataPath(int sourceKind) const;
-
- private:
-  platform::fs::path signaturePath(int sourceKind) const;
-  void clear(int sourceKind);
-
-  const platform::fs::path folder_;
-  std::mutex lock_;
-};
-
-// Where the daemon keeps the store: "<caches folder>/LookupHints".
-inline constexpr const char* kLookupHintsStoreFolder = "LookupHints";
 
 // The defaults suite shared with the look-up panel, and its switch.
 inline constexpr const char* kLookupSharedSuite = "com.norvel.lookup.shared";
