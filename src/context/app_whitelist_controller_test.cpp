@@ -56,7 +56,7 @@ class AppWhitelistControllerTest : public ::testing::Test {
       {"encoding", "bitmap"}});
 };
 
-TEST_F(AppWhitelistControllerTest, SignatureFollowsTheWhitelistAndOutlivesARestart) {
+TEST_F(AppWhitelistControllerTest, SignatureFollowsTheWhitelistOutlivesARestartAndGoesWithAnUnusableOne) {
   auto controller = AppWhitelistController::create(environment());
   controller->drainQueue();
   EXPECT_FALSE(controller->whitelistSignature());  // no whitelist downloaded yet
@@ -76,27 +76,20 @@ TEST_F(AppWhitelistControllerTest, SignatureFollowsTheWhitelistAndOutlivesAResta
   auto restarted = AppWhitelistController::create(environment());
   restarted->drainQueue();
   EXPECT_EQ(restarted->whitelistSignature(), expected);
-}
-
-TEST_F(AppWhitelistControllerTest, AnUnusableWhitelistRemovesTheSignatureAndSaysWhy) {
-  auto controller = AppWhitelistController::create(environment());
-  deliverWhitelist(whitelist);
-  controller->drainQueue();
-  ASSERT_TRUE(stored());
 
   // Malformed whitelists are the parser's business; here, that any failure withdraws the signature.
   platform::LogCapture logs;
   deliverWhitelist("not json");
-  controller->drainQueue();
-  EXPECT_FALSE(controller->whitelistSignature());
+  restarted->drainQueue();
+  EXPECT_FALSE(restarted->whitelistSignature());
   EXPECT_FALSE(stored());
   EXPECT_TRUE(logs.contains("no installed app signature"));
 
   deliverWhitelist(whitelist);
-  controller->drainQueue();
+  restarted->drainQueue();
   ASSERT_TRUE(stored());
   deliverWhitelist(std::string(17 * 1024 * 1024, '\xff'));  // refused unread
-  controller->drainQueue();
+  restarted->drainQueue();
   EXPECT_FALSE(stored());
   EXPECT_TRUE(logs.contains("File too large"));
 }

@@ -133,14 +133,5 @@ TEST_F(LookupTest, StartUpPushesOnlyHintsWhoseSignatureIsStale) {
   EXPECT_EQ(store->hintsSourceGetClientSignature(kTVXLookupSourceKindMonthly), "m2");
 }
 
-TEST_F(LookupTest, EnabledFollowsTheSharedSuiteAsItIsNow) {
-  EXPECT_TRUE(lookup->lookupEnabled());
-  auto shared = defaults->suite(kLookupSharedSuite);
-  shared->setObject(kLookupSuggestionsDisabledKey, true);
-  EXPECT_FALSE(lookup->lookupEnabled());
-  shared->removeObject(kLookupSuggestionsDisabledKey);
-  EXPECT_TRUE(lookup->lookupEnabled());
-}
-
 }  // namespace
 }  // namespace tavix
