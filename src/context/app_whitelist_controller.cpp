@@ -49,8 +49,11 @@ void AppWhitelistController::start() {
     whitelistSignature_ = std::move(stored);
   }
   std::weak_ptr<AppWhitelistController> weak = weak_from_this();
-  watcher_ = std::make_unique<DesktopEntryWatcher>(*env_.pool, *env_.clock, env_.applicationFolders, [weak] {
-    if (auto self = weak.lock()) self->generateWhitelistSignature();
+  // Off the watcher's queue: were the last reference to go there, the watcher would wait on itself.
+  watcher_ = std::make_unique<DesktopEntryWatcher>(*env_.pool, *env_.clock, env_.applicationFolders, [weak, pool = env_.pool] {
+    pool->post([weak] {
+      if (auto self = weak.lock()) self->generateWhitelistSignature();
+    });
   }, env_.debounce);
   downloaded_ = env_.center->addObserver(
       kTVXFileDownloadCompletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {

@@ -92,6 +92,22 @@ TEST_F(AppWhitelistControllerTest, SignatureFollowsTheWhitelistOutlivesARestartA
   restarted->drainQueue();
   EXPECT_FALSE(stored());
   EXPECT_TRUE(logs.contains("File too large"));
+
+  // Another whitelisted app arrives (moved in whole: one change); it counts once changes settle.
+  deliverWhitelist(whitelist);
+  restarted->drainQueue();
+  fs::create_directories(home.root() / "staging");
+  std::ofstream(home.root() / "staging/org.other.desktop") << "[Desktop Entry]\nType=Application\nName=O\n";
+  fs::rename(home.root() / "staging/org.other.desktop", folders[0] / "org.other.desktop");
+  ASSERT_TRUE(testing::waitFor([&] { return clock.pendingTimers() > 0; }));  // the inotify event is in
+  clock.advance(platform::seconds(59));
+  pool.drain();
+  EXPECT_EQ(restarted->whitelistSignature(), expected);
+  clock.advance(platform::seconds(1));
+  pool.drain();
+  const auto both = processWhitelist(whitelist, installedApps(folders));
+  ASSERT_NE(both, expected);
+  EXPECT_EQ(restarted->whitelistSignature(), both);
 }
 
 }  // namespace
