@@ -192,6 +192,45 @@ std::shared_ptr<TavixFlusherIPC> makeFlusherChannel(Assembly& assembly, TavixSer
   return channel;
 }
 
+// Every client state's services: one environment, shared by the states the manager makes.
+std::shared_ptr<const ClientState::Environment> clientStateEnvironment(const Assembly& assembly) {
+  auto env = std::make_shared<ClientState::Environment>();
+  env->pool = assembly.dispatchPool;
+  env->clock = assembly.clock;
+  env->defaults = assembly.userDefaults;
+  env->center = assembly.notificationCenter;
+  env->requestFactory = assembly.requestFactory;
+  env->bagController = assembly.bagController;
+  env->engagedCompletionCache = assembly.engagedCompletionCache;
+  env->locationManager = assembly.locationManager;
+  env->session = assembly.urlSession();
+  env->guidController = assembly.guidController;
+  env->sessionManager = assembly.clientSessionManager;
+  env->sessions = sessionManagerEnvironment(assembly);
+  return env;
+}
+
+// Every client connection's services. The service binds connections with it from the first
+// accepted client on, so it is completed (the flush channel, made after the service) before the
+// listener resumes.
+void fillConnectionEnvironment(ClientConnection::Environment& env, const Assembly& assembly,
+                               platform::ipc::LaunchEventRegistry& launchEvents) {
+  env.pool = assembly.dispatchPool;
+  env.clock = assembly.clock;
+  env.transactions = assembly.transactions;
+  env.activities = assembly.activityScheduler;
+  env.launchEvents = &launchEvents;
+  env.defaults = assembly.userDefaults;
+  env.center = assembly.notificationCenter;
+  env.requestFactory = assembly.requestFactory;
+  env.clientStates = assembly.clientStateManager;
+  env.sessionManager = assembly.clientSessionManager;
+  env.engagedCompletions = assembly.engagedCompletionCache;
+  env.feedback = feedbackEnvironment(assembly);
+  env.cachesFolder = assembly.cachesFolder();
+  env.flusher = assembly.flusherIPCListener;
+}
+
 // Socket activation hands the listening socket over; otherwise we make our own at `socketPath`.
 std::unique_ptr<platform::ipc::IpcListener> openListener(int activated, const std::string& socketPath,
                                                          platform::DispatchPool& pool, platform::Logger& log) {
@@ -302,16 +341,6 @@ void assembleFeedbackServices(Assembly& assembly) {
       std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), assembly.guidController, assembly.bagController, "tavix");
 }
 
-TavixService::Environment serviceEnvironment(Assembly& assembly, platform::ipc::LaunchEventRegistry* launchEvents) {
-  TavixService::Environment env;
-  env.pool = assembly.dispatchPool;
-  env.urlSession = [&assembly] { return assembly.urlSession(); };
-  env.makeConnection = [&assembly, launchEvents](const std::shared_ptr<platform::ipc::IpcConnection>& connection) {
-    return std::make_shared<ClientConnection>(assembly, connection, launchEvents);
-  };
-  return env;
-}
-
 int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   platform::setLogLevel(options.logLevel);
   auto& log = TavixLogForCategory(TavixLoggingCategoryDefault);
@@ -352,11 +381,18 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
 
   platform::SerialQueue ipcEventQueue(pool, "com.norvel.tavixd.ipc_event");
   platform::ipc::LaunchEventRegistry launchEvents(ipcEventQueue);
-  TavixService service(serviceEnvironment(assembly, &launchEvents));
+  auto connections = std::make_shared<ClientConnection::Environment>();
+  TavixService service({&pool, [&assembly] { return assembly.urlSession(); },
+                        [connections](const std::shared_ptr<platform::ipc::IpcConnection>& connection) {
+                          return std::make_shared<ClientConnection>(connections, connection);
+                        }});
   // After the feedback services: a client state may share their GUID controller and session manager.
   assembly.clientStateManager = std::make_shared<ClientStateManager>(
-      pool, defaults, [&assembly](const std::string& identifier) { return ClientState::create(assembly, identifier); });
+      pool, defaults, [env = clientStateEnvironment(assembly)](const std::string& identifier) {
+        return ClientState::create(env, identifier);
+      });
   assembly.flusherIPCListener = makeFlusherChannel(assembly, service);
+  fillConnectionEnvironment(*connections, assembly, launchEvents);
 
   // The orderly end, on every way out once the services exist.
   auto shutDown = [&] {

@@ -20,7 +20,7 @@
 #include "platform/http/url_session.h"
 #include "platform/notification_center.h"
 #include "query/client_state_manager.h"
-#include "support/test_assembly.h"
+#include "support/client_states.h"
 
 namespace tavix {
 namespace {
@@ -80,7 +80,7 @@ class ClientStateTest : public ::testing::Test, protected testing::TestAssembly 
   }
 
   std::shared_ptr<ClientState> make(const std::string& identifier = "com.norvel.seekara") {
-    states.push_back(ClientState::create(assembly, identifier));
+    states.push_back(ClientState::create(testing::clientStateEnvironment(*this), identifier));
     return states.back();
   }
 
@@ -178,7 +178,7 @@ TEST_F(ClientStateTest, NewUserAgentRelabelsTheBagAndEmptiesTheQueryCache) {
 
 TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
   startController();
-  auto manager = makeClientStateManager();
+  auto manager = testing::makeClientStateManager(*this);
   EXPECT_EQ(manager->stateForClientIdentifier(""), nullptr);
 
   std::shared_ptr<ClientState> a, b;
@@ -203,7 +203,7 @@ TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
                       platform::Dictionary{{"identifier", "com.norvel.brovane"}, {"agent", "brovane/7"}},
                       platform::Dictionary{{"identifier", "com.norvel.news"}},
                   });
-  auto loaded = makeClientStateManager();
+  auto loaded = testing::makeClientStateManager(*this);
   auto sessions = loaded->sessions();
   ASSERT_EQ(sessions.size(), 1u);
   EXPECT_EQ(*sessions[0].dictionary()->at("agent").string(), "brovane/7");

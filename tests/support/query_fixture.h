@@ -30,7 +30,7 @@
 #include "platform/notification_center.h"
 #include "query/client_state.h"
 #include "support/temp_home.h"
-#include "support/test_assembly.h"
+#include "support/client_states.h"
 #include "tavix_proto/feedback_session.pb.h"
 #include "cache/engaged_completion_cache.h"
 
@@ -154,7 +154,7 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
   }
 
   std::shared_ptr<ClientState> make(const std::string& identifier, const std::string& userAgent) {
-    states.push_back(ClientState::create(assembly, identifier));
+    states.push_back(ClientState::create(testing::clientStateEnvironment(*this), identifier));
     states.back()->updateClient(userAgent);
     return states.back();
   }

@@ -15,8 +15,6 @@
 #include "platform/dispatch.h"
 #include "platform/notification_center.h"
 #include "platform/transactions.h"
-#include "query/client_state.h"
-#include "query/client_state_manager.h"
 #include "support/temp_home.h"
 
 namespace tavix::testing {
@@ -56,11 +54,6 @@ class TestAssembly {
   std::shared_ptr<TVXNetworkRequestFactory> makeRequestFactory(TVXRequestFactoryProviders providers = {}) {
     assembly.requestFactory = TVXNetworkRequestFactory::create(requestFactoryEnvironment(), std::move(providers));
     return assembly.requestFactory;
-  }
-  // A client state manager whose states find their peers in the assembly.
-  std::shared_ptr<ClientStateManager> makeClientStateManager() {
-    return std::make_shared<ClientStateManager>(
-        pool, defaults, [this](const std::string& identifier) { return ClientState::create(assembly, identifier); });
   }
   // A new GUID controller announcing on the assembly's centre.
   std::shared_ptr<TavixUserGUIDController> makeGUIDController() {
