@@ -8,8 +8,6 @@
 
 namespace tavix {
 
-class Assembly;
-
 namespace platform {
 class UserDefaults;
 }
@@ -20,10 +18,6 @@ platform::Dictionary tavixdRegisteredDefaults();
 // Makes "<caches>/com.norvel.tavixd/CustomFeedback" and one folder per custom-feedback type.
 // Failures are logged and never stop start-up; a type folder that exists already is no error.
 void createCustomFeedbackDirectories(const platform::Paths& paths);
-
-// Reads "TVXSharedSession" and makes the feedback session manager that clients share when it is
-// set. After the GUID controller and the bag controller, which the manager uses.
-void assembleFeedbackServices(Assembly& assembly);
 
 // The background activities and how often each runs.
 inline constexpr const char* kFlusherActivity = "com.norvel.tavixd.flusher.background";

@@ -32,8 +32,7 @@ TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
 
   {
     testing::ConnectionServices services(f, nullptr, nullptr);
-    auto querySession = assembly.urlSession();
-    TavixService service({&pool, [querySession] { return querySession; },
+    TavixService service({&pool, assembly.urlSession(),
                           [env = services.env](const std::shared_ptr<ipc::IpcConnection>& connection) {
                             return std::make_shared<ClientConnection>(env, connection);
                           }});

@@ -11,7 +11,6 @@
 #include "bag/tavix_bag_controller.h"
 #include "bagview/tvx_bag.h"
 #include "cache/query_cache.h"
-#include "core/assembly.h"
 #include "devserver/devserver.h"
 #include "network/request_factory.h"
 #include "platform/clock.h"

@@ -15,7 +15,6 @@
 
 #include "bag/tavix_bag_controller.h"
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
 #include "core/requests.h"
 #include "devserver/devserver.h"
 #include "feedback/client_session_manager.h"
