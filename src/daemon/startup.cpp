@@ -139,7 +139,7 @@ void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform
   // Before the bag controller and the session manager, which stamp their feedback with its GUID.
   assembly.guidController = std::make_shared<TavixUserGUIDController>(pool, clock, assembly.notificationCenter);
   assembly.resourceVersions = std::make_shared<ResourceVersions>();
-  assembly.feedback = {&pool,        &clock, assembly.userDefaults, assembly.persistentStorage, assembly.guidController,
+  assembly.feedback = {&pool, &clock, assembly.userDefaults, assembly.persistentStorage, assembly.guidController,
                        assembly.resourceVersions};
 }
 
