@@ -9,7 +9,6 @@
 #include "bag/tavix_bag_controller.h"
 #include "bagview/tvx_bag.h"
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
 #include "devserver/devserver.h"
 #include "feedback/client_session_manager.h"
 #include "feedback/persistent_storage.h"

@@ -16,7 +16,6 @@
 #include <random>
 #include <thread>
 
-#include "core/assembly.h"
 #include "feedback/client_session.h"
 #include "feedback/persistent_storage.h"
 #include "feedback/tavix_feedback.h"
@@ -27,6 +26,7 @@
 #include "support/daemon_process.h"
 #include "support/devserver_process.h"
 #include "support/temp_home.h"
+#include "support/test_assembly.h"
 #include "support/test_seed.h"
 #include "tavix/client.h"
 #include "tavix_proto/feedback_records.pb.h"
@@ -56,7 +56,7 @@ int runTool(const std::string& args, std::string* out) {
 void writeSessions(const testing::TempHome& home, const std::vector<std::string>& agents) {
   platform::DispatchPool pool;
   platform::VirtualClock clock;
-  Assembly assembly;
+  testing::TestWiring assembly;
   assembly.dispatchPool = &pool;
   assembly.clock = &clock;
   assembly.paths = platform::Paths::fromEnvironment();

@@ -11,7 +11,6 @@
 #include <nlohmann/json.hpp>
 
 #include "bagview/tvx_bag.h"
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "devserver/devserver.h"
 #include "platform/clock.h"

@@ -7,7 +7,6 @@
 #include "bagview/tvx_bag.h"
 #include "cache/query_cache.h"
 #include "cache/engaged_completion_cache.h"
-#include "core/assembly.h"
 #include "core/logging.h"
 #include "core/names.h"
 #include "daemon/wire_records.h"
@@ -173,9 +172,9 @@ class ClientConnection::PendingCall {
   platform::ipc::IpcConnection::CallHold hold_;
 };
 
-ClientConnection::ClientConnection(Assembly& assembly, std::shared_ptr<platform::ipc::IpcConnection> connection,
-                                   platform::ipc::LaunchEventRegistry* launchEvents)
-    : assembly_(assembly), connection_(std::move(connection)), launchEvents_(launchEvents) {}
+ClientConnection::ClientConnection(std::shared_ptr<const Environment> env,
+                                   std::shared_ptr<platform::ipc::IpcConnection> connection)
+    : env_(std::move(env)), connection_(std::move(connection)) {}
 
 ClientConnection::~ClientConnection() {
   idleTimer_.cancel();
@@ -184,11 +183,11 @@ ClientConnection::~ClientConnection() {
 
 void ClientConnection::start() {
   std::weak_ptr<ClientConnection> weak = weak_from_this();
-  downloadObserver_ = assembly_.notificationCenter->addObserver(
+  downloadObserver_ = env_->center->addObserver(
       kTVXFileDownloadCompletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
         if (auto self = weak.lock()) self->relayResourceNotification(n, true);
       });
-  deleteObserver_ = assembly_.notificationCenter->addObserver(
+  deleteObserver_ = env_->center->addObserver(
       kTVXFileDeletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
         if (auto self = weak.lock()) self->relayResourceNotification(n, false);
       });
@@ -206,7 +205,7 @@ void ClientConnection::relayResourceNotification(const platform::Notification& n
   }
   // Off the poster's thread; the connection is held weakly, so a client gone meanwhile is skipped.
   std::weak_ptr<platform::ipc::IpcConnection> weak = connection_;
-  assembly_.dispatchPool->post([weak, bytes = out.SerializeAsString()]() mutable {
+  env_->pool->post([weak, bytes = out.SerializeAsString()]() mutable {
     if (auto connection = weak.lock()) sendToClient(*connection, std::move(bytes));
   });
 }
@@ -222,15 +221,15 @@ void ClientConnection::invalidated() {
 void ClientConnection::openOrExtendTransaction() {
   idleTimer_.cancel();
   std::weak_ptr<ClientConnection> weak = weak_from_this();
-  idleTimer_ = assembly_.clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(), [weak] {
+  idleTimer_ = env_->clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(), [weak] {
     auto self = weak.lock();
     if (!self) return;
     connectionLog().debug("timing out idle ipc transaction");
     self->closeTransaction(true);
   });
-  if (!transactionOpen_.exchange(true) && assembly_.transactions) {
+  if (!transactionOpen_.exchange(true)) {
     std::lock_guard lock(transactionLock_);
-    transaction_ = assembly_.transactions->begin("com.norvel.tavixd.ipc");
+    transaction_ = env_->transactions->begin("com.norvel.tavixd.ipc");
   }
 }
 
@@ -243,10 +242,10 @@ void ClientConnection::closeTransaction(bool now) {
     std::lock_guard lock(transactionLock_);
     transaction = std::move(transaction_);
   }
-  if (now || !assembly_.clock) return;  // ends here
+  if (now) return;  // ends here
   // The timer holds the IPC connection, whose queue it runs on, until it fires.
   auto held = std::make_shared<platform::TransactionTracker::Transaction>(std::move(transaction));
-  assembly_.clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(),
+  env_->clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(),
                          [held, connection = connection_] { held->reset(); });
 }
 
@@ -310,7 +309,7 @@ void ClientConnection::listenToFlusher(std::uint64_t callId) {
   // The tool's end of a fresh flusher channel rides with the reply.
   auto* answer = out.mutable_listen_to_flusher_reply();
   platform::ipc::UniqueFd endpoint;
-  if (assembly_.flusherIPCListener) endpoint = assembly_.flusherIPCListener->endpoint();
+  if (env_->flusher) endpoint = env_->flusher->endpoint();
   if (!endpoint.valid()) {
     setError(answer->mutable_error(), 500, "not available");
     return reply(callId, out);
@@ -328,7 +327,7 @@ void ClientConnection::listSessions(std::uint64_t callId) {
   ensureState();
   proto::Envelope out;
   auto* answer = out.mutable_list_sessions_reply();
-  for (const auto& session : assembly_.clientStateManager->sessions()) answer->add_sessions(platform::toJson(session));
+  for (const auto& session : env_->clientStates->sessions()) answer->add_sessions(platform::toJson(session));
   reply(callId, out);
 }
 
@@ -353,7 +352,7 @@ void ClientConnection::notify(std::uint64_t callId, const proto::Envelope& in) {
   proto::Envelope out;
   const std::string stream = in.notify().stream().empty() ? kNotifyStream : in.notify().stream();
   auto* answer = out.mutable_notify_reply();
-  answer->set_delivered(launchEvents_ && launchEvents_->deliver(stream, in.notify().name()));
+  answer->set_delivered(env_->launchEvents && env_->launchEvents->deliver(stream, in.notify().name()));
   if (!answer->delivered()) setError(answer->mutable_error(), 404, "no handler for stream " + stream);
   reply(callId, out);
 }
@@ -362,9 +361,9 @@ void ClientConnection::runActivity(std::uint64_t callId, const proto::Envelope& 
   proto::Envelope out;
   auto* answer = out.mutable_run_activity_reply();
   const std::string& name = in.run_activity().name();
-  if (!assembly_.activityScheduler || !assembly_.activityScheduler->state(name)) {
+  if (!env_->activities->state(name)) {
     setError(answer->mutable_error(), 404, "no activity " + name);
-  } else if (!assembly_.activityScheduler->runNow(name)) {
+  } else if (!env_->activities->runNow(name)) {
     setError(answer->mutable_error(), 500, "activity " + name + " is running");
   }
   reply(callId, out);
@@ -391,10 +390,7 @@ void ClientConnection::ensureState() {
   if (!configuration_->userAgent.empty()) {
     // The factory's device answers are the process's: the system's version is read once.
     const auto& agent = configuration_->userAgent;
-    fullUserAgent = (assembly_.requestFactory
-                         ? createUserAgentString(agent, assembly_.requestFactory->deviceInformation())
-                         : createUserAgentString(agent, DeviceInformation(assembly_.userDefaults.get())))
-                        .value_or(agent);
+    fullUserAgent = createUserAgentString(agent, env_->requestFactory->deviceInformation()).value_or(agent);
   }
   // The identifier and the full user agent (the client's part and the device's, which defaults
   // may override) go out as header values: a CR LF in either would add a header of its own.
@@ -403,7 +399,7 @@ void ClientConnection::ensureState() {
     sessionLog().fault("configuration carries a control character: {}", printable(*value));
     return;
   }
-  auto state = assembly_.clientStateManager->stateForClientIdentifier(configuration_->identifier);
+  auto state = env_->clientStates->stateForClientIdentifier(configuration_->identifier);
   if (!state) return;
   // The tool re-labels its state with each connection's agent; other clients keep the state's
   // first one on purpose.
@@ -436,9 +432,7 @@ void ClientConnection::configure(std::uint64_t callId, const proto::Envelope& in
   }
   if (!state_) {
     configuration_.reset();
-    if (auto manager = assembly_.clientSessionManager) {
-      manager->reportErrorAsTavixdFeedback(500, kTVXErrorDomain, "invalid configuration");
-    }
+    env_->sessionManager->reportErrorAsTavixdFeedback(500, kTVXErrorDomain, "invalid configuration");
     // No reply at all: the client learns of it by the closed connection.
     sessionLog().fault("invalid configuration, closing connection");
     connection_->invalidate();
@@ -477,12 +471,12 @@ void ClientConnection::bagDidLoad(const std::shared_ptr<const TVXBag>& bag, cons
   if (bag) setEngagedCompletionCacheValues(*bag);
   if (!bagObserver_) {
     std::weak_ptr<ClientConnection> weak = weak_from_this();
-    bagObserver_ = assembly_.notificationCenter->addObserver(
+    bagObserver_ = env_->center->addObserver(
         kTVXBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
           if (auto self = weak.lock()) self->bagChangeNotification(n);
         });
   }
-  assembly_.clientStateManager->saveState();
+  env_->clientStates->saveState();
 }
 
 void ClientConnection::bagChangeNotification(const platform::Notification& notification) {
@@ -507,7 +501,7 @@ void ClientConnection::setEngagedCompletionCacheValues(const TVXBag& bag) {
   parameters.all = bag.brovaneAll();
   parameters.mostRecent = bag.brovaneMostRecent();
   parameters.minThresholdToSend = bag.minThresholdToSend();
-  assembly_.engagedCompletionCache->updateParameters(parameters);
+  env_->engagedCompletions->updateParameters(parameters);
 }
 
 void ClientConnection::request(std::uint64_t callId, const proto::Envelope& in) {
@@ -525,7 +519,7 @@ void ClientConnection::request(std::uint64_t callId, const proto::Envelope& in) 
     return;
   }
   auto request = requestFromWire(wire);
-  auto* defaults = assembly_.userDefaults.get();
+  auto* defaults = env_->defaults.get();
   if (!request->keyboardInputMode) {
     request->keyboardInputMode = defaultKeyboardInputMode(defaults);
     connectionLog().debug("keyboardInputMode property not set, using {}", *request->keyboardInputMode);
@@ -593,7 +587,7 @@ void ClientConnection::feedback(std::uint64_t callId) {
 
 void ClientConnection::engagedCompletionMessage(const proto::Envelope& in) {
   ensureState();
-  auto cache = assembly_.engagedCompletionCache;
+  auto cache = env_->engagedCompletions;
   switch (in.message_case()) {
     case proto::Envelope::kClearEngagedCompletions: {
       const auto& dates = in.clear_engaged_completions();

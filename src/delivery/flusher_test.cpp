@@ -9,7 +9,6 @@
 
 #include "bag/tavix_bag_controller.h"
 #include "bagview/user_agent.h"
-#include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
 #include "delivery/custom_feedback_flusher.h"

@@ -12,7 +12,6 @@
 #include <nlohmann/json.hpp>
 
 #include "bagview/tvx_bag.h"
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/names.h"
 #include "devserver/devserver.h"

@@ -658,6 +658,8 @@ URLSession::URLSession(URLSessionConfiguration configuration)
 
 URLSession::~URLSession() { impl_->shutdown(); }
 
+void URLSession::invalidateAndCancel() { impl_->shutdown(); }
+
 std::shared_ptr<URLSessionDataTask> URLSession::dataTask(URLRequest request, DataTaskCompletion completion,
                                                          SerialQueue* deliverOn) {
   auto task = std::make_shared<URLSessionDataTask::Impl>();

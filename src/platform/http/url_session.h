@@ -153,6 +153,11 @@ class URLSession {
   URLSession(const URLSession&) = delete;
   URLSession& operator=(const URLSession&) = delete;
 
+  // What the destructor does, for an owner that is not the last holder: cancels every task still
+  // running (their completions are called) and stops the transfer thread. Tasks made afterwards
+  // complete with URLErrorCancelled when resumed.
+  void invalidateAndCancel();
+
   // A task for `request`, not yet resumed. The completion runs on `deliverOn` when given (it must
   // outlive the task's completion), else on the session's delegate queue.
   std::shared_ptr<URLSessionDataTask> dataTask(URLRequest request, DataTaskCompletion completion,
