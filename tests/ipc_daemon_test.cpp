@@ -16,8 +16,8 @@
 #include "cache/engaged_completion_cache.h"
 #include "platform/clock.h"
 #include "platform/dispatch.h"
-#include "support/daemon_process.h"
 #include "support/raw_frames.h"
+#include "support/tavixd.h"
 #include "tavix/client.h"
 
 namespace {
@@ -28,23 +28,8 @@ using tavix::testing::rawConnect;
 using tavix::testing::rawReceive;
 using tavix::testing::rawSend;
 
-// The daemon with debug logging, once it is up.
-struct Daemon : tavix::testing::DaemonProcess {
-  std::string socket;
-
-  explicit Daemon(const tavix::testing::TempHome& home, const std::string& logName = "tavixd.log",
-                  std::vector<std::string> extra = {})
-      : DaemonProcess(TAVIXD_BINARY, home, withDebugLog(std::move(extra)), logName),
-        socket((home.runtime() / "com.norvel.tavixd" / "socket").string()) {
-    // Up means start-up is complete, signal handling included, not merely that the socket exists.
-    waitForLog("tavixd started");
-  }
-
-  static std::vector<std::string> withDebugLog(std::vector<std::string> extra) {
-    extra.insert(extra.begin(), {"--log-level", "debug"});
-    return extra;
-  }
-};
+using Daemon = tavix::testing::Tavixd;
+using tavix::testing::runTool;
 
 Client::Options options(const Daemon& d, std::string identifier = "tests", std::string userAgent = "tests/1") {
   Client::Options o;
@@ -53,18 +38,6 @@ Client::Options options(const Daemon& d, std::string identifier = "tests", std::
   o.configuration.set_user_agent(std::move(userAgent));
   o.timeoutMs = 5000;
   return o;
-}
-
-// Runs tavix_tool with the test's environment; returns the exit status and fills `out` with stdout
-// and stderr together.
-int runTool(const std::string& args, std::string* out) {
-  const std::string command = std::string(TAVIX_TOOL_BINARY) + " " + args + " 2>&1";
-  FILE* p = popen(command.c_str(), "r");
-  out->clear();
-  char buf[512];
-  while (std::fgets(buf, sizeof buf, p)) *out += buf;
-  const int status = pclose(p);
-  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
 TEST(IpcDaemon, BadFramesAndVanishingClientsDoNotStopTheDaemon) {
@@ -198,7 +171,6 @@ TEST(IpcDaemon, ToolReadsDefaultsAndCountersWithTheDaemonStoppedAndRunsActivitie
 
   {
     Daemon d(home);
-    ASSERT_TRUE(d.waitForLog("tavixd started")) << d.log();
     EXPECT_EQ(runTool("activity run com.norvel.tavixd.dp.flush", &out), 0) << out << d.log();
     EXPECT_TRUE(d.waitForLog("Flushing custom feedback.")) << d.log();
     EXPECT_EQ(runTool("activity run com.norvel.tavixd.nothing", &out), 1);
