@@ -25,11 +25,6 @@ std::vector<std::string> keysWithPrefix(CritbitTree& tree, const std::string& pr
   return keys;
 }
 
-int countCalls(const char*, void* arg) {
-  ++*static_cast<int*>(arg);
-  return 1;
-}
-
 TEST(CritbitRecord, ResultCodesOfInsertContainsAndDelete) {
   critbit_tree tree;
   int a = 0, b = 0;
@@ -60,23 +55,6 @@ TEST(CritbitRecord, ResultCodesOfInsertContainsAndDelete) {
   EXPECT_EQ(critbit_contains(&tree, "again", nullptr), 1);
   critbit_clear(&tree);
   EXPECT_EQ(tree.root, 0u);
-}
-
-TEST(CritbitRecord, PrefixEnumerationResultCodes) {
-  critbit_tree tree;
-  int v = 0;
-  for (const char* k : {"", "a", "ab", "abc", "b"}) critbit_insert(&tree, k, &v, 1);
-  int calls = 0;
-  EXPECT_EQ(critbit_allprefixed(&tree, "ab", countCalls, &calls), 1);
-  EXPECT_EQ(calls, 2);
-  calls = 0;
-  EXPECT_EQ(critbit_allprefixed(&tree, "abcdef", countCalls, &calls), 1);
-  EXPECT_EQ(critbit_allprefixed(&tree, "zz", countCalls, &calls), 1);
-  EXPECT_EQ(calls, 0);
-  EXPECT_EQ(critbit_allprefixed(&tree, nullptr, countCalls, &calls), 1);
-  EXPECT_EQ(critbit_allprefixed(&tree, "", [](const char*, void*) { return 0; }, nullptr), 0);
-  EXPECT_EQ(critbit_allprefixed(&tree, "", [](const char*, void*) { return 7; }, nullptr), -1);
-  critbit_clear(&tree);
 }
 
 TEST(CritbitTree, HoldsExactlyOneReferencePerStoredValue) {
