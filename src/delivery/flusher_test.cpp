@@ -88,19 +88,6 @@ class FlusherTest : public ::testing::Test, protected testing::TestAssembly {
     }));
   }
 
-  void writeSession(const std::string& agent, int events) {
-    proto::CTErrorFeedback error;
-    error.set_code(500);
-    error.set_domain("test");
-    error.set_reason("first");
-    auto s = ClientSession::open(feedbackEnvironment(assembly), makeTavixFeedbackWithCodable(error, 0, "", agent));
-    for (int i = 1; i < events; ++i) {
-      error.set_reason("event " + std::to_string(i));
-      s->addFeedback(makeTavixFeedbackWithCodable(error, 0, "", agent));
-    }
-    s->sessionComplete();
-  }
-
   // The flushers' services, taken from the assembly as it stands.
   TavixFeedbackFlusher::Environment feedbackFlusherEnvironment() {
     return {feedbackEnvironment(assembly), assembly.uploadManager, assembly.flusherIPCListener, &transactions};
@@ -111,13 +98,6 @@ class FlusherTest : public ::testing::Test, protected testing::TestAssembly {
   }
 
   std::size_t waitingSessions() { return assembly.persistentStorage->getAvailableSessionHandles().size(); }
-  std::size_t sessionFilesOnDisk() {
-    std::size_t n = 0;
-    for (const auto& e : platform::fs::directory_iterator(assembly.cachesFolder())) {
-      n += e.path().filename().string().find("session.") != std::string::npos;  // waiting or claimed
-    }
-    return n;
-  }
   json received() {
     httplib::Client client("127.0.0.1", server.port());
     return json::parse(client.Get("/_feedback")->body);
@@ -131,55 +111,6 @@ class FlusherTest : public ::testing::Test, protected testing::TestAssembly {
       std::make_shared<platform::http::URLSession>(platform::http::URLSessionConfiguration{});
   std::shared_ptr<BackgroundUploadSession> session;
 };
-
-TEST_F(FlusherTest, PeriodicRunSendsEachSessionOnceAndDeletesItsFile) {
-  // A file that is not a session of ours: deleted unread, never uploaded.
-  platform::createDirectory(home.cache() / "com.norvel.tavixd", true);
-  std::ofstream(home.cache() / "com.norvel.tavixd" / "session.40") << "not a session";
-  start();
-  writeSession("seekara/1", 3);
-  writeSession("brovane/2", 1);
-  writeSession("news/3", 2);
-  ASSERT_TRUE(waitFor([&] { return waitingSessions() == 4; }));
-  const auto sent = counter("com.norvel.tavixd.feedbacksent");
-
-  platform::LogCapture logs;
-  activities.checkIn(kActivity, platform::seconds(0), [this](const auto& activity) {
-    TavixFeedbackFlusher::handlePeriodicFlushActivity(*defaults, feedbackFlusherEnvironment(), activity);
-  });
-  EXPECT_TRUE(waitFor([&] { return logs.contains("Bailing on periodic flush because background activity state != RUN"); }))
-      << "the check-in call is not a run";
-  EXPECT_EQ(waitingSessions(), 4u);
-
-  ASSERT_TRUE(activities.runNow(kActivity));
-  ASSERT_TRUE(waitFor([&] { return activities.state(kActivity) == platform::ActivityState::Done; }));
-  ASSERT_TRUE(waitFor([&] { return counter("com.norvel.tavixd.feedbacksent") == sent + 21; }))
-      << "three uploads of seven keys each";
-  EXPECT_EQ(logs.count("All periodic flush tasks completed."), 1u);
-  EXPECT_EQ(waitingSessions(), 0u);
-  EXPECT_TRUE(waitFor([&] { return sessionFilesOnDisk() == 0; }));
-
-  auto got = received();
-  ASSERT_EQ(got.size(), 3u);
-  std::multiset<std::string> agents;
-  std::size_t events = 0;
-  for (const auto& upload : got) {
-    EXPECT_EQ(upload["path"], "/feedback");
-    EXPECT_EQ(upload["v"], "2");
-    EXPECT_EQ(upload["json"].size(), 7u);
-    agents.insert(upload["json"]["agent"].get<std::string>());
-    events += upload["json"]["fb"].size();
-  }
-  EXPECT_EQ(agents, (std::multiset<std::string>{"brovane/2", "news/3", "seekara/1"}));
-  EXPECT_EQ(events, 6u);
-
-  // Nothing left: the next run completes at once and sends nothing.
-  ASSERT_TRUE(activities.runNow(kActivity));
-  ASSERT_TRUE(waitFor([&] { return logs.count("All periodic flush tasks completed.") == 2; }));
-  pool.drain();
-  EXPECT_EQ(received().size(), 3u);
-  EXPECT_EQ(transactions.openCount(), 0u);
-}
 
 class CustomFeedbackTest : public FlusherTest {
  protected:
