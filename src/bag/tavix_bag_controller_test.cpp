@@ -21,6 +21,7 @@
 #include "platform/http/url_session.h"
 #include "platform/log.h"
 #include "platform/notification_center.h"
+#include "support/devserver_control.h"
 #include "support/test_assembly.h"
 
 namespace tavix {
@@ -57,13 +58,7 @@ class BagControllerTest : public ::testing::Test, protected testing::TestAssembl
   void make() { controller = TavixBagController::create(bagControllerEnvironment(assembly)); }
 
   std::string call(const std::string& path, const std::string& method = "GET", std::string body = {}) {
-    platform::http::URLRequest r;
-    r.url = server.baseURL() + path;
-    r.method = method;
-    r.body = std::move(body);
-    std::promise<std::string> done;
-    control->dataTask(r, [&](std::string data, auto, auto) { done.set_value(std::move(data)); })->resume();
-    return done.get_future().get();
+    return testing::devserverCall(*control, server.baseURL(), path, method, std::move(body));
   }
   void fault(const nlohmann::json& f) { call("/_faults", "POST", f.dump()); }
   std::vector<nlohmann::json> bagRequests() {
