@@ -485,6 +485,8 @@ TEST_F(RequestFactoryTest, LocaleChangeAsksForABagRefresh) {
   auto q = queryOf(factory->searchRequest(TVXSearchRequest{}, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
   EXPECT_EQ(q["locale"], "en_US");
   EXPECT_EQ(q["units"], "US");
+  EXPECT_EQ(q["temp"], "F");
+  EXPECT_EQ(q.count("24h"), 0u);
   defaults->setObject("TVXAlwaysOnTophit", true);  // not part of the bag's identity
   factory->flushContextAccessQueue();
   pool.drain();
