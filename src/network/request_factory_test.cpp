@@ -74,21 +74,13 @@ class FakeRoutine final : public RoutineManager {
   std::atomic<int> mode{2};
 };
 
+// The request's query items, decoded; `names` receives them in order.
 std::map<std::string, std::string> queryOf(const std::string& url, std::vector<std::string>* names = nullptr) {
   std::map<std::string, std::string> items;
-  auto q = url.find('?');
-  if (q == std::string::npos) return items;
-  std::string query = url.substr(q + 1);
-  std::size_t pos = 0;
-  while (pos <= query.size()) {
-    auto amp = query.find('&', pos);
-    std::string part = query.substr(pos, amp == std::string::npos ? std::string::npos : amp - pos);
-    auto eq = part.find('=');
-    std::string name = part.substr(0, eq);
-    items[name] = eq == std::string::npos ? "" : platform::http::percentDecode(part.substr(eq + 1));
+  const auto q = url.find('?');
+  for (auto& [name, value] : platform::http::decodedQueryItems(q == std::string::npos ? "" : url.substr(q + 1))) {
     if (names) names->push_back(name);
-    if (amp == std::string::npos) break;
-    pos = amp + 1;
+    items[name] = value.value_or("");
   }
   return items;
 }
