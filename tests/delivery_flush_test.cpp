@@ -73,17 +73,9 @@ void writeSessions(const testing::TempHome& home, const std::vector<std::string>
 // their own (agent "... tavixd/0.1"), which are not counted.
 std::size_t sessionFiles(const testing::TempHome& home) {
   std::size_t n = 0;
-  std::error_code ec;
-  for (const auto& e : platform::fs::directory_iterator(home.cache() / "com.norvel.tavixd", ec)) {
-    if (e.path().filename().string().find("session.") == std::string::npos) continue;  // waiting or claimed
-    std::ifstream in(e.path(), std::ios::binary);
-    const std::string bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    for (const char* agent : {"seekara/1", "brovane/2", "news/3"}) {
-      if (bytes.find(agent) != std::string::npos) {
-        ++n;
-        break;
-      }
-    }
+  for (const auto& bytes : testing::sessionFileContents(home)) {
+    n += bytes.find("seekara/1") != std::string::npos || bytes.find("brovane/2") != std::string::npos ||
+         bytes.find("news/3") != std::string::npos;
   }
   return n;
 }

@@ -111,14 +111,8 @@ TEST(IpcDaemon, BadConfigurationGetsNoReplyAndAClosedConnection) {
   // Each refusal is recorded as an error in the daemon's own feedback session.
   EXPECT_EQ(d.stop(), 0);
   int recorded = 0;
-  for (const auto& entry : std::filesystem::directory_iterator(home.cache() / "com.norvel.tavixd")) {
-    if (entry.path().filename().string().rfind("session.", 0) != 0) continue;
-    std::ifstream in(entry.path(), std::ios::binary);
-    const std::string bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    for (auto at = bytes.find("invalid configuration"); at != std::string::npos;
-         at = bytes.find("invalid configuration", at + 1)) {
-      ++recorded;
-    }
+  for (const auto& bytes : tavix::testing::sessionFileContents(home)) {
+    recorded += static_cast<int>(tavix::testing::occurrences(bytes, "invalid configuration"));
   }
   EXPECT_EQ(recorded, 3);
 }
