@@ -1,14 +1,11 @@
 // Talks to the real tavixd over its real socket: libtavix, tavix_tool and raw frames.
-#include <fcntl.h>
 #include <signal.h>
 #include <sys/socket.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <fstream>
 #include <future>
 #include <string>
 #include <vector>
