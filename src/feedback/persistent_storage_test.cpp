@@ -136,6 +136,38 @@ TEST(TavixPersistentStorage, SessionWrittenEventByEventReadsBackAndDeletes) {
   EXPECT_FALSE(container->readRecord().has_value());
 }
 
+TEST(FileContainer, CutOffOrEmptyFilesKeepOnlyWhatIsWhole) {
+  StorageFixture f;
+  TavixPersistentStorage storage(f.storageEnvironment());
+  auto container = storage.createFileContainerForWriting();
+  const auto head = header(storage.version());
+  container->writeSessionHeader(head);
+  for (int i = 1; i <= 3; ++i) container->writeFeedback(*event(i));
+  container->close();
+  ASSERT_FALSE(container->isOpen());  // also waits for the queued appends
+  const fs::path url = container->fileUrl();
+  const auto full = fs::file_size(url);
+
+  fs::resize_file(url, full - 4);  // last event cut off mid-record
+  auto session = container->readRecord();
+  ASSERT_TRUE(session.has_value());
+  EXPECT_EQ(session->feedbacks_size(), 2);
+
+  fs::resize_file(url, head.ByteSizeLong() + 2);  // first event cut off: nothing to send
+  EXPECT_FALSE(container->readRecord().has_value());
+
+  // Cut at a field boundary inside the header: it parses, but without its agent.
+  proto::CTClientSession versionOnly;
+  versionOnly.set_version(head.version());
+  versionOnly.set_session_start(head.session_start());
+  ASSERT_LT(versionOnly.ByteSizeLong(), head.ByteSizeLong());
+  fs::resize_file(url, versionOnly.ByteSizeLong());
+  EXPECT_FALSE(container->readRecord().has_value());
+
+  fs::resize_file(url, 0);
+  EXPECT_FALSE(container->readRecord().has_value());
+}
+
 TEST(FileContainer, SizeLimitRefusesReachingItButReadsAFileOfExactlyIt) {
   const auto head = header(tavixdSessionFileVersion());
   const auto one = event(1);
