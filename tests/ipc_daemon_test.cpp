@@ -1,14 +1,11 @@
 // Talks to the real tavixd over its real socket: libtavix, tavix_tool and raw frames.
-#include <fcntl.h>
 #include <signal.h>
 #include <sys/socket.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <fstream>
 #include <future>
 #include <string>
 #include <vector>
@@ -16,8 +13,8 @@
 #include "cache/engaged_completion_cache.h"
 #include "platform/clock.h"
 #include "platform/dispatch.h"
-#include "support/daemon_process.h"
 #include "support/raw_frames.h"
+#include "support/tavixd.h"
 #include "tavix/client.h"
 
 namespace {
@@ -28,23 +25,8 @@ using tavix::testing::rawConnect;
 using tavix::testing::rawReceive;
 using tavix::testing::rawSend;
 
-// The daemon with debug logging, once it is up.
-struct Daemon : tavix::testing::DaemonProcess {
-  std::string socket;
-
-  explicit Daemon(const tavix::testing::TempHome& home, const std::string& logName = "tavixd.log",
-                  std::vector<std::string> extra = {})
-      : DaemonProcess(TAVIXD_BINARY, home, withDebugLog(std::move(extra)), logName),
-        socket((home.runtime() / "com.norvel.tavixd" / "socket").string()) {
-    // Up means start-up is complete, signal handling included, not merely that the socket exists.
-    waitForLog("tavixd started");
-  }
-
-  static std::vector<std::string> withDebugLog(std::vector<std::string> extra) {
-    extra.insert(extra.begin(), {"--log-level", "debug"});
-    return extra;
-  }
-};
+using Daemon = tavix::testing::Tavixd;
+using tavix::testing::runTool;
 
 Client::Options options(const Daemon& d, std::string identifier = "tests", std::string userAgent = "tests/1") {
   Client::Options o;
@@ -53,18 +35,6 @@ Client::Options options(const Daemon& d, std::string identifier = "tests", std::
   o.configuration.set_user_agent(std::move(userAgent));
   o.timeoutMs = 5000;
   return o;
-}
-
-// Runs tavix_tool with the test's environment; returns the exit status and fills `out` with stdout
-// and stderr together.
-int runTool(const std::string& args, std::string* out) {
-  const std::string command = std::string(TAVIX_TOOL_BINARY) + " " + args + " 2>&1";
-  FILE* p = popen(command.c_str(), "r");
-  out->clear();
-  char buf[512];
-  while (std::fgets(buf, sizeof buf, p)) *out += buf;
-  const int status = pclose(p);
-  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
 TEST(IpcDaemon, BadFramesAndVanishingClientsDoNotStopTheDaemon) {
@@ -138,14 +108,8 @@ TEST(IpcDaemon, BadConfigurationGetsNoReplyAndAClosedConnection) {
   // Each refusal is recorded as an error in the daemon's own feedback session.
   EXPECT_EQ(d.stop(), 0);
   int recorded = 0;
-  for (const auto& entry : std::filesystem::directory_iterator(home.cache() / "com.norvel.tavixd")) {
-    if (entry.path().filename().string().rfind("session.", 0) != 0) continue;
-    std::ifstream in(entry.path(), std::ios::binary);
-    const std::string bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    for (auto at = bytes.find("invalid configuration"); at != std::string::npos;
-         at = bytes.find("invalid configuration", at + 1)) {
-      ++recorded;
-    }
+  for (const auto& bytes : tavix::testing::sessionFileContents(home)) {
+    recorded += static_cast<int>(tavix::testing::occurrences(bytes, "invalid configuration"));
   }
   EXPECT_EQ(recorded, 3);
 }
@@ -198,7 +162,6 @@ TEST(IpcDaemon, ToolReadsDefaultsAndCountersWithTheDaemonStoppedAndRunsActivitie
 
   {
     Daemon d(home);
-    ASSERT_TRUE(d.waitForLog("tavixd started")) << d.log();
     EXPECT_EQ(runTool("activity run com.norvel.tavixd.dp.flush", &out), 0) << out << d.log();
     EXPECT_TRUE(d.waitForLog("Flushing custom feedback.")) << d.log();
     EXPECT_EQ(runTool("activity run com.norvel.tavixd.nothing", &out), 1);
