@@ -39,6 +39,7 @@ class EngagedCompletionCache;
 class LocationManager;
 class MotionManager;
 class ResourceVersionsProvider;
+class DownloadManager;
 
 class Assembly {
  public:
@@ -73,8 +74,9 @@ class Assembly {
   std::shared_ptr<EngagedCompletionCache> engagedCompletionCache;
   std::shared_ptr<LocationManager> locationManager;
   std::shared_ptr<MotionManager> motionManager;
-  // The resource versions each new feedback session records; the download manager's, once it is
-  // built. Empty until then.
+  // The resource files the bag names; made before the bag controller and the session manager.
+  std::shared_ptr<DownloadManager> downloadManager;
+  // The resource versions each new feedback session records: the download manager's.
   std::shared_ptr<ResourceVersionsProvider> resourceVersions;
 
   // The assembly's four URL sessions (queries, bag, resource downloads, feedback uploads). Each is

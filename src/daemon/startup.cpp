@@ -41,6 +41,7 @@
 #include "platform/service_manager.h"
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
+#include "resources/download_manager.h"
 #include "platform/transactions.h"
 
 namespace tavix {
@@ -48,6 +49,9 @@ namespace tavix {
 using platform::PropertyValue;
 
 namespace {
+
+// The defaults suite the look-up panel shares with the daemon.
+constexpr const char* kLookupSharedDomain = "com.norvel.lookup.shared";
 
 // How often the background activities fall due.
 constexpr double kFlusherIntervalSeconds = 3600;
@@ -134,6 +138,33 @@ void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform
       assembly.cachesFolder(), &pool, &clock, assembly.userDefaults.get(), assembly.transactions});
   // Before the bag controller and the session manager, which stamp their feedback with its GUID.
   assembly.guidController = std::make_shared<TavixUserGUIDController>(pool, clock, assembly.notificationCenter);
+}
+
+// Before the bag controller and the session manager, which take the resource versions when they
+// are made. Downloads an earlier run left in the journal resume here.
+void assembleDownloadManager(Assembly& assembly, platform::DispatchPool& pool, platform::Clock& clock) {
+  DownloadManager::Environment env;
+  env.pool = &pool;
+  env.clock = &clock;
+  env.center = assembly.notificationCenter;
+  env.defaults = assembly.userDefaults;
+  env.cachesFolder = assembly.cachesFolder();
+  env.session = platform::http::BackgroundDownloadSession::create(
+      assembly.downloadURLSession(), assembly.cachesFolder() / "DownloadJournal", pool, clock,
+      TavixLogForCategory(TavixLoggingCategoryDownloadManager));
+  env.fileDownloadRequest = [factory = assembly.requestFactory](const std::string& url,
+                                                                std::optional<std::string> version, bool latLong) {
+    return factory->fileDownloadRequest(url, std::move(version), latLong);
+  };
+  // Read fresh each time: the look-up panel's settings switch it while we run.
+  env.lookupEnabled = [defaults = assembly.userDefaults] {
+    return !defaults->suite(kLookupSharedDomain)->boolForKey("LookupSuggestionsDisabled");
+  };
+  env.reportError = [&assembly](int code, const std::string& domain, const std::string& reason) {
+    if (assembly.clientSessionManager) assembly.clientSessionManager->reportErrorAsTavixdFeedback(code, domain, reason);
+  };
+  assembly.downloadManager = DownloadManager::create(std::move(env));
+  assembly.resourceVersions = assembly.downloadManager;
 }
 
 // Topic weights a person or another program left for us; any property-list value, sent as JSON.
@@ -340,6 +371,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   assembly.paths = paths;
   assembly.userDefaults = defaults;
   assembleServices(assembly, pool, clock);
+  assembleDownloadManager(assembly, pool, clock);
 
   const auto countersFile = assembly.cachesFolder() / "counters.plist";
   auto& counters = TavixDiagnosticDataReporter::store();
