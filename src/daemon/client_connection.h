@@ -100,8 +100,9 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void request(std::uint64_t callId, const proto::Envelope& in);
   void listenToFlusher(std::uint64_t callId);
   void listSessions(std::uint64_t callId);
-  void fileHandleAndAttributesForResource(std::uint64_t callId);
+  void fileHandleAndAttributesForResource(std::uint64_t callId, const proto::Envelope& in);
   void getImageMap(std::uint64_t callId);
+  void listResources(std::uint64_t callId);
   void notify(std::uint64_t callId, const proto::Envelope& in);
   void runActivity(std::uint64_t callId, const proto::Envelope& in);
   void unknownMessage(std::uint64_t callId, const proto::Envelope& in);
