@@ -98,6 +98,17 @@ void sendToClient(platform::ipc::IpcConnection& connection, std::string bytes,
                         connection.isValid() ? "message too large" : "connection invalidated");
 }
 
+// Answers `callId` with `out` and `fd` attached; a message without a call id gets no answer.
+void answerWithDescriptor(platform::ipc::IpcConnection& connection, std::uint64_t callId, proto::Envelope& out,
+                          platform::ipc::UniqueFd fd) {
+  if (callId == 0) return;
+  out.set_attached_fds(1);
+  out.set_call_id(callId);
+  std::vector<platform::ipc::UniqueFd> fds;
+  fds.push_back(std::move(fd));
+  sendToClient(connection, out.SerializeAsString(), std::move(fds));
+}
+
 void setError(proto::TVXError* error, std::int64_t code, const std::string& reason) {
   error->set_domain(kTVXErrorDomain);
   error->set_code(code);
@@ -317,13 +328,8 @@ void ClientConnection::listenToFlusher(std::uint64_t callId) {
     setError(answer->mutable_error(), 500, "not available");
     return reply(callId, out);
   }
-  if (callId == 0) return;
   answer->set_has_endpoint(true);
-  out.set_attached_fds(1);
-  out.set_call_id(callId);
-  std::vector<platform::ipc::UniqueFd> fds;
-  fds.push_back(std::move(endpoint));
-  sendToClient(*connection_, out.SerializeAsString(), std::move(fds));
+  answerWithDescriptor(*connection_, callId, out, std::move(endpoint));
 }
 
 void ClientConnection::listSessions(std::uint64_t callId) {
@@ -350,15 +356,10 @@ void ClientConnection::fileHandleAndAttributesForResource(std::uint64_t callId, 
     setError(answer->mutable_error(), error.code, error.reason);
     return reply(callId, out);
   }
-  if (callId == 0) return;
   answer->set_has_file_handle(true);
   answer->set_attributes_plist(platform::toXmlPlist(attributes));
   // The open file rides with the reply: the client reads it without any access to our folder.
-  out.set_attached_fds(1);
-  out.set_call_id(callId);
-  std::vector<platform::ipc::UniqueFd> fds;
-  fds.push_back(std::move(fd));
-  sendToClient(*connection_, out.SerializeAsString(), std::move(fds));
+  answerWithDescriptor(*connection_, callId, out, std::move(fd));
 }
 
 void ClientConnection::listResources(std::uint64_t callId) {
@@ -377,6 +378,8 @@ void ClientConnection::listResources(std::uint64_t callId) {
     r->set_file_size(status.fileSize.value_or(0));
     if (status.fileModificationDate) r->set_file_modification_date(platform::toUnixSeconds(*status.fileModificationDate));
     r->set_downloading(status.downloading);
+    r->set_download_started(status.downloadStarted);
+    if (status.downloadBeginDate) r->set_download_begin_date(platform::toUnixSeconds(*status.downloadBeginDate));
     r->set_bytes_received(status.bytesReceived);
     r->set_bytes_expected(status.bytesExpected);
   }

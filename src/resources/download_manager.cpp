@@ -431,6 +431,8 @@ std::vector<DownloadResourceStatus> DownloadManager::resourceStatuses() const {
     status.identifier = *identifier;
     if (status.url.empty()) status.url = urlForCompare(task.originalRequest.url).value_or(task.originalRequest.url);
     status.downloading = true;
+    status.downloadStarted = task.started;
+    status.downloadBeginDate = task.earliestBeginDate;
     status.bytesReceived = task.bytesReceived;
     status.bytesExpected = task.bytesExpected;
   }

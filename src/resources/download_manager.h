@@ -59,6 +59,8 @@ struct DownloadResourceStatus {
   std::optional<std::int64_t> fileSize;  // none: no file
   std::optional<platform::TimePoint> fileModificationDate;
   bool downloading = false;
+  bool downloadStarted = false;  // false while it waits for its begin date
+  std::optional<platform::TimePoint> downloadBeginDate;
   std::int64_t bytesReceived = 0;
   std::int64_t bytesExpected = -1;
 };

@@ -13,8 +13,8 @@ namespace tavix::tool {
 
 namespace {
 
-// "3d4h", "12m5s": the age of a file at a glance.
-std::string age(double seconds) {
+// "3d4h", "12m5s": an age or a wait at a glance.
+std::string span(double seconds) {
   const auto s = static_cast<long long>(std::max(0.0, seconds));
   char text[32];
   if (s >= 86400) {
@@ -50,11 +50,13 @@ int list(client::Client& client) {
                 r.url().empty() ? "(not fetched yet)" : r.url().c_str(), r.version().empty() ? "-" : r.version().c_str());
     if (r.has_file()) {
       std::printf("  file:     %lld bytes, %s old\n", static_cast<long long>(r.file_size()),
-                  age(now - r.file_modification_date()).c_str());
+                  span(now - r.file_modification_date()).c_str());
     } else {
       std::printf("  file:     none\n");
     }
-    if (r.downloading()) {
+    if (r.downloading() && !r.download_started()) {
+      std::printf("  download: queued, begins in %s\n", span(r.download_begin_date() - now).c_str());
+    } else if (r.downloading()) {
       if (r.bytes_expected() > 0) {
         std::printf("  download: %lld of %lld bytes (%.0f%%)\n", static_cast<long long>(r.bytes_received()),
                     static_cast<long long>(r.bytes_expected()),
