@@ -253,11 +253,8 @@ TEST_F(DownloadManagerTest, BagChangeCancelsDownloadsOnTheWireAndReplans) {
 
 TEST_F(DownloadManagerTest, FailuresAreReportedAndHostileIdentifiersNeverBecomePaths) {
   testing::devserverCall(control, base, "/_faults", "POST", json{{"path", "/resources/gone"}, {"status", 500}}.dump());
-  postBag({{"gone", url("/resources/gone")},
-           {"../escape", url("/resources/escape")},
-           {"a/b", url("/resources/ab")},
-           {".hidden", url("/resources/hidden")},
-           {"", url("/resources/empty")}});
+  // The full table of refused keys is the identifier's own test; here one that would escape.
+  postBag({{"gone", url("/resources/gone")}, {"../escape", url("/resources/escape")}});
   EXPECT_EQ(session->allTasks().size(), 1u);
   runDownloads();
   EXPECT_FALSE(platform::fs::exists(caches / "gone"));
