@@ -17,6 +17,8 @@
 // Threading: owns the serial queue "com.norvel.tavix.DownloadManager"; the resource table lives
 // there. Public methods are safe from any thread; those that answer something hop onto the queue
 // synchronously (never call them from it). Session delegate calls hop onto it synchronously too.
+// "TVXFileDeletedNotification" is posted from the queue, so its observers must not call back
+// synchronously; "TVXFileDownloadCompletedNotification" is posted off it.
 // Must be owned by a shared_ptr (use create()).
 #pragma once
 
