@@ -1,4 +1,5 @@
 // Talks to the real tavixd over its real socket: libtavix, tavix_tool and raw frames.
+#include <fcntl.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -6,7 +7,10 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <filesystem>
+#include <fstream>
 #include <future>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -199,6 +203,54 @@ TEST(IpcDaemon, ClearDataLaunchEventForgetsTheSystemSearchCompletionsOnly) {
   auto cache = open();
   EXPECT_EQ(cache->rowCountForClient(tavix::kEngagedCompletionClientSeekara), 0);
   EXPECT_EQ(cache->rowCountForClient(tavix::kEngagedCompletionClientBrovane), 1);
+}
+
+// The client reads a resource through the descriptor the daemon opened for it, never by path.
+TEST(IpcDaemon, ResourceFilesTravelAsReadOnlyDescriptors) {
+  tavix::testing::TempHome home;
+  home.exportEnvironment();  // the tool runs in this environment
+  const auto caches = home.cache() / "com.norvel.tavixd";
+  std::filesystem::create_directories(caches);
+  std::ofstream(caches / "dictionary_resources_url") << "[\"wn\"]";
+  std::ofstream(home.cache() / "outside") << "not a resource";
+  Daemon d(home);
+  Client client(options(d));
+
+  struct Answer {
+    int fd;
+    std::string attributes;
+    std::optional<tavix::client::Error> error;
+  };
+  auto ask = [&](const std::string& identifier) {
+    std::promise<Answer> done;
+    client.fileHandleForResource(identifier, [&](int fd, std::string attributes, auto error) {
+      done.set_value({fd, std::move(attributes), std::move(error)});
+    });
+    return done.get_future().get();
+  };
+  auto found = ask("dictionary_resources_url");
+  ASSERT_FALSE(found.error) << found.error->describe() << d.log();
+  ASSERT_GE(found.fd, 0);
+  EXPECT_EQ(fcntl(found.fd, F_GETFL) & O_ACCMODE, O_RDONLY);
+  char buffer[64] = {};
+  EXPECT_EQ(read(found.fd, buffer, sizeof buffer), 6);
+  EXPECT_STREQ(buffer, "[\"wn\"]");
+  close(found.fd);
+  EXPECT_NE(found.attributes.find("<key>fileSize</key>"), std::string::npos) << found.attributes;
+  EXPECT_NE(found.attributes.find("<integer>6</integer>"), std::string::npos) << found.attributes;
+
+  for (const char* identifier : {"missing", "../outside"}) {
+    auto refused = ask(identifier);
+    EXPECT_EQ(refused.fd, -1) << identifier;
+    ASSERT_TRUE(refused.error) << identifier;
+    EXPECT_EQ(refused.error->domain, "kTVXErrorDomain");
+    EXPECT_EQ(refused.error->code, 404) << identifier;
+  }
+
+  std::string out;
+  EXPECT_EQ(runTool("resources cat dictionary_resources_url", &out), 0) << out;
+  EXPECT_EQ(out, "[\"wn\"]");
+  EXPECT_EQ(d.stop(), 0) << d.log();
 }
 
 }  // namespace

@@ -33,7 +33,8 @@ class TavixPersistentStorage;
 class EngagedCompletionCache;
 class LocationManager;
 class MotionManager;
-class ResourceVersions;
+class ResourceVersionsProvider;
+class DownloadManager;
 
 struct Assembly {
   Assembly() = default;
@@ -63,10 +64,10 @@ struct Assembly {
   std::shared_ptr<UploadManager> uploadManager;
   std::shared_ptr<TavixPersistentStorage> persistentStorage;
   std::shared_ptr<TavixUserGUIDController> guidController;
-  // Made before every object that opens feedback sessions: each keeps the provider it was made with
-  // (the session manager and bag controller through `feedback`), and the download manager fills
-  // this one once it knows the versions.
-  std::shared_ptr<ResourceVersions> resourceVersions;
+  // Made before every object that opens feedback sessions: each keeps the resource-versions
+  // provider it was made with (the session manager and bag controller through `feedback`).
+  std::shared_ptr<DownloadManager> downloadManager;
+  std::shared_ptr<ResourceVersionsProvider> resourceVersions;
   // What feedback sessions are opened with, once the storage, GUID controller and resource versions
   // exist.
   FeedbackEnvironment feedback;

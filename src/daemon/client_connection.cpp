@@ -26,6 +26,7 @@
 #include "platform/notification_center.h"
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
+#include "resources/download_manager.h"
 #include "tavix_proto/ipc.pb.h"
 
 namespace tavix {
@@ -94,6 +95,17 @@ void sendToClient(platform::ipc::IpcConnection& connection, std::string bytes,
   if (connection.send(std::move(bytes), std::move(fds))) return;
   connectionLog().error("(pid:{}) remote proxy error: {}", connection.peer().pid,
                         connection.isValid() ? "message too large" : "connection invalidated");
+}
+
+// Answers `callId` with `out` and `fd` attached; a message without a call id gets no answer.
+void answerWithDescriptor(platform::ipc::IpcConnection& connection, std::uint64_t callId, proto::Envelope& out,
+                          platform::ipc::UniqueFd fd) {
+  if (callId == 0) return;
+  out.set_attached_fds(1);
+  out.set_call_id(callId);
+  std::vector<platform::ipc::UniqueFd> fds;
+  fds.push_back(std::move(fd));
+  sendToClient(connection, out.SerializeAsString(), std::move(fds));
 }
 
 void setError(proto::TVXError* error, std::int64_t code, const std::string& reason) {
@@ -276,7 +288,7 @@ void ClientConnection::handleIncomingMessage(const std::string& payload) {
     case proto::Envelope::kFeedback: return feedback(callId);
     case proto::Envelope::kListenToFlusher: return listenToFlusher(callId);
     case proto::Envelope::kListSessions: return listSessions(callId);
-    case proto::Envelope::kFileHandleAndAttributesForResource: return fileHandleAndAttributesForResource(callId);
+    case proto::Envelope::kFileHandleAndAttributesForResource: return fileHandleAndAttributesForResource(callId, in);
     case proto::Envelope::kGetImageMap: return getImageMap(callId);
     case proto::Envelope::kReportFeedbackPayloadData:
       return reportFeedbackPayloadData(in.report_feedback_payload_data().data(),
@@ -286,6 +298,7 @@ void ClientConnection::handleIncomingMessage(const std::string& payload) {
     case proto::Envelope::kUpdateParameters: return engagedCompletionMessage(in);
     case proto::Envelope::kNotify: return notify(callId, in);
     case proto::Envelope::kRunActivity: return runActivity(callId, in);
+    case proto::Envelope::kListResources: return listResources(callId);
     default: return unknownMessage(callId, in);
   }
 }
@@ -314,13 +327,8 @@ void ClientConnection::listenToFlusher(std::uint64_t callId) {
     setError(answer->mutable_error(), 500, "not available");
     return reply(callId, out);
   }
-  if (callId == 0) return;
   answer->set_has_endpoint(true);
-  out.set_attached_fds(1);
-  out.set_call_id(callId);
-  std::vector<platform::ipc::UniqueFd> fds;
-  fds.push_back(std::move(endpoint));
-  sendToClient(*connection_, out.SerializeAsString(), std::move(fds));
+  answerWithDescriptor(*connection_, callId, out, std::move(endpoint));
 }
 
 void ClientConnection::listSessions(std::uint64_t callId) {
@@ -331,10 +339,49 @@ void ClientConnection::listSessions(std::uint64_t callId) {
   reply(callId, out);
 }
 
-void ClientConnection::fileHandleAndAttributesForResource(std::uint64_t callId) {
+void ClientConnection::fileHandleAndAttributesForResource(std::uint64_t callId, const proto::Envelope& in) {
   ensureState();
   proto::Envelope out;
-  setError(out.mutable_file_handle_and_attributes_for_resource_reply()->mutable_error(), 500, "not available");
+  auto* answer = out.mutable_file_handle_and_attributes_for_resource_reply();
+  if (!env_->downloads) {
+    setError(answer->mutable_error(), 500, "not available");
+    return reply(callId, out);
+  }
+  const std::string& identifier = in.file_handle_and_attributes_for_resource().identifier();
+  platform::Dictionary attributes;
+  TVXError error;
+  auto fd = env_->downloads->fileHandleForResource(identifier, &attributes, &error);
+  if (!fd.valid()) {
+    setError(answer->mutable_error(), error.code, error.reason);
+    return reply(callId, out);
+  }
+  answer->set_has_file_handle(true);
+  answer->set_attributes_plist(platform::toXmlPlist(attributes));
+  // The open file rides with the reply: the client reads it without any access to our folder.
+  answerWithDescriptor(*connection_, callId, out, std::move(fd));
+}
+
+void ClientConnection::listResources(std::uint64_t callId) {
+  proto::Envelope out;
+  auto* answer = out.mutable_list_resources_reply();
+  if (!env_->downloads) {
+    setError(answer->mutable_error(), 500, "not available");
+    return reply(callId, out);
+  }
+  for (const auto& status : env_->downloads->resourceStatuses()) {
+    auto* r = answer->add_resources();
+    r->set_identifier(status.identifier);
+    r->set_url(status.url);
+    r->set_version(status.version);
+    r->set_has_file(status.fileSize.has_value());
+    r->set_file_size(status.fileSize.value_or(0));
+    if (status.fileModificationDate) r->set_file_modification_date(platform::toUnixSeconds(*status.fileModificationDate));
+    r->set_downloading(status.downloading);
+    r->set_download_started(status.downloadStarted);
+    if (status.downloadBeginDate) r->set_download_begin_date(platform::toUnixSeconds(*status.downloadBeginDate));
+    r->set_bytes_received(status.bytesReceived);
+    r->set_bytes_expected(status.bytesExpected);
+  }
   reply(callId, out);
 }
 

@@ -26,6 +26,7 @@
 
 namespace tavix {
 
+class DownloadManager;
 class ClientSessionManager;
 class ClientState;
 class ClientStateManager;
@@ -76,6 +77,8 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
     platform::fs::path cachesFolder;  // where completion-feature files are written
     // Hands the tool its end of the flush command channel; null: "not available".
     std::shared_ptr<TavixFlusherIPC> flusher;
+    // The bag's resource files; null: resource calls answer "not available".
+    std::shared_ptr<DownloadManager> downloads;
   };
   ClientConnection(std::shared_ptr<const Environment> env, std::shared_ptr<platform::ipc::IpcConnection> connection);
   ~ClientConnection();
@@ -130,8 +133,9 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void request(std::uint64_t callId, const proto::Envelope& in);
   void listenToFlusher(std::uint64_t callId);
   void listSessions(std::uint64_t callId);
-  void fileHandleAndAttributesForResource(std::uint64_t callId);
+  void fileHandleAndAttributesForResource(std::uint64_t callId, const proto::Envelope& in);
   void getImageMap(std::uint64_t callId);
+  void listResources(std::uint64_t callId);
   void notify(std::uint64_t callId, const proto::Envelope& in);
   void runActivity(std::uint64_t callId, const proto::Envelope& in);
   void unknownMessage(std::uint64_t callId, const proto::Envelope& in);

@@ -43,6 +43,7 @@
 #include "platform/service_manager.h"
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
+#include "resources/download_manager.h"
 #include "platform/transactions.h"
 
 namespace tavix {
@@ -50,6 +51,9 @@ namespace tavix {
 using platform::PropertyValue;
 
 namespace {
+
+// The defaults suite the look-up panel shares with the daemon.
+constexpr const char* kLookupSharedDomain = "com.norvel.lookup.shared";
 
 // How often the background activities fall due.
 constexpr double kFlusherIntervalSeconds = 3600;
@@ -128,7 +132,7 @@ void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform
       {&pool, &clock, assembly.userDefaults, assembly.notificationCenter, assembly.cachesFolder()}, std::move(providers));
   assembly.engagedCompletionCache =
       EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, assembly.userDefaults.get()});
-  // The download manager's, when there is one.
+  // The download manager's.
   assembly.downloadSession = std::make_shared<platform::http::URLSession>(downloadSessionConfiguration());
   assembly.uploadSession = std::make_shared<platform::http::URLSession>(uploadSessionConfiguration());
   auto uploads = BackgroundUploadSession::create(assembly.uploadSession, assembly.cachesFolder() / "UploadJournal", pool);
@@ -138,9 +142,6 @@ void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform
       assembly.cachesFolder(), &pool, &clock, assembly.userDefaults.get(), assembly.transactions});
   // Before the bag controller and the session manager, which stamp their feedback with its GUID.
   assembly.guidController = std::make_shared<TavixUserGUIDController>(pool, clock, assembly.notificationCenter);
-  assembly.resourceVersions = std::make_shared<ResourceVersions>();
-  assembly.feedback = {&pool, &clock, assembly.userDefaults, assembly.persistentStorage, assembly.guidController,
-                       assembly.resourceVersions};
 }
 
 // The bag controller and its session; fetch records go to sessions of their own.
@@ -158,6 +159,35 @@ void assembleFeedbackServices(Assembly& assembly) {
                        assembly.userDefaults->boolForKey("TVXSharedSession")};
   assembly.clientSessionManager =
       std::make_shared<ClientSessionManager>(assembly.sessions, assembly.guidController, assembly.bagController, "tavix");
+}
+
+// Before the bag controller and the session manager, which take the resource versions with the
+// feedback environment made here. Downloads an earlier run left in the journal resume here.
+void assembleDownloadManager(Assembly& assembly, platform::DispatchPool& pool, platform::Clock& clock) {
+  DownloadManager::Environment env;
+  env.pool = &pool;
+  env.clock = &clock;
+  env.center = assembly.notificationCenter;
+  env.defaults = assembly.userDefaults;
+  env.cachesFolder = assembly.cachesFolder();
+  env.session = platform::http::BackgroundDownloadSession::create(
+      assembly.downloadSession, assembly.cachesFolder() / "DownloadJournal", pool, clock,
+      TavixLogForCategory(TavixLoggingCategoryDownloadManager));
+  env.fileDownloadRequest = [factory = assembly.requestFactory](const std::string& url,
+                                                                std::optional<std::string> version, bool latLong) {
+    return factory->fileDownloadRequest(url, std::move(version), latLong);
+  };
+  // Read fresh each time: the look-up panel's settings switch it while we run.
+  env.lookupEnabled = [defaults = assembly.userDefaults] {
+    return !defaults->suite(kLookupSharedDomain)->boolForKey("LookupSuggestionsDisabled");
+  };
+  env.reportError = [&assembly](int code, const std::string& domain, const std::string& reason) {
+    if (assembly.clientSessionManager) assembly.clientSessionManager->reportErrorAsTavixdFeedback(code, domain, reason);
+  };
+  assembly.downloadManager = DownloadManager::create(std::move(env));
+  assembly.resourceVersions = assembly.downloadManager;
+  assembly.feedback = {&pool, &clock, assembly.userDefaults, assembly.persistentStorage, assembly.guidController,
+                       assembly.resourceVersions};
 }
 
 // Topic weights a person or another program left for us; any property-list value, sent as JSON.
@@ -259,6 +289,7 @@ void fillConnectionEnvironment(ClientConnection::Environment& env, const Assembl
   env.feedback = assembly.feedback;
   env.cachesFolder = assembly.cachesFolder();
   env.flusher = assembly.flusherIPCListener;
+  env.downloads = assembly.downloadManager;
 }
 
 // Socket activation hands the listening socket over; otherwise we make our own at `socketPath`.
@@ -393,6 +424,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   assembly.paths = paths;
   assembly.userDefaults = defaults;
   assembleServices(assembly, pool, clock);
+  assembleDownloadManager(assembly, pool, clock);
 
   const auto countersFile = assembly.cachesFolder() / "counters.plist";
   auto& counters = TavixDiagnosticDataReporter::store();
