@@ -15,7 +15,6 @@
 #include <vector>
 
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
 #include "feedback/client_session_manager.h"
 #include "feedback/persistent_storage.h"
 #include "platform/clock.h"

@@ -12,7 +12,6 @@
 #include <string>
 #include <vector>
 
-#include "core/assembly.h"
 #include "delivery/output_stream.h"
 #include "feedback/client_session.h"
 #include "feedback/persistent_storage.h"

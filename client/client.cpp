@@ -346,6 +346,30 @@ void Client::listenToFlusher(std::function<void(int fd, std::optional<Error>)> r
   });
 }
 
+void Client::fileHandleForResource(const std::string& identifier,
+                                   std::function<void(int fd, std::string attributesPlist, std::optional<Error>)> reply) {
+  proto::Envelope message;
+  message.mutable_file_handle_and_attributes_for_resource()->set_identifier(identifier);
+  callWithDescriptors(std::move(message), [reply = std::move(reply)](const proto::Envelope* in, std::vector<int> fds,
+                                                                     std::optional<Error> error) {
+    int file = -1;
+    std::string attributes;
+    if (!error && !in->has_file_handle_and_attributes_for_resource_reply()) {
+      error = clientError(kProtocol, "unexpected reply");
+    }
+    const auto* r = error ? nullptr : &in->file_handle_and_attributes_for_resource_reply();
+    if (r && r->has_error()) error = Error::fromProto(r->error());
+    if (!error && (!r->has_file_handle() || fds.empty())) error = clientError(kProtocol, "reply without a file");
+    if (!error) {
+      file = fds.front();
+      fds.erase(fds.begin());
+      attributes = r->attributes_plist();
+    }
+    for (int fd : fds) ::close(fd);
+    reply(file, std::move(attributes), std::move(error));
+  });
+}
+
 bool Client::post(proto::Envelope message) {
   std::shared_ptr<Impl::Link> target;
   {

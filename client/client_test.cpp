@@ -182,20 +182,5 @@ TEST(Client, ACallWithoutAnAnswerFailsAtItsDeadlineOnceAndTheLateAnswerIsDropped
   EXPECT_EQ(calls, 1);
 }
 
-TEST(Client, FailsPendingCallsOnceWhenTheServerDropsThemAndWithoutReconnectStaysDown) {
-  testing::TempHome home;
-  auto server = std::make_unique<ScriptedServer>(home);
-  auto options = optionsFor(*server);
-  options.reconnect = false;
-  Client client(options);
-  ASSERT_FALSE(client.connect());
-  server.reset();  // every connection invalidated, the socket removed
-  EXPECT_TRUE(testing::waitFor([&] { return !client.isConnected(); }));
-  auto error = client.notifySync("x");
-  ASSERT_TRUE(error);
-  EXPECT_EQ(error->domain, kClientErrorDomain);
-  EXPECT_EQ(error->code, kConnectionLost);
-}
-
 }  // namespace
 }  // namespace tavix::client

@@ -1,16 +1,9 @@
 // tavixd and the tavix-devserver program, both real processes: the bag fetched at start, kept on
 // disk and served again after a restart. Expiry and failed fetches are the bag controller's cases.
-#include <poll.h>
-#include <signal.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <gtest/gtest.h>
 
-#include <thread>
-
-#include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
 #include "platform/files.h"
@@ -24,7 +17,6 @@
 namespace {
 
 using namespace tavix::platform;
-
 
 class BagDaemonTest : public ::testing::Test {
  protected:

@@ -25,16 +25,12 @@
 
 namespace {
 
-struct Daemon : tavix::testing::DaemonProcess {
-  Daemon(const tavix::testing::TempHome& home, std::vector<std::string> args, const std::string& logName,
-         const std::function<void()>& inChild = {})
-      : DaemonProcess(TAVIXD_BINARY, home, std::move(args), logName, inChild) {}
-};
+using tavix::testing::DaemonProcess;
 
 TEST(DaemonStartup, CreatesItsFoldersLogsItsStartAndExitsCleanlyOnSigterm) {
   tavix::testing::TempHome home;
   {
-    Daemon d(home, {"--log-level", "debug"}, "first.log");
+    DaemonProcess d(TAVIXD_BINARY, home, {"--log-level", "debug"}, "first.log");
     ASSERT_TRUE(d.waitForLog("tavixd started")) << d.log();
     for (const char* name : {"BrovaneAutoFill", "SeekaraResultFeatures", "BrovaneAutoPlay", "Quillet",
                              "EngagedCompletion", "ProactiveEventTracker"}) {
@@ -44,7 +40,7 @@ TEST(DaemonStartup, CreatesItsFoldersLogsItsStartAndExitsCleanlyOnSigterm) {
     EXPECT_EQ(d.waitExit(10000), 0) << d.log();
   }
   {
-    Daemon d(home, {}, "second.log");
+    DaemonProcess d(TAVIXD_BINARY, home, {}, "second.log");
     ASSERT_TRUE(d.waitForLog("tavixd started")) << d.log();
     d.signal(SIGINT);
     EXPECT_EQ(d.waitExit(10000), 0);
@@ -60,19 +56,19 @@ TEST(DaemonStartup, CreatesItsFoldersLogsItsStartAndExitsCleanlyOnSigterm) {
 
 TEST(DaemonStartup, ExitsByItselfWhenIdleAndRejectsBadFlags) {
   tavix::testing::TempHome home;
-  Daemon idle(home, {"--exit-when-idle", "0.3"}, "idle.log");
+  DaemonProcess idle(TAVIXD_BINARY, home, {"--exit-when-idle", "0.3"}, "idle.log");
   // The start-up bag fetch fails and is retried for about 8 s; its transaction holds the daemon.
   EXPECT_EQ(idle.waitExit(12000), 0) << idle.log();
   EXPECT_NE(idle.log().find("exiting"), std::string::npos);
 
   // A socket it cannot make ends the daemon the orderly way: services stopped, counters saved.
   std::ofstream(home.root() / "plain-file") << "not a folder";
-  Daemon deaf(home, {"--socket", (home.root() / "plain-file" / "socket").string()}, "deaf.log");
+  DaemonProcess deaf(TAVIXD_BINARY, home, {"--socket", (home.root() / "plain-file" / "socket").string()}, "deaf.log");
   EXPECT_EQ(deaf.waitExit(12000), 1) << deaf.log();
   EXPECT_NE(deaf.log().find("cannot listen on"), std::string::npos) << deaf.log();
   EXPECT_NE(deaf.log().find("tavixd stopped"), std::string::npos) << deaf.log();
 
-  Daemon bad(home, {"--log-level", "loud"}, "bad.log");
+  DaemonProcess bad(TAVIXD_BINARY, home, {"--log-level", "loud"}, "bad.log");
   EXPECT_EQ(bad.waitExit(3000), 2);
   EXPECT_NE(bad.log().find("unknown log level 'loud'"), std::string::npos);
 }
@@ -127,7 +123,7 @@ TEST(DaemonStartup, ServesTheActivatedSocketAndTellsTheServiceManagerItsState) {
   tavix::platform::ipc::UniqueFd listening;
   ASSERT_FALSE(tavix::platform::ipc::listenAt(socketPath.string(), &listening));
   DatagramSocket notify(home.root() / "notify");
-  Daemon d(home, {"--log-level", "debug"}, "activated.log", [&] {
+  DaemonProcess d(TAVIXD_BINARY, home, {"--log-level", "debug"}, "activated.log", [&] {
     ::dup2(listening.get(), 3);  // dup2 leaves close-on-exec off
     ::setenv("LISTEN_PID", std::to_string(::getpid()).c_str(), 1);
     ::setenv("LISTEN_FDS", "1", 1);
@@ -191,7 +187,7 @@ std::map<std::string, std::string> journalFields(const std::string& entry) {
 TEST(DaemonStartup, LogsToTheJournalWithPrioritiesAndTheCategoryInAFieldOfItsOwn) {
   tavix::testing::TempHome home;
   DatagramSocket journal(home.root() / "journal");
-  Daemon d(home, {"--log-level", "debug"}, "journal.log", [&] { redirectJournalTo(journal.path()); });
+  DaemonProcess d(TAVIXD_BINARY, home, {"--log-level", "debug"}, "journal.log", [&] { redirectJournalTo(journal.path()); });
   std::vector<std::string> entries;
   const auto started = journal.receiveUntil("MESSAGE=tavixd started", &entries);
   if (!started && d.waitExit(0) == 77) GTEST_SKIP() << "no private mount namespace for a journal of our own";

@@ -21,8 +21,8 @@
 #include "feedback/persistent_storage.h"
 #include "bagview/user_agent.h"
 #include "platform/dispatch.h"
-#include "support/daemon_process.h"
 #include "support/raw_frames.h"
+#include "support/tavixd.h"
 #include "support/test_seed.h"
 #include "tavix_proto/feedback_session.pb.h"
 #include "tavix_proto/ipc.pb.h"
@@ -35,12 +35,7 @@ constexpr std::uint64_t kMaxFileSize = 2097152;
 
 std::string agentName(int i) { return "reliability-" + std::to_string(i) + "/1.0"; }
 
-struct Daemon : testing::DaemonProcess {
-  std::string socket;
-  Daemon(const testing::TempHome& home, const std::string& logName)
-      : DaemonProcess(TAVIXD_BINARY, home, {"--log-level", "debug"}, logName),
-        socket((home.runtime() / "com.norvel.tavixd" / "socket").string()) {}
-};
+using Daemon = testing::Tavixd;
 
 // Connects, says who it is, waits for the answer and hangs up: the daemon then records the
 // connection's invalidation as feedback of that agent. False when the daemon is not there.
@@ -130,7 +125,6 @@ TEST(FeedbackReliability, SessionFilesSurviveAKillAtAnyPoint) {
   for (int round = 0; round < 6; ++round) {
     const std::string logName = "round" + std::to_string(round) + ".log";
     auto daemon = std::make_unique<Daemon>(home, logName);
-    ASSERT_TRUE(daemon->waitForLog("tavixd started")) << daemon->log();
 
     // Clients come and go on two threads until the daemon dies under them.
     std::atomic<bool> stop{false};
@@ -193,7 +187,6 @@ TEST(FeedbackReliability, SessionFilesSurviveAKillAtAnyPoint) {
 
   // The last restart finds every file of the earlier runs and goes on.
   Daemon last(home, "last.log");
-  ASSERT_TRUE(last.waitForLog("tavixd started")) << last.log();
   ASSERT_TRUE(connectAndLeave(last.socket, agentName(0)));
   ASSERT_TRUE(last.waitForLog("new file url")) << last.log();
   const auto reported = reportedFiles(last.log());

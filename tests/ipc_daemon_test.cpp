@@ -2,22 +2,23 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/socket.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <filesystem>
 #include <fstream>
 #include <future>
+#include <optional>
 #include <string>
 #include <vector>
 
 #include "cache/engaged_completion_cache.h"
 #include "platform/clock.h"
 #include "platform/dispatch.h"
-#include "support/daemon_process.h"
 #include "support/raw_frames.h"
+#include "support/tavixd.h"
 #include "tavix/client.h"
 
 namespace {
@@ -28,23 +29,8 @@ using tavix::testing::rawConnect;
 using tavix::testing::rawReceive;
 using tavix::testing::rawSend;
 
-// The daemon with debug logging, once it is up.
-struct Daemon : tavix::testing::DaemonProcess {
-  std::string socket;
-
-  explicit Daemon(const tavix::testing::TempHome& home, const std::string& logName = "tavixd.log",
-                  std::vector<std::string> extra = {})
-      : DaemonProcess(TAVIXD_BINARY, home, withDebugLog(std::move(extra)), logName),
-        socket((home.runtime() / "com.norvel.tavixd" / "socket").string()) {
-    // Up means start-up is complete, signal handling included, not merely that the socket exists.
-    waitForLog("tavixd started");
-  }
-
-  static std::vector<std::string> withDebugLog(std::vector<std::string> extra) {
-    extra.insert(extra.begin(), {"--log-level", "debug"});
-    return extra;
-  }
-};
+using Daemon = tavix::testing::Tavixd;
+using tavix::testing::runTool;
 
 Client::Options options(const Daemon& d, std::string identifier = "tests", std::string userAgent = "tests/1") {
   Client::Options o;
@@ -53,18 +39,6 @@ Client::Options options(const Daemon& d, std::string identifier = "tests", std::
   o.configuration.set_user_agent(std::move(userAgent));
   o.timeoutMs = 5000;
   return o;
-}
-
-// Runs tavix_tool with the test's environment; returns the exit status and fills `out` with stdout
-// and stderr together.
-int runTool(const std::string& args, std::string* out) {
-  const std::string command = std::string(TAVIX_TOOL_BINARY) + " " + args + " 2>&1";
-  FILE* p = popen(command.c_str(), "r");
-  out->clear();
-  char buf[512];
-  while (std::fgets(buf, sizeof buf, p)) *out += buf;
-  const int status = pclose(p);
-  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
 TEST(IpcDaemon, BadFramesAndVanishingClientsDoNotStopTheDaemon) {
@@ -138,14 +112,8 @@ TEST(IpcDaemon, BadConfigurationGetsNoReplyAndAClosedConnection) {
   // Each refusal is recorded as an error in the daemon's own feedback session.
   EXPECT_EQ(d.stop(), 0);
   int recorded = 0;
-  for (const auto& entry : std::filesystem::directory_iterator(home.cache() / "com.norvel.tavixd")) {
-    if (entry.path().filename().string().rfind("session.", 0) != 0) continue;
-    std::ifstream in(entry.path(), std::ios::binary);
-    const std::string bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    for (auto at = bytes.find("invalid configuration"); at != std::string::npos;
-         at = bytes.find("invalid configuration", at + 1)) {
-      ++recorded;
-    }
+  for (const auto& bytes : tavix::testing::sessionFileContents(home)) {
+    recorded += static_cast<int>(tavix::testing::occurrences(bytes, "invalid configuration"));
   }
   EXPECT_EQ(recorded, 3);
 }
@@ -198,7 +166,6 @@ TEST(IpcDaemon, ToolReadsDefaultsAndCountersWithTheDaemonStoppedAndRunsActivitie
 
   {
     Daemon d(home);
-    ASSERT_TRUE(d.waitForLog("tavixd started")) << d.log();
     EXPECT_EQ(runTool("activity run com.norvel.tavixd.dp.flush", &out), 0) << out << d.log();
     EXPECT_TRUE(d.waitForLog("Flushing custom feedback.")) << d.log();
     EXPECT_EQ(runTool("activity run com.norvel.tavixd.nothing", &out), 1);
@@ -236,6 +203,54 @@ TEST(IpcDaemon, ClearDataLaunchEventForgetsTheSystemSearchCompletionsOnly) {
   auto cache = open();
   EXPECT_EQ(cache->rowCountForClient(tavix::kEngagedCompletionClientSeekara), 0);
   EXPECT_EQ(cache->rowCountForClient(tavix::kEngagedCompletionClientBrovane), 1);
+}
+
+// The client reads a resource through the descriptor the daemon opened for it, never by path.
+TEST(IpcDaemon, ResourceFilesTravelAsReadOnlyDescriptors) {
+  tavix::testing::TempHome home;
+  home.exportEnvironment();  // the tool runs in this environment
+  const auto caches = home.cache() / "com.norvel.tavixd";
+  std::filesystem::create_directories(caches);
+  std::ofstream(caches / "dictionary_resources_url") << "[\"wn\"]";
+  std::ofstream(home.cache() / "outside") << "not a resource";
+  Daemon d(home);
+  Client client(options(d));
+
+  struct Answer {
+    int fd;
+    std::string attributes;
+    std::optional<tavix::client::Error> error;
+  };
+  auto ask = [&](const std::string& identifier) {
+    std::promise<Answer> done;
+    client.fileHandleForResource(identifier, [&](int fd, std::string attributes, auto error) {
+      done.set_value({fd, std::move(attributes), std::move(error)});
+    });
+    return done.get_future().get();
+  };
+  auto found = ask("dictionary_resources_url");
+  ASSERT_FALSE(found.error) << found.error->describe() << d.log();
+  ASSERT_GE(found.fd, 0);
+  EXPECT_EQ(fcntl(found.fd, F_GETFL) & O_ACCMODE, O_RDONLY);
+  char buffer[64] = {};
+  EXPECT_EQ(read(found.fd, buffer, sizeof buffer), 6);
+  EXPECT_STREQ(buffer, "[\"wn\"]");
+  close(found.fd);
+  EXPECT_NE(found.attributes.find("<key>fileSize</key>"), std::string::npos) << found.attributes;
+  EXPECT_NE(found.attributes.find("<integer>6</integer>"), std::string::npos) << found.attributes;
+
+  for (const char* identifier : {"missing", "../outside"}) {
+    auto refused = ask(identifier);
+    EXPECT_EQ(refused.fd, -1) << identifier;
+    ASSERT_TRUE(refused.error) << identifier;
+    EXPECT_EQ(refused.error->domain, "kTVXErrorDomain");
+    EXPECT_EQ(refused.error->code, 404) << identifier;
+  }
+
+  std::string out;
+  EXPECT_EQ(runTool("resources cat dictionary_resources_url", &out), 0) << out;
+  EXPECT_EQ(out, "[\"wn\"]");
+  EXPECT_EQ(d.stop(), 0) << d.log();
 }
 
 }  // namespace

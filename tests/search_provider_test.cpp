@@ -28,21 +28,12 @@ constexpr const char* kName = "com.norvel.tavixd.SearchProvider";
 constexpr const char* kPath = "/com/norvel/tavixd/SearchProvider";
 constexpr const char* kInterface = "org.gnome.Shell.SearchProvider2";
 
-std::optional<std::string> findProgram(const std::string& name) {
-  const char* path = std::getenv("PATH");
-  std::istringstream dirs(path ? path : "/usr/bin:/bin");
-  for (std::string dir; std::getline(dirs, dir, ':');) {
-    const auto candidate = std::filesystem::path(dir) / name;
-    if (::access(candidate.c_str(), X_OK) == 0) return candidate.string();
-  }
-  return std::nullopt;
-}
+constexpr const char* kDbusDaemon = "/usr/bin/dbus-daemon";  // from the bootstrap's dbus-daemon package
 
 class SearchProviderTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    const auto dbusDaemon = findProgram("dbus-daemon");
-    if (!dbusDaemon) GTEST_SKIP() << "dbus-daemon is not installed";
+    if (::access(kDbusDaemon, X_OK) != 0) GTEST_SKIP() << "dbus-daemon is not installed";
     ASSERT_FALSE(server.base.empty()) << server.firstLine;
     {
       platform::UserDefaults defaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
@@ -55,7 +46,7 @@ class SearchProviderTest : public ::testing::Test {
     ASSERT_TRUE(tavixd->waitForLog("bag change notification received", 10000)) << tavixd->log();
 
     // A private session bus; it prints its address first.
-    bus.emplace(*dbusDaemon, home,
+    bus.emplace(kDbusDaemon, home,
                 std::vector<std::string>{"--session", "--print-address=2", "--nofork", "--nopidfile"}, "bus.log");
     ASSERT_TRUE(bus->waitForLog("unix:")) << bus->log();
     const std::string log = bus->log();
@@ -150,12 +141,9 @@ class SearchProviderTest : public ::testing::Test {
   // The result engagements in the session files the daemon has written.
   std::vector<proto::CTResultEngagementFeedback> writtenEngagements() {
     std::vector<proto::CTResultEngagementFeedback> found;
-    std::error_code ec;
-    for (const auto& e : std::filesystem::directory_iterator(home.cache() / "com.norvel.tavixd", ec)) {
-      if (e.path().filename().string().rfind("session.", 0) != 0) continue;
-      std::ifstream in(e.path(), std::ios::binary);
+    for (const auto& bytes : tavix::testing::sessionFileContents(home)) {
       proto::CTClientSession session;
-      if (!session.ParseFromIstream(&in)) continue;
+      if (!session.ParseFromString(bytes)) continue;
       for (const auto& f : session.feedbacks()) {
         if (f.payload().has_result_engagement()) found.push_back(f.payload().result_engagement());
       }

@@ -10,7 +10,6 @@
 
 #include "bagview/tvx_bag.h"
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "core/names.h"
@@ -403,7 +402,7 @@ void TavixBagController::runFetch(std::optional<std::string> version, Completion
   std::weak_ptr<TavixBagController> weak = weak_from_this();
   auto retryClock = retryClock_;
   auto task = dataTaskWithRetryableRequest(
-      env_.bagSession(), retryable, 1, kFetchRetries, *retryClock, retryQueue_,
+      env_.session, retryable, 1, kFetchRetries, *retryClock, retryQueue_,
       [weak, retryClock, session, start, completion = std::move(completion)](
           std::string data, std::optional<platform::http::HTTPURLResponse> response,
           std::optional<platform::http::URLError> error, const platform::http::URLSessionTaskMetrics& metrics) {
@@ -550,16 +549,6 @@ void TavixBagController::cacheBagState(std::shared_ptr<const TVXBag> bag, bool f
       center.post(newNews == 1 ? kTVXNotifyEnabled : kTVXNotifyDisabled, this);
     }
   });
-}
-
-TavixBagController::Environment bagControllerEnvironment(const Assembly& assembly) {
-  return {feedbackEnvironment(assembly),
-          assembly.transactions,
-          assembly.notificationCenter,
-          assembly.requestFactory,
-          [&assembly] { return assembly.bagSession(); },
-          assembly.paths.cacheHome,
-          assembly.cachesFolder()};
 }
 
 }  // namespace tavix

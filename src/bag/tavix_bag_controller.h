@@ -37,7 +37,6 @@ namespace platform::http {
 class URLSession;
 }
 
-class Assembly;
 class TVXBag;
 namespace proto {
 class CTTavixFeedback;
@@ -48,7 +47,7 @@ class Message;
 }
 namespace tavix {
 
-// News availability, posted on the assembly's notification centre when a fetched bag turns the
+// News availability, posted on the daemon's notification centre when a fetched bag turns the
 // news reader's feature on or off.
 inline constexpr const char* kTVXNotifyEnabled = "com.norvel.tavix.news.enabled";
 inline constexpr const char* kTVXNotifyDisabled = "com.norvel.tavix.news.disabled";
@@ -82,9 +81,9 @@ class TavixBagController final : public TVXBagURLSource,
     platform::TransactionTracker* transactions = nullptr;  // may be null
     std::shared_ptr<platform::NotificationCenter> center;
     std::shared_ptr<TVXNetworkRequestFactory> requestFactory;
-    // Called at each fetch: the session is made on first use, and its owner cancels what is
-    // still on the wire before the services a completion reaches go.
-    std::function<std::shared_ptr<platform::http::URLSession>()> bagSession;
+    // The bag's own session. Its owner cancels what is still on the wire before the services a
+    // completion reaches go.
+    std::shared_ptr<platform::http::URLSession> session;
     platform::fs::path cacheHome;     // the user's caches directory; made when missing
     platform::fs::path cachesFolder;  // the daemon's folder in it, where the bag is kept
   };
@@ -120,7 +119,7 @@ class TavixBagController final : public TVXBagURLSource,
   bool isRefreshRequiredForCachedBag(const platform::Dictionary& rawBag);
 
   // From now on no fetch starts and a fetch still in flight completes without touching the
-  // assembly: for shutdown, before the assembly's services go. Waits for a completion running now.
+  // daemon's services: for shutdown, before those services go. Waits for a completion running now.
   void invalidate();
 
   std::shared_ptr<const TVXBag> inMemoryBag() override;
@@ -147,7 +146,7 @@ class TavixBagController final : public TVXBagURLSource,
   platform::ReaderWriterQueue inMemoryBagCacheAccessQueue_;
   class RetryClock;
   // Pauses between retries of a fetch run here, timed by the retry clock. A retry loop may
-  // outlive the controller (the bag session is process-wide); once the controller is invalidated
+  // outlive the controller (the bag session is shared with its owner); once the controller is invalidated
   // or gone the clock drops every pause, so the loop ends without touching the queue.
   platform::SerialQueue retryQueue_;
   std::shared_ptr<RetryClock> retryClock_;
@@ -161,8 +160,5 @@ class TavixBagController final : public TVXBagURLSource,
   std::unique_ptr<platform::TransactionTracker::Transaction> fetchTransaction_;
   platform::NotificationCenter::Registration refreshRegistration_;
 };
-
-// The assembly's services, for the callers that still find their peers there.
-TavixBagController::Environment bagControllerEnvironment(const Assembly& assembly);
 
 }  // namespace tavix

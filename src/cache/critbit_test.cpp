@@ -25,60 +25,6 @@ std::vector<std::string> keysWithPrefix(CritbitTree& tree, const std::string& pr
   return keys;
 }
 
-int countCalls(const char*, void* arg) {
-  ++*static_cast<int*>(arg);
-  return 1;
-}
-
-TEST(CritbitRecord, ResultCodesOfInsertContainsAndDelete) {
-  critbit_tree tree;
-  int a = 0, b = 0;
-  EXPECT_EQ(critbit_contains(&tree, "x", nullptr), 0);
-  EXPECT_EQ(critbit_delete(&tree, "x"), 0);
-  EXPECT_EQ(critbit_insert(&tree, "ab", &a, 1), 2);
-  EXPECT_EQ(critbit_insert(&tree, "abc", &a, 1), 2);
-  EXPECT_EQ(critbit_insert(&tree, "ab", &a, 1), 0);  // same value
-  EXPECT_EQ(critbit_insert(&tree, "ab", &b, 0), 1);  // different value, not replaced
-  void* out = nullptr;
-  ASSERT_EQ(critbit_contains(&tree, "ab", &out), 1);
-  EXPECT_EQ(out, &a);
-  EXPECT_EQ(critbit_insert(&tree, "ab", &b, 1), 1);
-  ASSERT_EQ(critbit_contains(&tree, "ab", &out), 1);
-  EXPECT_EQ(out, &b);
-  EXPECT_EQ(tree.count, 2u);
-  EXPECT_EQ(critbit_contains(&tree, "a", nullptr), 0);
-  EXPECT_EQ(critbit_contains(&tree, "abcd", nullptr), 0);
-
-  EXPECT_EQ(critbit_delete(&tree, "ab"), 1);
-  EXPECT_EQ(critbit_delete(&tree, "ab"), 0);
-  EXPECT_EQ(critbit_contains(&tree, "abc", nullptr), 1);
-  EXPECT_EQ(tree.count, 1u);
-  EXPECT_EQ(critbit_delete(&tree, "abc"), 1);
-  EXPECT_EQ(tree.root, 0u);
-  EXPECT_EQ(tree.count, 0u);
-  EXPECT_EQ(critbit_insert(&tree, "again", &a, 1), 2);
-  EXPECT_EQ(critbit_contains(&tree, "again", nullptr), 1);
-  critbit_clear(&tree);
-  EXPECT_EQ(tree.root, 0u);
-}
-
-TEST(CritbitRecord, PrefixEnumerationResultCodes) {
-  critbit_tree tree;
-  int v = 0;
-  for (const char* k : {"", "a", "ab", "abc", "b"}) critbit_insert(&tree, k, &v, 1);
-  int calls = 0;
-  EXPECT_EQ(critbit_allprefixed(&tree, "ab", countCalls, &calls), 1);
-  EXPECT_EQ(calls, 2);
-  calls = 0;
-  EXPECT_EQ(critbit_allprefixed(&tree, "abcdef", countCalls, &calls), 1);
-  EXPECT_EQ(critbit_allprefixed(&tree, "zz", countCalls, &calls), 1);
-  EXPECT_EQ(calls, 0);
-  EXPECT_EQ(critbit_allprefixed(&tree, nullptr, countCalls, &calls), 1);
-  EXPECT_EQ(critbit_allprefixed(&tree, "", [](const char*, void*) { return 0; }, nullptr), 0);
-  EXPECT_EQ(critbit_allprefixed(&tree, "", [](const char*, void*) { return 7; }, nullptr), -1);
-  critbit_clear(&tree);
-}
-
 TEST(CritbitTree, HoldsExactlyOneReferencePerStoredValue) {
   int destroyed = 0;
   {

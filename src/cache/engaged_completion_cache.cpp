@@ -15,7 +15,6 @@
 #include <cstdlib>
 #include <mutex>
 
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "platform/defaults.h"

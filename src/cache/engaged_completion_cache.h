@@ -35,7 +35,6 @@ namespace tavix {
 namespace platform {
 class UserDefaults;
 }
-class Assembly;
 
 // One local completion handed to the search path.
 struct TVXSearchSuggestion {

@@ -87,9 +87,6 @@ TEST(MotionManager, MapsActivitiesInPrecedenceOrderAndStopDropsPendingDeliveries
   EXPECT_EQ(transportationModeForActivity({}), 1);
   EXPECT_EQ(transportationModeForActivity({.stationary = true, .automotive = true}), 2);
   EXPECT_EQ(transportationModeForActivity({.automotive = true, .walking = true}), 6);
-  EXPECT_EQ(transportationModeForActivity({.walking = true, .running = true}), 3);
-  EXPECT_EQ(transportationModeForActivity({.running = true, .cycling = true}), 4);
-  EXPECT_EQ(transportationModeForActivity({.cycling = true}), 5);
 
   testing::TempHome home;
   platform::DispatchPool pool(1);

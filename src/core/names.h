@@ -1,8 +1,11 @@
-// Names the daemon's parts share: the error domain and the notifications they post and observe
-// on the assembly's notification centre. One spelling each, here.
+// Names the daemon's parts share: its domain, the error domain and the notifications they post
+// and observe on the daemon's notification centre. One spelling each, here.
 #pragma once
 
 namespace tavix {
+
+// The application domain of the daemon's defaults and its folder names.
+inline constexpr const char* kTavixdDomain = "com.norvel.tavixd";
 
 inline constexpr const char* kTVXErrorDomain = "kTVXErrorDomain";
 

@@ -1,5 +1,5 @@
-// Who tells feedback sessions which versions of the bag's resource files the device holds. The
-// download manager answers once it exists; until then no one does and sessions carry none.
+// Who tells feedback sessions which versions of the bag's resource files the device holds: the
+// download manager.
 #pragma once
 
 #include <map>

@@ -7,7 +7,6 @@
 #include "bagview/tvx_bag.h"
 #include "cache/query_cache.h"
 #include "cache/engaged_completion_cache.h"
-#include "core/assembly.h"
 #include "core/logging.h"
 #include "core/names.h"
 #include "daemon/wire_records.h"
@@ -27,6 +26,7 @@
 #include "platform/notification_center.h"
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
+#include "resources/download_manager.h"
 #include "tavix_proto/ipc.pb.h"
 
 namespace tavix {
@@ -95,6 +95,17 @@ void sendToClient(platform::ipc::IpcConnection& connection, std::string bytes,
   if (connection.send(std::move(bytes), std::move(fds))) return;
   connectionLog().error("(pid:{}) remote proxy error: {}", connection.peer().pid,
                         connection.isValid() ? "message too large" : "connection invalidated");
+}
+
+// Answers `callId` with `out` and `fd` attached; a message without a call id gets no answer.
+void answerWithDescriptor(platform::ipc::IpcConnection& connection, std::uint64_t callId, proto::Envelope& out,
+                          platform::ipc::UniqueFd fd) {
+  if (callId == 0) return;
+  out.set_attached_fds(1);
+  out.set_call_id(callId);
+  std::vector<platform::ipc::UniqueFd> fds;
+  fds.push_back(std::move(fd));
+  sendToClient(connection, out.SerializeAsString(), std::move(fds));
 }
 
 void setError(proto::TVXError* error, std::int64_t code, const std::string& reason) {
@@ -173,9 +184,9 @@ class ClientConnection::PendingCall {
   platform::ipc::IpcConnection::CallHold hold_;
 };
 
-ClientConnection::ClientConnection(Assembly& assembly, std::shared_ptr<platform::ipc::IpcConnection> connection,
-                                   platform::ipc::LaunchEventRegistry* launchEvents)
-    : assembly_(assembly), connection_(std::move(connection)), launchEvents_(launchEvents) {}
+ClientConnection::ClientConnection(std::shared_ptr<const Environment> env,
+                                   std::shared_ptr<platform::ipc::IpcConnection> connection)
+    : env_(std::move(env)), connection_(std::move(connection)) {}
 
 ClientConnection::~ClientConnection() {
   idleTimer_.cancel();
@@ -184,11 +195,11 @@ ClientConnection::~ClientConnection() {
 
 void ClientConnection::start() {
   std::weak_ptr<ClientConnection> weak = weak_from_this();
-  downloadObserver_ = assembly_.notificationCenter->addObserver(
+  downloadObserver_ = env_->center->addObserver(
       kTVXFileDownloadCompletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
         if (auto self = weak.lock()) self->relayResourceNotification(n, true);
       });
-  deleteObserver_ = assembly_.notificationCenter->addObserver(
+  deleteObserver_ = env_->center->addObserver(
       kTVXFileDeletedNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
         if (auto self = weak.lock()) self->relayResourceNotification(n, false);
       });
@@ -206,7 +217,7 @@ void ClientConnection::relayResourceNotification(const platform::Notification& n
   }
   // Off the poster's thread; the connection is held weakly, so a client gone meanwhile is skipped.
   std::weak_ptr<platform::ipc::IpcConnection> weak = connection_;
-  assembly_.dispatchPool->post([weak, bytes = out.SerializeAsString()]() mutable {
+  env_->pool->post([weak, bytes = out.SerializeAsString()]() mutable {
     if (auto connection = weak.lock()) sendToClient(*connection, std::move(bytes));
   });
 }
@@ -222,15 +233,15 @@ void ClientConnection::invalidated() {
 void ClientConnection::openOrExtendTransaction() {
   idleTimer_.cancel();
   std::weak_ptr<ClientConnection> weak = weak_from_this();
-  idleTimer_ = assembly_.clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(), [weak] {
+  idleTimer_ = env_->clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(), [weak] {
     auto self = weak.lock();
     if (!self) return;
     connectionLog().debug("timing out idle ipc transaction");
     self->closeTransaction(true);
   });
-  if (!transactionOpen_.exchange(true) && assembly_.transactions) {
+  if (!transactionOpen_.exchange(true)) {
     std::lock_guard lock(transactionLock_);
-    transaction_ = assembly_.transactions->begin("com.norvel.tavixd.ipc");
+    transaction_ = env_->transactions->begin("com.norvel.tavixd.ipc");
   }
 }
 
@@ -243,10 +254,10 @@ void ClientConnection::closeTransaction(bool now) {
     std::lock_guard lock(transactionLock_);
     transaction = std::move(transaction_);
   }
-  if (now || !assembly_.clock) return;  // ends here
+  if (now) return;  // ends here
   // The timer holds the IPC connection, whose queue it runs on, until it fires.
   auto held = std::make_shared<platform::TransactionTracker::Transaction>(std::move(transaction));
-  assembly_.clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(),
+  env_->clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(),
                          [held, connection = connection_] { held->reset(); });
 }
 
@@ -277,7 +288,7 @@ void ClientConnection::handleIncomingMessage(const std::string& payload) {
     case proto::Envelope::kFeedback: return feedback(callId);
     case proto::Envelope::kListenToFlusher: return listenToFlusher(callId);
     case proto::Envelope::kListSessions: return listSessions(callId);
-    case proto::Envelope::kFileHandleAndAttributesForResource: return fileHandleAndAttributesForResource(callId);
+    case proto::Envelope::kFileHandleAndAttributesForResource: return fileHandleAndAttributesForResource(callId, in);
     case proto::Envelope::kGetImageMap: return getImageMap(callId);
     case proto::Envelope::kReportFeedbackPayloadData:
       return reportFeedbackPayloadData(in.report_feedback_payload_data().data(),
@@ -287,6 +298,7 @@ void ClientConnection::handleIncomingMessage(const std::string& payload) {
     case proto::Envelope::kUpdateParameters: return engagedCompletionMessage(in);
     case proto::Envelope::kNotify: return notify(callId, in);
     case proto::Envelope::kRunActivity: return runActivity(callId, in);
+    case proto::Envelope::kListResources: return listResources(callId);
     default: return unknownMessage(callId, in);
   }
 }
@@ -310,32 +322,66 @@ void ClientConnection::listenToFlusher(std::uint64_t callId) {
   // The tool's end of a fresh flusher channel rides with the reply.
   auto* answer = out.mutable_listen_to_flusher_reply();
   platform::ipc::UniqueFd endpoint;
-  if (assembly_.flusherIPCListener) endpoint = assembly_.flusherIPCListener->endpoint();
+  if (env_->flusher) endpoint = env_->flusher->endpoint();
   if (!endpoint.valid()) {
     setError(answer->mutable_error(), 500, "not available");
     return reply(callId, out);
   }
-  if (callId == 0) return;
   answer->set_has_endpoint(true);
-  out.set_attached_fds(1);
-  out.set_call_id(callId);
-  std::vector<platform::ipc::UniqueFd> fds;
-  fds.push_back(std::move(endpoint));
-  sendToClient(*connection_, out.SerializeAsString(), std::move(fds));
+  answerWithDescriptor(*connection_, callId, out, std::move(endpoint));
 }
 
 void ClientConnection::listSessions(std::uint64_t callId) {
   ensureState();
   proto::Envelope out;
   auto* answer = out.mutable_list_sessions_reply();
-  for (const auto& session : assembly_.clientStateManager->sessions()) answer->add_sessions(platform::toJson(session));
+  for (const auto& session : env_->clientStates->sessions()) answer->add_sessions(platform::toJson(session));
   reply(callId, out);
 }
 
-void ClientConnection::fileHandleAndAttributesForResource(std::uint64_t callId) {
+void ClientConnection::fileHandleAndAttributesForResource(std::uint64_t callId, const proto::Envelope& in) {
   ensureState();
   proto::Envelope out;
-  setError(out.mutable_file_handle_and_attributes_for_resource_reply()->mutable_error(), 500, "not available");
+  auto* answer = out.mutable_file_handle_and_attributes_for_resource_reply();
+  if (!env_->downloads) {
+    setError(answer->mutable_error(), 500, "not available");
+    return reply(callId, out);
+  }
+  const std::string& identifier = in.file_handle_and_attributes_for_resource().identifier();
+  platform::Dictionary attributes;
+  TVXError error;
+  auto fd = env_->downloads->fileHandleForResource(identifier, &attributes, &error);
+  if (!fd.valid()) {
+    setError(answer->mutable_error(), error.code, error.reason);
+    return reply(callId, out);
+  }
+  answer->set_has_file_handle(true);
+  answer->set_attributes_plist(platform::toXmlPlist(attributes));
+  // The open file rides with the reply: the client reads it without any access to our folder.
+  answerWithDescriptor(*connection_, callId, out, std::move(fd));
+}
+
+void ClientConnection::listResources(std::uint64_t callId) {
+  proto::Envelope out;
+  auto* answer = out.mutable_list_resources_reply();
+  if (!env_->downloads) {
+    setError(answer->mutable_error(), 500, "not available");
+    return reply(callId, out);
+  }
+  for (const auto& status : env_->downloads->resourceStatuses()) {
+    auto* r = answer->add_resources();
+    r->set_identifier(status.identifier);
+    r->set_url(status.url);
+    r->set_version(status.version);
+    r->set_has_file(status.fileSize.has_value());
+    r->set_file_size(status.fileSize.value_or(0));
+    if (status.fileModificationDate) r->set_file_modification_date(platform::toUnixSeconds(*status.fileModificationDate));
+    r->set_downloading(status.downloading);
+    r->set_download_started(status.downloadStarted);
+    if (status.downloadBeginDate) r->set_download_begin_date(platform::toUnixSeconds(*status.downloadBeginDate));
+    r->set_bytes_received(status.bytesReceived);
+    r->set_bytes_expected(status.bytesExpected);
+  }
   reply(callId, out);
 }
 
@@ -353,7 +399,7 @@ void ClientConnection::notify(std::uint64_t callId, const proto::Envelope& in) {
   proto::Envelope out;
   const std::string stream = in.notify().stream().empty() ? kNotifyStream : in.notify().stream();
   auto* answer = out.mutable_notify_reply();
-  answer->set_delivered(launchEvents_ && launchEvents_->deliver(stream, in.notify().name()));
+  answer->set_delivered(env_->launchEvents && env_->launchEvents->deliver(stream, in.notify().name()));
   if (!answer->delivered()) setError(answer->mutable_error(), 404, "no handler for stream " + stream);
   reply(callId, out);
 }
@@ -362,9 +408,9 @@ void ClientConnection::runActivity(std::uint64_t callId, const proto::Envelope& 
   proto::Envelope out;
   auto* answer = out.mutable_run_activity_reply();
   const std::string& name = in.run_activity().name();
-  if (!assembly_.activityScheduler || !assembly_.activityScheduler->state(name)) {
+  if (!env_->activities->state(name)) {
     setError(answer->mutable_error(), 404, "no activity " + name);
-  } else if (!assembly_.activityScheduler->runNow(name)) {
+  } else if (!env_->activities->runNow(name)) {
     setError(answer->mutable_error(), 500, "activity " + name + " is running");
   }
   reply(callId, out);
@@ -391,10 +437,7 @@ void ClientConnection::ensureState() {
   if (!configuration_->userAgent.empty()) {
     // The factory's device answers are the process's: the system's version is read once.
     const auto& agent = configuration_->userAgent;
-    fullUserAgent = (assembly_.requestFactory
-                         ? createUserAgentString(agent, assembly_.requestFactory->deviceInformation())
-                         : createUserAgentString(agent, DeviceInformation(assembly_.userDefaults.get())))
-                        .value_or(agent);
+    fullUserAgent = createUserAgentString(agent, env_->requestFactory->deviceInformation()).value_or(agent);
   }
   // The identifier and the full user agent (the client's part and the device's, which defaults
   // may override) go out as header values: a CR LF in either would add a header of its own.
@@ -403,7 +446,7 @@ void ClientConnection::ensureState() {
     sessionLog().fault("configuration carries a control character: {}", printable(*value));
     return;
   }
-  auto state = assembly_.clientStateManager->stateForClientIdentifier(configuration_->identifier);
+  auto state = env_->clientStates->stateForClientIdentifier(configuration_->identifier);
   if (!state) return;
   // The tool re-labels its state with each connection's agent; other clients keep the state's
   // first one on purpose.
@@ -436,9 +479,7 @@ void ClientConnection::configure(std::uint64_t callId, const proto::Envelope& in
   }
   if (!state_) {
     configuration_.reset();
-    if (auto manager = assembly_.clientSessionManager) {
-      manager->reportErrorAsTavixdFeedback(500, kTVXErrorDomain, "invalid configuration");
-    }
+    env_->sessionManager->reportErrorAsTavixdFeedback(500, kTVXErrorDomain, "invalid configuration");
     // No reply at all: the client learns of it by the closed connection.
     sessionLog().fault("invalid configuration, closing connection");
     connection_->invalidate();
@@ -477,12 +518,12 @@ void ClientConnection::bagDidLoad(const std::shared_ptr<const TVXBag>& bag, cons
   if (bag) setEngagedCompletionCacheValues(*bag);
   if (!bagObserver_) {
     std::weak_ptr<ClientConnection> weak = weak_from_this();
-    bagObserver_ = assembly_.notificationCenter->addObserver(
+    bagObserver_ = env_->center->addObserver(
         kTVXBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& n) {
           if (auto self = weak.lock()) self->bagChangeNotification(n);
         });
   }
-  assembly_.clientStateManager->saveState();
+  env_->clientStates->saveState();
 }
 
 void ClientConnection::bagChangeNotification(const platform::Notification& notification) {
@@ -507,7 +548,7 @@ void ClientConnection::setEngagedCompletionCacheValues(const TVXBag& bag) {
   parameters.all = bag.brovaneAll();
   parameters.mostRecent = bag.brovaneMostRecent();
   parameters.minThresholdToSend = bag.minThresholdToSend();
-  assembly_.engagedCompletionCache->updateParameters(parameters);
+  env_->engagedCompletions->updateParameters(parameters);
 }
 
 void ClientConnection::request(std::uint64_t callId, const proto::Envelope& in) {
@@ -525,7 +566,7 @@ void ClientConnection::request(std::uint64_t callId, const proto::Envelope& in) 
     return;
   }
   auto request = requestFromWire(wire);
-  auto* defaults = assembly_.userDefaults.get();
+  auto* defaults = env_->defaults.get();
   if (!request->keyboardInputMode) {
     request->keyboardInputMode = defaultKeyboardInputMode(defaults);
     connectionLog().debug("keyboardInputMode property not set, using {}", *request->keyboardInputMode);
@@ -593,7 +634,7 @@ void ClientConnection::feedback(std::uint64_t callId) {
 
 void ClientConnection::engagedCompletionMessage(const proto::Envelope& in) {
   ensureState();
-  auto cache = assembly_.engagedCompletionCache;
+  auto cache = env_->engagedCompletions;
   switch (in.message_case()) {
     case proto::Envelope::kClearEngagedCompletions: {
       const auto& dates = in.clear_engaged_completions();

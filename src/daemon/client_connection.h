@@ -18,16 +18,27 @@
 
 #include "core/names.h"
 #include "core/requests.h"
+#include "feedback/client_session.h"
 #include "platform/clock.h"
+#include "platform/files.h"
 #include "platform/notification_center.h"
 #include "platform/transactions.h"
 
 namespace tavix {
 
-class Assembly;
+class DownloadManager;
+class ClientSessionManager;
 class ClientState;
+class ClientStateManager;
+class EngagedCompletionCache;
+class TavixFlusherIPC;
 class TVXBag;
+class TVXNetworkRequestFactory;
 
+namespace platform {
+class ActivityScheduler;
+class UserDefaults;
+}  // namespace platform
 namespace platform::ipc {
 class IpcConnection;
 class LaunchEventRegistry;
@@ -45,9 +56,31 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
  public:
   using Configuration = TVXSessionConfiguration;
 
-  // `launchEvents` may be null (no launch events then); it and the assembly outlive the object.
-  ClientConnection(Assembly& assembly, std::shared_ptr<platform::ipc::IpcConnection> connection,
-                   platform::ipc::LaunchEventRegistry* launchEvents);
+  // What every connection works with: one struct, made at start-up and shared by all connections.
+  // The pool, clock, transactions, activities and launch events must outlive the connections.
+  struct Environment {
+    platform::DispatchPool* pool = nullptr;
+    platform::Clock* clock = nullptr;
+    platform::TransactionTracker* transactions = nullptr;
+    platform::ActivityScheduler* activities = nullptr;
+    // Receives the launch events clients hand in; null: none are delivered.
+    platform::ipc::LaunchEventRegistry* launchEvents = nullptr;
+    std::shared_ptr<platform::UserDefaults> defaults;
+    std::shared_ptr<platform::NotificationCenter> center;
+    std::shared_ptr<TVXNetworkRequestFactory> requestFactory;  // the device's part of user agents
+    std::shared_ptr<ClientStateManager> clientStates;
+    // The daemon's own session manager: a rejected configuration is recorded there.
+    std::shared_ptr<ClientSessionManager> sessionManager;
+    std::shared_ptr<EngagedCompletionCache> engagedCompletions;
+    // A client's feedback that belongs to no session is reported as a session of its own.
+    FeedbackEnvironment feedback;
+    platform::fs::path cachesFolder;  // where completion-feature files are written
+    // Hands the tool its end of the flush command channel; null: "not available".
+    std::shared_ptr<TavixFlusherIPC> flusher;
+    // The bag's resource files; null: resource calls answer "not available".
+    std::shared_ptr<DownloadManager> downloads;
+  };
+  ClientConnection(std::shared_ptr<const Environment> env, std::shared_ptr<platform::ipc::IpcConnection> connection);
   ~ClientConnection();
   ClientConnection(const ClientConnection&) = delete;
   ClientConnection& operator=(const ClientConnection&) = delete;
@@ -100,8 +133,9 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void request(std::uint64_t callId, const proto::Envelope& in);
   void listenToFlusher(std::uint64_t callId);
   void listSessions(std::uint64_t callId);
-  void fileHandleAndAttributesForResource(std::uint64_t callId);
+  void fileHandleAndAttributesForResource(std::uint64_t callId, const proto::Envelope& in);
   void getImageMap(std::uint64_t callId);
+  void listResources(std::uint64_t callId);
   void notify(std::uint64_t callId, const proto::Envelope& in);
   void runActivity(std::uint64_t callId, const proto::Envelope& in);
   void unknownMessage(std::uint64_t callId, const proto::Envelope& in);
@@ -109,9 +143,8 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void feedback(std::uint64_t callId);
   void engagedCompletionMessage(const proto::Envelope& in);
 
-  Assembly& assembly_;
+  const std::shared_ptr<const Environment> env_;
   std::shared_ptr<platform::ipc::IpcConnection> connection_;
-  platform::ipc::LaunchEventRegistry* launchEvents_;
   std::optional<Configuration> configuration_;
   std::string userAgent_;
   std::shared_ptr<ClientState> state_;

@@ -10,7 +10,6 @@
 #include <atomic>
 #include <cmath>
 
-#include "core/assembly.h"
 #include "platform/activity.h"
 #include "platform/defaults.h"
 #include "platform/ipc/frame.h"
@@ -20,7 +19,7 @@
 #include "cache/query_cache.h"
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
-#include "support/test_assembly.h"
+#include "support/connection_services.h"
 #include "tavix_proto/ipc.pb.h"
 #include "cache/engaged_completion_cache.h"
 
@@ -35,6 +34,7 @@ struct Harness : testing::TestAssembly {
   platform::ActivityScheduler activities{clock, activityQueue, transactions};
   platform::SerialQueue eventQueue{pool, "test.events"};
   ipc::LaunchEventRegistry events{eventQueue};
+  testing::ConnectionServices services{*this, &activities, &events};
   platform::Logger log{"test", "connection"};
   ipc::UniqueFd client;
   std::shared_ptr<ipc::IpcConnection> connection;
@@ -42,15 +42,12 @@ struct Harness : testing::TestAssembly {
   ipc::FrameDecoder decoder;
 
   explicit Harness(std::size_t maxFrame = ipc::kMaxFrameSize) {
-    assembly.activityScheduler = &activities;
-    assembly.engagedCompletionCache = EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, nullptr});
-    assembly.clientStateManager = makeClientStateManager();
     int fds[2];
     EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
     client.reset(fds[1]);
     connection = ipc::IpcConnection::make(pool, ipc::UniqueFd(fds[0]), {::getpid(), ::getuid(), ::getgid()},
                                           "test.connection", log, maxFrame);
-    subject = std::make_shared<ClientConnection>(assembly, connection, &events);
+    subject = std::make_shared<ClientConnection>(services.env, connection);
     subject->start();
     std::weak_ptr<ClientConnection> weak = subject;
     connection->start([weak](std::string p) { if (auto s = weak.lock()) s->handleIncomingMessage(p); },
@@ -89,6 +86,8 @@ struct Harness : testing::TestAssembly {
     clock.advance(platform::seconds(s));
     pool.drain();
   }
+  // The connection's keep-alive transactions (a bag fetch holds one of its own).
+  std::size_t keepAlives() { return transactions.open()["com.norvel.tavixd.ipc"]; }
 };
 
 proto::Envelope configure(const std::string& identifier, const std::string& userAgent) {
@@ -107,13 +106,13 @@ proto::Envelope notify(const std::string& name, const std::string& stream = "") 
 
 TEST(ClientConnection, SilenceEndsTheKeepAliveTransactionAndTheNextMessageOpensOne) {
   Harness h;
-  EXPECT_EQ(h.transactions.openCount(), 1u);
+  EXPECT_EQ(h.keepAlives(), 1u);
   ASSERT_TRUE(h.call(configure("com.norvel.seekara", "seekara/1")).has_configure_reply());
   auto state = h.assembly.clientStateManager->stateForClientIdentifier("com.norvel.seekara");
   ASSERT_TRUE(state && state->queryCache());
   state->queryCache()->set(
       makeRef<CachedResultSet>("ca", nullptr, platform::Dictionary{{"query", "camera"}}, "u", "[1]", h.clock.now()));
-  // No bag controller here: once the wait is over the client hears why it has no bag.
+  // The bag server refuses: once the wait is over the client hears why it has no bag.
   h.advance(1);
   auto loaded = h.receive();
   ASSERT_TRUE(loaded.has_bag_did_load());
@@ -121,22 +120,22 @@ TEST(ClientConnection, SilenceEndsTheKeepAliveTransactionAndTheNextMessageOpensO
   h.advance(58);
   h.call(notify("a"));
   h.advance(59);
-  EXPECT_EQ(h.transactions.openCount(), 1u) << "each message re-arms the idle timer";
+  EXPECT_EQ(h.keepAlives(), 1u) << "each message re-arms the idle timer";
   EXPECT_EQ(state->queryCache()->count(), 1u);
   h.advance(2);
-  EXPECT_EQ(h.transactions.openCount(), 0u);
+  EXPECT_EQ(h.keepAlives(), 0u);
   EXPECT_EQ(state->queryCache()->count(), 0u) << "a silent client's cached replies go with its transaction";
   h.call(notify("b"));
-  EXPECT_EQ(h.transactions.openCount(), 1u);
+  EXPECT_EQ(h.keepAlives(), 1u);
 
   // The client goes away: its transaction stays a minute more, in case it comes back.
   h.client.reset();
   ASSERT_TRUE(tavix::testing::waitFor([&] { return !h.connection->isValid(); }));
   h.pool.drain();
   h.advance(59);
-  EXPECT_EQ(h.transactions.openCount(), 1u);
+  EXPECT_EQ(h.keepAlives(), 1u);
   h.advance(1);
-  EXPECT_EQ(h.transactions.openCount(), 0u);
+  EXPECT_EQ(h.keepAlives(), 0u);
 }
 
 TEST(ClientConnection, OneBagPerClientHoweverOftenItConfiguresAndLateRepliesAreLogged) {

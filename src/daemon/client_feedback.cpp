@@ -8,7 +8,6 @@
 #include "bagview/tvx_bag.h"
 #include "cache/engaged_completion_cache.h"
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
@@ -54,7 +53,7 @@ std::string capitalised(std::string text) {
 
 // One completion-feature file for the custom feedback flusher: the completion ("lc"), the input
 // it answered ("q"), whether it was engaged ("e") and the client number ("c").
-void sendCompletionFeatureFeedback(const Assembly& assembly, const proto::CTSearchResultForFeedback& result,
+void sendCompletionFeatureFeedback(const platform::fs::path& cachesFolder, const proto::CTSearchResultForFeedback& result,
                                    const std::string& input, unsigned long client, bool didEngage) {
   nlohmann::json record = {{"lc", result.completion()}, {"q", input}, {"e", didEngage}, {"c", client}};
   std::string text;
@@ -64,7 +63,7 @@ void sendCompletionFeatureFeedback(const Assembly& assembly, const proto::CTSear
     feedbackLog().error("sendCompletionFeatureFeedbackForResult failed to parse JSON: {}", e.what());
     return;
   }
-  const auto folder = assembly.cachesFolder() / std::string(kTVXCustomFeedbackDir) / std::string(kTVXEngagedCompletionDir);
+  const auto folder = cachesFolder / std::string(kTVXCustomFeedbackDir) / std::string(kTVXEngagedCompletionDir);
   if (auto ec = platform::createDirectory(folder, true)) {
     feedbackLog().error("sendCustomFeedback failed getting a caches dir: {}", ec.message());
     return;
@@ -123,7 +122,7 @@ std::vector<const proto::CTSearchResultForFeedback*> listedResults(const proto::
 void ClientConnection::reportFeedbackPayloadData(const std::string& data, std::uint64_t argumentQueryId) {
   ensureState();
   auto reportError = [this](const std::string& reason) {
-    ClientSession::createFeedbackSessionFromError(500, kTVXErrorDomain, reason, feedbackEnvironment(assembly_));
+    ClientSession::createFeedbackSessionFromError(500, kTVXErrorDomain, reason, env_->feedback);
   };
   if (!state_) {
     reportError("client state nil");
@@ -162,7 +161,7 @@ void ClientConnection::reportFeedbackPayloadData(const std::string& data, std::u
   }
   for (const auto* result : listedResults(payload)) {
     if (!isCompletionSuggestion(*result)) continue;
-    sendCompletionFeatureFeedback(assembly_, *result, "", featureClient, false);
+    sendCompletionFeatureFeedback(env_->cachesFolder, *result, "", featureClient, false);
     TavixDiagnosticDataReporter::addValue(1, createCounterKey(shortName, "querysuggestion.engagements"));
   }
 
@@ -194,9 +193,9 @@ void ClientConnection::reportFeedbackPayloadData(const std::string& data, std::u
         } else if (result.section_bundle_id().rfind("com.norvel.tavix", 0) == 0) {
           origin = kEngagedCompletionOriginTavix;
         }
-        assembly_.engagedCompletionCache->addCompletion(
+        env_->engagedCompletions->addCompletion(
             query, input, origin, client, static_cast<unsigned long>(bag->smartHistoryMaxRows()));
-        sendCompletionFeatureFeedback(assembly_, result, input, featureClient, true);
+        sendCompletionFeatureFeedback(env_->cachesFolder, result, input, featureClient, true);
       }
     }
   }

@@ -15,11 +15,13 @@
 #include "context/motion.h"
 #include "context/subscription_manager.h"
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "core/names.h"
+#include "core/resource_versions.h"
+#include "core/url_sessions.h"
+#include "daemon/assembly.h"
 #include "daemon/client_connection.h"
 #include "daemon/tavix_service.h"
 #include "delivery/custom_feedback_flusher.h"
@@ -45,6 +47,7 @@
 #include "platform/service_manager.h"
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
+#include "resources/download_manager.h"
 #include "resources/lookup.h"
 #include "platform/transactions.h"
 
@@ -124,8 +127,9 @@ std::shared_ptr<AppWhitelistController> makeAppWhitelistController(const Assembl
                                          applicationFoldersFromEnvironment()});
 }
 
-// Subscriptions (after the request factory, their delegate) and look-up hints; both before the
-// first bag change and the start-up notification they follow.
+// Subscriptions (after the request factory, their delegate) and look-up hints (after the download
+// manager, whose versions they compare); both before the first bag change and the start-up
+// notification they follow.
 void assembleResourceConsumers(Assembly& assembly) {
   const auto defaults = assembly.userDefaults;
   const std::string userAgent = assembly.requestFactory->userAgent().value_or("");
@@ -147,9 +151,8 @@ void assembleResourceConsumers(Assembly& assembly) {
        assembly.cachesFolder()});
 }
 
-// The services, made and wired in the order start-up needs: each is handed, or finds in the
-// assembly, the ones it reads in its constructor. Uploads left unsent by the last run resume with
-// the upload manager; endpoints come with the bag.
+// The services, made and wired in the order start-up needs: each is handed the ones it uses.
+// Uploads left unsent by the last run resume with the upload manager; endpoints come with the bag.
 void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform::Clock& clock) {
   auto& defaults = *assembly.userDefaults;
   assembly.notificationCenter = std::make_shared<platform::NotificationCenter>();
@@ -166,13 +169,60 @@ void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform
       {&pool, &clock, assembly.userDefaults, assembly.notificationCenter, assembly.cachesFolder()}, std::move(providers));
   assembly.engagedCompletionCache =
       EngagedCompletionCache::create({assembly.cachesFolder(), &clock, &pool, assembly.userDefaults.get()});
-  auto uploads = BackgroundUploadSession::create(assembly.uploadURLSession(), assembly.cachesFolder() / "UploadJournal", pool);
+  // The download manager's.
+  assembly.downloadSession = std::make_shared<platform::http::URLSession>(downloadSessionConfiguration());
+  assembly.uploadSession = std::make_shared<platform::http::URLSession>(uploadSessionConfiguration());
+  auto uploads = BackgroundUploadSession::create(assembly.uploadSession, assembly.cachesFolder() / "UploadJournal", pool);
   assembly.uploadManager =
       UploadManager::create(pool, *assembly.notificationCenter, assembly.requestFactory, std::move(uploads));
   assembly.persistentStorage = std::make_shared<TavixPersistentStorage>(TavixPersistentStorage::Environment{
       assembly.cachesFolder(), &pool, &clock, assembly.userDefaults.get(), assembly.transactions});
   // Before the bag controller and the session manager, which stamp their feedback with its GUID.
   assembly.guidController = std::make_shared<TavixUserGUIDController>(pool, clock, assembly.notificationCenter);
+}
+
+// The bag controller and its session; fetch records go to sessions of their own.
+void assembleBagController(Assembly& assembly) {
+  assembly.bagSession = std::make_shared<platform::http::URLSession>(bagSessionConfiguration());
+  assembly.bagController = TavixBagController::create({assembly.feedback, assembly.transactions, assembly.notificationCenter,
+                                                       assembly.requestFactory, assembly.bagSession,
+                                                       assembly.paths.cacheHome, assembly.cachesFolder()});
+}
+
+// Reads "TVXSharedSession" and makes the feedback session manager that clients share when it is
+// set. After the GUID controller and the bag controller, which the manager uses.
+void assembleFeedbackServices(Assembly& assembly) {
+  assembly.sessions = {assembly.feedback, assembly.transactions, assembly.notificationCenter,
+                       assembly.userDefaults->boolForKey("TVXSharedSession")};
+  assembly.clientSessionManager =
+      std::make_shared<ClientSessionManager>(assembly.sessions, assembly.guidController, assembly.bagController, "tavix");
+}
+
+// Before the bag controller and the session manager, which take the resource versions with the
+// feedback environment made here. Downloads an earlier run left in the journal resume here.
+void assembleDownloadManager(Assembly& assembly, platform::DispatchPool& pool, platform::Clock& clock) {
+  DownloadManager::Environment env;
+  env.pool = &pool;
+  env.clock = &clock;
+  env.center = assembly.notificationCenter;
+  env.defaults = assembly.userDefaults;
+  env.cachesFolder = assembly.cachesFolder();
+  env.session = platform::http::BackgroundDownloadSession::create(
+      assembly.downloadSession, assembly.cachesFolder() / "DownloadJournal", pool, clock,
+      TavixLogForCategory(TavixLoggingCategoryDownloadManager));
+  env.fileDownloadRequest = [factory = assembly.requestFactory](const std::string& url,
+                                                                std::optional<std::string> version, bool latLong) {
+    return factory->fileDownloadRequest(url, std::move(version), latLong);
+  };
+  // Read fresh each time: the look-up panel's settings switch it while we run.
+  env.lookupEnabled = [defaults = assembly.userDefaults] { return lookupEnabled(*defaults); };
+  env.reportError = [&assembly](int code, const std::string& domain, const std::string& reason) {
+    if (assembly.clientSessionManager) assembly.clientSessionManager->reportErrorAsTavixdFeedback(code, domain, reason);
+  };
+  assembly.downloadManager = DownloadManager::create(std::move(env));
+  assembly.resourceVersions = assembly.downloadManager;
+  assembly.feedback = {&pool, &clock, assembly.userDefaults, assembly.persistentStorage, assembly.guidController,
+                       assembly.resourceVersions};
 }
 
 // Topic weights a person or another program left for us; any property-list value, sent as JSON.
@@ -184,11 +234,11 @@ void applySilhouette(const platform::UserDefaults& defaults, TVXNetworkRequestFa
 
 // Built at each run: the flush channel is made after the first flushers are wired.
 TavixFeedbackFlusher::Environment feedbackFlusherEnvironment(const Assembly& assembly) {
-  return {feedbackEnvironment(assembly), assembly.uploadManager, assembly.flusherIPCListener, assembly.transactions};
+  return {assembly.feedback, assembly.uploadManager, assembly.flusherIPCListener, assembly.transactions};
 }
 
 TavixCustomFeedbackFlusher::Environment customFeedbackFlusherEnvironment(const Assembly& assembly) {
-  return {assembly.paths.cacheHome, assembly.cachesFolder(), feedbackEnvironment(assembly), assembly.bagController,
+  return {assembly.paths.cacheHome, assembly.cachesFolder(), assembly.feedback, assembly.bagController,
           assembly.uploadManager};
 }
 
@@ -198,7 +248,7 @@ std::shared_ptr<TavixFlusherIPC> makeFlusherChannel(Assembly& assembly, TavixSer
   TavixFlusherIPC::Environment env;
   env.pool = assembly.dispatchPool;
   env.defaults = assembly.userDefaults;
-  env.sharedSession = assembly.sharedSession;
+  env.sharedSession = assembly.sessions.sharedSession;
   env.flushFeedback = [&assembly](std::function<void()> done) {
     TavixFeedbackFlusher::create(feedbackFlusherEnvironment(assembly))->forceFlushWithCompletion(std::move(done));
   };
@@ -229,6 +279,52 @@ std::shared_ptr<TavixFlusherIPC> makeFlusherChannel(Assembly& assembly, TavixSer
     if (auto c = weak.lock()) c->sendDataToReceivingStreamListener(feedback);
   });
   return channel;
+}
+
+// The client states, their query session and their one shared environment. After the feedback
+// services: a client state may share their GUID controller and session manager.
+void assembleClientStates(Assembly& assembly) {
+  assembly.querySession = std::make_shared<platform::http::URLSession>(querySessionConfiguration(*assembly.userDefaults));
+  auto env = std::make_shared<ClientState::Environment>();
+  env->pool = assembly.dispatchPool;
+  env->clock = assembly.clock;
+  env->defaults = assembly.userDefaults;
+  env->center = assembly.notificationCenter;
+  env->requestFactory = assembly.requestFactory;
+  env->bagController = assembly.bagController;
+  env->engagedCompletionCache = assembly.engagedCompletionCache;
+  env->locationManager = assembly.locationManager;
+  env->session = assembly.querySession;
+  env->guidController = assembly.guidController;
+  env->sessionManager = assembly.clientSessionManager;
+  env->sessions = assembly.sessions;
+  assembly.clientStateManager = std::make_shared<ClientStateManager>(
+      *assembly.dispatchPool, assembly.userDefaults,
+      [env = std::shared_ptr<const ClientState::Environment>(std::move(env))](const std::string& identifier) {
+        return ClientState::create(env, identifier);
+      });
+}
+
+// Every client connection's services. The service binds connections with it from the first
+// accepted client on, so it is completed (the flush channel, made after the service) before the
+// listener resumes.
+void fillConnectionEnvironment(ClientConnection::Environment& env, const Assembly& assembly,
+                               platform::ipc::LaunchEventRegistry& launchEvents) {
+  env.pool = assembly.dispatchPool;
+  env.clock = assembly.clock;
+  env.transactions = assembly.transactions;
+  env.activities = assembly.activityScheduler;
+  env.launchEvents = &launchEvents;
+  env.defaults = assembly.userDefaults;
+  env.center = assembly.notificationCenter;
+  env.requestFactory = assembly.requestFactory;
+  env.clientStates = assembly.clientStateManager;
+  env.sessionManager = assembly.clientSessionManager;
+  env.engagedCompletions = assembly.engagedCompletionCache;
+  env.feedback = assembly.feedback;
+  env.cachesFolder = assembly.cachesFolder();
+  env.flusher = assembly.flusherIPCListener;
+  env.downloads = assembly.downloadManager;
 }
 
 // Socket activation hands the listening socket over; otherwise we make our own at `socketPath`.
@@ -335,22 +431,6 @@ class Housekeeping {
 
 }  // namespace
 
-void assembleFeedbackServices(Assembly& assembly) {
-  assembly.sharedSession = assembly.userDefaults->boolForKey("TVXSharedSession");
-  assembly.clientSessionManager =
-      std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), assembly.guidController, assembly.bagController, "tavix");
-}
-
-TavixService::Environment serviceEnvironment(Assembly& assembly, platform::ipc::LaunchEventRegistry* launchEvents) {
-  TavixService::Environment env;
-  env.pool = assembly.dispatchPool;
-  env.urlSession = [&assembly] { return assembly.urlSession(); };
-  env.makeConnection = [&assembly, launchEvents](const std::shared_ptr<platform::ipc::IpcConnection>& connection) {
-    return std::make_shared<ClientConnection>(assembly, connection, launchEvents);
-  };
-  return env;
-}
-
 int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   platform::setLogLevel(options.logLevel);
   auto& log = TavixLogForCategory(TavixLoggingCategoryDefault);
@@ -379,24 +459,28 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   assembly.paths = paths;
   assembly.userDefaults = defaults;
   assembleServices(assembly, pool, clock);
+  assembleDownloadManager(assembly, pool, clock);
   assembleResourceConsumers(assembly);
 
   const auto countersFile = assembly.cachesFolder() / "counters.plist";
   auto& counters = TavixDiagnosticDataReporter::store();
   if (auto ec = counters.load(countersFile)) log.error("cannot read counters {}", describe(countersFile, ec));
   TavixDiagnosticDataReporter::addValue(1, "com.norvel.tavixd.launch");
-  assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
+  assembleBagController(assembly);
   applySilhouette(*defaults, *assembly.requestFactory);
 
   assembleFeedbackServices(assembly);
 
   platform::SerialQueue ipcEventQueue(pool, "com.norvel.tavixd.ipc_event");
   platform::ipc::LaunchEventRegistry launchEvents(ipcEventQueue);
-  TavixService service(serviceEnvironment(assembly, &launchEvents));
-  // After the feedback services: a client state may share their GUID controller and session manager.
-  assembly.clientStateManager = std::make_shared<ClientStateManager>(
-      pool, defaults, [&assembly](const std::string& identifier) { return ClientState::create(assembly, identifier); });
+  auto connections = std::make_shared<ClientConnection::Environment>();
+  assembleClientStates(assembly);
+  TavixService service({&pool, assembly.querySession,
+                        [connections](const std::shared_ptr<platform::ipc::IpcConnection>& connection) {
+                          return std::make_shared<ClientConnection>(connections, connection);
+                        }});
   assembly.flusherIPCListener = makeFlusherChannel(assembly, service);
+  fillConnectionEnvironment(*connections, assembly, launchEvents);
 
   // The orderly end, on every way out once the services exist.
   auto shutDown = [&] {

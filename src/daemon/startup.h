@@ -8,14 +8,9 @@
 
 namespace tavix {
 
-class Assembly;
-
 namespace platform {
 class UserDefaults;
-namespace ipc {
-class LaunchEventRegistry;
 }
-}  // namespace platform
 
 // The settings registered at start; a value the user or a tool has set wins over these.
 platform::Dictionary tavixdRegisteredDefaults();
@@ -23,15 +18,6 @@ platform::Dictionary tavixdRegisteredDefaults();
 // Makes "<caches>/com.norvel.tavixd/CustomFeedback" and one folder per custom-feedback type.
 // Failures are logged and never stop start-up; a type folder that exists already is no error.
 void createCustomFeedbackDirectories(const platform::Paths& paths);
-
-// Reads "TVXSharedSession" and makes the feedback session manager that clients share when it is
-// set. After the GUID controller and the bag controller, which the manager uses.
-void assembleFeedbackServices(Assembly& assembly);
-
-// The service's dependencies: the assembly's pool and query session, and connections bound to the
-// assembly. `launchEvents` (may be null) receives the launch events that clients hand in; it must
-// outlive the service.
-TavixService::Environment serviceEnvironment(Assembly& assembly, platform::ipc::LaunchEventRegistry* launchEvents);
 
 // The background activities and how often each runs.
 inline constexpr const char* kFlusherActivity = "com.norvel.tavixd.flusher.background";

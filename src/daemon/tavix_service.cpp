@@ -91,10 +91,8 @@ void TavixService::connectionInvalidated(const std::shared_ptr<ClientConnection>
         connections_.erase(std::remove(connections_.begin(), connections_.end(), client), connections_.end());
         if (!connections_.empty()) return;
         // Replies cached for clients that have all gone are dead weight; the disk cache stays.
-        if (auto session = env_.urlSession()) {
-          TavixLogForCategory(TavixLoggingCategoryCaching).info("purging url cache");
-          session->purgeMemoryCache();
-        }
+        TavixLogForCategory(TavixLoggingCategoryCaching).info("purging url cache");
+        env_.querySession->purgeMemoryCache();
       });
     };
     // A connection that never said who it is has no session to close.

@@ -27,9 +27,8 @@ class TavixService {
  public:
   struct Environment {
     platform::DispatchPool* pool = nullptr;
-    // The query session, whose memory cache goes when the last client does. Called only then, so
-    // that a daemon no client ever reached does not make one.
-    std::function<std::shared_ptr<platform::http::URLSession>()> urlSession;
+    // The query session, whose memory cache goes when the last client does.
+    std::shared_ptr<platform::http::URLSession> querySession;
     // Binds a new connection to a client; not yet started.
     std::function<std::shared_ptr<ClientConnection>(const std::shared_ptr<platform::ipc::IpcConnection>&)>
         makeConnection;

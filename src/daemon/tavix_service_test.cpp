@@ -2,10 +2,8 @@
 
 #include <gtest/gtest.h>
 
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "daemon/client_connection.h"
-#include "daemon/startup.h"
 #include "platform/counters.h"
 #include "platform/defaults.h"
 #include "platform/ipc/frame.h"
@@ -13,7 +11,7 @@
 #include "platform/log.h"
 #include "platform/transactions.h"
 #include "query/client_state_manager.h"
-#include "support/test_assembly.h"
+#include "support/connection_services.h"
 #include "tavix_proto/ipc.pb.h"
 
 namespace tavix {
@@ -33,11 +31,11 @@ TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
   platform::Logger log("test", "listener");
 
   {
-    assembly.guidController = f.makeGUIDController();
-    assembleFeedbackServices(assembly);
-    EXPECT_TRUE(assembly.sharedSession);
-    TavixService service(serviceEnvironment(assembly, nullptr));
-    assembly.clientStateManager = f.makeClientStateManager();
+    testing::ConnectionServices services(f, nullptr, nullptr);
+    TavixService service({&pool, assembly.urlSession(),
+                          [env = services.env](const std::shared_ptr<ipc::IpcConnection>& connection) {
+                            return std::make_shared<ClientConnection>(env, connection);
+                          }});
     std::error_code ec;
     auto listener = ipc::IpcListener::listen(pool, (home.runtime() / "socket").string(), log, &ec);
     ASSERT_TRUE(listener);

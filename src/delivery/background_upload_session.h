@@ -1,12 +1,11 @@
 // The background upload session: uploads from files that outlive the daemon.
 //
-// Each task is written to a journal (a folder under the caches folder: the request as JSON and a
-// copy of the body, both 0600, atomically) before it reaches the transport, and is removed from
+// Each task is written to a transfer journal (a folder under the caches folder, see
+// transfer_journal.h) with a copy of its body before it reaches the transport, and is removed from
 // it once the server has answered or the transfer has failed. A task that was still on its way
 // when the process stopped is found in the journal by resumePendingTasks() at the next start and
 // sent again. Failures are final: the delegate hears of them and the entry is forgotten; only a
-// transfer cancelled because the transport went away stays for the next start. Files a crash
-// left half-way (a body without its task, a temporary file) are removed when the session is made.
+// transfer cancelled because the transport went away stays for the next start.
 //
 // Threading: owns the serial queue "com.norvel.tavixd.uploadsession"; the task table lives there.
 // Every public method is safe from any thread. Delegate calls and getAllTasks() callbacks run on
@@ -23,6 +22,7 @@
 
 #include "platform/dispatch.h"
 #include "platform/files.h"
+#include "platform/http/transfer_journal.h"
 #include "platform/http/url_request.h"
 
 namespace tavix::platform::http {
@@ -75,7 +75,7 @@ class BackgroundUploadSession : public std::enable_shared_from_this<BackgroundUp
   std::optional<std::uint64_t> uploadTask(platform::http::URLRequest request, const platform::fs::path& bodyFile,
                                           std::optional<std::int64_t> numberOfFeedbacks);
 
-  const platform::fs::path& journalDirectory() const { return journal_; }
+  const platform::fs::path& journalDirectory() const { return journal_.directory(); }
   platform::SerialQueue& queue() { return queue_; }
 
  private:
@@ -92,14 +92,12 @@ class BackgroundUploadSession : public std::enable_shared_from_this<BackgroundUp
              std::optional<std::int64_t> numberOfFeedbacks);
   void completed(std::uint64_t taskIdentifier, std::optional<platform::http::HTTPURLResponse> response,
                  std::optional<platform::http::URLError> error);  // on queue_
-  void forget(const std::string& journalName);                    // on queue_
 
   std::shared_ptr<platform::http::URLSession> transport_;
-  platform::fs::path journal_;
+  platform::http::TransferJournal journal_;  // on queue_
   platform::SerialQueue queue_;
   std::weak_ptr<Delegate> delegate_;          // on queue_
   std::map<std::uint64_t, Entry> tasks_;      // on queue_, by task identifier
-  std::uint64_t nextJournalNumber_ = 1;       // on queue_
 };
 
 }  // namespace tavix

@@ -4,7 +4,6 @@
 
 #include <nlohmann/json.hpp>
 
-#include "core/assembly.h"
 #include "feedback/client_session.h"
 #include "feedback/persistent_storage.h"
 #include "platform/defaults.h"
@@ -165,7 +164,7 @@ TEST(CBAFilter, EngagementsAreGradedAgainstEarlierWebResultsOfTheirQuery) {
 TEST(CBAFilter, OnlyBrowserSessionsAreFilteredOnTheirWayOut) {
   testing::TestAssembly f;
   f.makeStorage();
-  Assembly& assembly = f.assembly;
+  auto& assembly = f.assembly;
 
   auto upload = [&](const std::string& agent) {
     auto first = visible(4, {{kWebIndex, "https://a.com/x"}});

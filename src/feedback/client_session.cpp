@@ -7,7 +7,6 @@
 #include <ctime>
 
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "core/names.h"
@@ -46,11 +45,6 @@ std::optional<std::string> firstUseKeyForAgent(std::string_view agent) {
     if (l.find(name) != std::string::npos) return std::string("TavixFirstUseOfTheDay_") + name;
   }
   return std::nullopt;
-}
-
-FeedbackEnvironment feedbackEnvironment(const Assembly& assembly) {
-  return {assembly.dispatchPool,   assembly.clock,          assembly.userDefaults,
-          assembly.persistentStorage, assembly.guidController, assembly.resourceVersions};
 }
 
 ClientSession::ClientSession(FeedbackEnvironment env)

@@ -20,7 +20,6 @@
 
 namespace tavix {
 
-class Assembly;
 class FileContainer;
 class ResourceVersionsProvider;
 class TavixPersistentStorage;
@@ -41,10 +40,6 @@ struct FeedbackEnvironment {
   // The versions each new session records; null until a download manager provides them.
   std::shared_ptr<ResourceVersionsProvider> resourceVersions;
 };
-
-// The assembly's current services, for the objects that still find their peers there. Built at
-// each call: start-up makes the GUID controller after some of its users.
-FeedbackEnvironment feedbackEnvironment(const Assembly& assembly);
 
 // "TavixFirstUseOfTheDay_<client>" for the first of brovane, seekara, lookup, messages, news,
 // vocly that the lower-cased agent contains; none otherwise.

@@ -2,7 +2,6 @@
 
 #include "bagview/tvx_bag.h"
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
 #include "core/logging.h"
 #include "bagview/user_agent.h"
 #include "feedback/vocabulary.h"
@@ -325,10 +324,6 @@ void ClientSessionManager::currentSessionFeedbacks(std::function<void(std::vecto
     if (self->single_) gather(*self->single_);
     done(std::move(all));
   });
-}
-
-ClientSessionManager::Environment sessionManagerEnvironment(const Assembly& assembly) {
-  return {feedbackEnvironment(assembly), assembly.transactions, assembly.notificationCenter, assembly.sharedSession};
 }
 
 }  // namespace tavix

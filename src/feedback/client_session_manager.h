@@ -141,7 +141,4 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   std::function<void(const proto::CTTavixFeedback&)> feedbackObserver_;
 };
 
-// The assembly's services, for the callers that still find their peers there.
-ClientSessionManager::Environment sessionManagerEnvironment(const Assembly& assembly);
-
 }  // namespace tavix

@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
 #include "feedback/persistent_storage.h"
 #include "platform/defaults.h"
 #include "platform/notification_center.h"

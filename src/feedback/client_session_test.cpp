@@ -6,7 +6,6 @@
 
 #include <nlohmann/json.hpp>
 
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/resource_versions.h"
 #include "feedback/persistent_storage.h"

@@ -49,13 +49,6 @@ TEST(LocaleContext, IcuAnswersForSeveralLocales) {
   EXPECT_EQ(britain.is24hDateFormat, "1");
   EXPECT_EQ(britain.preferredLanguages, R"(["en-GB","cy","fr"])");
   EXPECT_EQ(britain.effectiveSystemLanguage, "en-GB");
-
-  TVXLocaleContext us = TVXComputeLocaleContext({"en_US", {}, "America/New_York"});
-  EXPECT_EQ(us.localeMeasurementSystem, "US");
-  EXPECT_EQ(us.tempUnits, "F");
-  EXPECT_FALSE(us.is24hDateFormat);
-  EXPECT_FALSE(us.preferredLanguages);
-  EXPECT_FALSE(us.effectiveSystemLanguage);
 }
 
 }  // namespace

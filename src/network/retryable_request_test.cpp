@@ -9,6 +9,7 @@
 
 #include "devserver/devserver.h"
 #include "platform/dispatch.h"
+#include "support/devserver_control.h"
 #include "support/temp_home.h"
 
 namespace {
@@ -21,22 +22,18 @@ class RetryableRequestTest : public ::testing::Test {
  protected:
   void SetUp() override { ASSERT_TRUE(server.start({}, nullptr)); }
 
-  URLRequest request(const std::string& path, const std::string& method = "GET", std::string body = {}) {
+  URLRequest request(const std::string& path) {
     URLRequest r;
     r.url = server.baseURL() + path;
-    r.method = method;
-    r.body = std::move(body);
     return r;
   }
 
-  // A plain round trip on the session, for the devserver's control endpoints.
-  std::string call(const URLRequest& r) {
-    std::promise<std::string> done;
-    session->dataTask(r, [&](std::string data, auto, auto) { done.set_value(std::move(data)); })->resume();
-    return done.get_future().get();
+  // The devserver's control routes.
+  std::string call(const std::string& path, const std::string& method = "GET", std::string body = {}) {
+    return tavix::testing::devserverCall(*session, server.baseURL(), path, method, std::move(body));
   }
-  void fault(const nlohmann::json& f) { call(request("/_faults", "POST", f.dump())); }
-  std::size_t attemptsOnTheWire() { return nlohmann::json::parse(call(request("/_recorded"))).size(); }
+  void fault(const nlohmann::json& f) { call("/_faults", "POST", f.dump()); }
+  std::size_t attemptsOnTheWire() { return nlohmann::json::parse(call("/_recorded")).size(); }
 
   struct Result {
     std::atomic<int> calls = 0;
@@ -109,7 +106,7 @@ TEST_F(RetryableRequestTest, UndelayedRetriesStopAtTheFirstResponseWhateverItsSt
   EXPECT_GT(recovered.metrics.firstByteSeconds, 0);
   EXPECT_EQ(clock.pendingTimers(), 0u);
 
-  call(request("/_reset", "POST"));
+  call("/_reset", "POST");
   fault({{"path", "/search"}, {"status", 500}});
   Result serverError;
   send(TVXRetryableNetworkRequest(request("/search?q=w"), clock.now() + seconds(10), false), 3, serverError)->resume();
@@ -117,7 +114,7 @@ TEST_F(RetryableRequestTest, UndelayedRetriesStopAtTheFirstResponseWhateverItsSt
   EXPECT_EQ(serverError.response->statusCode, 500);
   EXPECT_EQ(attemptsOnTheWire(), 1u);
 
-  call(request("/_reset", "POST"));
+  call("/_reset", "POST");
   fault({{"path", "/search"}, {"drop", true}});
   Result spent;
   send(TVXRetryableNetworkRequest(request("/search?q=w"), clock.now() + seconds(10), false), 3, spent)->resume();

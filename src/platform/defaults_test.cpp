@@ -32,26 +32,7 @@ TEST_F(DefaultsTest, PersistentValueWinsOverRegisteredAndRemovalFallsBack) {
   EXPECT_TRUE(defaults.boolForKey("TVXSharedSession"));
 }
 
-TEST_F(DefaultsTest, ValuesSurviveTheFileAndTheFileIsPrivate) {
-  // Every type's round trip through the plist forms is PropertyList's; this is the file.
-  const TimePoint when = fromUnixSeconds(1767225600);  // whole seconds: XML dates keep seconds
-  {
-    UserDefaults writer(folder, "com.norvel.tavixd");
-    writer.setObject("i", PropertyValue(std::int64_t{-600}));
-    writer.setObject("t", PropertyValue(Date{when}));
-    writer.setObject("dict", PropertyValue(Dictionary{{"k", PropertyValue(2.5)}}));
-  }
-  UserDefaults reader(folder, "com.norvel.tavixd");
-  EXPECT_EQ(reader.integerForKey("i"), -600);
-  EXPECT_EQ(reader.dateForKey("t"), when);
-  EXPECT_DOUBLE_EQ(*reader.objectForKey("dict")->dictionary()->at("k").real(), 2.5);
-
-  struct stat st {};
-  ASSERT_EQ(stat(reader.filePath().c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0600u);
-}
-
-TEST_F(DefaultsTest, AWriteDoesNotLoseAValueAnotherWriterPutInTheFile) {
+TEST_F(DefaultsTest, AWriteKeepsAnotherWritersValueAndTheFilePrivate) {
   UserDefaults daemon(folder, "com.norvel.tavixd");
   UserDefaults tool(folder, "com.norvel.tavixd");
   tool.setObject("fromTool", PropertyValue(1));
@@ -59,6 +40,9 @@ TEST_F(DefaultsTest, AWriteDoesNotLoseAValueAnotherWriterPutInTheFile) {
   UserDefaults fresh(folder, "com.norvel.tavixd");
   EXPECT_EQ(fresh.integerForKey("fromTool"), 1);
   EXPECT_EQ(fresh.integerForKey("fromDaemon"), 2);
+  struct stat st {};
+  ASSERT_EQ(stat(fresh.filePath().c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
 }
 
 TEST_F(DefaultsTest, SynchronizeSeesAHandEditAndTellsObserversWhatChanged) {
@@ -107,16 +91,6 @@ TEST_F(DefaultsTest, WatchPicksUpAFileWrittenByHand) {
   EXPECT_EQ(*defaults.stringForKey("TVXBagURL"), "http://127.0.0.1:1/bag");
   std::lock_guard<std::mutex> guard(lock);
   EXPECT_NE(std::find(heard.begin(), heard.end(), "TVXBagURL"), heard.end());
-}
-
-TEST_F(DefaultsTest, SuitesAreSeparateDomainsInTheSameFolder) {
-  UserDefaults app(folder, "com.norvel.tavixd");
-  auto shared = app.suite("com.norvel.lookup.shared");
-  shared->setObject("k", PropertyValue("shared"));
-  app.setObject("k", PropertyValue("app"));
-  EXPECT_EQ(shared->stringForKey("k"), "shared");
-  EXPECT_EQ(app.stringForKey("k"), "app");
-  EXPECT_TRUE(fs::exists(folder / "com.norvel.lookup.shared.plist"));
 }
 
 }  // namespace

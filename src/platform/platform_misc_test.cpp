@@ -1,4 +1,4 @@
-// Smaller platform pieces: property lists, files, counters, transactions, logging.
+// Smaller platform pieces: property lists, files, counters.
 #include <sys/stat.h>
 
 #include <gtest/gtest.h>
@@ -9,7 +9,6 @@
 #include "platform/files.h"
 #include "platform/log.h"
 #include "platform/property_value.h"
-#include "platform/transactions.h"
 #include "support/temp_home.h"
 
 namespace tavix::platform {
@@ -80,17 +79,6 @@ TEST(PropertyValue, LenientReadingsFollowTheDefaultsRules) {
   EXPECT_EQ(PropertyValue("-1e300").asInteger(), INT64_MIN);
 }
 
-TEST(Files, CreateDirectoryReportsExistingEntriesOnlyWithoutIntermediates) {
-  testing::TempHome home;
-  const fs::path deep = home.root() / "a" / "b" / "c";
-  EXPECT_FALSE(createDirectory(deep, true));
-  EXPECT_FALSE(createDirectory(deep, true));  // again: fine
-  EXPECT_EQ(createDirectory(deep, false).value(), EEXIST);
-  EXPECT_EQ(createDirectory(home.root() / "x" / "y", false).value(), ENOENT);
-  std::ofstream(home.root() / "file") << "x";
-  EXPECT_TRUE(createDirectory(home.root() / "file" / "sub", true));
-}
-
 TEST(Files, AtomicWriteReplacesWholeFilesWithTheAskedModeAndLeavesNoTemporaries) {
   testing::TempHome home;
   const fs::path file = home.root() / "bag.plist";
@@ -130,26 +118,6 @@ TEST(CounterStore, SurvivesASaveAndLoadAndRejectsACorruptFile) {
   EXPECT_EQ(again.value("com.norvel.tavixd.launch"), 3);
   CounterStore missing;
   EXPECT_FALSE(missing.load(home.root() / "none.plist"));
-}
-
-TEST(TransactionTracker, CountsByNameAndCallsTheIdleHandlerWhenTheLastCloses) {
-  TransactionTracker tracker;
-  int idle = 0;
-  tracker.setIdleHandler([&] { idle++; });
-  auto a = tracker.begin("addFeedback");
-  auto b = tracker.begin("addFeedback");
-  auto c = tracker.begin("bagFetch");
-  EXPECT_EQ(tracker.openCount(), 3u);
-  EXPECT_EQ(tracker.open().at("addFeedback"), 2u);
-  a.reset();
-  auto moved = std::move(b);
-  b.reset();  // moved-from: closes nothing
-  EXPECT_EQ(tracker.openCount(), 2u);
-  moved.reset();
-  EXPECT_EQ(idle, 0);
-  c.reset();
-  EXPECT_EQ(idle, 1);
-  EXPECT_TRUE(tracker.open().empty());
 }
 
 }  // namespace

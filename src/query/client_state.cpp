@@ -9,7 +9,6 @@
 #include "bagview/tvx_bag.h"
 #include "cache/query_cache.h"
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
 #include "core/logging.h"
 #include "core/names.h"
 #include "feedback/client_session_manager.h"
@@ -31,32 +30,32 @@ std::shared_ptr<const TVXBag> labelled(const TVXBag& bag, const std::string& use
 
 }  // namespace
 
-std::shared_ptr<ClientState> ClientState::create(Assembly& assembly, std::string identifier) {
-  return std::shared_ptr<ClientState>(new ClientState(assembly, std::move(identifier)));
+std::shared_ptr<ClientState> ClientState::create(std::shared_ptr<const Environment> env, std::string identifier) {
+  return std::shared_ptr<ClientState>(new ClientState(std::move(env), std::move(identifier)));
 }
 
-ClientState::ClientState(Assembly& assembly, std::string identifier)
-    : assembly_(assembly),
+ClientState::ClientState(std::shared_ptr<const Environment> env, std::string identifier)
+    : env_(std::move(env)),
       identifier_(std::move(identifier)),
       clientShortName_(extractClientNameFromString(identifier_)),
-      waitQueue_(std::make_unique<platform::SerialQueue>(*assembly.dispatchPool, "com.norvel.tavixd.clientState")),
-      retryQueue_(std::make_unique<platform::SerialQueue>(*assembly.dispatchPool, "com.norvel.tavixd.clientState.retry")) {
-  if (!assembly_.userDefaults || !assembly_.userDefaults->boolForKey("TVXNoQueryCache")) {
-    queryCache_ = QueryCache::create(*assembly_.dispatchPool, *assembly_.clock, *assembly_.notificationCenter);
+      waitQueue_(std::make_unique<platform::SerialQueue>(*env_->pool, "com.norvel.tavixd.clientState")),
+      retryQueue_(std::make_unique<platform::SerialQueue>(*env_->pool, "com.norvel.tavixd.clientState.retry")) {
+  if (!env_->defaults->boolForKey("TVXNoQueryCache")) {
+    queryCache_ = QueryCache::create(*env_->pool, *env_->clock, *env_->center);
     cachingLog().debug("query cache ON for {}", identifier_);
   } else {
     cachingLog().debug("query cache OFF for {}", identifier_);
   }
-  if (assembly_.sharedSession && assembly_.guidController && assembly_.clientSessionManager) {
+  if (env_->sessions.sharedSession) {
     sessionLog().debug("Tavix is using shared instance of guid controller");
-    guidController_ = assembly_.guidController;
-    sessionManager_ = assembly_.clientSessionManager;
+    guidController_ = env_->guidController;
+    sessionManager_ = env_->sessionManager;
   } else {
-    guidController_ = std::make_shared<TavixUserGUIDController>(*assembly_.dispatchPool, *assembly_.clock,
-                                                                assembly_.notificationCenter);
+    guidController_ = std::make_shared<TavixUserGUIDController>(*env_->pool, *env_->clock, env_->center);
     sessionLog().debug("Tavix is using individual instance of guid controller {}",
                        static_cast<const void*>(guidController_.get()));
-    sessionManager_ = std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly_), guidController_, assembly_.bagController, identifier_);
+    sessionManager_ =
+        std::make_shared<ClientSessionManager>(env_->sessions, guidController_, env_->bagController, identifier_);
   }
 }
 
@@ -94,13 +93,13 @@ std::optional<platform::TimePoint> ClientState::lastNetworkRequest() const {
 }
 
 void ClientState::markNetworkRequest() {
-  const auto now = assembly_.clock->now();
+  const auto now = env_->clock->now();
   std::lock_guard lock(mutex_);
   lastNetworkRequest_ = now;
 }
 
 bool ClientState::isProbablyFirstLaunchEver() const {
-  return !assembly_.userDefaults || !assembly_.userDefaults->objectForKey("download_resources");
+  return !env_->defaults->objectForKey("download_resources");
 }
 
 void ClientState::relabelBagLocked() {
@@ -141,7 +140,7 @@ void ClientState::bag(const std::string& userAgent, BagReply reply) {
     observeBagChangesLocked();
   }
   cachingLog().info("Warming bag cache for agent: {}", agent);
-  if (auto current = assembly_.bagController ? assembly_.bagController->currentBag() : nullptr) {
+  if (auto current = env_->bagController->currentBag()) {
     std::shared_ptr<const TVXBag> bag;
     {
       std::lock_guard lock(mutex_);
@@ -166,7 +165,7 @@ void ClientState::bag(const std::string& userAgent, BagReply reply) {
   }
   // The waiter is answered once: by the bag's arrival or by this timer, whichever takes it first.
   std::weak_ptr<ClientState> weak = weak_from_this();
-  assembly_.clock->after(platform::seconds(bagWaitMilliseconds() / 1000.0), *waitQueue_, [weak, waiter] {
+  env_->clock->after(platform::seconds(bagWaitMilliseconds() / 1000.0), *waitQueue_, [weak, waiter] {
     auto self = weak.lock();
     if (!self) return;
     {
@@ -187,9 +186,9 @@ int ClientState::bagWaitMilliseconds() const {
 }
 
 void ClientState::observeBagChangesLocked() {
-  if (bagObserver_ || !assembly_.notificationCenter) return;
+  if (bagObserver_) return;
   std::weak_ptr<ClientState> weak = weak_from_this();
-  bagObserver_ = assembly_.notificationCenter->addObserver(
+  bagObserver_ = env_->center->addObserver(
       kTVXBagChangeNotification, nullptr, nullptr, [weak](const platform::Notification& notification) {
         if (auto self = weak.lock()) self->bagChangeNotification(notification);
       });
@@ -205,8 +204,7 @@ bool ClientState::ensureBag() {
     observeBagChangesLocked();
   }
   cachingLog().info("Warming bag cache for agent: {}", agent);
-  auto current = assembly_.bagController ? assembly_.bagController->currentBag() : nullptr;
-  if (current) {
+  if (auto current = env_->bagController->currentBag()) {
     std::lock_guard lock(mutex_);
     if (!bag_) bag_ = labelled(*current, userAgent_.value_or(agent));
     return true;
@@ -216,7 +214,7 @@ bool ClientState::ensureBag() {
   markNetworkRequest();
   const int waitMs = bagWaitMilliseconds();
   std::unique_lock lock(mutex_);
-  if (assembly_.clock->waitFor(lock, bagSignal_, platform::seconds(waitMs / 1000.0), [this] { return bagSignals_ > 0; })) {
+  if (env_->clock->waitFor(lock, bagSignal_, platform::seconds(waitMs / 1000.0), [this] { return bagSignals_ > 0; })) {
     --bagSignals_;
   }
   TavixLogForCategory(TavixLoggingCategoryDefault).notice("client {} finished waiting for bag", identifier_);

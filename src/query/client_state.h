@@ -20,6 +20,7 @@
 #include <vector>
 
 #include "core/requests.h"
+#include "feedback/client_session_manager.h"
 #include "platform/dispatch.h"
 #include "platform/notification_center.h"
 #include "platform/time.h"
@@ -30,12 +31,15 @@ class Message;
 
 namespace tavix {
 
-class Assembly;
 struct ClientStateQueryKind;
 class ClientSessionManager;
+class EngagedCompletionCache;
+class LocationManager;
 class QueryCache;
+class TavixBagController;
 class TavixUserGUIDController;
 class TVXBag;
+class TVXNetworkRequestFactory;
 
 namespace proto {
 class CTStartNetworkSearchFeedback;
@@ -43,7 +47,9 @@ class CTStartNetworkSearchFeedback;
 namespace platform {
 class Logger;
 class SerialQueue;
+class UserDefaults;
 namespace http {
+class URLSession;
 class URLSessionDataTask;
 struct URLSessionTaskMetrics;
 }  // namespace http
@@ -66,9 +72,28 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
  public:
   using BagReply = std::function<void(std::shared_ptr<const TVXBag> bag, std::optional<TVXError> error)>;
 
-  // Reads "TVXNoQueryCache"; shares the assembly's GUID controller and session manager when the
-  // assembly's sharedSession is set, else makes its own (the manager keyed by `identifier`).
-  static std::shared_ptr<ClientState> create(Assembly& assembly, std::string identifier);
+  // What every client state works with: one struct, made at start-up and shared by all states.
+  struct Environment {
+    platform::DispatchPool* pool = nullptr;
+    platform::Clock* clock = nullptr;
+    std::shared_ptr<platform::UserDefaults> defaults;
+    std::shared_ptr<platform::NotificationCenter> center;  // bag changes; the query caches' purges
+    std::shared_ptr<TVXNetworkRequestFactory> requestFactory;
+    std::shared_ptr<TavixBagController> bagController;
+    std::shared_ptr<EngagedCompletionCache> engagedCompletionCache;
+    std::shared_ptr<LocationManager> locationManager;
+    std::shared_ptr<platform::http::URLSession> session;  // the queries'
+    // The daemon's GUID controller and session manager: shared by every state when
+    // `sessions.sharedSession` is set; the manager also records the warm-up requests.
+    std::shared_ptr<TavixUserGUIDController> guidController;
+    std::shared_ptr<ClientSessionManager> sessionManager;
+    // What a state's own session manager is made with when sessions are not shared.
+    ClientSessionManager::Environment sessions;
+  };
+
+  // Reads "TVXNoQueryCache"; shares the daemon's GUID controller and session manager when
+  // sessions are shared, else makes its own (the manager keyed by `identifier`).
+  static std::shared_ptr<ClientState> create(std::shared_ptr<const Environment> env, std::string identifier);
   ~ClientState();
   ClientState(const ClientState&) = delete;
   ClientState& operator=(const ClientState&) = delete;
@@ -99,7 +124,6 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   void flightSearch(std::shared_ptr<const TVXFlightSearchRequest> request, TVXReplyBlock reply);
 
   // ---- Fields
-  Assembly& assembly() const { return assembly_; }
   const std::string& identifier() const { return identifier_; }
   const std::optional<std::string>& clientShortName() const { return clientShortName_; }
   std::optional<std::string> userAgent() const;
@@ -123,7 +147,7 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   bool isProbablyFirstLaunchEver() const;
 
  private:
-  ClientState(Assembly& assembly, std::string identifier);
+  ClientState(std::shared_ptr<const Environment> env, std::string identifier);
   void bagChangeNotification(const platform::Notification& notification);
   // Replaces the held bag (if any) by one labelled with `userAgent`. Under mutex_.
   void relabelBagLocked();
@@ -203,7 +227,7 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
                             SearchResponse answer, const platform::http::URLSessionTaskMetrics& timing);
   void debugFlightSearch(const TVXFlightSearchRequest& request, const TVXReplyBlock& reply);
 
-  Assembly& assembly_;
+  const std::shared_ptr<const Environment> env_;
   const std::string identifier_;
   const std::optional<std::string> clientShortName_;
   std::shared_ptr<QueryCache> queryCache_;

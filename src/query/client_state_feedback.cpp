@@ -9,7 +9,6 @@
 #include "bagview/tvx_bag.h"
 #include "context/location.h"
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "feedback/client_session_manager.h"
@@ -78,7 +77,7 @@ void ClientState::addCodable(const google::protobuf::Message& codable, std::uint
 
 void ClientState::recordSkipSearch(int reason, const std::string& input, std::uint64_t queryId) {
   proto::CTSkipSearchFeedback skip;
-  skip.set_timestamp(eventTimestamp(assembly_));
+  skip.set_timestamp(eventTimestamp(*env_->clock));
   skip.set_input(input);
   skip.set_reason(static_cast<proto::SkipSearchType::Value>(reason));
   addCodable(skip, queryId, false);
@@ -90,28 +89,27 @@ void ClientState::recordDidGoToSearch(const TVXRequest& request, const std::stri
   const std::string lower = platform::asciiLowercased(*agent);
   if (lower.find("messages") == std::string::npos) return;
   proto::CTDidGoToSearchFeedback didGo;
-  didGo.set_timestamp(eventTimestamp(assembly_));
+  didGo.set_timestamp(eventTimestamp(*env_->clock));
   didGo.set_input(input);
   didGo.set_endpoint_type(proto::EndpointType::tavix_search);
   addCodable(didGo, request.queryId, true);
 }
 
 std::optional<std::string> ClientState::geoSessionEntityString() {
-  if (!assembly_.locationManager) return std::nullopt;
-  auto session = assembly_.locationManager->getMapsUserSessionEntityAndReset(true);
+  auto session = env_->locationManager->getMapsUserSessionEntityAndReset(true);
   if (!session || session->sessionId.empty()) return std::nullopt;
   return fmt::format("{} {} {:f}", session->sessionId, session->sequenceNumber, session->relativeTimestamp);
 }
 
 ClientState::StartRecord ClientState::startSearchEventForRequest(const platform::http::URLRequest& request) {
   auto start = std::make_shared<proto::CTStartNetworkSearchFeedback>();
-  start->set_timestamp(eventTimestamp(assembly_));
+  start->set_timestamp(eventTimestamp(*env_->clock));
   start->set_url(request.url);
   auto& headers = *start->mutable_headers();
   for (const auto& [name, value] : request.headers.all()) headers[name] = value;
   start->set_uuid(makeRandomUUIDString());
-  if (assembly_.requestFactory && assembly_.requestFactory->useMarvola()) {
-    start->set_marvola_status(assembly_.requestFactory->proxyGetStatus());
+  if (env_->requestFactory->useMarvola()) {
+    start->set_marvola_status(env_->requestFactory->proxyGetStatus());
   }
   return start;
 }
@@ -126,7 +124,7 @@ void ClientState::endNetworkFeedback(const StartRecord& start, const std::string
                                      std::uint64_t responseSize, long statusCode, const URLSessionTaskMetrics& timing,
                                      std::uint64_t queryId, const std::string& agent) {
   if (!start || !sessionManager_) return;
-  auto end = makeEndRecord(*start, responseSize, statusCode, timing, eventTimestamp(assembly_));
+  auto end = makeEndRecord(*start, responseSize, statusCode, timing, eventTimestamp(*env_->clock));
   // The server's own account of the request sits in the first element of its reply.
   const auto reply = platform::parseJson(rawResponse);
   const auto* list = reply ? reply->array() : nullptr;
@@ -158,7 +156,7 @@ void ClientState::failSearchFeedback(const std::optional<TVXError>& error, const
     }
   }
   proto::CTErrorFeedback errorRecord;
-  errorRecord.set_timestamp(eventTimestamp(assembly_));
+  errorRecord.set_timestamp(eventTimestamp(*env_->clock));
   if (error) {
     errorRecord.set_code(static_cast<std::int32_t>(error->code));
     errorRecord.set_domain(error->domain);
@@ -166,7 +164,7 @@ void ClientState::failSearchFeedback(const std::optional<TVXError>& error, const
   }
   addCodable(errorRecord, request.queryId, false);
   if (!start || !sessionManager_) return;
-  auto end = makeEndRecord(*start, responseSize, statusCode, timing, eventTimestamp(assembly_));
+  auto end = makeEndRecord(*start, responseSize, statusCode, timing, eventTimestamp(*env_->clock));
   addCodable(end, request.queryId, false);
 }
 
@@ -178,12 +176,12 @@ void ClientState::recordSearchResult(long statusCode) {
 }
 
 void ClientState::setPerformedSearch() {
-  if (assembly_.requestFactory) assembly_.requestFactory->setPerformedSearch();
+  env_->requestFactory->setPerformedSearch();
 }
 
 std::optional<std::string> ClientState::proxyForTask() const {
-  if (!assembly_.requestFactory || assembly_.requestFactory->proxyGetStatus() != 1) return std::nullopt;
-  auto proxy = assembly_.requestFactory->proxyURL();
+  if (env_->requestFactory->proxyGetStatus() != 1) return std::nullopt;
+  auto proxy = env_->requestFactory->proxyURL();
   if (!proxy) TavixLogForCategory(TavixLoggingCategoryConnection).error("Enabling Marvola for request failed.");
   return proxy;
 }
@@ -197,12 +195,12 @@ void ClientState::failUnbuiltRequest(const TVXRequest& request, const std::strin
 }
 
 void ClientState::warm() {
-  const auto warmURL = assembly_.bagController ? assembly_.bagController->warmURL() : std::nullopt;
+  const auto warmURL = env_->bagController->warmURL();
   if (!warmURL) {
     searchLog().debug("warm not required, bag fetch in process");
     return;
   }
-  const auto now = assembly_.clock->now();
+  const auto now = env_->clock->now();
   {
     std::lock_guard lock(mutex_);
     if (lastNetworkRequest_ && now - *lastNetworkRequest_ < platform::seconds(30)) {
@@ -210,7 +208,7 @@ void ClientState::warm() {
       return;
     }
   }
-  auto request = assembly_.requestFactory ? assembly_.requestFactory->warmRequest(*warmURL) : std::nullopt;
+  auto request = env_->requestFactory->warmRequest(*warmURL);
   if (!request) return;
   {
     // Taken now that a request exists, and checked again, so that of two warms racing one goes.
@@ -225,12 +223,10 @@ void ClientState::warm() {
   const std::string agent = userAgent().value_or("");
   // The start of a warm-up is the daemon's own record and goes to the daemon's session manager;
   // its end, like every end record, to the client's (the same one when sessions are shared).
-  if (assembly_.clientSessionManager) {
-    assembly_.clientSessionManager->addTavixFeedback(makeTavixFeedbackWithCodable(*start, 0, "", agent));
-  }
+  env_->sessionManager->addTavixFeedback(makeTavixFeedbackWithCodable(*start, 0, "", agent));
   std::weak_ptr<ClientState> weak = weak_from_this();
   auto task = dataTaskWithTiming(
-      assembly_.urlSession(), *request,
+      env_->session, *request,
       [weak, start, agent](std::string data, std::optional<platform::http::HTTPURLResponse> response,
                            std::optional<platform::http::URLError> error, const URLSessionTaskMetrics& timing) {
         const long status = response ? response->statusCode : 0;

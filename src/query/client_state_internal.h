@@ -4,16 +4,15 @@
 #include <cstdint>
 #include <string>
 
-#include "core/assembly.h"
 #include "feedback/tavix_feedback.h"
 #include "platform/clock.h"
 #include "platform/http/url_request.h"
 
 namespace tavix::query_internal {
 
-// Event time stamps follow the assembly's clock (nanoseconds), so that records and sessions agree,
+// Event time stamps follow the daemon's clock (nanoseconds), so that records and sessions agree,
 // also on a virtual clock.
-inline std::uint64_t eventTimestamp(const Assembly& assembly) { return hostTicksNow(assembly.clock); }
+inline std::uint64_t eventTimestamp(const platform::Clock& clock) { return hostTicksNow(&clock); }
 
 // "Name: value, Name: value" for the protocol log.
 inline std::string headersText(const platform::http::HeaderFields& headers) {

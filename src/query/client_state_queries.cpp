@@ -9,7 +9,6 @@
 #include <sstream>
 
 #include "bagview/tvx_bag.h"
-#include "core/assembly.h"
 #include "core/logging.h"
 #include "core/names.h"
 #include "network/request_factory.h"
@@ -106,7 +105,7 @@ void ClientState::lookup(std::shared_ptr<const TVXLookupRequest> request, TVXRep
 }
 
 void ClientState::flightSearch(std::shared_ptr<const TVXFlightSearchRequest> request, TVXReplyBlock reply) {
-  if (assembly_.userDefaults && assembly_.userDefaults->boolForKey("TVXFlightUseDebugData")) {
+  if (env_->defaults->boolForKey("TVXFlightUseDebugData")) {
     debugFlightSearch(*request, reply);
     return;
   }
@@ -120,9 +119,7 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
 
   std::shared_ptr<const TVXBag> bag;
   if (!bagForQuery(kind, *request, reply, &bag)) return;
-  auto built = assembly_.requestFactory && bag
-                   ? kind.build(*assembly_.requestFactory, *request, *bag, currentUserGuid())
-                   : std::nullopt;
+  auto built = bag ? kind.build(*env_->requestFactory, *request, *bag, currentUserGuid()) : std::nullopt;
   if (!built) {
     failUnbuiltRequest(*request, kind.input(*request, URLRequest{}), reply, log);
     return;
@@ -147,14 +144,14 @@ void ClientState::performQuery(const ClientStateQueryKind& kind, std::shared_ptr
   const auto proxy = proxyForTask();
   std::shared_ptr<platform::http::URLSessionDataTask> task;
   if (kind.retriedUntilRenderDeadline) {
-    const auto expire = assembly_.clock->now() +
+    const auto expire = env_->clock->now() +
                         platform::seconds(static_cast<double>(bag->searchRenderTimeout()) / 1000.0) -
                         platform::seconds(0.5);
     auto retryable = std::make_shared<const TVXRetryableNetworkRequest>(*httpRequest, expire, false, proxy);
-    task = dataTaskWithRetryableRequest(assembly_.urlSession(), retryable, 1, 3, *assembly_.clock, *retryQueue_,
+    task = dataTaskWithRetryableRequest(env_->session, retryable, 1, 3, *env_->clock, *retryQueue_,
                                         std::move(completion));
   } else {
-    task = dataTaskWithTiming(assembly_.urlSession(), *httpRequest, std::move(completion));
+    task = dataTaskWithTiming(env_->session, *httpRequest, std::move(completion));
     if (proxy) task->setProxy(*proxy);
   }
   task->resume();
@@ -194,7 +191,7 @@ ClientState::StartRecord ClientState::startRecordForQuery(const ClientStateQuery
   StartRecord start;
   if (kind.startWithoutUUID) {
     start = std::make_shared<proto::CTStartNetworkSearchFeedback>();
-    start->set_timestamp(query_internal::eventTimestamp(assembly_));
+    start->set_timestamp(query_internal::eventTimestamp(*env_->clock));
     start->set_url(httpRequest.url);
     for (const auto& [name, value] : httpRequest.headers.all()) (*start->mutable_headers())[name] = value;
   } else {
@@ -302,9 +299,7 @@ void ClientState::queryResponseArrived(const ClientStateQueryKind& kind, const T
 void ClientState::debugFlightSearch(const TVXFlightSearchRequest& request, const TVXReplyBlock& reply) {
   auto& log = TavixLogForCategory(TavixLoggingCategoryFlight);
   std::string location = "file:///tmp/flight_dummy_data.json";
-  if (assembly_.userDefaults) {
-    if (auto configured = assembly_.userDefaults->stringForKey("TVXFlightDebugDataLocation")) location = *configured;
-  }
+  if (auto configured = env_->defaults->stringForKey("TVXFlightDebugDataLocation")) location = *configured;
   const std::string path = location.rfind("file://", 0) == 0 ? location.substr(7) : location;
   std::ifstream file(path, std::ios::binary);
   std::ostringstream text;

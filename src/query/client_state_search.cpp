@@ -6,7 +6,6 @@
 #include "bagview/tvx_bag.h"
 #include "cache/engaged_completion_cache.h"
 #include "cache/query_cache.h"
-#include "core/assembly.h"
 #include "core/diagnostics.h"
 #include "core/logging.h"
 #include "core/names.h"
@@ -74,8 +73,7 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
   recordDidGoToSearch(*request, input);
 
   const std::string guid = currentUserGuid();
-  auto built = assembly_.requestFactory ? assembly_.requestFactory->searchRequest(*request, *bag, guid)
-                                        : std::nullopt;
+  auto built = env_->requestFactory->searchRequest(*request, *bag, guid);
   if (!built) {
     failUnbuiltRequest(*request, input, reply, searchLog());
     return;
@@ -102,7 +100,7 @@ ClientState::LocalCompletions ClientState::localCompletionsForSearch(const TVXSe
     return local;
   }
   proto::CTStartLocalSearchFeedback start;
-  start.set_timestamp(query_internal::eventTimestamp(assembly_));
+  start.set_timestamp(query_internal::eventTimestamp(*env_->clock));
   start.set_input(input);
   start.set_trigger_event(length < smartMinimum ? proto::TriggerSearchRequestEvent::warm
                                                 : proto::TriggerSearchRequestEvent::new_character);
@@ -118,7 +116,7 @@ ClientState::LocalCompletions ClientState::localCompletionsForSearch(const TVXSe
     count = asked > 0 ? static_cast<unsigned long>(asked) : 3;
   }
   const auto timeout = static_cast<unsigned long>(std::max<std::int64_t>(bag.smartHistoryTimeout(), 0));
-  auto found = assembly_.engagedCompletionCache->completionsForInput(input, client, count, timeout);
+  auto found = env_->engagedCompletionCache->completionsForInput(input, client, count, timeout);
   if (!found || found->empty()) {
     TavixLogForCategory(TavixLoggingCategoryDefault).notice("Local completion not found: input {}", input);
   } else {
@@ -151,7 +149,7 @@ bool ClientState::answerSearchFromQueryCache(const TVXSearchRequest& request, co
     TavixDiagnosticDataReporter::addValue(1, createCounterKey(*clientShortName_, "ondevicecachehits"));
   }
   proto::CTCacheHitFeedback cacheHit;
-  cacheHit.set_timestamp(query_internal::eventTimestamp(assembly_));
+  cacheHit.set_timestamp(query_internal::eventTimestamp(*env_->clock));
   cacheHit.set_input(request.queryString);
   cacheHit.set_uuid(request.uuid);
   cacheHit.set_reason(proto::SkipSearchType::cache_hit);
@@ -171,7 +169,7 @@ void ClientState::sendSearch(std::shared_ptr<const TVXSearchRequest> request, TV
 
   auto self = shared_from_this();
   auto task = dataTaskWithTiming(
-      assembly_.urlSession(), *httpRequest,
+      env_->session, *httpRequest,
       [self, request, reply, httpRequest, start, localSuggestions = std::move(localSuggestions)](
           std::string data, std::optional<HTTPURLResponse> response, std::optional<URLError> error,
           const platform::http::URLSessionTaskMetrics& timing) {
@@ -224,7 +222,7 @@ void ClientState::searchResponseArrived(const TVXSearchRequest& request, const T
     const platform::Dictionary* first = parsed->dictionary();
     if (const auto* list = parsed->array(); list && !list->empty()) first = list->front().dictionary();
     if (first) {
-      auto now = assembly_.clock->now();
+      auto now = env_->clock->now();
       queryCache_->set(Ref<CachedResultSet>(new CachedResultSet(input, &httpRequest, *first, request.uuid, data, now)));
     }
   }
@@ -244,7 +242,7 @@ void ClientState::searchResponseArrived(const TVXSearchRequest& request, const T
   if (auto forceFetch = response->headers.get("X-Norvel-ForceFetch")) {
     const auto value = platform::parseJson(*forceFetch);
     if (value && value->dictionary()) {
-      if (assembly_.bagController) assembly_.bagController->forceFetchBag(*value->dictionary());
+      env_->bagController->forceFetchBag(*value->dictionary());
     } else {
       searchLog().error("Failed to deserialize X-Norvel-ForceFetch header data into a dictionary: {}", *forceFetch);
     }

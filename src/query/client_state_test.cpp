@@ -11,7 +11,6 @@
 #include "bag/tavix_bag_controller.h"
 #include "bagview/tvx_bag.h"
 #include "cache/query_cache.h"
-#include "core/assembly.h"
 #include "devserver/devserver.h"
 #include "network/request_factory.h"
 #include "platform/clock.h"
@@ -20,7 +19,7 @@
 #include "platform/http/url_session.h"
 #include "platform/notification_center.h"
 #include "query/client_state_manager.h"
-#include "support/test_assembly.h"
+#include "support/client_states.h"
 
 namespace tavix {
 namespace {
@@ -80,7 +79,7 @@ class ClientStateTest : public ::testing::Test, protected testing::TestAssembly 
   }
 
   std::shared_ptr<ClientState> make(const std::string& identifier = "com.norvel.seekara") {
-    states.push_back(ClientState::create(assembly, identifier));
+    states.push_back(ClientState::create(testing::clientStateEnvironment(*this), identifier));
     return states.back();
   }
 
@@ -178,7 +177,7 @@ TEST_F(ClientStateTest, NewUserAgentRelabelsTheBagAndEmptiesTheQueryCache) {
 
 TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
   startController();
-  auto manager = makeClientStateManager();
+  auto manager = testing::makeClientStateManager(*this);
   EXPECT_EQ(manager->stateForClientIdentifier(""), nullptr);
 
   std::shared_ptr<ClientState> a, b;
@@ -203,7 +202,7 @@ TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
                       platform::Dictionary{{"identifier", "com.norvel.brovane"}, {"agent", "brovane/7"}},
                       platform::Dictionary{{"identifier", "com.norvel.news"}},
                   });
-  auto loaded = makeClientStateManager();
+  auto loaded = testing::makeClientStateManager(*this);
   auto sessions = loaded->sessions();
   ASSERT_EQ(sessions.size(), 1u);
   EXPECT_EQ(*sessions[0].dictionary()->at("agent").string(), "brovane/7");

@@ -57,9 +57,11 @@ void Lookup::start() {
   });
 }
 
-bool Lookup::lookupEnabled() const {
-  return !env_.defaults->suite(kLookupSharedSuite)->boolForKey(kLookupSuggestionsDisabledKey);
+bool lookupEnabled(const platform::UserDefaults& defaults) {
+  return !defaults.suite(kLookupSharedSuite)->boolForKey(kLookupSuggestionsDisabledKey);
 }
+
+bool Lookup::lookupEnabled() const { return tavix::lookupEnabled(*env_.defaults); }
 
 std::string Lookup::signatureFromURL(std::string_view url) { return tavix::signatureFromURL(url); }
 

@@ -30,6 +30,10 @@ class ResourceVersionsProvider;
 inline constexpr const char* kLookupSharedSuite = "com.norvel.lookup.shared";
 inline constexpr const char* kLookupSuggestionsDisabledKey = "LookupSuggestionsDisabled";
 
+// True unless the look-up panel's suite (in the folder of `defaults`) disables suggestions, read
+// from disk on every call: the panel's settings switch it while we run. Safe from any thread.
+bool lookupEnabled(const platform::UserDefaults& defaults);
+
 class Lookup : public std::enable_shared_from_this<Lookup> {
  public:
   // Everything must outlive the Lookup except what is shared. `resourceVersions` may be null (no
@@ -51,8 +55,7 @@ class Lookup : public std::enable_shared_from_this<Lookup> {
   Lookup(const Lookup&) = delete;
   Lookup& operator=(const Lookup&) = delete;
 
-  // True unless "LookupSuggestionsDisabled" is set in the suite "com.norvel.lookup.shared", read
-  // from disk on every call. Safe from any thread.
+  // lookupEnabled() of the daemon's defaults.
   bool lookupEnabled() const;
 
   // The version of a hints file served from `url` (see signatureFromURL in lookup_hints.h).

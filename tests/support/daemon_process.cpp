@@ -21,6 +21,17 @@ void keepBagFetchesLocal(const TempHome& home) {
          "\t<key>TVXBagURL</key>\n\t<string>http://127.0.0.1:9/bag</string>\n</dict>\n</plist>\n";
 }
 
+std::vector<std::string> sessionFileContents(const TempHome& home) {
+  std::vector<std::string> files;
+  std::error_code ec;
+  for (const auto& e : std::filesystem::directory_iterator(home.cache() / "com.norvel.tavixd", ec)) {
+    if (e.path().filename().string().find("session.") == std::string::npos) continue;
+    std::ifstream in(e.path(), std::ios::binary);
+    files.emplace_back(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+  }
+  return files;
+}
+
 DaemonProcess::DaemonProcess(const std::string& binary, const TempHome& home, std::vector<std::string> args,
                              const std::string& logName, const std::function<void()>& inChild)
     : logFile_(home.root() / logName) {

@@ -16,6 +16,9 @@ namespace tavix::testing {
 // at once (and holds the daemon for its retries, about 8 s). DaemonProcess does it by itself.
 void keepBagFetchesLocal(const TempHome& home);
 
+// The bytes of each feedback session file, waiting or claimed, in the daemon's caches folder.
+std::vector<std::string> sessionFileContents(const TempHome& home);
+
 class DaemonProcess {
  public:
   // Starts `binary` with `args`, the XDG homes pointed into `home`, stderr into home/`logName`.

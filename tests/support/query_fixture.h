@@ -15,7 +15,6 @@
 
 #include "bag/tavix_bag_controller.h"
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
 #include "core/requests.h"
 #include "devserver/devserver.h"
 #include "feedback/client_session_manager.h"
@@ -30,7 +29,7 @@
 #include "platform/notification_center.h"
 #include "query/client_state.h"
 #include "support/temp_home.h"
-#include "support/test_assembly.h"
+#include "support/client_states.h"
 #include "tavix_proto/feedback_session.pb.h"
 #include "cache/engaged_completion_cache.h"
 
@@ -154,7 +153,7 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
   }
 
   std::shared_ptr<ClientState> make(const std::string& identifier, const std::string& userAgent) {
-    states.push_back(ClientState::create(assembly, identifier));
+    states.push_back(ClientState::create(testing::clientStateEnvironment(*this), identifier));
     states.back()->updateClient(userAgent);
     return states.back();
   }

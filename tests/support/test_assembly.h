@@ -1,25 +1,94 @@
 // The daemon-level services a unit test stands its objects on, made the way start-up makes them:
 // a dispatch pool, a virtual clock, a temp home holding the daemon's defaults and caches folder,
-// a notification centre and a transaction tracker. `assembly` is wired to them for the objects
-// that still find their peers through one.
+// a notification centre and a transaction tracker. `assembly` holds what a test wires on them,
+// under start-up's names, and the environment builders below hand it to the objects under test.
 #pragma once
 
 #include <memory>
+#include <mutex>
 
+#include "bag/tavix_bag_controller.h"
 #include "context/user_guid_controller.h"
-#include "core/assembly.h"
+#include "core/names.h"
+#include "core/url_sessions.h"
+#include "feedback/client_session.h"
+#include "feedback/client_session_manager.h"
 #include "feedback/persistent_storage.h"
 #include "network/request_factory.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
+#include "platform/http/url_session.h"
 #include "platform/notification_center.h"
 #include "platform/transactions.h"
-#include "query/client_state.h"
-#include "query/client_state_manager.h"
 #include "support/temp_home.h"
 
+namespace tavix {
+namespace platform {
+class ActivityScheduler;
+}
+class ClientStateManager;
+class EngagedCompletionCache;
+class LocationManager;
+class ResourceVersionsProvider;
+class TavixFlusherIPC;
+class UploadManager;
+}  // namespace tavix
+
 namespace tavix::testing {
+
+// The objects a test wires together, named as start-up names them; null until the test makes them.
+struct TestWiring {
+  platform::DispatchPool* dispatchPool = nullptr;
+  platform::Clock* clock = nullptr;
+  platform::TransactionTracker* transactions = nullptr;
+  platform::ActivityScheduler* activityScheduler = nullptr;
+  platform::Paths paths;
+  bool sharedSession = false;
+  std::shared_ptr<platform::UserDefaults> userDefaults;
+  std::shared_ptr<platform::NotificationCenter> notificationCenter;
+  std::shared_ptr<TVXNetworkRequestFactory> requestFactory;
+  std::shared_ptr<TavixBagController> bagController;
+  std::shared_ptr<UploadManager> uploadManager;
+  std::shared_ptr<ClientStateManager> clientStateManager;
+  std::shared_ptr<TavixUserGUIDController> guidController;
+  std::shared_ptr<ClientSessionManager> clientSessionManager;
+  std::shared_ptr<TavixFlusherIPC> flusherIPCListener;
+  std::shared_ptr<TavixPersistentStorage> persistentStorage;
+  std::shared_ptr<EngagedCompletionCache> engagedCompletionCache;
+  std::shared_ptr<LocationManager> locationManager;
+  std::shared_ptr<ResourceVersionsProvider> resourceVersions;
+
+  // The query and bag sessions, configured as start-up configures them; made on first use.
+  std::shared_ptr<platform::http::URLSession> urlSession() {
+    std::call_once(queryOnce_, [&] {
+      query_ = std::make_shared<platform::http::URLSession>(querySessionConfiguration(*userDefaults));
+    });
+    return query_;
+  }
+  std::shared_ptr<platform::http::URLSession> bagSession() {
+    std::call_once(bagOnce_, [&] { bag_ = std::make_shared<platform::http::URLSession>(bagSessionConfiguration()); });
+    return bag_;
+  }
+  platform::fs::path cachesFolder() const { return paths.cachesFolder(kTavixdDomain); }
+
+ private:
+  std::once_flag queryOnce_, bagOnce_;
+  std::shared_ptr<platform::http::URLSession> query_, bag_;
+};
+
+// What feedback sessions, session managers and bag controllers are made with, from the wiring as it
+// is now.
+inline FeedbackEnvironment feedbackEnvironment(const TestWiring& w) {
+  return {w.dispatchPool, w.clock, w.userDefaults, w.persistentStorage, w.guidController, w.resourceVersions};
+}
+inline ClientSessionManager::Environment sessionManagerEnvironment(const TestWiring& w) {
+  return {feedbackEnvironment(w), w.transactions, w.notificationCenter, w.sharedSession};
+}
+inline TavixBagController::Environment bagControllerEnvironment(TestWiring& w) {
+  return {feedbackEnvironment(w), w.transactions, w.notificationCenter, w.requestFactory, w.bagSession(),
+          w.paths.cacheHome, w.cachesFolder()};
+}
 
 class TestAssembly {
  public:
@@ -57,11 +126,6 @@ class TestAssembly {
     assembly.requestFactory = TVXNetworkRequestFactory::create(requestFactoryEnvironment(), std::move(providers));
     return assembly.requestFactory;
   }
-  // A client state manager whose states find their peers in the assembly.
-  std::shared_ptr<ClientStateManager> makeClientStateManager() {
-    return std::make_shared<ClientStateManager>(
-        pool, defaults, [this](const std::string& identifier) { return ClientState::create(assembly, identifier); });
-  }
   // A new GUID controller announcing on the assembly's centre.
   std::shared_ptr<TavixUserGUIDController> makeGUIDController() {
     return std::make_shared<TavixUserGUIDController>(pool, *assembly.clock, center);
@@ -74,7 +138,7 @@ class TestAssembly {
   platform::VirtualClock clock;
   std::shared_ptr<platform::UserDefaults> defaults;
   std::shared_ptr<platform::NotificationCenter> center;
-  Assembly assembly;
+  TestWiring assembly;
 };
 
 }  // namespace tavix::testing

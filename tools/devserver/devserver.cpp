@@ -1,5 +1,6 @@
 #include "devserver/devserver.h"
 #include "devserver/feedback_routes.h"
+#include "devserver/resource_files.h"
 #include "platform/json_value.h"
 #include "platform/http/url.h"
 #include "platform/strings.h"
@@ -95,6 +96,7 @@ struct DevServer::Impl {
   json recorded = json::array();
   std::map<std::string, Fault> faults;
   std::uint64_t served = 0;
+  std::atomic<std::uint64_t> bagsServed{0};
 
   std::string base() const { return "http://127.0.0.1:" + std::to_string(port); }
 
@@ -298,9 +300,9 @@ struct DevServer::Impl {
     return true;
   }
 
-  json bag() const {
+  json bag() {
     const std::string b = base();
-    return {{"version", "1"},
+    json out = {{"version", "1"},
             {"enabled", true},
             {"feedback_enabled", true},
             {"search_url", b + "/search"},
@@ -313,9 +315,10 @@ struct DevServer::Impl {
             {"min_query_length", 1},
             {"search_render_timeout_ms", 2000},
             {"request_timeout_s", 10},
-            {"resources", json::object()},
-            {"download_resources_list", {"lookup_hints"}},
-            {"lookup_hints", b + "/resources/lookup_hints"}};
+            {"resources", json::object()}};
+    // A new access key with every bag: resource URLs change only in "key".
+    addResourcesToBag(out, b, "devkey" + std::to_string(++bagsServed));
+    return out;
   }
 
   json search(const httplib::Request& req) {
@@ -390,19 +393,26 @@ struct DevServer::Impl {
     res.set_content("flight " + req.get_param_value("q") + " on time", "application/x-protobuf");
   }
 
-  // A resource file: a fixed body with an ETag, cacheable for "max_age" seconds (default 60).
+  // A resource file the bag names, or any other name: a fixed body. Each has an ETag (a quoted or
+  // bare If-None-Match of it gets 304) and is cacheable for "max_age" seconds (default 60).
   void resource(const httplib::Request& req, httplib::Response& res) {
     const std::string name = req.matches[1];
-    const std::string body = "resource " + name + "\n";
-    const std::string etag = "\"" + std::to_string(std::hash<std::string>{}(body)) + "\"";
+    const auto file = resourceFile(req.path);
+    if (file && !file->redirect.empty()) {
+      res.set_redirect(base() + file->redirect);
+      return;
+    }
+    const std::string body = file ? file->body : "resource " + name + "\n";
+    const std::string tag = file ? file->etag : std::to_string(std::hash<std::string>{}(body));
+    const std::string etag = "\"" + tag + "\"";
     const std::string maxAge = req.has_param("max_age") ? req.get_param_value("max_age") : "60";
     res.set_header("ETag", etag);
     res.set_header("Cache-Control", "max-age=" + maxAge);
-    if (req.get_header_value("If-None-Match") == etag) {
+    if (const auto match = req.get_header_value("If-None-Match"); match == etag || match == tag) {
       res.status = 304;
       return;
     }
-    res.set_content(body, "application/octet-stream");
+    res.set_content(body, file ? "application/json" : "application/octet-stream");
   }
 
   void routes() {
@@ -469,7 +479,7 @@ struct DevServer::Impl {
                served_([this](const httplib::Request& req, httplib::Response& res) { replyJSON(res, card(req)); }));
     server.Get("/flight", served_([this](const httplib::Request& req, httplib::Response& res) { flight(req, res); }));
     server.Get("/warm", served_([](const httplib::Request&, httplib::Response& res) { res.status = 204; }));
-    server.Get(R"(/resources/([A-Za-z0-9_.-]+))",
+    server.Get(R"(/resources/([A-Za-z0-9_./-]+))",
                served_([this](const httplib::Request& req, httplib::Response& res) { resource(req, res); }));
     addFeedbackRoutes(server, feedbackStore, [this](httplib::Server::Handler handler) { return served_(std::move(handler)); });
     auto notFound = served_([](const httplib::Request&, httplib::Response& res) {

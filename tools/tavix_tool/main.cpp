@@ -14,6 +14,7 @@
 #include "search_commands.h"
 #include "tavix/client.h"
 #include "flush_commands.h"
+#include "resource_commands.h"
 
 namespace {
 
@@ -35,6 +36,9 @@ int usage(std::FILE* out = stderr, int status = 2) {
       "                                           one JSON reply a line; - reads one input a line\n"
       "  bag [--client ID] [--agent UA]           print the client's bag\n"
       "  sessions                                 list the known client states\n"
+      "  resources                                each resource file: URL, version, size, age,\n"
+      "                                           and the progress of a download in flight\n"
+      "  resources cat ID                         print the file of resource ID\n"
       "  type [--client ID] [--agent UA] [TEXT...]\n"
       "                                           type on a terminal and see each keystroke's\n"
       "                                           suggestions; without one, type TEXT and print\n"
@@ -167,6 +171,10 @@ int main(int argc, char** argv) {
   tavix::client::Client client(options);
   if (command == "notify" && args.size() == 1) return report(client.notifySync(args[0]));
   if (command == "activity" && args.size() == 2 && args[0] == "run") return report(client.runActivitySync(args[1]));
+  if (command == "resources") {
+    const int status = tavix::tool::resourcesCommand(client, args);
+    return status == 2 ? usage() : status;
+  }
   if (tavix::tool::isFlushCommand(command)) {
     const int status = tavix::tool::runFlushCommand(client, command, args);
     return status == 2 ? usage() : status;

@@ -85,6 +85,11 @@ class Client {
   void runActivity(const std::string& name, std::function<void(std::optional<Error>)> reply);
   // The flush command channel's endpoint: a connected socket (yours to close) or -1 with an error.
   void listenToFlusher(std::function<void(int fd, std::optional<Error>)> reply);
+  // A resource file the daemon keeps (a bag key): a read-only descriptor (yours to close) and its
+  // attributes as an XML property list dictionary, or -1 with an error (code 404 in
+  // "kTVXErrorDomain" when there is no such file).
+  void fileHandleForResource(const std::string& identifier,
+                             std::function<void(int fd, std::string attributesPlist, std::optional<Error>)> reply);
 
   // Blocking helpers: the same calls, waiting for their answer (at most their deadline).
   std::optional<Error> connect();  // connects and configures now

@@ -113,6 +113,9 @@ struct URLSessionDataTask::Impl {
 
   std::atomic<State> state{State::Suspended};
   std::atomic<bool> finished{false};
+  // Response bytes so far and as announced (-1 unknown), for progress reports.
+  std::atomic<std::int64_t> received{0};
+  std::atomic<std::int64_t> expected{-1};
 
   mutable std::mutex lock;  // guards the fields below
   DataTaskCompletion completion;
@@ -329,8 +332,10 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
     return size * count;
   }
 
-  static int onProgress(void* user, curl_off_t, curl_off_t dlnow, curl_off_t, curl_off_t ulnow) {
+  static int onProgress(void* user, curl_off_t dltotal, curl_off_t dlnow, curl_off_t, curl_off_t ulnow) {
     auto* task = static_cast<TaskImpl*>(user);
+    task->received = dlnow;
+    task->expected = dltotal > 0 ? dltotal : -1;
     if (dlnow + ulnow != task->lastTransferred) {
       task->lastTransferred = dlnow + ulnow;
       task->lastProgress = Steady::now();
@@ -626,6 +631,10 @@ const URLRequest& URLSessionDataTask::originalRequest() const { return impl_->re
 
 URLSessionDataTask::State URLSessionDataTask::state() const { return impl_->state; }
 
+std::int64_t URLSessionDataTask::countOfBytesReceived() const { return impl_->received; }
+
+std::int64_t URLSessionDataTask::countOfBytesExpectedToReceive() const { return impl_->expected; }
+
 URLSessionTaskMetrics URLSessionDataTask::metrics() const {
   std::lock_guard guard(impl_->lock);
   return impl_->metrics;
@@ -657,6 +666,8 @@ URLSession::URLSession(URLSessionConfiguration configuration)
     : impl_(std::make_shared<Impl>(std::move(configuration))) {}
 
 URLSession::~URLSession() { impl_->shutdown(); }
+
+void URLSession::invalidateAndCancel() { impl_->shutdown(); }
 
 std::shared_ptr<URLSessionDataTask> URLSession::dataTask(URLRequest request, DataTaskCompletion completion,
                                                          SerialQueue* deliverOn) {

@@ -12,12 +12,8 @@
 //
 // Threading: every method of URLSession and URLSessionDataTask is safe from any thread.
 //
-// Background sessions (resource downloads, feedback uploads) share this transport. Their
-// persistence is meant to sit beside it, not inside: a TransferJournal keyed by the configuration's
-// `identifier` would record each upload/download task (request, file, attached values) before its
-// resume() reaches the transfer thread, drop the record when the completion has been delivered,
-// and at session creation re-create and resume the tasks it still holds, handing their
-// completions to the session's delegate. Nothing of that is built yet.
+// Background sessions (resource downloads, feedback uploads) share this transport; their
+// persistence sits beside it, in a TransferJournal (transfer_journal.h).
 #pragma once
 
 #include <any>
@@ -124,6 +120,9 @@ class URLSessionDataTask {
   std::uint64_t taskIdentifier() const;
   const URLRequest& originalRequest() const;
   State state() const;
+  // Response body bytes received so far, and as the response announced them (-1 while unknown).
+  std::int64_t countOfBytesReceived() const;
+  std::int64_t countOfBytesExpectedToReceive() const;
 
   // Filled in just before the completion is called; empty until then.
   URLSessionTaskMetrics metrics() const;
@@ -152,6 +151,11 @@ class URLSession {
   ~URLSession();
   URLSession(const URLSession&) = delete;
   URLSession& operator=(const URLSession&) = delete;
+
+  // What the destructor does, for an owner that is not the last holder: cancels every task still
+  // running (their completions are called) and stops the transfer thread. Tasks made afterwards
+  // complete with URLErrorCancelled when resumed.
+  void invalidateAndCancel();
 
   // A task for `request`, not yet resumed. The completion runs on `deliverOn` when given (it must
   // outlive the task's completion), else on the session's delegate queue.

@@ -175,61 +175,6 @@ TEST(IpcServer, PeerThatStopsReadingIsDisconnected) {
   EXPECT_TRUE(capture.contains("peer does not read"));
 }
 
-TEST(IpcServer, UnansweredCallsStopTheReadingUntilOneIsAnswered) {
-  DispatchPool pool(2);
-  Logger log("test", "ipc");
-  int pair[2];
-  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair), 0);
-  UniqueFd peer(pair[1]);
-  auto c = IpcConnection::make(pool, UniqueFd(pair[0]), {::getpid(), ::getuid(), ::getgid()}, "test", log,
-                               kMaxFrameSize, 4);
-  std::mutex lock;
-  std::vector<std::string> seen;
-  std::vector<IpcConnection::CallHold> open;  // calls whose answers are still to come
-  bool answerAtOnce = false;
-  std::weak_ptr<IpcConnection> weak = c;
-  c->start(
-      [&, weak](std::string p) {
-        std::lock_guard l(lock);
-        seen.push_back(p);
-        if (auto self = weak.lock(); self && !answerAtOnce) open.push_back(self->holdCurrentCall());
-      },
-      [] {});
-  auto count = [&] {
-    std::lock_guard l(lock);
-    return seen.size();
-  };
-
-  std::string burst;
-  for (int i = 0; i < 10; ++i) burst += encodeFrame("call " + std::to_string(i));
-  std::size_t sent = 0;
-  ASSERT_FALSE(sendWithFds(peer.get(), burst, {}, true, &sent));
-  ASSERT_TRUE(testing::waitFor([&] { return count() == 4; }));
-  // A round trip through the connection's queue: had it read on, more would be there by now.
-  c->queue().sync([] {});
-  pool.drain();
-  EXPECT_EQ(count(), 4u);
-  {
-    std::lock_guard l(lock);
-    open.erase(open.begin());  // one call answered
-  }
-  ASSERT_TRUE(testing::waitFor([&] { return count() == 5; }));
-
-  // Frames the handler does not hold count only while they wait for it.
-  {
-    std::lock_guard l(lock);
-    answerAtOnce = true;
-    open.clear();
-  }
-  ASSERT_TRUE(testing::waitFor([&] { return count() == 10; }));
-  burst.clear();
-  for (int i = 0; i < 50; ++i) burst += encodeFrame("one-way");
-  ASSERT_FALSE(sendWithFds(peer.get(), burst, {}, true, &sent));
-  ASSERT_TRUE(testing::waitFor([&] { return count() == 60; }));
-  std::lock_guard l(lock);
-  for (int i = 0; i < 10; ++i) EXPECT_EQ(seen[i], "call " + std::to_string(i));
-}
-
 TEST(IpcServer, RefusesPeersOfAnotherUser) {
   if (::geteuid() != 0) GTEST_SKIP() << "needs root to connect as another user";
   testing::TempHome home;

@@ -1,0 +1,49 @@
+// The tavixd and tavix_tool binaries of the build, for tests that drive them as a user would.
+// Header-only: each test target names the binaries it depends on (TAVIXD_BINARY,
+// TAVIX_TOOL_BINARY).
+#pragma once
+
+#include <sys/wait.h>
+
+#include <cstdio>
+#include <string>
+#include <vector>
+
+#include "support/daemon_process.h"
+
+namespace tavix::testing {
+
+#ifdef TAVIXD_BINARY
+// tavixd with debug logging, once start-up is complete: signal handling included, not merely
+// the socket bound.
+struct Tavixd : DaemonProcess {
+  std::string socket;
+
+  explicit Tavixd(const TempHome& home, const std::string& logName = "tavixd.log", std::vector<std::string> extra = {})
+      : DaemonProcess(TAVIXD_BINARY, home, withDebugLog(std::move(extra)), logName),
+        socket((home.runtime() / "com.norvel.tavixd" / "socket").string()) {
+    waitForLog("tavixd started");
+  }
+
+  static std::vector<std::string> withDebugLog(std::vector<std::string> extra) {
+    extra.insert(extra.begin(), {"--log-level", "debug"});
+    return extra;
+  }
+};
+#endif
+
+#ifdef TAVIX_TOOL_BINARY
+// Runs tavix_tool in the test's environment: its exit status, `out` filled with stdout and
+// stderr together.
+inline int runTool(const std::string& args, std::string* out) {
+  const std::string command = std::string(TAVIX_TOOL_BINARY) + " " + args + " 2>&1";
+  FILE* p = popen(command.c_str(), "r");
+  out->clear();
+  char buf[512];
+  while (std::fgets(buf, sizeof buf, p)) *out += buf;
+  const int status = pclose(p);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+#endif
+
+}  // namespace tavix::testing
