@@ -35,6 +35,9 @@ class LocationManager;
 class MotionManager;
 class ResourceVersionsProvider;
 class DownloadManager;
+class AppWhitelistController;
+class TavixSubscriptionManager;
+class Lookup;
 
 struct Assembly {
   Assembly() = default;
@@ -68,6 +71,10 @@ struct Assembly {
   // provider it was made with (the session manager and bag controller through `feedback`).
   std::shared_ptr<DownloadManager> downloadManager;
   std::shared_ptr<ResourceVersionsProvider> resourceVersions;
+  // What requests and the look-up panel learn from downloaded resources and the user's providers.
+  std::shared_ptr<AppWhitelistController> appWhitelistController;
+  std::shared_ptr<TavixSubscriptionManager> subscriptionManager;
+  std::shared_ptr<Lookup> lookup;
   // What feedback sessions are opened with, once the storage, GUID controller and resource versions
   // exist.
   FeedbackEnvironment feedback;

@@ -7,9 +7,13 @@
 #include <csignal>
 
 #include "bag/tavix_bag_controller.h"
+#include "bagview/tvx_bag.h"
 #include "cache/engaged_completion_cache.h"
+#include "context/app_whitelist_controller.h"
+#include "context/desktop_entries.h"
 #include "context/location.h"
 #include "context/motion.h"
+#include "context/subscription_manager.h"
 #include "context/user_guid_controller.h"
 #include "core/custom_feedback_dirs.h"
 #include "core/diagnostics.h"
@@ -44,6 +48,7 @@
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
 #include "resources/download_manager.h"
+#include "resources/lookup.h"
 #include "platform/transactions.h"
 
 namespace tavix {
@@ -51,9 +56,6 @@ namespace tavix {
 using platform::PropertyValue;
 
 namespace {
-
-// The defaults suite the look-up panel shares with the daemon.
-constexpr const char* kLookupSharedDomain = "com.norvel.lookup.shared";
 
 // How often the background activities fall due.
 constexpr double kFlusherIntervalSeconds = 3600;
@@ -118,6 +120,37 @@ void createCustomFeedbackDirectories(const platform::Paths& paths) {
 
 namespace {
 
+// The installed-app signature, made before the request factory that sends it.
+std::shared_ptr<AppWhitelistController> makeAppWhitelistController(const Assembly& assembly) {
+  return AppWhitelistController::create({assembly.dispatchPool, assembly.clock, assembly.transactions,
+                                         assembly.notificationCenter, assembly.userDefaults, assembly.cachesFolder(),
+                                         applicationFoldersFromEnvironment()});
+}
+
+// Subscriptions (after the request factory, their delegate) and look-up hints (after the download
+// manager, whose versions they compare); both before the first bag change and the start-up
+// notification they follow.
+void assembleResourceConsumers(Assembly& assembly) {
+  const auto defaults = assembly.userDefaults;
+  const std::string userAgent = assembly.requestFactory->userAgent().value_or("");
+  assembly.subscriptionManager = TavixSubscriptionManager::create(
+      {assembly.dispatchPool, assembly.clock, assembly.notificationCenter,
+       [userAgent](const platform::Notification& n) -> std::optional<SubscriptionBagSettings> {
+         auto bag = bagOfNotification(n, userAgent);
+         if (!bag) return std::nullopt;
+         return SubscriptionBagSettings{bag->subscriptionProviderDomainWhitelist(),
+                                        bag->subscriptionProviderBundleIdentifierWhitelist(), bag->subscriptionTTL()};
+       },
+       std::make_shared<DefaultsVideoSubscriptionProvider>(*defaults),
+       std::make_shared<DefaultsMusicSubscriptionProvider>(*defaults),
+       std::make_shared<DefaultsStorefrontProvider>(*defaults), defaults},
+      assembly.requestFactory);
+  assembly.lookup = Lookup::create(
+      {assembly.dispatchPool, assembly.transactions, assembly.notificationCenter, defaults, assembly.resourceVersions,
+       std::make_shared<FileLookupHintsStore>(assembly.cachesFolder() / kLookupHintsStoreFolder),
+       assembly.cachesFolder()});
+}
+
 // The services, made and wired in the order start-up needs: each is handed the ones it uses.
 // Uploads left unsent by the last run resume with the upload manager; endpoints come with the bag.
 void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform::Clock& clock) {
@@ -128,6 +161,10 @@ void assembleServices(Assembly& assembly, platform::DispatchPool& pool, platform
   TVXRequestFactoryProviders providers;
   providers.locationManager = assembly.locationManager;
   providers.motionManager = assembly.motionManager;
+  assembly.appWhitelistController = makeAppWhitelistController(assembly);
+  providers.appWhitelistSignature = [signatures = assembly.appWhitelistController] {
+    return signatures->whitelistSignature();
+  };
   assembly.requestFactory = TVXNetworkRequestFactory::create(
       {&pool, &clock, assembly.userDefaults, assembly.notificationCenter, assembly.cachesFolder()}, std::move(providers));
   assembly.engagedCompletionCache =
@@ -178,9 +215,7 @@ void assembleDownloadManager(Assembly& assembly, platform::DispatchPool& pool, p
     return factory->fileDownloadRequest(url, std::move(version), latLong);
   };
   // Read fresh each time: the look-up panel's settings switch it while we run.
-  env.lookupEnabled = [defaults = assembly.userDefaults] {
-    return !defaults->suite(kLookupSharedDomain)->boolForKey("LookupSuggestionsDisabled");
-  };
+  env.lookupEnabled = [defaults = assembly.userDefaults] { return lookupEnabled(*defaults); };
   env.reportError = [&assembly](int code, const std::string& domain, const std::string& reason) {
     if (assembly.clientSessionManager) assembly.clientSessionManager->reportErrorAsTavixdFeedback(code, domain, reason);
   };
@@ -425,6 +460,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
   assembly.userDefaults = defaults;
   assembleServices(assembly, pool, clock);
   assembleDownloadManager(assembly, pool, clock);
+  assembleResourceConsumers(assembly);
 
   const auto countersFile = assembly.cachesFolder() / "counters.plist";
   auto& counters = TavixDiagnosticDataReporter::store();

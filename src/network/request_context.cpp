@@ -437,6 +437,15 @@ void TVXNetworkRequestFactory::setSubscriptionInfo(std::optional<std::string> in
   });
 }
 
+void TVXNetworkRequestFactory::didUpdateSubscriptionDictionaries(const SubscriptionRecords& records) {
+  // No records, no header: a bag that withdraws its whitelists withdraws what was sent.
+  setSubscriptionInfo(subscriptionHeaderValue(records));
+}
+
+void TVXNetworkRequestFactory::didUpdateStorefrontIdentifier(const std::optional<std::string>& identifier) {
+  setStoreFrontIdentifier(identifier);
+}
+
 void TVXNetworkRequestFactory::setInstalledDictionaries(std::optional<std::string> dictionaries) {
   std::weak_ptr<TVXNetworkRequestFactory> weak = weak_from_this();
   context_->queue.async([weak, dictionaries = std::move(dictionaries)] {

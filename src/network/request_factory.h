@@ -31,6 +31,7 @@
 #include <string_view>
 #include <vector>
 
+#include "context/subscription_manager.h"
 #include "core/requests.h"
 #include "platform/files.h"
 #include "platform/http/url_request.h"
@@ -103,7 +104,8 @@ struct TVXRequestFactoryProviders {
   std::function<bool(const std::string& identifier)> isDictionaryInstalled;
 };
 
-class TVXNetworkRequestFactory : public std::enable_shared_from_this<TVXNetworkRequestFactory> {
+class TVXNetworkRequestFactory : public std::enable_shared_from_this<TVXNetworkRequestFactory>,
+                                 public TavixSubscriptionManagerDelegate {
  public:
   // What the factory works with besides its providers. The pool and clock must outlive it.
   struct Environment {
@@ -155,6 +157,9 @@ class TVXNetworkRequestFactory : public std::enable_shared_from_this<TVXNetworkR
   // From the subscription manager. Asynchronous.
   void setStoreFrontIdentifier(std::optional<std::string> identifier);
   void setSubscriptionInfo(std::optional<std::string> info);
+  // The subscription manager's news, kept as the two above. Asynchronous.
+  void didUpdateSubscriptionDictionaries(const SubscriptionRecords& records) override;
+  void didUpdateStorefrontIdentifier(const std::optional<std::string>& identifier) override;
   // The installed dictionaries, as sent in "dicts". Asynchronous.
   void setInstalledDictionaries(std::optional<std::string> dictionaries);
 

@@ -21,6 +21,7 @@
 #include "platform/json_value.h"
 #include "query/client_state.h"
 #include "query/client_state_internal.h"
+#include "resources/lookup_hints.h"
 #include "tavix_proto/feedback_records.pb.h"
 
 namespace tavix {
@@ -58,6 +59,8 @@ struct ClientStateQueryKind {
   bool requiresListWith200 = false;
   bool setsPerformedSearch = false;
   bool messagesRule = false;
+  // Look-ups pass on only the results whose instructions the typed query meets.
+  bool filtersLookupResults = false;
 };
 
 namespace {
@@ -226,6 +229,7 @@ void ClientState::queryResponseArrived(const ClientStateQueryKind& kind, const T
   std::optional<TVXError> transport;
   if (error) transport = TVXError{error->domain, error->code, error->description};
   std::optional<TVXError> jsonError;
+  std::optional<platform::PropertyValue> parsed;
   if (kind.requiresListWith200) {
     if (error || status != 200) {
       log.error("{}", fmt::format(fmt::runtime(kind.fetchFailed), status,
@@ -264,11 +268,18 @@ void ClientState::queryResponseArrived(const ClientStateQueryKind& kind, const T
     // with the parse error, as a search does.
     if (kind.endpoint != proto::EndpointType::tavix_flight) {
       std::string parseError;
-      if (!platform::parseJson(data, &parseError)) {
+      parsed = platform::parseJson(data, &parseError);
+      if (!parsed) {
         jsonError = TVXError{kTVXJSONErrorDomain, kTVXJSONErrorCodeNotJSON, parseError.empty() ? "not JSON" : parseError};
       }
     }
     endNetworkFeedback(start, data, data.size(), status, timing, queryId);
+  }
+
+  if (kind.filtersLookupResults && parsed) {
+    // Untouched bytes when nothing is dropped: the client gets exactly what the server sent.
+    auto kept = filterLookupResults(request.queryString, *parsed);
+    if (kept != *parsed) data = platform::toJson(kept);
   }
 
   TVXReply result;
@@ -427,6 +438,7 @@ const ClientStateQueryKind& lookupKind() {
       .endpoint = proto::EndpointType::tavix_search,
       .retriedUntilRenderDeadline = true,
       .setsPerformedSearch = true,
+      .filtersLookupResults = true,
   };
   return kind;
 }

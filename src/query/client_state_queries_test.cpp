@@ -260,6 +260,31 @@ TEST_F(QueriesTest, LookupsFlightsAndZeroKeywordRecordWhatTheyAskedFor) {
   EXPECT_EQ(sent[1].at("qtype"), platform::PropertyValue("zkw"));
 }
 
+TEST_F(QueriesTest, LookupRepliesKeepOnlyTheResultsTheQueryMeets) {
+  serveBag(bagWith());
+  // "kept": 0.25 + 0.5 reach the minimum exactly (the third keyword is not in the query).
+  // "dropped": one keyword short. Results without instructions always stay.
+  fault("/search", {{"times", 1}, {"body", R"([{"results": [
+      {"id": "kept", "lookup_instructions": {"min_keywords_score": 0.75, "completion": "Serendip",
+        "keywords": [{"word": "seren", "weight": 0.25}, {"word": "DIPITY", "weight": 0.5},
+                     {"word": "absent", "weight": 5}]}},
+      {"id": "dropped", "lookup_instructions": {"min_keywords_score": 0.75, "completion": "serendipity",
+        "keywords": [{"word": "seren", "weight": 0.5}]}},
+      {"id": "plain"}]}])"}});
+  auto state = make("com.norvel.lookup", "Lookup/1.0");
+  Replies replies;
+  state->lookup(request<TVXLookupRequest>(53, "serendipity"), replies.block());
+  auto call = replies.first();
+  ASSERT_TRUE(call.reply);
+  const auto reply = platform::parseJson(call.reply->data);
+  ASSERT_TRUE(reply && reply->array() && reply->array()->size() == 1u) << call.reply->data;
+  std::vector<std::string> ids;
+  for (const auto& result : *reply->array()->front().dictionary()->at("results").array()) {
+    ids.push_back(*result.dictionary()->at("id").string());
+  }
+  EXPECT_EQ(ids, (std::vector<std::string>{"kept", "plain"}));
+}
+
 TEST_F(QueriesTest, FlightDebugDataAnswersFromTheLocalFileWithoutTheNetwork) {
   serveBag(bagWith());
   const auto file = home.cache() / "flights.json";

@@ -70,13 +70,5 @@ TEST(LookupHints, RepliesOfOtherShapesPassThrough) {
   EXPECT_EQ(tokenize("Grüße, WELT! 42"), (std::vector<std::string>{"grüße", "welt", "42"}));
 }
 
-TEST(LookupHints, HintsFilesMustBeJson) {
-  std::string why;
-  EXPECT_TRUE(isUsableHintsFile(R"({"hints":["a","b"]})"));
-  EXPECT_FALSE(isUsableHintsFile(R"({"hints":["a",)", &why));
-  EXPECT_FALSE(why.empty());
-  EXPECT_FALSE(isUsableHintsFile(std::string(100 * 1024 * 1024, '[')));
-}
-
 }  // namespace
 }  // namespace tavix
