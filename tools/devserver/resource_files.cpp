@@ -25,11 +25,11 @@ std::string whitelist() {
   // Each app's list ends with the object that gives its bit in the bitmap.
   const json inner = {{"version", "0a1f"},
                       {"apps",
-                       {{"org.gnome.Nautilus.desktop", {{{"encoding_id", 1}}}},
-                        {"firefox-esr.desktop", {"esr", {{"encoding_id", 3}}}},
-                        {"org.gnome.Calculator.desktop", {{{"encoding_id", 5}}}},
-                        {"org.libreoffice.LibreOffice.writer.desktop", {{{"encoding_id", 8}}}},
-                        {"org.gnome.Maps.desktop", {{{"encoding_id", 13}}}}}}};
+                       {{"org.gnome.Nautilus", {{{"encoding_id", 1}}}},
+                        {"firefox-esr", {"esr", {{"encoding_id", 3}}}},
+                        {"org.gnome.Calculator", {{{"encoding_id", 5}}}},
+                        {"org.libreoffice.LibreOffice.writer", {{{"encoding_id", 8}}}},
+                        {"org.gnome.Maps", {{{"encoding_id", 13}}}}}}};
   return json{{"apps", inner.dump()}, {"compression", "RLE"}, {"encoding", "bitmap"}}.dump(2) + "\n";
 }
 
