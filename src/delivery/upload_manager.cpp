@@ -33,6 +33,15 @@ constexpr double kUploadTimeoutSeconds = 300;
 constexpr std::size_t kCopyChunkSize = 8192;
 constexpr std::size_t kMaximumTempPathLength = 1024;
 
+// `url` with "name=value" appended after its query items. A URL that cannot be parsed is kept as
+// it stands: the request made from it is refused, and the upload waits for a better bag.
+std::string appendingQueryItem(std::string_view url, std::string_view name, std::string_view value) {
+  auto parsed = platform::http::URL::parse(url);
+  if (!parsed) return std::string(url);
+  parsed->appendQueryItem(name, value);
+  return parsed->string();
+}
+
 }  // namespace
 
 // ---- TempFile
@@ -56,25 +65,6 @@ std::optional<std::string> TempFile::readContents() const {
     out.append(buffer, static_cast<std::size_t>(n));
     offset += n;
   }
-}
-
-// ---- helpers
-
-std::string appendingQueryItem(std::string_view url, std::string_view name, std::string_view value) {
-  const std::string encoded = platform::http::percentEncode(value);
-  std::string base(url);
-  std::string fragment;
-  if (const auto hash = base.find('#'); hash != std::string::npos) {
-    fragment = base.substr(hash);
-    base.resize(hash);
-  }
-  const auto question = base.find('?');
-  if (question == std::string::npos) {
-    base += '?';
-  } else if (question + 1 < base.size() && base.back() != '&') {
-    base += '&';
-  }
-  return base + std::string(name) + "=" + encoded + fragment;
 }
 
 // ---- UploadManager

@@ -131,7 +131,4 @@ class UploadManager : public std::enable_shared_from_this<UploadManager>, public
   platform::NotificationCenter::Registration bagObserver_;
 };
 
-// Appends "name=value" (value percent-encoded) as the last query item of `url`.
-std::string appendingQueryItem(std::string_view url, std::string_view name, std::string_view value);
-
 }  // namespace tavix

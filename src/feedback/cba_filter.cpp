@@ -1,13 +1,12 @@
 #include "feedback/cba_filter.h"
+#include "platform/http/url.h"
 #include "platform/strings.h"
 
 #include <arpa/inet.h>
 #include <libpsl.h>
 
 #include <algorithm>
-#include <cctype>
 #include <map>
-#include <set>
 
 namespace tavix {
 
@@ -18,63 +17,39 @@ constexpr std::string_view kWebIndexSection = "com.norvel.tavix.web_index";
 // Wrappers nest at most this deep in practice; the bound keeps a crafted URL from looping long.
 constexpr int kMaxAMPUnwrapping = 4;
 
-bool isSchemeChar(char c) {
-  return std::isalnum(static_cast<unsigned char>(c)) || c == '+' || c == '-' || c == '.';
-}
-
-bool allDigits(std::string_view s) {
-  return !s.empty() && std::all_of(s.begin(), s.end(), [](unsigned char c) { return std::isdigit(c); });
-}
-
-bool startsWith(std::string_view s, std::string_view prefix) { return s.substr(0, prefix.size()) == prefix; }
-bool endsWith(std::string_view s, std::string_view suffix) {
-  return s.size() >= suffix.size() && s.substr(s.size() - suffix.size()) == suffix;
-}
-
-// The scheme of `text` when it has one: letters first, then scheme characters, then ":". A
-// "name:digits" that ends there or goes on with "/" is a host and port, not a scheme.
-std::optional<std::string_view> schemeOf(std::string_view text) {
-  if (text.empty() || !std::isalpha(static_cast<unsigned char>(text[0]))) return std::nullopt;
-  std::size_t i = 1;
-  while (i < text.size() && isSchemeChar(text[i])) ++i;
-  if (i >= text.size() || text[i] != ':') return std::nullopt;
-  std::string_view rest = text.substr(i + 1);
-  const std::string_view beforeSlash = rest.substr(0, rest.find_first_of("/?#"));
-  if (!startsWith(rest, "//") && allDigits(beforeSlash)) return std::nullopt;
-  return text.substr(0, i);
-}
-
-// Parses "[user[:password]@]host[:port]" into `out`; false for a port that is not a number.
-bool parseAuthority(std::string_view authority, URLComponents& out) {
-  if (const auto at = authority.rfind('@'); at != std::string_view::npos) {
-    const std::string_view userinfo = authority.substr(0, at);
-    const auto colon = userinfo.find(':');
-    out.user = std::string(userinfo.substr(0, colon));
-    if (colon != std::string_view::npos) out.password = std::string(userinfo.substr(colon + 1));
-    authority = authority.substr(at + 1);
-  }
-  std::string_view host = authority;
-  std::string_view port;
-  if (startsWith(authority, "[")) {
-    const auto close = authority.find(']');
-    if (close == std::string_view::npos) {
-      host = authority;
-    } else {
-      host = authority.substr(0, close + 1);
-      const std::string_view after = authority.substr(close + 1);
-      if (startsWith(after, ":")) port = after.substr(1);
-    }
-  } else if (const auto colon = authority.rfind(':'); colon != std::string_view::npos) {
-    host = authority.substr(0, colon);
-    port = authority.substr(colon + 1);
-  }
-  out.host = platform::asciiLowercased(host);
+URLComponents componentsOf(const platform::http::URL& url) {
+  URLComponents out;
+  out.scheme = url.scheme();
+  out.user = url.user().value_or("");
+  out.password = url.password().value_or("");
+  out.host = platform::asciiLowercased(url.host());
   while (!out.host.empty() && out.host.back() == '.') out.host.pop_back();
-  if (!port.empty()) {
-    if (!allDigits(port) || port.size() > 5) return false;
-    out.port = std::stoi(std::string(port));
+  out.port = url.port();
+  out.path = url.path();
+  out.query = url.query();
+  out.fragment = url.fragment();
+  return out;
+}
+
+// "mailto:a@b.com", "about:blank": a scheme, then the path, query and fragment of an address that
+// names no host. Text after "scheme:/" is an authority that the URL parser refused.
+std::optional<URLComponents> componentsWithoutHost(std::string_view text) {
+  const auto scheme = platform::http::schemeOf(text);
+  if (!scheme) return std::nullopt;
+  std::string_view rest = text.substr(scheme->size() + 1);
+  if (rest.starts_with('/')) return std::nullopt;
+  URLComponents out;
+  out.scheme = platform::asciiLowercased(*scheme);
+  if (const auto hash = rest.find('#'); hash != std::string_view::npos) {
+    out.fragment = std::string(rest.substr(hash + 1));
+    rest = rest.substr(0, hash);
   }
-  return true;
+  if (const auto question = rest.find('?'); question != std::string_view::npos) {
+    out.query = std::string(rest.substr(question + 1));
+    rest = rest.substr(0, question);
+  }
+  out.path = std::string(rest);
+  return out;
 }
 
 const psl_ctx_t* publicSuffixList() {
@@ -104,7 +79,7 @@ std::optional<std::string> registrableDomain(const std::string& host) {
 // Whether the host is Google's, on any of its country domains ("google.com", "www.google.co.uk").
 bool isGoogleHost(const std::string& host) {
   const auto domain = registrableDomain(host);
-  return domain && startsWith(*domain, "google.");
+  return domain && domain->starts_with("google.");
 }
 
 // Splits "HOST/PATH" of a wrapper's path into a URL with the given scheme.
@@ -120,18 +95,18 @@ std::optional<URLComponents> embeddedURL(std::string_view rest, std::string_view
 std::optional<URLComponents> unwrapOnce(const URLComponents& c) {
   if (c.host.empty()) return std::nullopt;
   const std::string_view path = c.path;
-  if (endsWith(c.host, ".cdn.ampproject.org")) {
+  if (c.host.ends_with(".cdn.ampproject.org")) {
     for (std::string_view kind : {"/c/", "/v/"}) {
-      if (!startsWith(path, kind)) continue;
+      if (!path.starts_with(kind)) continue;
       const std::string_view rest = path.substr(kind.size());
-      if (startsWith(rest, "s/")) return embeddedURL(rest.substr(2), "https", c);
+      if (rest.starts_with("s/")) return embeddedURL(rest.substr(2), "https", c);
       return embeddedURL(rest, "http", c);
     }
     return std::nullopt;
   }
-  if (startsWith(path, "/amp/") && isGoogleHost(c.host)) {
+  if (path.starts_with("/amp/") && isGoogleHost(c.host)) {
     const std::string_view rest = path.substr(5);
-    if (startsWith(rest, "s/")) return embeddedURL(rest.substr(2), "https", c);
+    if (rest.starts_with("s/")) return embeddedURL(rest.substr(2), "https", c);
     return embeddedURL(rest, "http", c);
   }
   return std::nullopt;
@@ -142,44 +117,8 @@ bool isWebSection(const std::string& section) { return section == kWebSuggestSec
 }  // namespace
 
 std::optional<URLComponents> tavix_componentsWithString(std::string_view text) {
-  const auto first = text.find_first_not_of(" \t\r\n\f\v");
-  if (first == std::string_view::npos) return std::nullopt;
-  text = text.substr(first, text.find_last_not_of(" \t\r\n\f\v") - first + 1);
-
-  URLComponents out;
-  bool hasAuthority = false;
-  if (auto scheme = schemeOf(text)) {
-    out.scheme = platform::asciiLowercased(*scheme);
-    text = text.substr(scheme->size() + 1);
-    if (startsWith(text, "//")) {
-      hasAuthority = true;
-      text = text.substr(2);
-    }
-  } else if (startsWith(text, "//")) {
-    hasAuthority = true;
-    text = text.substr(2);
-  } else {
-    // A bare "host/path" as people type it.
-    out.scheme = "http";
-    hasAuthority = true;
-  }
-
-  if (const auto hash = text.find('#'); hash != std::string_view::npos) {
-    out.fragment = std::string(text.substr(hash + 1));
-    text = text.substr(0, hash);
-  }
-  if (const auto question = text.find('?'); question != std::string_view::npos) {
-    out.query = std::string(text.substr(question + 1));
-    text = text.substr(0, question);
-  }
-  if (hasAuthority) {
-    const auto slash = text.find('/');
-    if (!parseAuthority(text.substr(0, slash), out)) return std::nullopt;
-    text = slash == std::string_view::npos ? std::string_view() : text.substr(slash);
-  }
-  out.path = std::string(text);
-  if (!out.host.empty() && out.path.empty()) out.path = "/";
-  return out;
+  if (auto url = platform::http::URL::parseLeniently(text)) return componentsOf(*url);
+  return componentsWithoutHost(platform::trimmedWhitespace(text));
 }
 
 URLComponents tavix_componentsForEmbeddedAMPURL(const URLComponents& components) {

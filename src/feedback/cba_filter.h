@@ -3,7 +3,7 @@
 // punch-out that the service itself showed earlier for the same query; the URL is then removed
 // from the record, and engagements that match nothing shown are dropped. Stateless.
 //
-// The URL helpers below are what the grading compares with: a lenient parser, the unwrapping of
+// The URL helpers below are what the grading compares with: lenient parsing, the unwrapping of
 // accelerated-mobile-page (AMP) wrapper URLs, and a host-and-path form normalised by registrable
 // domain (public suffix list, libpsl).
 #pragma once
@@ -33,9 +33,10 @@ struct URLComponents {
   bool operator==(const URLComponents&) const = default;
 };
 
-// Parses leniently: surrounding white space is ignored, a string without a scheme is read as
-// "http://" + string ("www.a.com/x", "localhost:8080/x"), and "//host/x" keeps an empty scheme.
-// None only for an empty (or all-blank) string or a port that is not a number.
+// Parses leniently, as `URL::parseLeniently` does: blanks around the text are ignored, and a text
+// without a scheme is an http URL ("www.a.com/x", "localhost:8080/x", "//a.com/x"). An address
+// that names no host ("mailto:a@b.com") keeps what follows its scheme as path, query and fragment.
+// None for what is no URL: an empty or blank string, a bad host or port, control characters.
 std::optional<URLComponents> tavix_componentsWithString(std::string_view text);
 
 // The page that an AMP wrapper URL shows, or `components` itself when it is not a wrapper.
