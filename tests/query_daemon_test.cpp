@@ -25,11 +25,7 @@ TEST_F(QueryDaemonTest, ClientsHearTheBagWhenTheyConfigureWhenTheyAskAndWhenItCh
   std::mutex lock;
   std::condition_variable arrived;
   std::vector<proto::BagDidLoad> loads;
-  client::Client::Options options;
-  options.socketPath = socket();
-  options.configuration.set_identifier("com.norvel.seekara");
-  options.configuration.set_user_agent("seekara/1.0");
-  client::Client second(options);
+  client::Client second(clientOptions("com.norvel.seekara", "seekara/1.0"));
   second.setBagDidLoadHandler([&](const proto::BagDidLoad& load) {
     std::lock_guard hold(lock);
     loads.push_back(load);

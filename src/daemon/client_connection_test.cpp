@@ -127,15 +127,6 @@ TEST(ClientConnection, SilenceEndsTheKeepAliveTransactionAndTheNextMessageOpensO
   EXPECT_EQ(state->queryCache()->count(), 0u) << "a silent client's cached replies go with its transaction";
   h.call(notify("b"));
   EXPECT_EQ(h.keepAlives(), 1u);
-
-  // The client goes away: its transaction stays a minute more, in case it comes back.
-  h.client.reset();
-  ASSERT_TRUE(tavix::testing::waitFor([&] { return !h.connection->isValid(); }));
-  h.pool.drain();
-  h.advance(59);
-  EXPECT_EQ(h.keepAlives(), 1u);
-  h.advance(1);
-  EXPECT_EQ(h.keepAlives(), 0u);
 }
 
 TEST(ClientConnection, OneBagPerClientHoweverOftenItConfiguresAndLateRepliesAreLogged) {
@@ -233,7 +224,6 @@ TEST(ClientConnection, RefusesConfigurationsThatWouldInjectHeaders) {
     EXPECT_FALSE(h.call(configure).has_configure_reply()) << "closed without a reply";
     EXPECT_TRUE(capture.contains("configuration carries a control character"));
     EXPECT_TRUE(capture.contains("seekara/1.0\\x0d\\x0aX-Injected: agent")) << "logged, escaped";
-    EXPECT_TRUE(capture.contains("invalid configuration, closing connection"));
     EXPECT_TRUE(h.assembly.clientStateManager->sessions().empty()) << "no state for a refused client";
   }
   // The device's part of the agent comes from defaults, and is held to the same rule.

@@ -285,28 +285,24 @@ TEST_F(QueriesTest, FlightDebugDataAnswersFromTheLocalFileWithoutTheNetwork) {
   EXPECT_TRUE(received("/flight").empty());
 }
 
-// Timers and deadlines on a clock the test moves; the clock is made before the fixture that uses it.
-struct VirtualClockHolder {
-  platform::VirtualClock virtualClock;
-};
-class VirtualTimeTest : private VirtualClockHolder, public QueryFixture {
+// Timers and deadlines on a clock the test moves.
+class VirtualTimeTest : public QueryFixture {
  protected:
-  VirtualTimeTest() : QueryFixture(&virtualClock) {}
-  using VirtualClockHolder::virtualClock;
+  VirtualTimeTest() : QueryFixture(true) {}
 };
 
 TEST_F(VirtualTimeTest, WithoutABagInTimeASearchFailsAtTheEndOfTheWaitAndRecordsWhy) {
   // The bag never comes: the search waits the first-launch wait on this clock, no longer.
   fault("/bag", {{"hang", true}});
-  assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
+  startBagController();
   auto waiting = make("com.norvel.seekara", "Seekara/1.0");
   Replies timedOut;
   auto searching = std::async(std::launch::async,
                               [&] { waiting->search(request<TVXSearchRequest>(7, "weather"), timedOut.block()); });
-  virtualClock.awaitParked(1);
-  virtualClock.advance(platform::seconds(kTVXFirstLaunchBagSemaphoreWait / 1000.0 - 0.001));
+  clock.awaitParked(1);
+  clock.advance(platform::seconds(kTVXFirstLaunchBagSemaphoreWait / 1000.0 - 0.001));
   EXPECT_EQ(timedOut.count(), 0u);
-  virtualClock.advance(platform::seconds(0.001));
+  clock.advance(platform::seconds(0.001));
   searching.get();
   auto call = timedOut.first();
   EXPECT_EQ(call.queryId, 7u);
@@ -345,7 +341,7 @@ TEST_F(VirtualTimeTest, ALookupIsRetriedOnlyUntilItsRenderDeadline) {
   lookup->queryId = 71;
   state->lookup(lookup, late.block());
   ASSERT_TRUE(testing::waitFor([&] { return received("/search").size() == 5; }));
-  virtualClock.advance(platform::seconds(1.6));
+  clock.advance(platform::seconds(1.6));
   send("POST", "/_reset");
   EXPECT_TRUE(late.first().error);
   EXPECT_TRUE(received("/search").empty()) << "retried past the deadline";
@@ -368,9 +364,9 @@ TEST_F(VirtualTimeTest, TwoWarmsWithin30SecondsSendOneRequest) {
   EXPECT_EQ(starts[0].payload().network_search_start().uuid(), ends[0].payload().network_search_end().uuid());
   EXPECT_EQ(received("/warm").size(), 1u);
 
-  virtualClock.advance(platform::seconds(29));
+  clock.advance(platform::seconds(29));
   state->warm();
-  virtualClock.advance(platform::seconds(2));
+  clock.advance(platform::seconds(2));
   state->warm();
   EXPECT_EQ(recordsOfType(*state, kFeedbackTypeNetworkSearchEnd, 2).size(), 2u);
   EXPECT_EQ(received("/warm").size(), 2u);

@@ -71,12 +71,12 @@ class Replies {
   std::vector<Call> calls_;
 };
 
-// The assembly runs on the system clock unless the test hands in another.
+// The assembly runs on the system clock, or on the virtual `clock` that the test moves.
 class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
  protected:
-  explicit QueryFixture(platform::Clock* testClock = nullptr) : testing::TestAssembly(8) {
+  explicit QueryFixture(bool virtualTime = false) : testing::TestAssembly(8) {
     EXPECT_TRUE(server.start({}, nullptr));
-    clock_ = testClock ? testClock : &systemClock;
+    clock_ = virtualTime ? static_cast<platform::Clock*>(&clock) : &systemClock;
     assembly.clock = clock_;
     defaults->registerDefaults({{"TVXSessionSoftLimitOverride", platform::PropertyValue(std::int64_t{600})},
                                 {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
@@ -115,11 +115,14 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
     for (const auto& [key, value] : extra) bag[key] = value;
     return bag;
   }
+  // After any fault on /bag has been set, so that no fetch slips by it.
+  void startBagController() {
+    assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
+  }
   // Serves `bag` and starts the bag controller on it; waits until the controller holds it.
   void serveBag(const platform::Dictionary& bag) {
     fault("/bag", {{"body", platform::toJson(platform::PropertyValue(bag))}});
-    assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
-    assembly.bagController->currentBag();
+    startBagController();
     ASSERT_TRUE(testing::waitFor([&] { return assembly.bagController->currentBag() != nullptr; }, 5000));
   }
 
@@ -152,10 +155,15 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
     return out;
   }
 
-  std::shared_ptr<ClientState> make(const std::string& identifier, const std::string& userAgent) {
+  // A state for `identifier`; without `userAgent` the client has not said who it is yet.
+  std::shared_ptr<ClientState> make(const std::string& identifier, const std::string& userAgent = {}) {
     states.push_back(ClientState::create(testing::clientStateEnvironment(*this), identifier));
-    states.back()->updateClient(userAgent);
+    if (!userAgent.empty()) states.back()->updateClient(userAgent);
     return states.back();
+  }
+  void advance(double seconds) {
+    clock.advance(platform::seconds(seconds));
+    pool.drain();
   }
 
   // Every event the client's sessions have recorded so far (session ends left out), oldest first.

@@ -29,7 +29,6 @@ class ActivityScheduler;
 }
 class ClientStateManager;
 class EngagedCompletionCache;
-class LocationManager;
 class ResourceVersionsProvider;
 class TavixFlusherIPC;
 class UploadManager;
@@ -56,7 +55,6 @@ struct TestWiring {
   std::shared_ptr<TavixFlusherIPC> flusherIPCListener;
   std::shared_ptr<TavixPersistentStorage> persistentStorage;
   std::shared_ptr<EngagedCompletionCache> engagedCompletionCache;
-  std::shared_ptr<LocationManager> locationManager;
   std::shared_ptr<ResourceVersionsProvider> resourceVersions;
 
   // The query and bag sessions, configured as start-up configures them; made on first use.
