@@ -86,16 +86,7 @@ TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
     for (const char* path : {"/search", "/more", "/card", "/flight"}) fault(path, settings);
   };
 
-  sendAll("healthy");
-  waitAll();
-  for (std::size_t i = 0; i < kinds.size(); ++i) {
-    const auto call = outcomes[i].replies->first();
-    EXPECT_TRUE(call.reply && !call.error) << outcomes[i].what;
-    if (call.reply) {
-      EXPECT_FALSE(call.reply->data.empty()) << outcomes[i].what;
-    }
-  }
-
+  // Each kind's good answer is checked in a test of its own.
   onEveryPath({{"hang", true}});
   sendAll("hanging");
   waitAll();
@@ -106,7 +97,7 @@ TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
   sendAll("garbage");
   waitAll();
 
-  for (std::size_t i = kinds.size(); i < outcomes.size(); ++i) {
+  for (std::size_t i = 0; i < outcomes.size(); ++i) {
     const auto call = outcomes[i].replies->first(0);
     const bool garbage = outcomes[i].what.rfind("garbage", 0) == 0;
     // Garbage still reaches the search-like kinds, with the parse error; a flight body is not
