@@ -82,10 +82,6 @@ struct Harness : testing::TestAssembly {
       decoder.append(buf, n);
     }
   }
-  void advance(double s) {
-    clock.advance(platform::seconds(s));
-    pool.drain();
-  }
   // The connection's keep-alive transactions (a bag fetch holds one of its own).
   std::size_t keepAlives() { return transactions.open()["com.norvel.tavixd.ipc"]; }
 };

@@ -161,10 +161,6 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
     if (!userAgent.empty()) states.back()->updateClient(userAgent);
     return states.back();
   }
-  void advance(double seconds) {
-    clock.advance(platform::seconds(seconds));
-    pool.drain();
-  }
 
   // Every event the client's sessions have recorded so far (session ends left out), oldest first.
   // The state's records are written asynchronously; flushing the sessions (the client's and the

@@ -108,6 +108,12 @@ class TestAssembly {
   TestAssembly(const TestAssembly&) = delete;
   TestAssembly& operator=(const TestAssembly&) = delete;
 
+  // Moves the virtual clock and waits for what its timers queued.
+  void advance(double seconds) {
+    clock.advance(platform::seconds(seconds));
+    pool.drain();
+  }
+
   TavixPersistentStorage::Environment storageEnvironment() {
     return {assembly.cachesFolder(), &pool, assembly.clock, defaults.get(), &transactions};
   }
