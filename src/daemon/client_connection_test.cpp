@@ -141,10 +141,7 @@ TEST(ClientConnection, OneBagPerClientHoweverOftenItConfiguresAndLateRepliesAreL
   // not dropped silently.
   proto::Envelope ask;
   ask.mutable_bag();
-  ask.set_call_id(5);
-  auto frame = ipc::encodeFrame(ask.SerializeAsString());
-  std::size_t sent = 0;
-  ASSERT_FALSE(ipc::sendWithFds(h.client.get(), frame, {}, true, &sent));
+  h.post(ask, 5);
   h.pool.drain();
   h.client.reset();
   ASSERT_TRUE(tavix::testing::waitFor([&] { return !h.connection->isValid(); }));
