@@ -23,41 +23,29 @@ struct Kind {
   std::function<void(ClientState&, std::uint64_t, TVXReplyBlock)> send;
 };
 
+template <typename Request>
+Kind kind(const char* name, const char* path, void (ClientState::*method)(std::shared_ptr<const Request>, TVXReplyBlock),
+          std::string text, std::function<void(Request&)> adjust = {}) {
+  return {name, path, [=](ClientState& state, std::uint64_t id, TVXReplyBlock reply) {
+            auto request = std::make_shared<Request>();
+            request->queryId = id;
+            request->queryString = text;
+            request->triggerEvent = 1;
+            if (adjust) adjust(*request);
+            (state.*method)(request, std::move(reply));
+          }};
+}
+
 std::vector<Kind> allKinds() {
-  auto make = [](auto request, std::uint64_t id, const std::string& text) {
-    request->queryId = id;
-    request->queryString = text;
-    request->triggerEvent = 1;
-    return request;
-  };
-  return {
-      {"search", "/search",
-       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
-         s.search(make(std::make_shared<TVXSearchRequest>(), id, "camera" + std::to_string(id)), std::move(r));
-       }},
-      {"zero-keyword", "/search",
-       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
-         s.zeroKeyword(make(std::make_shared<TVXZeroKeywordRequest>(), id, ""), std::move(r));
-       }},
-      {"more results", "/more",
-       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
-         s.moreResults(make(std::make_shared<TVXMoreResultsRequest>(), id, "ca"), std::move(r));
-       }},
-      {"card", "/card",
-       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
-         s.card(make(std::make_shared<TVXCardRequest>(), id, ""), std::move(r));
-       }},
-      {"look-up", "/search",
-       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
-         s.lookup(make(std::make_shared<TVXLookupRequest>(), id, "serendipity"), std::move(r));
-       }},
-      {"flight", "/flight",
-       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
-         auto f = make(std::make_shared<TVXFlightSearchRequest>(), id, "");
-         f->flightQuery = "UA 123";
-         s.flightSearch(f, std::move(r));
-       }},
-  };
+  // Searches differ by id, so that none is answered from the query cache.
+  return {kind<TVXSearchRequest>("search", "/search", &ClientState::search, "",
+                                 [](auto& r) { r.queryString = "camera" + std::to_string(r.queryId); }),
+          kind("zero-keyword", "/search", &ClientState::zeroKeyword, ""),
+          kind("more results", "/more", &ClientState::moreResults, "ca"),
+          kind("card", "/card", &ClientState::card, ""),
+          kind("look-up", "/search", &ClientState::lookup, "serendipity"),
+          kind<TVXFlightSearchRequest>("flight", "/flight", &ClientState::flightSearch, "",
+                                       [](auto& f) { f.flightQuery = "UA 123"; })};
 }
 
 TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
