@@ -28,6 +28,7 @@
 #include "platform/json_value.h"
 #include "platform/notification_center.h"
 #include "query/client_state.h"
+#include "support/devserver_control.h"
 #include "support/temp_home.h"
 #include "support/client_states.h"
 #include "tavix_proto/feedback_session.pb.h"
@@ -128,14 +129,7 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
 
   std::string send(const std::string& method, const std::string& path, const std::string& body = {},
                    const devserver::DevServer* to = nullptr) {
-    platform::http::URLRequest r;
-    r.url = (to ? to : &server)->baseURL() + path;
-    r.method = method;
-    r.body = body;
-    r.reloadIgnoringLocalCacheData = true;
-    std::promise<std::string> done;
-    control->dataTask(r, [&](std::string data, auto, auto) { done.set_value(std::move(data)); })->resume();
-    return done.get_future().get();
+    return testing::devserverCall(*control, (to ? to : &server)->baseURL(), path, method, body);
   }
   void fault(const std::string& path, platform::Dictionary settings) {
     settings["path"] = path;
