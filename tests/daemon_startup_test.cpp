@@ -47,11 +47,9 @@ TEST(DaemonStartup, CreatesItsFoldersLogsItsStartAndExitsCleanlyOnSigterm) {
     EXPECT_EQ(d.log().find("failed"), std::string::npos) << d.log();
   }
   // Each start counted, and the counters kept across runs.
-  std::ifstream counters(home.cache() / "com.norvel.tavixd" / "counters.plist");
-  std::stringstream text;
-  text << counters.rdbuf();
-  EXPECT_NE(text.str().find("<key>com.norvel.tavixd.launch</key>\n\t<integer>2</integer>"), std::string::npos)
-      << text.str();
+  const auto counters = tavix::testing::readFile(home.cache() / "com.norvel.tavixd" / "counters.plist");
+  EXPECT_NE(counters.find("<key>com.norvel.tavixd.launch</key>\n\t<integer>2</integer>"), std::string::npos)
+      << counters;
 }
 
 TEST(DaemonStartup, ExitsByItselfWhenIdleAndRejectsBadFlags) {

@@ -10,15 +10,9 @@
 #include <future>
 #include <nlohmann/json.hpp>
 
-#include "core/names.h"
-#include "platform/clock.h"
-#include "platform/defaults.h"
-#include "platform/http/url_session.h"
-#include "platform/log.h"
-#include "resources/download_manager.h"
 #include "support/devserver_control.h"
 #include "support/devserver_process.h"
-#include "support/temp_home.h"
+#include "support/downloads.h"
 
 namespace tavix {
 namespace {
@@ -28,32 +22,6 @@ using platform::PropertyValue;
 using json = nlohmann::json;
 
 constexpr const char* kPath = "/resources/dictionary_resources_url";
-
-// What start-up makes, on virtual time: the session over the journal and the manager.
-struct Downloads {
-  Downloads(const testing::TempHome& home, platform::DispatchPool& pool, platform::Clock& clock)
-      : defaults(std::make_shared<platform::UserDefaults>(home.config(), "com.norvel.tavixd")) {
-    session = platform::http::BackgroundDownloadSession::create(transport, home.cache() / "journal", pool, clock, log);
-    DownloadManager::Environment env;
-    env.pool = &pool;
-    env.clock = &clock;
-    env.center = center;
-    env.defaults = defaults;
-    env.cachesFolder = home.cache() / "com.norvel.tavixd";
-    env.session = session;
-    env.fileDownloadRequest = [](const std::string& url, std::optional<std::string>, bool) {
-      return std::optional(platform::http::URLRequest{url});
-    };
-    manager = DownloadManager::create(std::move(env));
-  }
-
-  platform::Logger log{"com.norvel.tavixd", "test"};
-  std::shared_ptr<platform::http::URLSession> transport = std::make_shared<platform::http::URLSession>();
-  std::shared_ptr<platform::NotificationCenter> center = std::make_shared<platform::NotificationCenter>();
-  std::shared_ptr<platform::UserDefaults> defaults;
-  std::shared_ptr<platform::http::BackgroundDownloadSession> session;
-  std::shared_ptr<DownloadManager> manager;
-};
 
 TEST(ResourceDownloadCrash, KilledMidDownloadLeavesNoPartialFileAndResumesAtNextStart) {
   testing::TempHome home;
@@ -76,7 +44,8 @@ TEST(ResourceDownloadCrash, KilledMidDownloadLeavesNoPartialFileAndResumesAtNext
     if (read(go[0], &byte, 1) != 1) _exit(1);
     platform::DispatchPool pool(2);
     platform::VirtualClock clock;
-    Downloads downloads(home, pool, clock);
+    testing::Downloads downloads(home, pool, clock);
+    downloads.start();
     PropertyValue::Array list{"dicts"};
     downloads.center->post(kTVXBagChangeNotification, nullptr, {},
                            Dictionary{{kTVXNotificationBagKey,
@@ -102,13 +71,13 @@ TEST(ResourceDownloadCrash, KilledMidDownloadLeavesNoPartialFileAndResumesAtNext
   std::vector<std::string> files;
   for (const auto& entry : platform::fs::directory_iterator(caches)) files.push_back(entry.path().filename());
   EXPECT_EQ(files, std::vector<std::string>{"dicts"}) << "no temporary or partial file";
-  std::ifstream old(caches / "dicts");
-  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(old), {}), "old\n");
+  EXPECT_EQ(testing::readFile(caches / "dicts"), "old\n");
 
   // The next start: the journal holds the download, which begins at its date without a bag.
   testing::devserverCall(control, server.base, "/_reset", "POST");
   platform::VirtualClock clock;
-  Downloads downloads(home, pool, clock);
+  testing::Downloads downloads(home, pool, clock);
+  downloads.start();
   std::promise<std::string> completed;
   auto observer = downloads.center->addObserver(kTVXFileDownloadCompletedNotification, nullptr, nullptr,
                                                 [&](const platform::Notification& n) {
@@ -117,8 +86,7 @@ TEST(ResourceDownloadCrash, KilledMidDownloadLeavesNoPartialFileAndResumesAtNext
   ASSERT_EQ(downloads.session->allTasks().size(), 1u);
   clock.advance(platform::seconds(60));
   EXPECT_EQ(completed.get_future().get(), "dicts");
-  std::ifstream fresh(caches / "dicts");
-  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(fresh), {}), "[\"wn\",\"gcide\",\"moby-thesaurus\"]\n");
+  EXPECT_EQ(downloads.file("dicts"), "[\"wn\",\"gcide\",\"moby-thesaurus\"]\n");
 }
 
 }  // namespace

@@ -151,12 +151,7 @@ class SearchProviderTest : public ::testing::Test {
     return found;
   }
 
-  std::string opened() const {
-    std::ifstream in(home.root() / "opened");
-    std::stringstream s;
-    s << in.rdbuf();
-    return s.str();
-  }
+  std::string opened() const { return tavix::testing::readFile(home.root() / "opened"); }
 
   tavix::testing::TempHome home;
   tavix::testing::DevServerProcess server{DEVSERVER_BINARY};

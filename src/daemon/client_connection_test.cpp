@@ -82,10 +82,6 @@ struct Harness : testing::TestAssembly {
       decoder.append(buf, n);
     }
   }
-  void advance(double s) {
-    clock.advance(platform::seconds(s));
-    pool.drain();
-  }
   // The connection's keep-alive transactions (a bag fetch holds one of its own).
   std::size_t keepAlives() { return transactions.open()["com.norvel.tavixd.ipc"]; }
 };
@@ -127,15 +123,6 @@ TEST(ClientConnection, SilenceEndsTheKeepAliveTransactionAndTheNextMessageOpensO
   EXPECT_EQ(state->queryCache()->count(), 0u) << "a silent client's cached replies go with its transaction";
   h.call(notify("b"));
   EXPECT_EQ(h.keepAlives(), 1u);
-
-  // The client goes away: its transaction stays a minute more, in case it comes back.
-  h.client.reset();
-  ASSERT_TRUE(tavix::testing::waitFor([&] { return !h.connection->isValid(); }));
-  h.pool.drain();
-  h.advance(59);
-  EXPECT_EQ(h.keepAlives(), 1u);
-  h.advance(1);
-  EXPECT_EQ(h.keepAlives(), 0u);
 }
 
 TEST(ClientConnection, OneBagPerClientHoweverOftenItConfiguresAndLateRepliesAreLogged) {
@@ -154,10 +141,7 @@ TEST(ClientConnection, OneBagPerClientHoweverOftenItConfiguresAndLateRepliesAreL
   // not dropped silently.
   proto::Envelope ask;
   ask.mutable_bag();
-  ask.set_call_id(5);
-  auto frame = ipc::encodeFrame(ask.SerializeAsString());
-  std::size_t sent = 0;
-  ASSERT_FALSE(ipc::sendWithFds(h.client.get(), frame, {}, true, &sent));
+  h.post(ask, 5);
   h.pool.drain();
   h.client.reset();
   ASSERT_TRUE(tavix::testing::waitFor([&] { return !h.connection->isValid(); }));
@@ -233,7 +217,6 @@ TEST(ClientConnection, RefusesConfigurationsThatWouldInjectHeaders) {
     EXPECT_FALSE(h.call(configure).has_configure_reply()) << "closed without a reply";
     EXPECT_TRUE(capture.contains("configuration carries a control character"));
     EXPECT_TRUE(capture.contains("seekara/1.0\\x0d\\x0aX-Injected: agent")) << "logged, escaped";
-    EXPECT_TRUE(capture.contains("invalid configuration, closing connection"));
     EXPECT_TRUE(h.assembly.clientStateManager->sessions().empty()) << "no state for a refused client";
   }
   // The device's part of the agent comes from defaults, and is held to the same rule.

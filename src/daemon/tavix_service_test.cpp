@@ -19,19 +19,14 @@ namespace {
 
 namespace ipc = platform::ipc;
 
-TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
-  platform::LogCapture capture;
-  testing::TestAssembly f;
-  auto& home = f.home;
-  auto& pool = f.pool;
-  auto& clock = f.clock;
-  auto& transactions = f.transactions;
-  auto& assembly = f.assembly;
-  f.defaults->registerDefaults({{"TVXSharedSession", platform::PropertyValue(true)}});
-  platform::Logger log("test", "listener");
+struct TavixServiceTest : ::testing::Test, testing::TestAssembly {};
 
+TEST_F(TavixServiceTest, TracksConnectionsFromAcceptanceToInvalidation) {
+  platform::LogCapture capture;
+  defaults->registerDefaults({{"TVXSharedSession", platform::PropertyValue(true)}});
+  platform::Logger log("test", "listener");
   {
-    testing::ConnectionServices services(f, nullptr, nullptr);
+    testing::ConnectionServices services(*this, nullptr, nullptr);
     TavixService service({&pool, assembly.urlSession(),
                           [env = services.env](const std::shared_ptr<ipc::IpcConnection>& connection) {
                             return std::make_shared<ClientConnection>(env, connection);
@@ -46,7 +41,6 @@ TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
     ASSERT_FALSE(ipc::connectTo(listener->path(), &second));
     ASSERT_TRUE(testing::waitFor([&] { return service.getClientConnections().size() == 2; }));
     const std::string pid = std::to_string(::getpid());
-    EXPECT_TRUE(capture.contains("new connection from daemon_tests (" + pid + ")"));
     EXPECT_TRUE(testing::waitFor([&] { return capture.contains("too many connections 2 from pid " + pid); }));
     EXPECT_EQ(capture.count("too many connections 1"), 0u);
     EXPECT_EQ(transactions.openCount(), 2u) << "each new client holds the daemon up";
@@ -71,7 +65,6 @@ TEST(TavixService, TracksConnectionsFromAcceptanceToInvalidation) {
     // The second never sent a configuration: no session of its own to close.
     EXPECT_TRUE(testing::waitFor([&] { return capture.count(" on invalidation") == 2; }));
     EXPECT_GE(capture.count("session not flushed on invalidation"), 1u);
-    EXPECT_EQ(capture.count("connection from daemon_tests (" + pid + ") invalidated"), 2u);
     EXPECT_EQ(TavixDiagnosticDataReporter::store().value(invalidations), before + 1);
     // A client that leaves holds the daemon up a minute more, in case it comes back.
     auto held = [&] { return transactions.open()["com.norvel.tavixd.ipc"]; };

@@ -23,41 +23,29 @@ struct Kind {
   std::function<void(ClientState&, std::uint64_t, TVXReplyBlock)> send;
 };
 
+template <typename Request>
+Kind kind(const char* name, const char* path, void (ClientState::*method)(std::shared_ptr<const Request>, TVXReplyBlock),
+          std::string text, std::function<void(Request&)> adjust = {}) {
+  return {name, path, [=](ClientState& state, std::uint64_t id, TVXReplyBlock reply) {
+            auto request = std::make_shared<Request>();
+            request->queryId = id;
+            request->queryString = text;
+            request->triggerEvent = 1;
+            if (adjust) adjust(*request);
+            (state.*method)(request, std::move(reply));
+          }};
+}
+
 std::vector<Kind> allKinds() {
-  auto make = [](auto request, std::uint64_t id, const std::string& text) {
-    request->queryId = id;
-    request->queryString = text;
-    request->triggerEvent = 1;
-    return request;
-  };
-  return {
-      {"search", "/search",
-       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
-         s.search(make(std::make_shared<TVXSearchRequest>(), id, "camera" + std::to_string(id)), std::move(r));
-       }},
-      {"zero-keyword", "/search",
-       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
-         s.zeroKeyword(make(std::make_shared<TVXZeroKeywordRequest>(), id, ""), std::move(r));
-       }},
-      {"more results", "/more",
-       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
-         s.moreResults(make(std::make_shared<TVXMoreResultsRequest>(), id, "ca"), std::move(r));
-       }},
-      {"card", "/card",
-       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
-         s.card(make(std::make_shared<TVXCardRequest>(), id, ""), std::move(r));
-       }},
-      {"look-up", "/search",
-       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
-         s.lookup(make(std::make_shared<TVXLookupRequest>(), id, "serendipity"), std::move(r));
-       }},
-      {"flight", "/flight",
-       [=](ClientState& s, std::uint64_t id, TVXReplyBlock r) {
-         auto f = make(std::make_shared<TVXFlightSearchRequest>(), id, "");
-         f->flightQuery = "UA 123";
-         s.flightSearch(f, std::move(r));
-       }},
-  };
+  // Searches differ by id, so that none is answered from the query cache.
+  return {kind<TVXSearchRequest>("search", "/search", &ClientState::search, "",
+                                 [](auto& r) { r.queryString = "camera" + std::to_string(r.queryId); }),
+          kind("zero-keyword", "/search", &ClientState::zeroKeyword, ""),
+          kind("more results", "/more", &ClientState::moreResults, "ca"),
+          kind("card", "/card", &ClientState::card, ""),
+          kind("look-up", "/search", &ClientState::lookup, "serendipity"),
+          kind<TVXFlightSearchRequest>("flight", "/flight", &ClientState::flightSearch, "",
+                                       [](auto& f) { f.flightQuery = "UA 123"; })};
 }
 
 TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
@@ -86,16 +74,7 @@ TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
     for (const char* path : {"/search", "/more", "/card", "/flight"}) fault(path, settings);
   };
 
-  sendAll("healthy");
-  waitAll();
-  for (std::size_t i = 0; i < kinds.size(); ++i) {
-    const auto call = outcomes[i].replies->first();
-    EXPECT_TRUE(call.reply && !call.error) << outcomes[i].what;
-    if (call.reply) {
-      EXPECT_FALSE(call.reply->data.empty()) << outcomes[i].what;
-    }
-  }
-
+  // Each kind's good answer is checked in a test of its own.
   onEveryPath({{"hang", true}});
   sendAll("hanging");
   waitAll();
@@ -106,7 +85,7 @@ TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
   sendAll("garbage");
   waitAll();
 
-  for (std::size_t i = kinds.size(); i < outcomes.size(); ++i) {
+  for (std::size_t i = 0; i < outcomes.size(); ++i) {
     const auto call = outcomes[i].replies->first(0);
     const bool garbage = outcomes[i].what.rfind("garbage", 0) == 0;
     // Garbage still reaches the search-like kinds, with the parse error; a flight body is not
@@ -310,28 +289,24 @@ TEST_F(QueriesTest, FlightDebugDataAnswersFromTheLocalFileWithoutTheNetwork) {
   EXPECT_TRUE(received("/flight").empty());
 }
 
-// Timers and deadlines on a clock the test moves; the clock is made before the fixture that uses it.
-struct VirtualClockHolder {
-  platform::VirtualClock virtualClock;
-};
-class VirtualTimeTest : private VirtualClockHolder, public QueryFixture {
+// Timers and deadlines on a clock the test moves.
+class VirtualTimeTest : public QueryFixture {
  protected:
-  VirtualTimeTest() : QueryFixture(&virtualClock) {}
-  using VirtualClockHolder::virtualClock;
+  VirtualTimeTest() : QueryFixture(true) {}
 };
 
 TEST_F(VirtualTimeTest, WithoutABagInTimeASearchFailsAtTheEndOfTheWaitAndRecordsWhy) {
   // The bag never comes: the search waits the first-launch wait on this clock, no longer.
   fault("/bag", {{"hang", true}});
-  assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
+  startBagController();
   auto waiting = make("com.norvel.seekara", "Seekara/1.0");
   Replies timedOut;
   auto searching = std::async(std::launch::async,
                               [&] { waiting->search(request<TVXSearchRequest>(7, "weather"), timedOut.block()); });
-  virtualClock.awaitParked(1);
-  virtualClock.advance(platform::seconds(kTVXFirstLaunchBagSemaphoreWait / 1000.0 - 0.001));
+  clock.awaitParked(1);
+  clock.advance(platform::seconds(kTVXFirstLaunchBagSemaphoreWait / 1000.0 - 0.001));
   EXPECT_EQ(timedOut.count(), 0u);
-  virtualClock.advance(platform::seconds(0.001));
+  clock.advance(platform::seconds(0.001));
   searching.get();
   auto call = timedOut.first();
   EXPECT_EQ(call.queryId, 7u);
@@ -370,7 +345,7 @@ TEST_F(VirtualTimeTest, ALookupIsRetriedOnlyUntilItsRenderDeadline) {
   lookup->queryId = 71;
   state->lookup(lookup, late.block());
   ASSERT_TRUE(testing::waitFor([&] { return received("/search").size() == 5; }));
-  virtualClock.advance(platform::seconds(1.6));
+  clock.advance(platform::seconds(1.6));
   send("POST", "/_reset");
   EXPECT_TRUE(late.first().error);
   EXPECT_TRUE(received("/search").empty()) << "retried past the deadline";
@@ -393,9 +368,9 @@ TEST_F(VirtualTimeTest, TwoWarmsWithin30SecondsSendOneRequest) {
   EXPECT_EQ(starts[0].payload().network_search_start().uuid(), ends[0].payload().network_search_end().uuid());
   EXPECT_EQ(received("/warm").size(), 1u);
 
-  virtualClock.advance(platform::seconds(29));
+  clock.advance(platform::seconds(29));
   state->warm();
-  virtualClock.advance(platform::seconds(2));
+  clock.advance(platform::seconds(2));
   state->warm();
   EXPECT_EQ(recordsOfType(*state, kFeedbackTypeNetworkSearchEnd, 2).size(), 2u);
   EXPECT_EQ(received("/warm").size(), 2u);

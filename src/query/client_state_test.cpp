@@ -4,24 +4,15 @@
 
 #include <gtest/gtest.h>
 
-#include <future>
 #include <mutex>
 #include <thread>
 
-#include "bag/tavix_bag_controller.h"
 #include "bagview/tvx_bag.h"
 #include "cache/query_cache.h"
-#include "devserver/devserver.h"
-#include "network/request_factory.h"
-#include "platform/clock.h"
-#include "platform/defaults.h"
-#include "platform/dispatch.h"
-#include "platform/http/url_session.h"
-#include "platform/notification_center.h"
 #include "query/client_state_manager.h"
-#include "support/client_states.h"
+#include "support/query_fixture.h"
 
-namespace tavix {
+namespace tavix::query_testing {
 namespace {
 
 using tavix::testing::waitFor;
@@ -47,75 +38,25 @@ struct BagAnswer {
 };
 
 // The bag wait runs on virtual time; the bag itself comes from the development server.
-class ClientStateTest : public ::testing::Test, protected testing::TestAssembly {
+class ClientStateTest : public QueryFixture {
  protected:
-  ClientStateTest() : testing::TestAssembly(4) {
-    EXPECT_TRUE(server.start({}, nullptr));
-    defaults->setObject("TVXBagURL", server.baseURL() + "/bag");
-    makeRequestFactory();
-  }
-  // After any fault on /bag has been set, so that no fetch slips by it.
-  void startController() { assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly)); }
-  ~ClientStateTest() override {
-    states.clear();
-    if (assembly.bagController) assembly.bagController->invalidate();
-    pool.drain();
-    assembly.bagController.reset();
-    assembly.requestFactory.reset();
-  }
-
-  void failBag() {
-    platform::http::URLRequest r;
-    r.url = server.baseURL() + "/_faults";
-    r.method = "POST";
-    r.body = R"({"path": "/bag", "status": 500})";
-    std::promise<void> done;
-    assembly.urlSession()->dataTask(r, [&](auto, auto, auto) { done.set_value(); })->resume();
-    done.get_future().wait();
-  }
-  void advance(double seconds) {
-    clock.advance(platform::seconds(seconds));
-    pool.drain();
-  }
-
-  std::shared_ptr<ClientState> make(const std::string& identifier = "com.norvel.seekara") {
-    states.push_back(ClientState::create(testing::clientStateEnvironment(*this), identifier));
-    return states.back();
-  }
-
-  devserver::DevServer server;
-  std::vector<std::shared_ptr<ClientState>> states;
+  ClientStateTest() : QueryFixture(true) {}
 };
 
 TEST_F(ClientStateTest, WaitsForTheBagWithoutBlockingAndGivesUpOnTime) {
-  failBag();
-  startController();
-  auto state = make();
-  BagAnswer noAgent;
-  state->bag("", noAgent.reply());
-  ASSERT_EQ(noAgent.count(), 1) << "answered at once";
-  EXPECT_FALSE(noAgent.bag);
-  ASSERT_TRUE(noAgent.error);
-  EXPECT_EQ(noAgent.error->code, 1);
-  EXPECT_EQ(noAgent.error->reason, "no UserAgent");
-
-  // First launch ever: the long wait, then "timeout".
-  BagAnswer late;
-  state->bag("seekara/1", late.reply());
-  advance(kTVXFirstLaunchBagSemaphoreWait / 1000.0 - 0.001);
-  EXPECT_EQ(late.count(), 0);
-  advance(0.002);
-  ASSERT_EQ(late.count(), 1);
-  EXPECT_FALSE(late.bag);
-  ASSERT_TRUE(late.error);
-  EXPECT_EQ(late.error->reason, "timeout");
-
-  // A device that has recorded resources waits the short wait.
+  fault("/bag", {{"status", 500}});
+  startBagController();
+  // The first launch's long wait is the search's (VirtualTimeTest); a device that has recorded
+  // resources waits the short one.
   defaults->setObject("download_resources", platform::PropertyValue::Array{});
   BagAnswer shorter;
   make("com.norvel.brovane")->bag("brovane/1", shorter.reply());
-  advance(kTVXDefaultBagSemaphoreWait / 1000.0 + 0.001);
+  advance(kTVXDefaultBagSemaphoreWait / 1000.0 - 0.001);
+  EXPECT_EQ(shorter.count(), 0);
+  advance(0.002);
   ASSERT_EQ(shorter.count(), 1);
+  EXPECT_FALSE(shorter.bag);
+  ASSERT_TRUE(shorter.error);
   EXPECT_EQ(shorter.error->reason, "timeout");
 
   // A bag change during the wait ends it at once, with the bag labelled for the waiting client;
@@ -141,9 +82,8 @@ TEST_F(ClientStateTest, WaitsForTheBagWithoutBlockingAndGivesUpOnTime) {
 }
 
 TEST_F(ClientStateTest, NewUserAgentRelabelsTheBagAndEmptiesTheQueryCache) {
-  startController();
-  ASSERT_TRUE(waitFor([&] { return assembly.bagController->currentBag() != nullptr; }, 5000));
-  auto state = make();
+  serveBag(bagWith());
+  auto state = make("com.norvel.seekara");
   BagAnswer first;
   state->bag("seekara/1", first.reply());
   ASSERT_EQ(first.count(), 1);
@@ -171,12 +111,15 @@ TEST_F(ClientStateTest, NewUserAgentRelabelsTheBagAndEmptiesTheQueryCache) {
   EXPECT_FALSE(state->userAgent());
   BagAnswer none;
   state->bag("", none.reply());
+  ASSERT_EQ(none.count(), 1) << "answered at once";
+  EXPECT_FALSE(none.bag);
   ASSERT_TRUE(none.error);
+  EXPECT_EQ(none.error->code, 1);
   EXPECT_EQ(none.error->reason, "no UserAgent");
 }
 
 TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
-  startController();
+  startBagController();
   auto manager = testing::makeClientStateManager(*this);
   EXPECT_EQ(manager->stateForClientIdentifier(""), nullptr);
 
@@ -217,4 +160,4 @@ TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
 }
 
 }  // namespace
-}  // namespace tavix
+}  // namespace tavix::query_testing

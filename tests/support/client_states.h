@@ -12,8 +12,7 @@
 
 namespace tavix::testing {
 
-// The assembly's services as they are now; a location manager on the defaults when the assembly
-// has none.
+// The assembly's services as they are now, with a location manager on the defaults.
 inline std::shared_ptr<const ClientState::Environment> clientStateEnvironment(TestAssembly& t) {
   auto& a = t.assembly;
   auto env = std::make_shared<ClientState::Environment>();
@@ -24,8 +23,7 @@ inline std::shared_ptr<const ClientState::Environment> clientStateEnvironment(Te
   env->requestFactory = a.requestFactory;
   env->bagController = a.bagController;
   env->engagedCompletionCache = a.engagedCompletionCache;
-  env->locationManager =
-      a.locationManager ? a.locationManager : std::make_shared<DefaultsLocationManager>(*t.defaults, *a.clock, t.pool);
+  env->locationManager = std::make_shared<DefaultsLocationManager>(*t.defaults, *a.clock, t.pool);
   env->session = a.urlSession();
   env->guidController = a.guidController;
   env->sessionManager = a.clientSessionManager;

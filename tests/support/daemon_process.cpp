@@ -7,7 +7,6 @@
 
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 
 namespace tavix::testing {
 
@@ -25,9 +24,7 @@ std::vector<std::string> sessionFileContents(const TempHome& home) {
   std::vector<std::string> files;
   std::error_code ec;
   for (const auto& e : std::filesystem::directory_iterator(home.cache() / "com.norvel.tavixd", ec)) {
-    if (e.path().filename().string().find("session.") == std::string::npos) continue;
-    std::ifstream in(e.path(), std::ios::binary);
-    files.emplace_back(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+    if (e.path().filename().string().find("session.") != std::string::npos) files.push_back(readFile(e.path()));
   }
   return files;
 }
@@ -97,12 +94,7 @@ int DaemonProcess::stop() {
   return status_;
 }
 
-std::string DaemonProcess::log() const {
-  std::ifstream in(logFile_);
-  std::stringstream s;
-  s << in.rdbuf();
-  return s.str();
-}
+std::string DaemonProcess::log() const { return readFile(logFile_); }
 
 bool DaemonProcess::waitForLog(const std::string& text, int ms) const {
   return waitFor([&] { return log().find(text) != std::string::npos; }, ms);

@@ -16,9 +16,9 @@
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
 #include "platform/http/url_session.h"
-#include "support/daemon_process.h"
 #include "support/devserver_control.h"
 #include "support/devserver_process.h"
+#include "support/tavixd.h"
 #include "support/temp_home.h"
 #include "tavix/client.h"
 
@@ -58,8 +58,7 @@ class QueryDaemonTest : public ::testing::Test {
       defaults.setObject("TVXBagURL", server.base + "/bag");
       ASSERT_TRUE(defaults.synchronize());
     }
-    tavixd.emplace(TAVIXD_BINARY, home, std::vector<std::string>{"--socket", socket(), "--log-level", "debug"});
-    ASSERT_TRUE(tavixd->waitForLog("tavixd started")) << tavixd->log();
+    tavixd.emplace(home);
     // With the bag in, no client waits for it (a wait counts as network use and delays warming).
     ASSERT_TRUE(tavixd->waitForLog("bag change notification received")) << tavixd->log();
     app.emplace(clientOptions("com.norvel.seekara", "seekara/1.0"));
@@ -68,13 +67,12 @@ class QueryDaemonTest : public ::testing::Test {
   // A client of the daemon; its calls fail with kTimedOut after 10 s without an answer.
   client::Client::Options clientOptions(const std::string& identifier, const std::string& userAgent) const {
     client::Client::Options options;
-    options.socketPath = socket();
+    options.socketPath = tavixd->socket;
     options.configuration.set_identifier(identifier);
     options.configuration.set_user_agent(userAgent);
     options.timeoutMs = 10000;
     return options;
   }
-  std::string socket() const { return (home.runtime() / "tavixd.socket").string(); }
 
   proto::TVXRequest request(const std::string& input) {
     proto::TVXRequest r;
@@ -146,7 +144,7 @@ class QueryDaemonTest : public ::testing::Test {
   DevServerProcess server{DEVSERVER_BINARY};
   platform::DispatchPool pool{1};
   platform::http::URLSession session{platform::http::URLSessionConfiguration{.delegatePool = &pool}};
-  std::optional<DaemonProcess> tavixd;
+  std::optional<Tavixd> tavixd;
   std::optional<client::Client> app;
   std::uint64_t queryId = 100;
 };

@@ -28,6 +28,7 @@
 #include "platform/json_value.h"
 #include "platform/notification_center.h"
 #include "query/client_state.h"
+#include "support/devserver_control.h"
 #include "support/temp_home.h"
 #include "support/client_states.h"
 #include "tavix_proto/feedback_session.pb.h"
@@ -71,12 +72,12 @@ class Replies {
   std::vector<Call> calls_;
 };
 
-// The assembly runs on the system clock unless the test hands in another.
+// The assembly runs on the system clock, or on the virtual `clock` that the test moves.
 class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
  protected:
-  explicit QueryFixture(platform::Clock* testClock = nullptr) : testing::TestAssembly(8) {
+  explicit QueryFixture(bool virtualTime = false) : testing::TestAssembly(8) {
     EXPECT_TRUE(server.start({}, nullptr));
-    clock_ = testClock ? testClock : &systemClock;
+    clock_ = virtualTime ? static_cast<platform::Clock*>(&clock) : &systemClock;
     assembly.clock = clock_;
     defaults->registerDefaults({{"TVXSessionSoftLimitOverride", platform::PropertyValue(std::int64_t{600})},
                                 {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
@@ -115,24 +116,20 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
     for (const auto& [key, value] : extra) bag[key] = value;
     return bag;
   }
+  // After any fault on /bag has been set, so that no fetch slips by it.
+  void startBagController() {
+    assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
+  }
   // Serves `bag` and starts the bag controller on it; waits until the controller holds it.
   void serveBag(const platform::Dictionary& bag) {
     fault("/bag", {{"body", platform::toJson(platform::PropertyValue(bag))}});
-    assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
-    assembly.bagController->currentBag();
+    startBagController();
     ASSERT_TRUE(testing::waitFor([&] { return assembly.bagController->currentBag() != nullptr; }, 5000));
   }
 
   std::string send(const std::string& method, const std::string& path, const std::string& body = {},
                    const devserver::DevServer* to = nullptr) {
-    platform::http::URLRequest r;
-    r.url = (to ? to : &server)->baseURL() + path;
-    r.method = method;
-    r.body = body;
-    r.reloadIgnoringLocalCacheData = true;
-    std::promise<std::string> done;
-    control->dataTask(r, [&](std::string data, auto, auto) { done.set_value(std::move(data)); })->resume();
-    return done.get_future().get();
+    return testing::devserverCall(*control, (to ? to : &server)->baseURL(), path, method, body);
   }
   void fault(const std::string& path, platform::Dictionary settings) {
     settings["path"] = path;
@@ -152,9 +149,10 @@ class QueryFixture : public ::testing::Test, protected testing::TestAssembly {
     return out;
   }
 
-  std::shared_ptr<ClientState> make(const std::string& identifier, const std::string& userAgent) {
+  // A state for `identifier`; without `userAgent` the client has not said who it is yet.
+  std::shared_ptr<ClientState> make(const std::string& identifier, const std::string& userAgent = {}) {
     states.push_back(ClientState::create(testing::clientStateEnvironment(*this), identifier));
-    states.back()->updateClient(userAgent);
+    if (!userAgent.empty()) states.back()->updateClient(userAgent);
     return states.back();
   }
 

@@ -30,6 +30,9 @@ class TempHome {
 // wait on real threads (inotify, child processes); virtual-time tests never need it.
 bool waitFor(const std::function<bool()>& condition, int timeoutMs = 5000);
 
+// The whole content of `file`; empty when it cannot be read.
+std::string readFile(const std::filesystem::path& file);
+
 // How often `what` occurs in `text` (log lines, for tests that wait on the n-th one).
 std::size_t occurrences(const std::string& text, const std::string& what);
 

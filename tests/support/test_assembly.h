@@ -29,7 +29,6 @@ class ActivityScheduler;
 }
 class ClientStateManager;
 class EngagedCompletionCache;
-class LocationManager;
 class ResourceVersionsProvider;
 class TavixFlusherIPC;
 class UploadManager;
@@ -56,7 +55,6 @@ struct TestWiring {
   std::shared_ptr<TavixFlusherIPC> flusherIPCListener;
   std::shared_ptr<TavixPersistentStorage> persistentStorage;
   std::shared_ptr<EngagedCompletionCache> engagedCompletionCache;
-  std::shared_ptr<LocationManager> locationManager;
   std::shared_ptr<ResourceVersionsProvider> resourceVersions;
 
   // The query and bag sessions, configured as start-up configures them; made on first use.
@@ -109,6 +107,12 @@ class TestAssembly {
   }
   TestAssembly(const TestAssembly&) = delete;
   TestAssembly& operator=(const TestAssembly&) = delete;
+
+  // Moves the virtual clock and waits for what its timers queued.
+  void advance(double seconds) {
+    clock.advance(platform::seconds(seconds));
+    pool.drain();
+  }
 
   TavixPersistentStorage::Environment storageEnvironment() {
     return {assembly.cachesFolder(), &pool, assembly.clock, defaults.get(), &transactions};
