@@ -252,7 +252,7 @@ class Housekeeping {
   void start(platform::CounterStore& counters, const platform::fs::path& countersFile, double exitWhenIdle,
              std::function<bool()> isBusy, std::function<void()> exit, platform::Logger& log) {
     queue_.sync([&] {
-      if (!memoryPressure_.start()) log.info("no memory pressure information; caches shrink only when told");
+      if (!memoryPressure_.start(&log)) log.info("no memory pressure information; caches shrink only when told");
       // Pings from a pool queue: a pool wedged for the whole interval gets the daemon restarted.
       if (const auto interval = platform::watchdogInterval(); interval > platform::Duration::zero()) {
         watchdog_.start(interval / 3, [] { platform::notifyServiceManager("WATCHDOG=1"); });
