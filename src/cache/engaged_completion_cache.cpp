@@ -9,6 +9,8 @@
 #include <unicode/translit.h>
 #include <unicode/unistr.h>
 
+#include <algorithm>
+#include <cctype>
 #include <chrono>
 #include <condition_variable>
 #include <cstdio>
@@ -151,6 +153,13 @@ std::string EngagedCompletionCache::kanize(const std::string& text) {
 }
 
 std::string EngagedCompletionCache::normalizeString(const std::string& text) {
+  // ASCII has no diacritics and no compatibility forms: lower-casing is all there is to do, and
+  // it is most of what users type.
+  if (std::all_of(text.begin(), text.end(), [](char c) { return static_cast<unsigned char>(c) < 0x80; })) {
+    std::string lower = text;
+    for (char& c : lower) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
+    return lower;
+  }
   if (containsJapanese(text)) return text;
   icu::UnicodeString s = icu::UnicodeString::fromUTF8(text);
   s.toLower(icu::Locale::getRoot());
@@ -203,8 +212,14 @@ bool EngagedCompletionCache::hasDatabase() const {
   return completionsDB_ != nullptr;
 }
 
+void EngagedCompletionCache::finalizeStatements() {
+  sqlite3_finalize(select_);
+  select_ = nullptr;
+}
+
 void EngagedCompletionCache::closeDBConnection() {
   std::lock_guard hold(dbLock_);
+  finalizeStatements();
   if (completionsDB_) sqlite3_close_v2(completionsDB_);
   completionsDB_ = nullptr;
 }
@@ -233,6 +248,7 @@ void EngagedCompletionCache::openDatabaseConnection() {
   std::lock_guard hold(dbLock_);
   if (completionsDB_) {
     eccLog().notice("Closing existing Completions database connection");
+    finalizeStatements();
     sqlite3_close_v2(completionsDB_);
     completionsDB_ = nullptr;
   }
@@ -459,53 +475,89 @@ void EngagedCompletionCache::addCompletion(const std::string& completion, const 
 
 // Searching
 
-std::vector<TVXSearchSuggestion> EngagedCompletionCache::runSearch(const std::string& input, unsigned long client,
-                                                                   unsigned long count) {
-  std::lock_guard hold(dbLock_);
-  std::vector<TVXSearchSuggestion> found;
-  const auto started = std::chrono::steady_clock::now();
+sqlite3_stmt* EngagedCompletionCache::selectStatement(unsigned long count) {
   const EngagedCompletionParameters p = parameters();
+  if (select_ && selectParameters_ == p && selectCount_ == count) return select_;
+  finalizeStatements();
   // Sized to what the weights print to: a bag may send weights of hundreds of digits.
   const int length = std::snprintf(nullptr, 0, kSelectFormat, p.last1hour, p.last1day, p.last1week, p.last1month,
                                    p.all, p.mostRecent, "%q", "%q", "%q", "%q", count);
-  if (length < 0) return found;
+  if (length < 0) return nullptr;
   std::string formatted(static_cast<std::size_t>(length) + 1, '\0');
   std::snprintf(formatted.data(), formatted.size(), kSelectFormat, p.last1hour, p.last1day, p.last1week,
                 p.last1month, p.all, p.mostRecent, "%q", "%q", "%q", "%q", count);
   const std::string sql = positional(formatted.c_str());
   sqlite3* db = handle();
-  if (!db) return found;
-  Statement s;
-  int rc = sqlite3_prepare_v2(db, sql.c_str(), -1, &s.stmt, nullptr);
+  if (!db) return nullptr;
+  int rc = sqlite3_prepare_v3(db, sql.c_str(), -1, SQLITE_PREPARE_PERSISTENT, &select_, nullptr);
   if (rc != SQLITE_OK) {
     eccLog().error("_prepareSelectStatement failed - SQL:{} code: {}", sql, rc);
-    return found;
+    sqlite3_finalize(select_);
+    select_ = nullptr;
+    return nullptr;
   }
-  const std::int64_t now = wholeSeconds(env_.clock->now());
-  for (int i = 0; i < 5; ++i) sqlite3_bind_int(s.stmt, i + 1, static_cast<std::int32_t>(now - kBuckets[i]));
-  sqlite3_bind_int(s.stmt, 6, static_cast<std::int32_t>(now));
+  selectParameters_ = p;
+  selectCount_ = count;
+  return select_;
+}
+
+namespace {
+
+// Ends a statement that runs past its deadline. Looked at every few hundred virtual-machine
+// steps: a clock read is cheap next to them.
+struct SearchDeadline {
+  platform::Clock* clock;
+  platform::TimePoint at;
+  static int check(void* self) {
+    auto* d = static_cast<SearchDeadline*>(self);
+    return d->clock->now() > d->at ? 1 : 0;
+  }
+};
+
+}  // namespace
+
+std::optional<std::vector<TVXSearchSuggestion>> EngagedCompletionCache::runSearch(
+    const std::string& input, unsigned long client, unsigned long count, const platform::TimePoint* deadline) {
+  std::lock_guard hold(dbLock_);
+  if (!handle()) return std::nullopt;
+  std::vector<TVXSearchSuggestion> found;
+  const auto started = std::chrono::steady_clock::now();
+  sqlite3_stmt* stmt = selectStatement(count);
+  if (!stmt) return found;
   const std::string normalized = normalizeString(input);
   if (normalized.empty()) return found;
-  sqlite3_bind_text(s.stmt, 7, input.c_str(), -1, SQLITE_TRANSIENT);
-  sqlite3_bind_text(s.stmt, 8, (input + kRangeEnd).c_str(), -1, SQLITE_TRANSIENT);
-  sqlite3_bind_text(s.stmt, 9, normalized.c_str(), -1, SQLITE_TRANSIENT);
-  sqlite3_bind_text(s.stmt, 10, (normalized + kRangeEnd).c_str(), -1, SQLITE_TRANSIENT);
-  sqlite3_bind_int64(s.stmt, 11, static_cast<sqlite3_int64>(client));
-  while (sqlite3_step(s.stmt) == SQLITE_ROW) {
+  const std::int64_t now = wholeSeconds(env_.clock->now());
+  for (int i = 0; i < 5; ++i) sqlite3_bind_int(stmt, i + 1, static_cast<std::int32_t>(now - kBuckets[i]));
+  sqlite3_bind_int(stmt, 6, static_cast<std::int32_t>(now));
+  sqlite3_bind_text(stmt, 7, input.c_str(), -1, SQLITE_TRANSIENT);
+  sqlite3_bind_text(stmt, 8, (input + kRangeEnd).c_str(), -1, SQLITE_TRANSIENT);
+  sqlite3_bind_text(stmt, 9, normalized.c_str(), -1, SQLITE_TRANSIENT);
+  sqlite3_bind_text(stmt, 10, (normalized + kRangeEnd).c_str(), -1, SQLITE_TRANSIENT);
+  sqlite3_bind_int64(stmt, 11, static_cast<sqlite3_int64>(client));
+  SearchDeadline limit{env_.clock, deadline ? *deadline : platform::TimePoint::max()};
+  if (deadline) sqlite3_progress_handler(handle(), 256, &SearchDeadline::check, &limit);
+  int rc;
+  while ((rc = sqlite3_step(stmt)) == SQLITE_ROW) {
     TVXSearchSuggestion suggestion;
-    const auto* text = reinterpret_cast<const char*>(sqlite3_column_text(s.stmt, 0));
-    const auto* origin = reinterpret_cast<const char*>(sqlite3_column_text(s.stmt, 1));
+    const auto* text = reinterpret_cast<const char*>(sqlite3_column_text(stmt, 0));
+    const auto* origin = reinterpret_cast<const char*>(sqlite3_column_text(stmt, 1));
     suggestion.suggestion = text ? text : "";
-    const std::string originText = origin ? origin : "";
+    const std::string_view originText = origin ? origin : "";
     suggestion.type = originText == "se" ? 1 : originText == "3d" ? 8 : 0;
-    suggestion.score = sqlite3_column_double(s.stmt, 2);
+    suggestion.score = sqlite3_column_double(stmt, 2);
     suggestion.query = input;
-    auto elapsed =
-        std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - started).count();
-    eccLog().debug("Match found input {}, completion {}, score {:f} duration {}", input, suggestion.suggestion,
-                   suggestion.score, elapsed);
+    if (eccLog().wants(platform::LogLevel::Debug)) {
+      auto elapsed =
+          std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - started).count();
+      eccLog().debug("Match found input {}, completion {}, score {:f} duration {}", input, suggestion.suggestion,
+                     suggestion.score, elapsed);
+    }
     found.push_back(std::move(suggestion));
   }
+  if (deadline) sqlite3_progress_handler(handle(), 0, nullptr, nullptr);
+  // Kept prepared for the next search; reset lets go of its read lock on the file.
+  sqlite3_reset(stmt);
+  if (rc == SQLITE_INTERRUPT) return std::nullopt;
   return found;
 }
 
@@ -513,19 +565,41 @@ std::optional<std::vector<TVXSearchSuggestion>> EngagedCompletionCache::completi
                                                                                            unsigned long client,
                                                                                            unsigned long count,
                                                                                            unsigned long timeoutMs) {
-  if (!cacheEnabled() || !hasDatabase()) return std::nullopt;
+  if (!cacheEnabled()) return std::nullopt;
+  const platform::Duration timeout = platform::seconds(timeoutMs / 1000.0);
+  auto answer = [&](std::optional<std::vector<TVXSearchSuggestion>> found, bool inTime)
+      -> std::optional<std::vector<TVXSearchSuggestion>> {
+    if (!inTime) {
+      eccLog().debug("EngagedCompletionCache search timed out for input {} timeout value {}", input, timeoutMs);
+      return std::nullopt;
+    }
+    if (!found) return std::nullopt;
+    const double threshold = parameters().minThresholdToSend;
+    std::erase_if(*found, [threshold](const TVXSearchSuggestion& s) { return s.score < threshold; });
+    return found;
+  };
 
-  // Shared with the search block, which may finish after we stopped waiting for it.
+  // The database is free: search here, on the caller's thread, held to the same deadline.
+  if (std::unique_lock hold(dbLock_, std::try_to_lock); hold.owns_lock()) {
+    if (!handle()) return std::nullopt;
+    const platform::TimePoint deadline = env_.clock->now() + timeout;
+    auto found = runSearch(input, client, count, &deadline);
+    const bool inTime = found.has_value() && env_.clock->now() <= deadline;  // interrupted: nullopt
+    return answer(std::move(found), inTime);
+  }
+
+  // Busy with a write or another search: the search waits for it on the pool, and the caller
+  // waits for the search at most its time-out.
   struct Wait {
     std::mutex lock;
     std::condition_variable done;
     bool finished = false;
-    std::vector<TVXSearchSuggestion> results;
+    std::optional<std::vector<TVXSearchSuggestion>> results;
   };
   auto wait = std::make_shared<Wait>();
   std::weak_ptr<EngagedCompletionCache> weak = weak_from_this();
   env_.pool->post([weak, wait, input, client, count] {
-    std::vector<TVXSearchSuggestion> results;
+    std::optional<std::vector<TVXSearchSuggestion>> results;
     if (auto self = weak.lock()) results = self->runSearch(input, client, count);
     std::lock_guard<std::mutex> guard(wait->lock);
     wait->results = std::move(results);
@@ -534,17 +608,8 @@ std::optional<std::vector<TVXSearchSuggestion>> EngagedCompletionCache::completi
   });
 
   std::unique_lock<std::mutex> guard(wait->lock);
-  if (!env_.clock->waitFor(guard, wait->done, platform::seconds(timeoutMs / 1000.0),
-                           [&] { return wait->finished; })) {
-    eccLog().debug("EngagedCompletionCache search timed out for input {} timeout value {}", input, timeoutMs);
-    return std::nullopt;
-  }
-  const double threshold = parameters().minThresholdToSend;
-  std::vector<TVXSearchSuggestion> results;
-  for (auto& s : wait->results) {
-    if (s.score >= threshold) results.push_back(s);
-  }
-  return results;
+  const bool inTime = env_.clock->waitFor(guard, wait->done, timeout, [&] { return wait->finished; });
+  return answer(inTime ? std::move(wait->results) : std::nullopt, inTime);
 }
 
 std::optional<TVXSearchSuggestion> EngagedCompletionCache::completionForInput(const std::string& input,

@@ -29,6 +29,7 @@
 #include "platform/files.h"
 
 struct sqlite3;
+struct sqlite3_stmt;
 
 namespace tavix {
 
@@ -78,6 +79,8 @@ struct EngagedCompletionParameters {
   double all = 0.001;         // ... in the last 365 days
   double mostRecent = 1.0;    // weight of (newest engagement date / now)
   double minThresholdToSend = 0.0;  // results scoring below it are dropped
+
+  bool operator==(const EngagedCompletionParameters&) const = default;
 };
 
 class EngagedCompletionCache : public std::enable_shared_from_this<EngagedCompletionCache> {
@@ -154,6 +157,9 @@ class EngagedCompletionCache : public std::enable_shared_from_this<EngagedComple
   // Row count of one client, or -1 on failure. For tests and tools.
   std::int64_t rowCountForClient(unsigned long client);
 
+  // Holds the database as a long write would, until the lock is dropped. For tests.
+  std::unique_lock<std::recursive_mutex> holdDatabaseForTesting() { return std::unique_lock(dbLock_); }
+
  private:
   explicit EngagedCompletionCache(Environment env);
 
@@ -170,7 +176,14 @@ class EngagedCompletionCache : public std::enable_shared_from_this<EngagedComple
   bool execSQLStatement(const std::string& sql);
   void deleteOldestEngagements(unsigned long limit, unsigned long client);
   std::int64_t countRows(const std::string& sql, bool* ok);
-  std::vector<TVXSearchSuggestion> runSearch(const std::string& input, unsigned long client, unsigned long count);
+  // The search, under dbLock_. With a deadline, a search still running then is interrupted and
+  // answers nullopt.
+  std::optional<std::vector<TVXSearchSuggestion>> runSearch(const std::string& input, unsigned long client,
+                                                            unsigned long count,
+                                                            const platform::TimePoint* deadline = nullptr);
+  // The search statement for the current weights and `count`, prepared once; null on failure.
+  sqlite3_stmt* selectStatement(unsigned long count);
+  void finalizeStatements();
   void warmup();
 
   Environment env_;
@@ -180,6 +193,10 @@ class EngagedCompletionCache : public std::enable_shared_from_this<EngagedComple
   // an add runs clears and counts of its own, and a corrupt insert rebuilds, all under one hold.
   mutable std::recursive_mutex dbLock_;
   sqlite3* completionsDB_ = nullptr;  // guarded by dbLock_
+  // The search statement kept prepared on completionsDB_, and what it was made for; dbLock_.
+  sqlite3_stmt* select_ = nullptr;
+  EngagedCompletionParameters selectParameters_;
+  unsigned long selectCount_ = 0;
   std::atomic<int> schemaVersion_{0};
   platform::SerialQueue updateQueue_;
   mutable std::mutex parametersLock_;

@@ -45,6 +45,7 @@
 #include "platform/notification_center.h"
 #include "platform/run_loop.h"
 #include "platform/service_manager.h"
+#include "platform/transactions.h"
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
 #include "resources/download_manager.h"
@@ -371,62 +372,106 @@ void checkInActivities(platform::ActivityScheduler& activities, Assembly& assemb
                      });
 }
 
-// The periodic chores on a queue of their own: counters saved, the idle exit, the service
-// manager's watchdog and the memory-pressure monitor.
+// The chores on a queue of their own: counters saved, the idle exit, the service manager's
+// watchdog and the memory-pressure monitor. None keeps a timer while it has nothing to do.
 class Housekeeping {
  public:
   Housekeeping(platform::DispatchPool& pool, platform::Clock& clock)
-      : clock_(clock),
-        queue_(pool, "com.norvel.tavixd.housekeeping"),
-        saveCounters_(clock, queue_),
-        idleCheck_(clock, queue_),
-        watchdog_(clock, queue_),
+      : clock_(clock), queue_(pool, "com.norvel.tavixd.housekeeping"), watchdog_(clock, queue_),
         memoryPressure_(clock, queue_) {}
 
   // `isBusy` says whether a transaction is open or a client connected; `exit` ends the run loop.
   void start(platform::CounterStore& counters, const platform::fs::path& countersFile, double exitWhenIdle,
-             std::function<bool()> isBusy, std::function<void()> exit, platform::Logger& log) {
+             platform::TransactionTracker& transactions, std::function<bool()> isBusy, std::function<void()> exit,
+             platform::Logger& log) {
     queue_.sync([&] {
-      if (!memoryPressure_.start()) log.info("no memory pressure information; caches shrink only when told");
+      log_ = &log;
+      if (!memoryPressure_.start(&log)) log.info("no memory pressure information; caches shrink only when told");
       // Pings from a pool queue: a pool wedged for the whole interval gets the daemon restarted.
       if (const auto interval = platform::watchdogInterval(); interval > platform::Duration::zero()) {
         watchdog_.start(interval / 3, [] { platform::notifyServiceManager("WATCHDOG=1"); });
       }
-      saveCounters_.start(platform::seconds(kCounterSaveIntervalSeconds), [&counters, countersFile, &log] {
-        if (!counters.dirty()) return;
-        if (auto ec = counters.save(countersFile)) log.error("cannot save counters {}", describe(countersFile, ec));
-      });
+      // Saved a while after the first change, not on a timer that runs while nothing changes.
+      counters_ = &counters;
+      countersFile_ = countersFile;
+      counters.setDirtyHandler([this] { queue_.async([this] { saveCountersLater(); }); });
+      if (counters.dirty()) saveCountersLater();
       if (exitWhenIdle > 0) {
-        auto idleSince = std::make_shared<platform::TimePoint>(clock_.now());
-        idleCheck_.start(platform::seconds(std::min(1.0, exitWhenIdle)),
-                         [this, idleSince, exitWhenIdle, isBusy = std::move(isBusy), exit = std::move(exit), &log] {
-                           if (isBusy()) {
-                             *idleSince = clock_.now();
-                           } else if (clock_.now() - *idleSince >= platform::seconds(exitWhenIdle)) {
-                             log.info("idle for {} s, exiting", exitWhenIdle);
-                             exit();
-                           }
-                         });
+        transactions_ = &transactions;
+        exitWhenIdle_ = exitWhenIdle;
+        isBusy_ = std::move(isBusy);
+        exit_ = std::move(exit);
+        idleSince_ = clock_.now();
+        // The last transaction's end restarts the count; no timer runs while one is open.
+        transactions.setIdleHandler([this] {
+          queue_.async([this] {
+            idleSince_ = clock_.now();
+            checkIdleAfter(platform::seconds(exitWhenIdle_));
+          });
+        });
+        checkIdleAfter(platform::seconds(exitWhenIdle_));
       }
     });
   }
 
+  // Before the objects the handlers reach go; a handler already called still finds them alive,
+  // since they outlive the pool's shutdown.
   void stop() {
+    if (counters_) counters_->setDirtyHandler(nullptr);
+    if (transactions_) transactions_->setIdleHandler(nullptr);
     queue_.sync([&] {
-      saveCounters_.stop();
-      idleCheck_.stop();
+      saveCounters_.cancel();
+      idleCheck_.cancel();
       watchdog_.stop();
       memoryPressure_.stop();
     });
   }
 
  private:
+  void saveCountersLater() {
+    if (saveArmed_) return;
+    saveArmed_ = true;
+    saveCounters_ = clock_.after(platform::seconds(kCounterSaveIntervalSeconds), queue_, [this] {
+      saveArmed_ = false;
+      if (!counters_->dirty()) return;
+      if (auto ec = counters_->save(countersFile_)) log_->error("cannot save counters {}", describe(countersFile_, ec));
+    });
+  }
+
+  void checkIdleAfter(platform::Duration delay) {
+    idleCheck_.cancel();
+    idleCheck_ = clock_.after(delay, queue_, [this] {
+      if (transactions_->openCount() > 0) return;  // the end of the last one checks again
+      const auto now = clock_.now();
+      if (isBusy_()) {
+        // A client connected without a transaction: only looking tells when it goes.
+        idleSince_ = now;
+        checkIdleAfter(platform::seconds(std::min(1.0, exitWhenIdle_)));
+      } else if (now - idleSince_ >= platform::seconds(exitWhenIdle_)) {
+        log_->info("idle for {} s, exiting", exitWhenIdle_);
+        exit_();
+      } else {
+        checkIdleAfter(idleSince_ + platform::seconds(exitWhenIdle_) - now);
+      }
+    });
+  }
+
   platform::Clock& clock_;
   platform::SerialQueue queue_;
-  platform::RepeatingTimer saveCounters_;
-  platform::RepeatingTimer idleCheck_;
   platform::RepeatingTimer watchdog_;
   platform::PressureStallMonitor memoryPressure_;
+  platform::Logger* log_ = nullptr;
+  // On queue_ once started.
+  platform::CounterStore* counters_ = nullptr;
+  platform::fs::path countersFile_;
+  platform::TimerHandle saveCounters_;
+  bool saveArmed_ = false;
+  platform::TransactionTracker* transactions_ = nullptr;
+  double exitWhenIdle_ = 0;
+  std::function<bool()> isBusy_;
+  std::function<void()> exit_;
+  platform::TimePoint idleSince_;
+  platform::TimerHandle idleCheck_;
 };
 
 }  // namespace
@@ -520,7 +565,7 @@ int runDaemon(const DaemonOptions& options, const platform::Paths& paths) {
 
   Housekeeping housekeeping(pool, clock);
   housekeeping.start(
-      counters, countersFile, options.exitWhenIdle,
+      counters, countersFile, options.exitWhenIdle, transactions,
       [&] { return transactions.openCount() > 0 || !service.getClientConnections().empty(); },
       [&] { runLoop.stop(); }, log);
 

@@ -22,6 +22,7 @@
 #include "bagview/user_agent.h"
 #include "platform/clock.h"
 #include "platform/defaults.h"
+#include "platform/dispatch.h"
 #include "platform/transactions.h"
 #include "tavix_proto/feedback_session.pb.h"
 
@@ -361,29 +362,27 @@ std::optional<proto::CTClientSession> FileContainer::unarchiveObject() {
 
 // ---- TavixPersistentStorage -----------------------------------------------------------------
 
-// One thread and its job list. Jobs run in order; the thread drains them before it stops.
+// A thread and its job list. Jobs run in order; the thread starts with the first job after a quiet
+// spell and leaves once none is left, so an idle daemon keeps no thread here.
 struct TavixPersistentStorage::Syncer {
   std::mutex lock;
   std::condition_variable changed;
   std::deque<std::function<void()>> jobs;
-  bool busy = false;
-  bool stopping = false;
-  std::thread thread{[this] { run(); }};
+  bool busy = false;  // the thread is on the jobs
+  std::thread thread;
 
   ~Syncer() {
-    {
-      std::lock_guard guard(lock);
-      stopping = true;
-    }
-    changed.notify_all();
-    thread.join();
+    waitIdle();
+    if (thread.joinable()) thread.join();
   }
   void post(std::function<void()> job) {
-    {
-      std::lock_guard guard(lock);
-      jobs.push_back(std::move(job));
-    }
-    changed.notify_all();
+    std::lock_guard guard(lock);
+    jobs.push_back(std::move(job));
+    if (busy) return;
+    busy = true;
+    // The last thread let go of the lock for good when it cleared `busy`: this join is short.
+    if (thread.joinable()) thread.join();
+    thread = std::thread([this] { run(); });
   }
   bool morePending() {
     std::lock_guard guard(lock);
@@ -394,19 +393,18 @@ struct TavixPersistentStorage::Syncer {
     changed.wait(guard, [this] { return jobs.empty() && !busy; });
   }
   void run() {
+    platform::nameThisThread("tavixd-sync");
     std::unique_lock guard(lock);
-    for (;;) {
-      changed.wait(guard, [this] { return stopping || !jobs.empty(); });
-      if (jobs.empty()) return;
+    while (!jobs.empty()) {
       auto job = std::move(jobs.front());
       jobs.pop_front();
-      busy = true;
       guard.unlock();
       job();
+      job = nullptr;
       guard.lock();
-      busy = false;
-      changed.notify_all();
     }
+    busy = false;
+    changed.notify_all();
   }
 };
 

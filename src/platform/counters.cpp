@@ -6,21 +6,48 @@
 
 namespace tavix::platform {
 
-void CounterStore::setValue(std::int64_t value, const std::string& key) {
-  std::lock_guard<std::mutex> guard(lock_);
-  values_[key] = value;
+std::shared_ptr<std::function<void()>> CounterStore::markDirty() {
+  if (dirty_) return nullptr;
   dirty_ = true;
+  return dirtyHandler_;
+}
+
+void CounterStore::notify(const std::shared_ptr<std::function<void()>>& handler) {
+  if (handler && *handler) (*handler)();
+}
+
+void CounterStore::setDirtyHandler(std::function<void()> handler) {
+  std::lock_guard<std::mutex> guard(lock_);
+  dirtyHandler_ = std::make_shared<std::function<void()>>(std::move(handler));
+}
+
+void CounterStore::setValue(std::int64_t value, const std::string& key) {
+  std::shared_ptr<std::function<void()>> handler;
+  {
+    std::lock_guard<std::mutex> guard(lock_);
+    values_[key] = value;
+    handler = markDirty();
+  }
+  notify(handler);
 }
 
 void CounterStore::addValue(std::int64_t delta, const std::string& key) {
-  std::lock_guard<std::mutex> guard(lock_);
-  values_[key] += delta;
-  dirty_ = true;
+  std::shared_ptr<std::function<void()>> handler;
+  {
+    std::lock_guard<std::mutex> guard(lock_);
+    values_[key] += delta;
+    handler = markDirty();
+  }
+  notify(handler);
 }
 
 void CounterStore::clear(const std::string& key) {
-  std::lock_guard<std::mutex> guard(lock_);
-  if (values_.erase(key)) dirty_ = true;
+  std::shared_ptr<std::function<void()>> handler;
+  {
+    std::lock_guard<std::mutex> guard(lock_);
+    if (values_.erase(key)) handler = markDirty();
+  }
+  notify(handler);
 }
 
 std::int64_t CounterStore::value(const std::string& key) const {
@@ -69,8 +96,12 @@ std::error_code CounterStore::save(const fs::path& file) {
   }
   auto ec = writeFileAtomically(file, toXmlPlist(PropertyValue(std::move(dict))), 0600);
   if (ec) {
-    std::lock_guard<std::mutex> guard(lock_);
-    dirty_ = true;
+    std::shared_ptr<std::function<void()>> handler;
+    {
+      std::lock_guard<std::mutex> guard(lock_);
+      handler = markDirty();
+    }
+    notify(handler);
   }
   return ec;
 }

@@ -5,6 +5,8 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
+#include <memory>
 #include <map>
 #include <mutex>
 #include <string>
@@ -25,6 +27,9 @@ class CounterStore {
 
   // True when something changed since the last save or load.
   bool dirty() const;
+  // Called, on the thread that made the change, each time a clean store becomes dirty; so a
+  // save can be scheduled when there is something to save. Null removes it.
+  void setDirtyHandler(std::function<void()> handler);
   // Replaces the counters with the file's; a missing file is an empty store. A corrupt file is
   // an error and leaves the store as it was.
   std::error_code load(const fs::path& file);
@@ -34,9 +39,14 @@ class CounterStore {
   static std::error_code read(const fs::path& file, std::map<std::string, std::int64_t>* out);
 
  private:
+  // With `lock_` held; answers the handler to call once it is released.
+  std::shared_ptr<std::function<void()>> markDirty();
+  static void notify(const std::shared_ptr<std::function<void()>>& handler);
+
   mutable std::mutex lock_;
   std::map<std::string, std::int64_t> values_;
   bool dirty_ = false;
+  std::shared_ptr<std::function<void()>> dirtyHandler_;
 };
 
 }  // namespace tavix::platform

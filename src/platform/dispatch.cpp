@@ -1,17 +1,19 @@
 #include "platform/dispatch.h"
 
+#include <malloc.h>
+#include <pthread.h>
+
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <deque>
-#include <future>
+#include <map>
+#include <optional>
 #include <thread>
 #include <vector>
 
 #include <asio/executor_work_guard.hpp>
 #include <asio/io_context.hpp>
-#include <asio/post.hpp>
-#include <asio/strand.hpp>
 
 #include "platform/asio_context.h"
 
@@ -25,13 +27,34 @@ namespace {
 }
 }  // namespace
 
+void nameThisThread(const char* name) { pthread_setname_np(pthread_self(), name); }
+
 struct DispatchPool::Impl {
-  asio::io_context context;
-  asio::executor_work_guard<asio::io_context::executor_type> work{context.get_executor()};
-  std::vector<std::thread> threads;
+  Impl(unsigned limit, Duration idleExit) : limit(limit), idleExit(idleExit) {}
+
+  void startWorker();  // with `lock` held
+  void work();
+  void joinExited();  // with `lock` held
+
+  const unsigned limit;
+  const Duration idleExit;
+
   std::mutex lock;
-  std::condition_variable idle;
-  std::size_t inFlight = 0;  // posted through post() or a queue and not yet finished
+  std::condition_variable wake;     // a task arrived, or the pool stops
+  std::condition_variable idle;     // inFlight fell to zero, or a worker left
+  std::deque<Task> tasks;           // posted and not yet taken by a worker
+  std::size_t inFlight = 0;         // posted through post() or a queue and not yet finished
+  unsigned workers = 0;             // alive
+  unsigned waiting = 0;             // alive and blocked waiting for a task
+  bool stopping = false;            // shutdown() has begun: workers leave, none starts
+  std::map<std::thread::id, std::thread> threads;
+  std::vector<std::thread::id> exited;  // left their loop; joined by the next start or shutdown
+
+  // The reactor: started by the first nativeContext(), stopped by shutdown().
+  asio::io_context context{1};
+  std::optional<asio::executor_work_guard<asio::io_context::executor_type>> reactorWork;
+  std::thread reactor;
+
   // The queues made on the pool, so that tasks still queued when it stops can be dropped: a task
   // often holds the object that owns its queue, and would keep both alive for ever.
   struct Queue {
@@ -41,14 +64,60 @@ struct DispatchPool::Impl {
   std::vector<Queue> queues;  // under `lock`
 };
 
-DispatchPool::DispatchPool(unsigned threads) : impl_(std::make_unique<Impl>()) {
-  // sync() parks a pool thread while it waits, so the pool must be larger than the deepest chain
-  // of nested sync calls; eight is comfortably more than any such chain in the daemon.
-  if (threads == 0) threads = std::max(8u, std::thread::hardware_concurrency());
-  impl_->threads.reserve(threads);
-  for (unsigned i = 0; i < threads; ++i) {
-    impl_->threads.emplace_back([this] { impl_->context.run(); });
+void DispatchPool::Impl::startWorker() {
+  ++workers;
+  std::thread t([this] { work(); });
+  threads.emplace(t.get_id(), std::move(t));
+}
+
+void DispatchPool::Impl::joinExited() {
+  // Each of them has left its loop: joining waits for no task, at most for a last trim of the heap.
+  for (auto id : exited) {
+    auto it = threads.find(id);
+    it->second.join();
+    threads.erase(it);
   }
+  exited.clear();
+}
+
+void DispatchPool::Impl::work() {
+  nameThisThread("tavixd-pool");
+  std::unique_lock<std::mutex> guard(lock);
+  for (;;) {
+    if (stopping) break;  // what is still queued is dropped with the pool
+    if (tasks.empty()) {
+      ++waiting;
+      // The only timed wait of the pool, and it ends the thread: an idle pool wakes no one.
+      const bool more = wake.wait_for(guard, idleExit, [this] { return !tasks.empty() || stopping; });
+      --waiting;
+      // Decided under the lock that post() takes: a task posted from here on sees this worker gone.
+      if (!more) break;
+      continue;
+    }
+    Task task = std::move(tasks.front());
+    tasks.pop_front();
+    guard.unlock();
+    task();
+    task = nullptr;  // what it holds goes before the lock is taken again
+    guard.lock();
+    if (--inFlight == 0) idle.notify_all();
+  }
+  --workers;
+  exited.push_back(std::this_thread::get_id());
+  idle.notify_all();
+  // The last worker out hands the heap memory freed by the work back to the system: a daemon
+  // that went idle should not keep its busiest moment's footprint.
+  if (workers == 0 && !stopping) {
+    guard.unlock();
+    malloc_trim(0);
+  }
+}
+
+DispatchPool::DispatchPool(unsigned threads, Duration idleExit) {
+  // sync() parks a pool thread while it waits, so the pool must be allowed more threads than the
+  // deepest chain of nested sync calls; eight is comfortably more than any such chain in the daemon.
+  if (threads == 0) threads = std::max(8u, std::thread::hardware_concurrency());
+  impl_ = std::make_unique<Impl>(threads, idleExit);
 }
 
 DispatchPool::~DispatchPool() {
@@ -58,9 +127,11 @@ DispatchPool::~DispatchPool() {
 
 void DispatchPool::dropPending() {
   std::vector<Impl::Queue> queues;
+  std::deque<Task> tasks;
   {
     std::lock_guard<std::mutex> guard(impl_->lock);
     queues = impl_->queues;
+    tasks.swap(impl_->tasks);
   }
   for (auto& q : queues) {
     if (auto alive = q.queue.lock()) q.dropPending();
@@ -68,12 +139,23 @@ void DispatchPool::dropPending() {
 }
 
 void DispatchPool::shutdown() {
-  if (impl_->threads.empty()) return;
+  {
+    std::lock_guard<std::mutex> guard(impl_->lock);
+    if (impl_->stopping) return;
+  }
   drain();
-  impl_->work.reset();
-  impl_->context.stop();
-  for (auto& t : impl_->threads) t.join();
-  impl_->threads.clear();
+  {
+    std::unique_lock<std::mutex> guard(impl_->lock);
+    impl_->stopping = true;
+    impl_->wake.notify_all();
+    impl_->idle.wait(guard, [this] { return impl_->workers == 0; });
+    impl_->joinExited();
+  }
+  if (impl_->reactor.joinable()) {
+    impl_->reactorWork.reset();
+    impl_->context.stop();
+    impl_->reactor.join();
+  }
   // Tasks queued meanwhile will never run: destroy them now, while what they hold is alive.
   dropPending();
 }
@@ -97,11 +179,18 @@ void DispatchPool::endWork() {
 }
 
 void DispatchPool::post(Task task) {
-  beginWork();
-  asio::post(impl_->context, [this, task = std::move(task)] {
-    task();
-    endWork();
-  });
+  Impl& p = *impl_;
+  std::unique_lock<std::mutex> guard(p.lock);
+  ++p.inFlight;
+  p.tasks.push_back(std::move(task));
+  if (p.stopping) return;  // never runs; destroyed with the pool
+  // Every waiting worker takes one task; beyond them a new worker starts, up to the limit.
+  if (p.tasks.size() <= p.waiting) {
+    p.wake.notify_one();
+  } else if (p.workers < p.limit) {
+    p.joinExited();
+    p.startWorker();
+  }
 }
 
 void DispatchPool::drain() {
@@ -109,9 +198,20 @@ void DispatchPool::drain() {
   impl_->idle.wait(guard, [this] { return impl_->inFlight == 0; });
 }
 
-unsigned DispatchPool::threadCount() const { return static_cast<unsigned>(impl_->threads.size()); }
+unsigned DispatchPool::threadCount() const { return impl_->limit; }
 
-void* DispatchPool::nativeContext() { return &impl_->context; }
+void* DispatchPool::nativeContext() {
+  Impl& p = *impl_;
+  std::lock_guard<std::mutex> guard(p.lock);
+  if (!p.reactor.joinable() && !p.stopping) {
+    p.reactorWork.emplace(p.context.get_executor());
+    p.reactor = std::thread([&p] {
+      nameThisThread("tavixd-io");
+      p.context.run();
+    });
+  }
+  return &p.context;
+}
 
 // A serial queue is a list of tasks and an owner: at most one thread at a time "is on" the queue
 // and runs its tasks. async() appends and, when nobody owns the queue, posts a drain job to the
@@ -221,6 +321,8 @@ SerialQueue::SerialQueue(DispatchPool& pool, std::string label)
 }
 
 SerialQueue::~SerialQueue() = default;
+
+DispatchPool& SerialQueue::pool() const { return impl_->pool; }
 
 void SerialQueue::async(Task task) {
   // Counted by the pool so that DispatchPool::drain() also waits for queue work.

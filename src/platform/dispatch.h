@@ -17,15 +17,24 @@
 #include <shared_mutex>
 #include <string>
 
+#include "platform/time.h"
+
 namespace tavix::platform {
 
 using Task = std::function<void()>;
 
+// Names the calling thread as tools (top, /proc/<pid>/task/*/comm) show it: at most 15 bytes.
+void nameThisThread(const char* name);
+
 // The process's worker pool. One per process, created at start-up (or per test) and outliving
 // every queue made on it. The destructor stops the workers after the queued work has drained.
+//
+// Workers start as work needs them, up to the limit, and one that has found nothing to do for
+// `idleExit` leaves: an idle process keeps no worker and no timer. Sockets, timers and signals
+// (nativeContext()) run on one reactor thread of their own, started by the first that needs it.
 class DispatchPool {
  public:
-  explicit DispatchPool(unsigned threads = 0);  // 0 picks a size fit for the machine
+  explicit DispatchPool(unsigned threads = 0, Duration idleExit = seconds(10));  // 0: a size fit for the machine
   ~DispatchPool();
   DispatchPool(const DispatchPool&) = delete;
   DispatchPool& operator=(const DispatchPool&) = delete;
@@ -43,10 +52,12 @@ class DispatchPool {
   // thread. From the thread that owns the pool. The destructor calls it.
   void shutdown();
 
+  // The most workers that run at once.
   unsigned threadCount() const;
 
-  // The Asio io_context behind the pool, as an opaque pointer for the few platform pieces
-  // (timers, signals, file watches) that need it. Cast with asioContext() in platform sources.
+  // The Asio io_context behind the pool's sockets and timers, as an opaque pointer for the few
+  // platform pieces that need it. Cast with asioContext() in platform sources. The first call
+  // starts the reactor thread, so handlers on it must be short: they hand work to a queue.
   void* nativeContext();
 
  private:
@@ -72,6 +83,7 @@ class SerialQueue {
   SerialQueue& operator=(const SerialQueue&) = delete;
 
   const std::string& label() const { return label_; }
+  DispatchPool& pool() const;
 
   // Queues `task` and returns at once.
   void async(Task task);

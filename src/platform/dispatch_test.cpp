@@ -4,6 +4,7 @@
 
 #include <atomic>
 #include <future>
+#include <latch>
 #include <thread>
 #include <vector>
 
@@ -89,6 +90,26 @@ TEST(DispatchPool, DrainWaitsForQueueWorkPostedByQueueWork) {
   pool.drain();
   releaser.join();
   EXPECT_EQ(done.load(), 2);
+}
+
+TEST(DispatchPool, GrowsToItsLimitAndLosesNoWorkWhileWorkersLeave) {
+  // Workers leave as soon as they find nothing to do, so posts keep racing the last one out.
+  DispatchPool pool(4, Duration::zero());
+  std::atomic<int> ran{0};
+  std::vector<std::thread> posters;
+  for (int t = 0; t < 2; ++t) {
+    posters.emplace_back([&] {
+      for (int i = 0; i < 2000; ++i) pool.post([&] { ran++; });
+    });
+  }
+  for (auto& t : posters) t.join();
+  pool.drain();
+  EXPECT_EQ(ran.load(), 4000);
+
+  // Every worker blocks until all of them run at once: only a pool that grew to its limit ends.
+  std::latch together(pool.threadCount());
+  for (unsigned i = 0; i < pool.threadCount(); ++i) pool.post([&] { together.arrive_and_wait(); });
+  pool.drain();
 }
 
 TEST(ReaderWriterQueue, ReadsSeeEveryWriteSubmittedBeforeThem) {

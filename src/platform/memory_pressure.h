@@ -18,6 +18,7 @@
 #include "platform/clock.h"
 #include "platform/dispatch.h"
 #include "platform/files.h"
+#include "platform/log.h"
 
 namespace tavix::platform {
 
@@ -50,24 +51,37 @@ class MemoryPressureSource {
 // Delivers `event` to every resumed source whose mask contains it.
 void raiseMemoryPressure(std::uint32_t event);
 
-// Reads the kernel's memory PSI file every `interval` on `queue` and raises critical pressure
-// (MemoryPressureCritical | MemoryPressureProcessLimitCritical) when the share of time in which
-// every task stalled on memory ("full avg10") reaches `thresholdPercent`. It raises once per rise
+// Raises critical pressure (MemoryPressureCritical | MemoryPressureProcessLimitCritical) when the
+// share of time in which every task stalled on memory reaches `thresholdPercent`: once per rise,
 // and again only after the share fell below the threshold. Start and stop it on `queue`.
+//
+// Where the kernel offers it, a PSI trigger on `file` (a "full" stall of that share of each
+// `interval`) wakes the monitor only when pressure comes; the process sleeps meanwhile. Elsewhere
+// (a plain file, or a kernel or container that refuses triggers) it reads the file's
+// "full avg10" every `interval`.
 class PressureStallMonitor {
  public:
   PressureStallMonitor(Clock& clock, SerialQueue& queue, fs::path file = "/proc/pressure/memory",
                        double thresholdPercent = 10, Duration interval = seconds(2));
-  // False (and nothing started) when the file cannot be read or parsed.
-  bool start();
+  ~PressureStallMonitor();
+  // False (and nothing started) when the file cannot be read or parsed. A trigger the kernel
+  // refuses is logged to `log`, once, before the monitor falls back to reading the file.
+  bool start(Logger* log = nullptr);
   void stop();
+  // True while the kernel's trigger, not a timer, drives the monitor.
+  bool triggered() const { return trigger_ != nullptr; }
 
   // The "full avg10" value of a PSI file's text, or nullopt.
   static std::optional<double> fullAverage10(std::string_view text);
 
  private:
   void poll();
+  bool startTrigger(Logger* log);
 
+  struct Trigger;
+  Clock& clock_;
+  SerialQueue& queue_;
+  std::shared_ptr<Trigger> trigger_;
   fs::path file_;
   double threshold_;
   Duration interval_;

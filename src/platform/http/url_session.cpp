@@ -5,6 +5,8 @@
 #include <algorithm>
 #include <atomic>
 #include <cctype>
+#include <climits>
+#include <condition_variable>
 #include <cstdlib>
 #include <cstring>
 #include <deque>
@@ -178,6 +180,7 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
       if (stopping) return;
       stopping = true;
     }
+    idle.notify_one();
     curl_multi_wakeup(multi);
     if (thread.joinable()) thread.join();
     std::vector<std::shared_ptr<TaskImpl>> open;
@@ -197,6 +200,7 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
       if (stopping) return false;
       commands.push_back(std::move(command));
     }
+    idle.notify_one();
     curl_multi_wakeup(multi);
     return true;
   }
@@ -250,10 +254,15 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
   // ---- transfer thread ----
 
   void run() {
+    nameThisThread("tavixd-http");
+    long waitMs = -1;
     for (;;) {
       std::deque<Command> pending;
       {
-        std::lock_guard guard(lock);
+        std::unique_lock guard(lock);
+        // Nothing on the wire and no timer of curl's due: sleep, without a time-out, until a
+        // command comes.
+        if (running.empty() && waitMs < 0) idle.wait(guard, [this] { return stopping || !commands.empty(); });
         if (stopping) break;
         pending.swap(commands);
       }
@@ -274,8 +283,11 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
         auto task = it->second;
         finish(task, message->data.result);
       }
-      const long waitMs = expireIdleTasks();
-      curl_multi_poll(multi, nullptr, 0, static_cast<int>(waitMs), nullptr);
+      waitMs = expireIdleTasks();
+      if (running.empty() && waitMs < 0) continue;
+      // Bounded by curl's own timer and the tasks' idle deadlines; without either, only sockets
+      // and curl_multi_wakeup() end the wait.
+      curl_multi_poll(multi, nullptr, 0, waitMs < 0 ? INT_MAX : static_cast<int>(waitMs), nullptr);
     }
     // Shutting down: every transfer still on the wire ends as cancelled.
     auto open = std::move(running);
@@ -476,12 +488,10 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
   }
 
   // Fails tasks that made no progress for their idle time-out; returns how long the loop may
-  // wait before it has to look again.
+  // wait before it has to look again, or -1 when nothing is due.
   long expireIdleTasks() {
-    long waitMs = 1000;
-    long curlTimeout = -1;
-    curl_multi_timeout(multi, &curlTimeout);
-    if (curlTimeout >= 0) waitMs = std::min(waitMs, curlTimeout);
+    long waitMs = -1;
+    curl_multi_timeout(multi, &waitMs);
     const auto now = Steady::now();
     std::vector<std::shared_ptr<TaskImpl>> expired;
     for (auto& [easy, task] : running) {
@@ -493,7 +503,7 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
       } else {
         const long left = static_cast<long>(
             std::chrono::duration_cast<std::chrono::milliseconds>(deadline - now).count() + 1);
-        waitMs = std::min(waitMs, left);
+        waitMs = waitMs < 0 ? left : std::min(waitMs, left);
       }
     }
     for (auto& task : expired) {
@@ -594,6 +604,7 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
   std::atomic<std::uint64_t> nextIdentifier{1};
 
   std::mutex lock;  // guards commands, stopping and tasks
+  std::condition_variable idle;  // the transfer thread waits here while nothing is in flight
   std::deque<Command> commands;
   bool stopping = false;
   std::unordered_map<std::uint64_t, std::weak_ptr<TaskImpl>> tasks;  // every task not yet completed
