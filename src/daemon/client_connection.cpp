@@ -241,18 +241,29 @@ void ClientConnection::invalidated() {
 }
 
 void ClientConnection::openOrExtendTransaction() {
-  idleTimer_.cancel();
-  std::weak_ptr<ClientConnection> weak = weak_from_this();
-  idleTimer_ = env_->clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(), [weak] {
-    auto self = weak.lock();
-    if (!self) return;
-    connectionLog().debug("timing out idle ipc transaction");
-    self->closeTransaction(true);
-  });
+  // A message only moves the mark; the one armed timer looks at it when it fires, so that a
+  // keystroke does not cost a timer of its own.
+  lastMessage_ = env_->clock->now();
+  if (!idleTimerArmed_) armIdleTimer(platform::seconds(kIdleTransactionSeconds));
   if (!transactionOpen_.exchange(true)) {
     std::lock_guard lock(transactionLock_);
     transaction_ = env_->transactions->begin("com.norvel.tavixd.ipc");
   }
+}
+
+void ClientConnection::armIdleTimer(platform::Duration delay) {
+  idleTimerArmed_ = true;
+  std::weak_ptr<ClientConnection> weak = weak_from_this();
+  idleTimer_ = env_->clock->after(delay, connection_->queue(), [weak] {
+    auto self = weak.lock();
+    if (!self) return;
+    self->idleTimerArmed_ = false;
+    const auto limit = platform::seconds(kIdleTransactionSeconds);
+    const auto silent = self->env_->clock->now() - self->lastMessage_;
+    if (silent < limit) return self->armIdleTimer(limit - silent);
+    connectionLog().debug("timing out idle ipc transaction");
+    self->closeTransaction(true);
+  });
 }
 
 void ClientConnection::closeTransaction(bool now) {
