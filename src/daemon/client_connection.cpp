@@ -88,11 +88,21 @@ std::string defaultKeyboardInputMode(const platform::UserDefaults* defaults) {
   return TVXCurrentLocaleSettings(defaults).locale;
 }
 
+// `message` serialized straight into a frame, header in place, so that it is never copied again.
+// `size` is the message's ByteSizeLong(), taken just before.
+std::string frameOf(const google::protobuf::MessageLite& message, std::size_t size) {
+  std::string frame = platform::ipc::frameWithRoom(size);
+  message.SerializeWithCachedSizesToArray(reinterpret_cast<std::uint8_t*>(frame.data() + platform::ipc::kFrameHeaderSize));
+  return frame;
+}
+
+std::string frameOf(const google::protobuf::MessageLite& message) { return frameOf(message, message.ByteSizeLong()); }
+
 // Sends one frame to the client; a frame that cannot go (the client has gone, or it is over the
 // size limit) is the remote proxy's error, logged and otherwise dropped.
-void sendToClient(platform::ipc::IpcConnection& connection, std::string bytes,
+void sendToClient(platform::ipc::IpcConnection& connection, std::string frame,
                   std::vector<platform::ipc::UniqueFd> fds = {}) {
-  if (connection.send(std::move(bytes), std::move(fds))) return;
+  if (connection.sendFrame(std::move(frame), std::move(fds))) return;
   connectionLog().error("(pid:{}) remote proxy error: {}", connection.peer().pid,
                         connection.isValid() ? "message too large" : "connection invalidated");
 }
@@ -105,7 +115,7 @@ void answerWithDescriptor(platform::ipc::IpcConnection& connection, std::uint64_
   out.set_call_id(callId);
   std::vector<platform::ipc::UniqueFd> fds;
   fds.push_back(std::move(fd));
-  sendToClient(connection, out.SerializeAsString(), std::move(fds));
+  sendToClient(connection, frameOf(out), std::move(fds));
 }
 
 void setError(proto::TVXError* error, std::int64_t code, const std::string& reason) {
@@ -131,17 +141,17 @@ std::string printable(std::string_view text) {
 
 // The answer to `callId` as a frame the connection will take: an answer too large for a frame
 // becomes a call_failed that says so, so that the caller still hears back once.
-std::string answerBytes(const platform::ipc::IpcConnection& connection, std::uint64_t callId, proto::Envelope& out) {
+std::string answerFrame(const platform::ipc::IpcConnection& connection, std::uint64_t callId, proto::Envelope& out) {
   out.set_call_id(callId);
-  std::string bytes = out.SerializeAsString();
-  if (bytes.size() <= connection.maxFrameSize()) return bytes;
+  const std::size_t size = out.ByteSizeLong();
+  if (size <= connection.maxFrameSize()) return frameOf(out, size);
   const std::string reason =
-      fmt::format("reply of {} bytes is over the frame limit of {} bytes", bytes.size(), connection.maxFrameSize());
+      fmt::format("reply of {} bytes is over the frame limit of {} bytes", size, connection.maxFrameSize());
   connectionLog().error("answering call {} from pid {} with an error: {}", callId, connection.peer().pid, reason);
   proto::Envelope failed;
   failed.set_call_id(callId);
   setError(failed.mutable_call_failed(), 500, reason);
-  return failed.SerializeAsString();
+  return frameOf(failed);
 }
 
 }  // namespace
@@ -160,7 +170,7 @@ class ClientConnection::PendingCall {
     connectionLog().fault("call {} ended without an answer", callId_);
     proto::Envelope failed;
     setError(failed.mutable_call_failed(), 500, "no answer");
-    if (auto connection = connection_.lock()) sendToClient(*connection, answerBytes(*connection, callId_, failed));
+    if (auto connection = connection_.lock()) sendToClient(*connection, answerFrame(*connection, callId_, failed));
   }
   PendingCall(const PendingCall&) = delete;
   PendingCall& operator=(const PendingCall&) = delete;
@@ -172,7 +182,7 @@ class ClientConnection::PendingCall {
       return;
     }
     if (auto connection = connection_.lock(); connection && callId_ != 0) {
-      sendToClient(*connection, answerBytes(*connection, callId_, out));
+      sendToClient(*connection, answerFrame(*connection, callId_, out));
     }
     hold_.reset();
   }
@@ -217,8 +227,8 @@ void ClientConnection::relayResourceNotification(const platform::Notification& n
   }
   // Off the poster's thread; the connection is held weakly, so a client gone meanwhile is skipped.
   std::weak_ptr<platform::ipc::IpcConnection> weak = connection_;
-  env_->pool->post([weak, bytes = out.SerializeAsString()]() mutable {
-    if (auto connection = weak.lock()) sendToClient(*connection, std::move(bytes));
+  env_->pool->post([weak, frame = frameOf(out)]() mutable {
+    if (auto connection = weak.lock()) sendToClient(*connection, std::move(frame));
   });
 }
 
@@ -231,18 +241,29 @@ void ClientConnection::invalidated() {
 }
 
 void ClientConnection::openOrExtendTransaction() {
-  idleTimer_.cancel();
-  std::weak_ptr<ClientConnection> weak = weak_from_this();
-  idleTimer_ = env_->clock->after(platform::seconds(kIdleTransactionSeconds), connection_->queue(), [weak] {
-    auto self = weak.lock();
-    if (!self) return;
-    connectionLog().debug("timing out idle ipc transaction");
-    self->closeTransaction(true);
-  });
+  // A message only moves the mark; the one armed timer looks at it when it fires, so that a
+  // keystroke does not cost a timer of its own.
+  lastMessage_ = env_->clock->now();
+  if (!idleTimerArmed_) armIdleTimer(platform::seconds(kIdleTransactionSeconds));
   if (!transactionOpen_.exchange(true)) {
     std::lock_guard lock(transactionLock_);
     transaction_ = env_->transactions->begin("com.norvel.tavixd.ipc");
   }
+}
+
+void ClientConnection::armIdleTimer(platform::Duration delay) {
+  idleTimerArmed_ = true;
+  std::weak_ptr<ClientConnection> weak = weak_from_this();
+  idleTimer_ = env_->clock->after(delay, connection_->queue(), [weak] {
+    auto self = weak.lock();
+    if (!self) return;
+    self->idleTimerArmed_ = false;
+    const auto limit = platform::seconds(kIdleTransactionSeconds);
+    const auto silent = self->env_->clock->now() - self->lastMessage_;
+    if (silent < limit) return self->armIdleTimer(limit - silent);
+    connectionLog().debug("timing out idle ipc transaction");
+    self->closeTransaction(true);
+  });
 }
 
 void ClientConnection::closeTransaction(bool now) {
@@ -262,12 +283,12 @@ void ClientConnection::closeTransaction(bool now) {
 }
 
 void ClientConnection::send(std::uint64_t callId, proto::Envelope& out) {
-  sendToClient(*connection_, answerBytes(*connection_, callId, out));
+  sendToClient(*connection_, answerFrame(*connection_, callId, out));
 }
 
 void ClientConnection::reply(std::uint64_t callId, proto::Envelope& out) {
   if (callId == 0) return;  // a call without an id cannot be answered
-  sendToClient(*connection_, answerBytes(*connection_, callId, out));
+  sendToClient(*connection_, answerFrame(*connection_, callId, out));
 }
 
 void ClientConnection::handleIncomingMessage(const std::string& payload) {
@@ -584,7 +605,7 @@ void ClientConnection::request(std::uint64_t callId, const proto::Envelope& in) 
     proto::Envelope out;
     auto* wireReply = out.mutable_request_reply();
     wireReply->set_query_id(queryId);
-    if (r) replyToWire(*r, wireReply->mutable_reply());
+    if (r) replyToWire(std::move(*r), wireReply->mutable_reply());
     if (error) errorToWire(*error, wireReply->mutable_error());
     pending->answer(out);
     if (endCode) trace(endCode);

@@ -114,6 +114,7 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   class PendingCall;
 
   void openOrExtendTransaction();
+  void armIdleTimer(platform::Duration delay);
   // Empties the state's query cache and ends the keep-alive: at once (`now`, the idle timer) or
   // kIdleTransactionSeconds later (invalidation, destruction).
   void closeTransaction(bool now);
@@ -155,6 +156,9 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   std::mutex transactionLock_;
   platform::TransactionTracker::Transaction transaction_;
   platform::TimerHandle idleTimer_;
+  // On the queue (and in start(), before messages flow).
+  bool idleTimerArmed_ = false;
+  platform::TimePoint lastMessage_{};
   platform::NotificationCenter::Registration downloadObserver_;
   platform::NotificationCenter::Registration deleteObserver_;
   platform::NotificationCenter::Registration bagObserver_;

@@ -81,9 +81,9 @@ std::shared_ptr<TVXRequest> requestFromWire(const proto::TVXRequest& wire) {
   return request;
 }
 
-void replyToWire(const TVXReply& reply, proto::TVXReply* wire) {
+void replyToWire(TVXReply&& reply, proto::TVXReply* wire) {
   wire->set_scale(reply.scale);
-  wire->set_data(reply.data);
+  wire->set_data(std::move(reply.data));
   if (reply.httpRequest) {
     auto* request = wire->mutable_http_request();
     request->set_method(reply.httpRequest->method);

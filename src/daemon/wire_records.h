@@ -21,7 +21,8 @@ class TVXRequest;
 // The request of the wire record's kind, or none for a record without a kind.
 std::shared_ptr<TVXRequest> requestFromWire(const proto::TVXRequest& wire);
 
-void replyToWire(const TVXReply& reply, proto::TVXReply* wire);
+// The body is moved into the wire record: a search reply's body is its largest part.
+void replyToWire(TVXReply&& reply, proto::TVXReply* wire);
 void errorToWire(const TVXError& error, proto::TVXError* wire);
 void bagToWire(const TVXBag& bag, proto::TVXBagData* wire);
 

@@ -94,29 +94,40 @@ ClientSessionManager::~ClientSessionManager() {
 
 void ClientSessionManager::addTavixFeedback(FeedbackRef feedback) {
   if (!feedback) return;
-  if (feedbackObserver_) feedbackObserver_(*feedback);
   auto transaction = std::make_shared<platform::TransactionTracker::Transaction>();
   if (env_.transactions) *transaction = env_.transactions->begin("addFeedback");
-  sessionQueue_.async([self = shared_from_this(), feedback, transaction] {
-    if (!self->feedbackEnabledFor(feedback->user_agent())) return;
-    const platform::TimePoint now = self->env_.feedback.clock->now();
-    feedback->set_user_guid(self->guidController_ ? self->guidController_->currentUserGUID() : std::string());
-    if (self->currentState_ != kNoSession && self->sessionGuid() != feedback->user_guid()) {
-      self->updateState(kGuidChanged, feedback);
-    } else if (self->currentState_ != kActive && self->currentState_ != kNoSession) {
-      const int type = feedbackType(*feedback);
-      if (type == kFeedbackTypeVisibleResults || type == kFeedbackTypeCardEngagement) {
-        self->updateState(kSentinelFeedback, feedback);
-      } else if (self->expirationTime_ <= now) {
-        self->updateState(kIdleAfterSoftLimit, feedback);
-      } else {
-        self->updateState(kFeedbackAdded, feedback);
-      }
-    } else {
-      self->updateState(kFeedbackAdded, feedback);
-    }
-    self->expirationTime_ = now + platform::seconds(static_cast<double>(self->idleTime_));
+  sessionQueue_.async([self = shared_from_this(), feedback = std::move(feedback), transaction] { self->accept(feedback); });
+}
+
+void ClientSessionManager::addTavixFeedbackMadeBy(std::function<FeedbackRef()> make) {
+  auto transaction = std::make_shared<platform::TransactionTracker::Transaction>();
+  if (env_.transactions) *transaction = env_.transactions->begin("addFeedback");
+  sessionQueue_.async([self = shared_from_this(), make = std::move(make), transaction] {
+    if (auto feedback = make()) self->accept(feedback);
   });
+}
+
+void ClientSessionManager::accept(const FeedbackRef& feedback) {
+  sessionQueue_.assertCurrent("ClientSessionManager::accept");
+  if (feedbackObserver_) feedbackObserver_(*feedback);
+  if (!feedbackEnabledFor(feedback->user_agent())) return;
+  const platform::TimePoint now = env_.feedback.clock->now();
+  feedback->set_user_guid(guidController_ ? guidController_->currentUserGUID() : std::string());
+  if (currentState_ != kNoSession && sessionGuid() != feedback->user_guid()) {
+    updateState(kGuidChanged, feedback);
+  } else if (currentState_ != kActive && currentState_ != kNoSession) {
+    const int type = feedbackType(*feedback);
+    if (type == kFeedbackTypeVisibleResults || type == kFeedbackTypeCardEngagement) {
+      updateState(kSentinelFeedback, feedback);
+    } else if (expirationTime_ <= now) {
+      updateState(kIdleAfterSoftLimit, feedback);
+    } else {
+      updateState(kFeedbackAdded, feedback);
+    }
+  } else {
+    updateState(kFeedbackAdded, feedback);
+  }
+  expirationTime_ = now + platform::seconds(static_cast<double>(idleTime_));
 }
 
 void ClientSessionManager::flushSession(std::function<void()> done) {

@@ -82,8 +82,12 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   // Asynchronous; the whole path holds the "addFeedback" transaction. Dropped when a bag is
   // loaded and the sender's view of it has feedback disabled.
   void addTavixFeedback(FeedbackRef feedback);
-  // Sees every event as it arrives, before any filtering, on the caller's thread (the flush
-  // command channel's live stream). Set once at start, before feedback flows.
+  // As addTavixFeedback(), with the event made by `make` on the session queue, in turn with the
+  // events added before it: a caller that answers a client first hands the making over too.
+  void addTavixFeedbackMadeBy(std::function<FeedbackRef()> make);
+  // Sees every event as it arrives, before any filtering, on the session queue in the order the
+  // events were added (the flush command channel's live stream). Set once at start, before
+  // feedback flows.
   void setFeedbackObserver(std::function<void(const proto::CTTavixFeedback&)> observer) {
     feedbackObserver_ = std::move(observer);
   }
@@ -112,6 +116,8 @@ class ClientSessionManager : public std::enable_shared_from_this<ClientSessionMa
   platform::SerialQueue& sessionQueue() { return sessionQueue_; }
 
  private:
+  // One added event, on the session queue.
+  void accept(const FeedbackRef& feedback);
   void updateState(unsigned event, const FeedbackRef& feedback, std::function<void()> callback = {});
   void setNewSession(const FeedbackRef& feedback);
   void onSoftLimitReached();

@@ -46,6 +46,7 @@ class CTStartNetworkSearchFeedback;
 }
 namespace platform {
 class Logger;
+class PropertyValue;
 class SerialQueue;
 class UserDefaults;
 namespace http {
@@ -162,11 +163,11 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   using StartRecord = std::shared_ptr<proto::CTStartNetworkSearchFeedback>;
   // A start record for `request` (URL, headers, a new UUID), not yet added anywhere.
   StartRecord startSearchEventForRequest(const platform::http::URLRequest& request);
-  // Adds the end record: server values from the first element of the JSON reply `rawResponse`
-  // (none when it is not a list of dictionaries), size, status and the task's timing data.
-  void endNetworkFeedback(const StartRecord& start, const std::string& rawResponse, std::uint64_t responseSize,
+  // Adds the end record: server values from the first element of the reply as the caller parsed
+  // it (none when it is null or not a list of dictionaries), size, status and the task's timing.
+  void endNetworkFeedback(const StartRecord& start, const platform::PropertyValue* reply, std::uint64_t responseSize,
                           long statusCode, const platform::http::URLSessionTaskMetrics& timing, std::uint64_t queryId);
-  void endNetworkFeedback(const StartRecord& start, const std::string& rawResponse, std::uint64_t responseSize,
+  void endNetworkFeedback(const StartRecord& start, const platform::PropertyValue* reply, std::uint64_t responseSize,
                           long statusCode, const platform::http::URLSessionTaskMetrics& timing, std::uint64_t queryId,
                           const std::string& userAgent);
   // The error record and the end record of a request that failed; counts transport errors.
@@ -211,7 +212,7 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   };
   void searchResponseArrived(const TVXSearchRequest& request, const TVXReplyBlock& reply,
                              const platform::http::URLRequest& httpRequest, const StartRecord& start,
-                             const std::vector<std::string>& localSuggestions, const SearchResponse& answer,
+                             const std::vector<std::string>& localSuggestions, SearchResponse answer,
                              const platform::http::URLSessionTaskMetrics& timing);
 
   // ---- The kinds besides search (client_state_queries.cpp)

@@ -114,19 +114,18 @@ ClientState::StartRecord ClientState::startSearchEventForRequest(const platform:
   return start;
 }
 
-void ClientState::endNetworkFeedback(const StartRecord& start, const std::string& rawResponse,
+void ClientState::endNetworkFeedback(const StartRecord& start, const platform::PropertyValue* reply,
                                      std::uint64_t responseSize, long statusCode, const URLSessionTaskMetrics& timing,
                                      std::uint64_t queryId) {
-  endNetworkFeedback(start, rawResponse, responseSize, statusCode, timing, queryId, userAgent().value_or(""));
+  endNetworkFeedback(start, reply, responseSize, statusCode, timing, queryId, userAgent().value_or(""));
 }
 
-void ClientState::endNetworkFeedback(const StartRecord& start, const std::string& rawResponse,
+void ClientState::endNetworkFeedback(const StartRecord& start, const platform::PropertyValue* reply,
                                      std::uint64_t responseSize, long statusCode, const URLSessionTaskMetrics& timing,
                                      std::uint64_t queryId, const std::string& agent) {
   if (!start || !sessionManager_) return;
   auto end = makeEndRecord(*start, responseSize, statusCode, timing, eventTimestamp(*env_->clock));
   // The server's own account of the request sits in the first element of its reply.
-  const auto reply = platform::parseJson(rawResponse);
   const auto* list = reply ? reply->array() : nullptr;
   const auto* first = list && !list->empty() ? list->front().dictionary() : nullptr;
   if (first) {
@@ -232,7 +231,10 @@ void ClientState::warm() {
         const long status = response ? response->statusCode : 0;
         searchLog().notice("Status for warm request: ({}) error: ({})", status,
                            error ? error->description : std::string("none"));
-        if (auto self = weak.lock()) self->endNetworkFeedback(start, data, data.size(), status, timing, 0, agent);
+        auto self = weak.lock();
+        if (!self) return;
+        const auto parsed = platform::parseJson(data);
+        self->endNetworkFeedback(start, parsed ? &*parsed : nullptr, data.size(), status, timing, 0, agent);
       });
   // A pre-connect task: only the connection matters, so no cached answer may stand in for it.
   task->setValue("preconnect", true);

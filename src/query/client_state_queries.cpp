@@ -249,7 +249,7 @@ void ClientState::queryResponseArrived(const ClientStateQueryKind& kind, const T
       failSearchFeedback(std::nullopt, request, start, data.size(), status, timing);
       return;
     }
-    endNetworkFeedback(start, data, data.size(), 200, timing, queryId);
+    endNetworkFeedback(start, &*parsed, data.size(), 200, timing, queryId);
   } else {
     if (error || data.empty()) {
       log.error("error with request {}", httpRequest.url);
@@ -265,15 +265,14 @@ void ClientState::queryResponseArrived(const ClientStateQueryKind& kind, const T
       return;
     }
     // Flight answers are not JSON; the others pass a body that does not parse on to the client
-    // with the parse error, as a search does.
-    if (kind.endpoint != proto::EndpointType::tavix_flight) {
-      std::string parseError;
-      parsed = platform::parseJson(data, &parseError);
-      if (!parsed) {
-        jsonError = TVXError{kTVXJSONErrorDomain, kTVXJSONErrorCodeNotJSON, parseError.empty() ? "not JSON" : parseError};
-      }
+    // with the parse error, as a search does. One parse serves that check, the end record and the
+    // look-up filter.
+    std::string parseError;
+    parsed = platform::parseJson(data, &parseError);
+    if (!parsed && kind.endpoint != proto::EndpointType::tavix_flight) {
+      jsonError = TVXError{kTVXJSONErrorDomain, kTVXJSONErrorCodeNotJSON, parseError.empty() ? "not JSON" : parseError};
     }
-    endNetworkFeedback(start, data, data.size(), status, timing, queryId);
+    endNetworkFeedback(start, parsed ? &*parsed : nullptr, data.size(), status, timing, queryId);
   }
 
   if (kind.filtersLookupResults && parsed) {

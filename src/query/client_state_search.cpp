@@ -79,7 +79,9 @@ void ClientState::search(std::shared_ptr<const TVXSearchRequest> request, TVXRep
     return;
   }
   const auto httpRequest = std::make_shared<const URLRequest>(std::move(*built));
-  protocolLog().info("request: {} header: {}", httpRequest->url, query_internal::headersText(httpRequest->headers));
+  if (protocolLog().wants(platform::LogLevel::Info)) {
+    protocolLog().info("request: {} header: {}", httpRequest->url, query_internal::headersText(httpRequest->headers));
+  }
   if (answerSearchFromQueryCache(*request, *httpRequest, local.others, reply)) return;
   sendSearch(std::move(request), std::move(reply), httpRequest, local.others);
 }
@@ -148,12 +150,19 @@ bool ClientState::answerSearchFromQueryCache(const TVXSearchRequest& request, co
   if (clientShortName_) {
     TavixDiagnosticDataReporter::addValue(1, createCounterKey(*clientShortName_, "ondevicecachehits"));
   }
-  proto::CTCacheHitFeedback cacheHit;
-  cacheHit.set_timestamp(query_internal::eventTimestamp(*env_->clock));
-  cacheHit.set_input(request.queryString);
-  cacheHit.set_uuid(request.uuid);
-  cacheHit.set_reason(proto::SkipSearchType::cache_hit);
-  addCodable(cacheHit, request.queryId, false);
+  if (!sessionManager_) return true;
+  // The record is made on the session queue: a hit is the fast path, and the client already has
+  // its answer.
+  sessionManager_->addTavixFeedbackMadeBy(
+      [timestamp = query_internal::eventTimestamp(*env_->clock), input = request.queryString, uuid = request.uuid,
+       queryId = request.queryId, agent = userAgent().value_or("")] {
+        proto::CTCacheHitFeedback cacheHit;
+        cacheHit.set_timestamp(timestamp);
+        cacheHit.set_input(input);
+        cacheHit.set_uuid(uuid);
+        cacheHit.set_reason(proto::SkipSearchType::cache_hit);
+        return makeTavixFeedbackWithCodable(cacheHit, static_cast<std::int64_t>(queryId), "", agent);
+      });
   return true;
 }
 
@@ -185,11 +194,11 @@ void ClientState::sendSearch(std::shared_ptr<const TVXSearchRequest> request, TV
 
 void ClientState::searchResponseArrived(const TVXSearchRequest& request, const TVXReplyBlock& reply,
                                         const URLRequest& httpRequest, const StartRecord& start,
-                                        const std::vector<std::string>& localSuggestions, const SearchResponse& answer,
+                                        const std::vector<std::string>& localSuggestions, SearchResponse answer,
                                         const platform::http::URLSessionTaskMetrics& timing) {
   const std::uint64_t queryId = request.queryId;
   const std::string& input = request.queryString;
-  const std::string& data = answer.data;
+  std::string& data = answer.data;
   const auto& response = answer.response;
   const long status = response ? response->statusCode : 0;
   if (response) recordSearchResult(status);
@@ -226,7 +235,7 @@ void ClientState::searchResponseArrived(const TVXSearchRequest& request, const T
       queryCache_->set(Ref<CachedResultSet>(new CachedResultSet(input, &httpRequest, *first, request.uuid, data, now)));
     }
   }
-  endNetworkFeedback(start, data, data.size(), status, timing, queryId);
+  endNetworkFeedback(start, parsed ? &*parsed : nullptr, data.size(), status, timing, queryId);
 
   TVXReply result;
   result.scale = request.scale;
@@ -234,7 +243,7 @@ void ClientState::searchResponseArrived(const TVXSearchRequest& request, const T
     result.httpRequest = httpRequest;
     result.httpResponse = *response;
   }
-  result.data = data;
+  result.data = std::move(data);  // the cache took its own copy
   result.geoSessionEntityString = geoSessionEntityString();
   result.localSuggestions = localSuggestions;
   reply(queryId, std::move(result), jsonError);

@@ -520,6 +520,9 @@ bool DevServer::start(const Options& options, std::string* error) {
   // stop() waits for idle keep-alive connections to time out; a second keeps reuse under load
   // without making every shutdown (one per test) wait five.
   impl_->server.set_keep_alive_timeout(1);
+  // A daemon sends every keystroke over a few kept connections; the library's default of five
+  // requests a connection would have it reconnect every few keystrokes, and measure that.
+  impl_->server.set_keep_alive_max_count(10000);
   // Hung and trickling requests each hold a thread; enough for a client that floods its daemon
   // to keep every one of its calls on the wire.
   impl_->server.new_task_queue = [] { return new httplib::ThreadPool(128); };

@@ -2,15 +2,19 @@
 
 namespace tavix::platform::ipc {
 
+std::string frameWithRoom(std::size_t payloadSize) {
+  const auto n = static_cast<std::uint32_t>(payloadSize);
+  std::string out(kFrameHeaderSize + payloadSize, '\0');
+  out[0] = static_cast<char>((n >> 24) & 0xff);
+  out[1] = static_cast<char>((n >> 16) & 0xff);
+  out[2] = static_cast<char>((n >> 8) & 0xff);
+  out[3] = static_cast<char>(n & 0xff);
+  return out;
+}
+
 std::string encodeFrame(std::string_view payload) {
-  const auto n = static_cast<std::uint32_t>(payload.size());
-  std::string out;
-  out.reserve(kFrameHeaderSize + payload.size());
-  out.push_back(static_cast<char>((n >> 24) & 0xff));
-  out.push_back(static_cast<char>((n >> 16) & 0xff));
-  out.push_back(static_cast<char>((n >> 8) & 0xff));
-  out.push_back(static_cast<char>(n & 0xff));
-  out.append(payload);
+  std::string out = frameWithRoom(payload.size());
+  payload.copy(out.data() + kFrameHeaderSize, payload.size());
   return out;
 }
 

@@ -19,6 +19,10 @@ inline constexpr std::size_t kFrameHeaderSize = 4;
 // Header and payload in one buffer, ready to write. `payload` must not exceed kMaxFrameSize.
 std::string encodeFrame(std::string_view payload);
 
+// A frame of `payloadSize` bytes with its header written, for a payload to be serialized in place
+// at offset kFrameHeaderSize.
+std::string frameWithRoom(std::size_t payloadSize);
+
 class FrameDecoder {
  public:
   explicit FrameDecoder(std::size_t maxFrameSize = kMaxFrameSize) : max_(maxFrameSize) {}

@@ -57,12 +57,16 @@ struct IpcConnection::Impl {
   };
 
   Strand strand;
-  asio::posix::stream_descriptor socket;  // touched on `strand` only
+  // Waited on and read on `strand` only. Written from whichever thread sends, under writeLock,
+  // which the close also takes, so that no write ever reaches a descriptor number reused since.
+  asio::posix::stream_descriptor socket;
   FrameDecoder decoder;
+  std::string readBuffer;  // on `strand`; kept, so that a wake-up costs no allocation
   std::size_t maxFrame;
-  std::deque<Outgoing> outbox;
+  std::mutex writeLock;
+  std::deque<Outgoing> outbox;  // under writeLock; not empty exactly while `writing`
   std::size_t outboxBytes = 0;
-  bool writing = false;
+  bool writing = false;  // a wait for the socket to take more is armed or about to be
   std::shared_ptr<Calls> calls;
   bool paused = false;  // not reading: too many calls unanswered
   // Set once by start(); cleared on the queue after the invalidation handler ran, which breaks
@@ -75,6 +79,7 @@ struct IpcConnection::Impl {
   static Delivery deliverFrames(const std::shared_ptr<IpcConnection>& self);
   static void release(const std::shared_ptr<Calls>& calls);
   static void resume(const std::shared_ptr<IpcConnection>& self);
+  static void armWrite(const std::shared_ptr<IpcConnection>& self);
   static void flush(const std::shared_ptr<IpcConnection>& self);
   static void close(const std::shared_ptr<IpcConnection>& self);
 };
@@ -120,7 +125,8 @@ void IpcConnection::Impl::armRead(const std::shared_ptr<IpcConnection>& self) {
 
 void IpcConnection::Impl::onReadable(const std::shared_ptr<IpcConnection>& self) {
   Impl& impl = *self->impl_;
-  std::string buffer(kReadChunk, '\0');
+  std::string& buffer = impl.readBuffer;
+  if (buffer.empty()) buffer.resize(kReadChunk);
   for (int round = 0; round < kReadsPerWakeup; ++round) {
     std::vector<int> fds;
     std::size_t n = 0;
@@ -143,7 +149,7 @@ void IpcConnection::Impl::onReadable(const std::shared_ptr<IpcConnection>& self)
     impl.decoder.append(buffer.data(), n);
     // Paused, the read is not armed again: the peer's further bytes wait in its socket until a
     // call is answered.
-    if (deliverFrames(self) != Delivery::More) return;
+    if (deliverFrames(self) != Delivery::More || self->closed_) return;
     if (n < buffer.size()) break;  // drained for now
   }
   armRead(self);
@@ -152,6 +158,7 @@ void IpcConnection::Impl::onReadable(const std::shared_ptr<IpcConnection>& self)
 IpcConnection::Impl::Delivery IpcConnection::Impl::deliverFrames(const std::shared_ptr<IpcConnection>& self) {
   Impl& impl = *self->impl_;
   while (impl.calls->unanswered.load() < impl.calls->max) {
+    if (self->closed_) return Delivery::Failed;  // a handler run here may have ended it
     auto payload = impl.decoder.next();
     if (!payload) {
       if (!impl.decoder.failed()) return Delivery::More;
@@ -162,7 +169,9 @@ IpcConnection::Impl::Delivery IpcConnection::Impl::deliverFrames(const std::shar
     }
     impl.calls->unanswered.fetch_add(1);
     CallHold hold(impl.calls.get(), [calls = impl.calls](void*) { release(calls); });
-    self->queue_.async([self, hold = std::move(hold), p = std::move(*payload)]() mutable {
+    // On this thread when the queue is idle: the common case of one call at a time is answered
+    // without waking a second thread.
+    self->queue_.runHereOrAsync([self, hold = std::move(hold), p = std::move(*payload)]() mutable {
       self->currentCall_ = std::move(hold);
       if (self->impl_->onMessage) self->impl_->onMessage(std::move(p));
       self->currentCall_.reset();
@@ -199,26 +208,66 @@ bool IpcConnection::send(std::string payload, std::vector<UniqueFd> fds) {
                   impl_->maxFrame);
     return false;
   }
-  auto self = shared_from_this();
-  asio::post(impl_->strand, [self, bytes = encodeFrame(payload), fds = std::move(fds)]() mutable {
-    if (self->closed_) return;
-    Impl& impl = *self->impl_;
+  return sendFrame(encodeFrame(payload), std::move(fds));
+}
+
+bool IpcConnection::sendFrame(std::string frame, std::vector<UniqueFd> fds) {
+  if (closed_) return false;
+  Impl& impl = *impl_;
+  const std::size_t payloadSize = frame.size() - std::min(frame.size(), kFrameHeaderSize);
+  if (payloadSize > impl.maxFrame) {
+    logger_.error("not sending {} bytes to pid {}: over the frame limit of {}", payloadSize, peer_.pid, impl.maxFrame);
+    return false;
+  }
+  std::unique_lock lock(impl.writeLock);
+  if (closed_) return false;
+  if (impl.writing) {
     // A peer that stops reading must not make us hold its replies for ever.
-    if (impl.outboxBytes + bytes.size() > kMaxOutboxFrames * impl.maxFrame) {
-      self->logger_.error("closing connection from pid {}: peer does not read, {} bytes waiting", self->peer_.pid,
-                          impl.outboxBytes);
-      Impl::close(self);
+    if (impl.outboxBytes + frame.size() > kMaxOutboxFrames * impl.maxFrame) {
+      logger_.error("closing connection from pid {}: peer does not read, {} bytes waiting", peer_.pid,
+                    impl.outboxBytes);
+      lock.unlock();
+      invalidate();
+      return true;
+    }
+    impl.outboxBytes += frame.size();
+    impl.outbox.push_back({std::move(frame), std::move(fds), 0});
+    return true;
+  }
+  // Nothing waits before this frame: write it from this thread, and leave to the connection's
+  // strand only what the socket does not take now.
+  std::vector<int> raw;
+  for (auto& fd : fds) raw.push_back(fd.get());
+  std::size_t sent = 0;
+  if (sendWithFds(impl.socket.native_handle(), frame, raw, false, &sent)) {
+    lock.unlock();
+    invalidate();
+    return true;
+  }
+  if (sent == frame.size()) return true;
+  if (sent > 0) fds.clear();  // they went with the first byte
+  impl.outboxBytes += frame.size();
+  impl.outbox.push_back({std::move(frame), std::move(fds), sent});
+  impl.writing = true;
+  lock.unlock();
+  asio::post(impl.strand, [self = shared_from_this()] { Impl::armWrite(self); });
+  return true;
+}
+
+void IpcConnection::Impl::armWrite(const std::shared_ptr<IpcConnection>& self) {
+  if (self->closed_) return;
+  self->impl_->socket.async_wait(asio::posix::stream_descriptor::wait_write, [self](const asio::error_code& ec) {
+    if (ec || self->closed_) {
+      close(self);
       return;
     }
-    impl.outboxBytes += bytes.size();
-    self->impl_->outbox.push_back({std::move(bytes), std::move(fds), 0});
-    if (!self->impl_->writing) Impl::flush(self);
+    flush(self);
   });
-  return true;
 }
 
 void IpcConnection::Impl::flush(const std::shared_ptr<IpcConnection>& self) {
   Impl& impl = *self->impl_;
+  std::unique_lock lock(impl.writeLock);
   while (!impl.outbox.empty()) {
     auto& out = impl.outbox.front();
     std::vector<int> raw;
@@ -227,37 +276,35 @@ void IpcConnection::Impl::flush(const std::shared_ptr<IpcConnection>& self) {
     auto ec = sendWithFds(impl.socket.native_handle(), std::string_view(out.bytes).substr(out.offset), raw, false,
                           &sent);
     if (ec) {
+      lock.unlock();
       close(self);
       return;
     }
     if (sent > 0) out.fds.clear();  // they went with the first byte
     out.offset += sent;
     if (out.offset < out.bytes.size()) {
-      impl.writing = true;
-      impl.socket.async_wait(asio::posix::stream_descriptor::wait_write, [self](const asio::error_code& ec) {
-        self->impl_->writing = false;
-        if (ec || self->closed_) {
-          close(self);
-          return;
-        }
-        flush(self);
-      });
+      lock.unlock();
+      armWrite(self);
       return;
     }
     impl.outboxBytes -= out.bytes.size();
     impl.outbox.pop_front();
   }
+  impl.writing = false;
 }
 
 void IpcConnection::Impl::close(const std::shared_ptr<IpcConnection>& self) {
   Impl& impl = *self->impl_;
-  self->closed_ = true;
-  if (impl.socket.is_open()) {
-    asio::error_code ignored;
-    impl.socket.close(ignored);
+  {
+    std::lock_guard lock(impl.writeLock);
+    self->closed_ = true;
+    if (impl.socket.is_open()) {
+      asio::error_code ignored;
+      impl.socket.close(ignored);
+    }
+    impl.outbox.clear();
+    impl.outboxBytes = 0;
   }
-  impl.outbox.clear();
-  impl.outboxBytes = 0;
   // Moved out, so it runs once; it runs after every message already queued, and nothing more is
   // delivered afterwards.
   auto handler = std::move(impl.onInvalidated);

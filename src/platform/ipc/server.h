@@ -68,6 +68,10 @@ class IpcConnection : public std::enable_shared_from_this<IpcConnection> {
   // limit (logged; the caller owes its peer a smaller answer). A peer that leaves more than four
   // maximum frames unread, a flood of calls it does not read the answers of, is disconnected.
   bool send(std::string payload, std::vector<UniqueFd> fds = {});
+  // As send(), for a frame whose header is already in place (frameWithRoom()), so that a reply
+  // serialized into it is never copied. Written from the calling thread when nothing waits
+  // before it.
+  bool sendFrame(std::string frame, std::vector<UniqueFd> fds = {});
 
   std::size_t maxFrameSize() const;
 
