@@ -82,6 +82,16 @@ TEST_F(HTTPSessionTest, TransportFailuresBecomeURLErrors) {
   EXPECT_EQ(unsupported.error->code, URLErrorUnsupportedURL);
 }
 
+TEST_F(HTTPSessionTest, TasksStartWhileTheTransferThreadLeaves) {
+  // No linger: the thread leaves as soon as each answer is in, racing the next task's start.
+  URLSession session{URLSessionConfiguration{.transferThreadLinger = std::chrono::milliseconds(0), .delegatePool = &pool}};
+  for (int i = 0; i < 50; ++i) {
+    Outcome outcome = run(session, {url("/bag")});
+    ASSERT_FALSE(outcome.error) << "request " << i;
+    ASSERT_EQ(outcome.response->statusCode, 200) << "request " << i;
+  }
+}
+
 TEST_F(HTTPSessionTest, HostileAnswersEndAtTheSessionsLimits) {
   Logger log("test", "http");
   LogCapture capture;

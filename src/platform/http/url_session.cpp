@@ -164,7 +164,6 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
     share = curl_share_init();
     curl_share_setopt(share, CURLSHOPT_SHARE, CURL_LOCK_DATA_DNS);
     if (config.tlsSessionReuse) curl_share_setopt(share, CURLSHOPT_SHARE, CURL_LOCK_DATA_SSL_SESSION);
-    thread = std::thread([this] { run(); });
   }
 
   ~Impl() {
@@ -199,6 +198,7 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
       std::lock_guard guard(lock);
       if (stopping) return false;
       commands.push_back(std::move(command));
+      startThreadIfGone();
     }
     idle.notify_one();
     curl_multi_wakeup(multi);
@@ -251,6 +251,15 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
     if (!post({Command::Start, task})) deliver(task, {}, std::nullopt, makeError(URLErrorCancelled, "cancelled"));
   }
 
+  // Under `lock`. The transfer thread runs only while there is work or shortly after; one that has
+  // left set `threadRunning` false under the lock as its last act, so joining it here is immediate.
+  void startThreadIfGone() {
+    if (threadRunning) return;
+    if (thread.joinable()) thread.join();
+    threadRunning = true;
+    thread = std::thread([this] { run(); });
+  }
+
   // ---- transfer thread ----
 
   void run() {
@@ -260,9 +269,13 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
       std::deque<Command> pending;
       {
         std::unique_lock guard(lock);
-        // Nothing on the wire and no timer of curl's due: sleep, without a time-out, until a
-        // command comes.
-        if (running.empty() && waitMs < 0) idle.wait(guard, [this] { return stopping || !commands.empty(); });
+        // Nothing on the wire and no timer of curl's due: sleep until a command comes, and leave
+        // if none comes within the linger.
+        if (running.empty() && waitMs < 0 &&
+            !idle.wait_for(guard, config.transferThreadLinger, [this] { return stopping || !commands.empty(); })) {
+          threadRunning = false;  // the next post starts a new thread
+          return;
+        }
         if (stopping) break;
         pending.swap(commands);
       }
@@ -601,9 +614,10 @@ struct URLSession::Impl : std::enable_shared_from_this<URLSession::Impl> {
   CURLM* multi = nullptr;
   CURLSH* share = nullptr;
   std::thread thread;
+  bool threadRunning = false;  // under `lock`
   std::atomic<std::uint64_t> nextIdentifier{1};
 
-  std::mutex lock;  // guards commands, stopping and tasks
+  std::mutex lock;  // guards commands, stopping, tasks and the transfer thread's start
   std::condition_variable idle;  // the transfer thread waits here while nothing is in flight
   std::deque<Command> commands;
   bool stopping = false;

@@ -45,6 +45,9 @@ struct URLSessionConfiguration {
   bool tlsSessionReuse = true;
   // Idle connections are kept for reuse this long, then closed.
   std::chrono::seconds connectionIdleTimeout{10};
+  // How long the transfer thread stays once nothing is in flight; the next task starts it again.
+  // An idle daemon then holds no HTTP thread at all.
+  std::chrono::milliseconds transferThreadLinger{10000};
   // Several requests on one connection where the server speaks HTTP/2.
   bool multiplexing = true;
 
