@@ -332,30 +332,6 @@ void SerialQueue::async(Task task) {
   if (!impl_->owned && !impl_->drainPosted) impl_->postDrain(impl_);
 }
 
-void SerialQueue::runHereOrAsync(Task task) {
-  Impl& q = *impl_;
-  bool busy = false;
-  {
-    std::lock_guard<std::mutex> guard(q.lock);
-    busy = q.owned || !q.items.empty();
-    if (!busy) q.owned = true;
-  }
-  if (busy) return async(std::move(task));
-  // Counted as queued work is, so that drain() also waits for a task run here, and for what it
-  // holds to be let go.
-  q.pool.beginWork();
-  {
-    OnQueue on(&q);
-    task();
-    task = nullptr;
-  }
-  {
-    std::unique_lock<std::mutex> guard(q.lock);
-    q.release(guard, impl_);
-  }
-  q.pool.endWork();
-}
-
 void SerialQueue::sync(const Task& task) {
   if (isCurrent()) die("sync onto queue '" + label_ + "' from itself would deadlock");
   Impl& q = *impl_;

@@ -88,11 +88,6 @@ class SerialQueue {
   // Queues `task` and returns at once.
   void async(Task task);
 
-  // Runs `task` at once on the calling thread when the queue is idle (nobody on it, nothing
-  // queued), else queues it as async() does. Saves a thread hop where the caller may run the
-  // queue's work itself; never waits.
-  void runHereOrAsync(Task task);
-
   // Runs `task` on the queue and waits for it; the task runs on the calling thread, after every
   // task queued before it (which the caller may run too). Never call sync() on the queue you are running
   // on (directly or through a chain of sync calls): that would wait on itself for ever, so it is

@@ -30,35 +30,6 @@ TEST(SerialQueue, RunsTasksOneAtATimeInSubmissionOrder) {
   for (int i = 0; i < 500; ++i) EXPECT_EQ(order[i], i);
 }
 
-TEST(SerialQueue, RunHereOrAsyncRunsOnTheCallerOnlyWhenIdleAndKeepsOrder) {
-  DispatchPool pool(2);
-  SerialQueue queue(pool, "test.here");
-  const auto caller = std::this_thread::get_id();
-  std::thread::id ranOn;
-  queue.runHereOrAsync([&] {
-    ranOn = std::this_thread::get_id();
-    EXPECT_TRUE(queue.isCurrent());
-  });
-  EXPECT_EQ(ranOn, caller) << "an idle queue runs the task at once, here";
-
-  // Busy: the task waits its turn behind the queued one, on the queue's thread.
-  std::promise<void> release;
-  std::vector<int> order;
-  queue.async([&, gate = release.get_future().share()] {
-    gate.wait();
-    order.push_back(1);
-  });
-  queue.runHereOrAsync([&] {
-    order.push_back(2);
-    ranOn = std::this_thread::get_id();
-  });
-  EXPECT_TRUE(order.empty());
-  release.set_value();
-  pool.drain();
-  EXPECT_EQ(order, (std::vector<int>{1, 2}));
-  EXPECT_NE(ranOn, caller);
-}
-
 TEST(SerialQueue, ManyQueuesSyncingOntoOneNeverStarveASmallPool) {
   // Every pool thread is busy in a task that syncs onto one shared queue, which also has async
   // work pending: no caller may wait for a free pool thread, or this never ends.

@@ -108,6 +108,11 @@ void URL::appendQueryItem(std::string_view name, std::string_view value) {
   curl_url_set(handle_->url, CURLUPART_QUERY, item.c_str(), CURLU_APPENDQUERY);
 }
 
+void URL::setQuery(std::optional<std::string_view> query) {
+  const std::string text(query.value_or(""));
+  curl_url_set(handle_->url, CURLUPART_QUERY, query ? text.c_str() : nullptr, 0);
+}
+
 std::optional<std::string_view> schemeOf(std::string_view text) {
   const auto length = schemeLength(text);
   if (length == 0) return std::nullopt;

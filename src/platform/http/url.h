@@ -42,6 +42,8 @@ class URL {
   // Appends "name=value", both percent-encoded as `percentEncode` does, after the query items the
   // URL has and before its fragment.
   void appendQueryItem(std::string_view name, std::string_view value);
+  // Replaces the query, still percent-encoded and without "?"; none removes it, "?" and all.
+  void setQuery(std::optional<std::string_view> query);
 
  private:
   struct Handle;

@@ -158,7 +158,7 @@ void IpcConnection::Impl::onReadable(const std::shared_ptr<IpcConnection>& self)
 IpcConnection::Impl::Delivery IpcConnection::Impl::deliverFrames(const std::shared_ptr<IpcConnection>& self) {
   Impl& impl = *self->impl_;
   while (impl.calls->unanswered.load() < impl.calls->max) {
-    if (self->closed_) return Delivery::Failed;  // a handler run here may have ended it
+    if (self->closed_) return Delivery::Failed;
     auto payload = impl.decoder.next();
     if (!payload) {
       if (!impl.decoder.failed()) return Delivery::More;
@@ -169,9 +169,9 @@ IpcConnection::Impl::Delivery IpcConnection::Impl::deliverFrames(const std::shar
     }
     impl.calls->unanswered.fetch_add(1);
     CallHold hold(impl.calls.get(), [calls = impl.calls](void*) { release(calls); });
-    // On this thread when the queue is idle: the common case of one call at a time is answered
-    // without waking a second thread.
-    self->queue_.runHereOrAsync([self, hold = std::move(hold), p = std::move(*payload)]() mutable {
+    // Never here: this is the reactor's one thread, and a call may wait (for the first bag, for
+    // the completion database) where every other socket and timer would wait with it.
+    self->queue_.async([self, hold = std::move(hold), p = std::move(*payload)]() mutable {
       self->currentCall_ = std::move(hold);
       if (self->impl_->onMessage) self->impl_->onMessage(std::move(p));
       self->currentCall_.reset();
