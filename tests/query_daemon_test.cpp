@@ -4,7 +4,6 @@
 
 #include <filesystem>
 #include <fstream>
-#include <condition_variable>
 #include <future>
 #include <mutex>
 #include <optional>
@@ -23,17 +22,17 @@ TEST_F(QueryDaemonTest, ClientsHearTheBagWhenTheyConfigureWhenTheyAskAndWhenItCh
   startDaemon();
   // A second client of the same identifier hears the bag in its own right.
   std::mutex lock;
-  std::condition_variable arrived;
   std::vector<proto::BagDidLoad> loads;
   client::Client second(clientOptions("com.norvel.seekara", "seekara/1.0"));
   second.setBagDidLoadHandler([&](const proto::BagDidLoad& load) {
     std::lock_guard hold(lock);
     loads.push_back(load);
-    arrived.notify_all();
   });
   auto waitForLoads = [&](std::size_t n) {
-    std::unique_lock hold(lock);
-    return arrived.wait_for(hold, std::chrono::seconds(15), [&] { return loads.size() >= n; });
+    return tavix::testing::waitFor([&] {
+      std::lock_guard hold(lock);
+      return loads.size() >= n;
+    }, 15000);
   };
   ASSERT_FALSE(second.connect());
   ASSERT_TRUE(waitForLoads(1)) << tavixd->log();
