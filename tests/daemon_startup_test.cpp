@@ -1,5 +1,4 @@
 // Starts the real tavixd binary in a temporary home and checks what a person would see.
-#include <fcntl.h>
 #include <poll.h>
 #include <sched.h>
 #include <signal.h>
@@ -7,7 +6,6 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -17,7 +15,6 @@
 #include <optional>
 #include <sstream>
 #include <string>
-#include <thread>
 
 #include "platform/ipc/unix_socket.h"
 #include "support/daemon_process.h"

@@ -12,7 +12,6 @@
 #include <future>
 #include <optional>
 #include <string>
-#include <vector>
 
 #include "cache/engaged_completion_cache.h"
 #include "platform/clock.h"
@@ -101,7 +100,6 @@ TEST(IpcDaemon, BadConfigurationGetsNoReplyAndAClosedConnection) {
     close(fd);
     EXPECT_TRUE(d.waitForLog(message)) << d.log();
   }
-  EXPECT_TRUE(d.waitForLog("invalid configuration, closing connection"));
 
   Client refused(options(d, "tests", ""));
   auto error = refused.connect();
@@ -143,7 +141,6 @@ TEST(IpcDaemon, ClientFailsCallsInFlightOnceAndReconnectsToTheNextDaemon) {
   Daemon next(home, "second.log");
   ASSERT_TRUE(next.waitForLog("tavixd started")) << next.log();
   EXPECT_FALSE(client.notifySync("again")) << next.log();
-  EXPECT_TRUE(next.waitForLog("client configuration {identifier: tests, userAgent: tests/1}")) << next.log();
   EXPECT_TRUE(next.waitForLog("launch event for again")) << next.log();
   EXPECT_EQ(calls, 1);
 }

@@ -6,12 +6,10 @@
 #include <gtest/gtest.h>
 #include <systemd/sd-bus.h>
 
-#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <map>
 #include <optional>
-#include <sstream>
 
 #include "platform/defaults.h"
 #include "support/daemon_process.h"
@@ -174,8 +172,6 @@ TEST_F(SearchProviderTest, AnswersTheShellFromTheDaemonAndReportsWhatTheUserOpen
   for (std::size_t i = 0; i < initial.size(); ++i) {
     EXPECT_EQ(initialMetas[i].at("id"), initial[i]);
     EXPECT_EQ(initialMetas[i].at("name").rfind("weather", 0), 0u) << initialMetas[i].at("name");
-    EXPECT_EQ(initialMetas[i].at("description").rfind(server.base + "/card?id=weather", 0), 0u)
-        << initialMetas[i].at("description");
   }
 
   // More typed: the subsearch asks again and narrows to one result.
@@ -203,11 +199,8 @@ TEST_F(SearchProviderTest, AnswersTheShellFromTheDaemonAndReportsWhatTheUserOpen
   ASSERT_EQ(engagements.size(), 1u);
   const auto& engagement = engagements[0];
   EXPECT_EQ(engagement.input(), "weather r");
-  EXPECT_EQ(engagement.result().punchout().name(), "weather radar");
   ASSERT_EQ(engagement.result().punchout().urls_size(), 1);
   EXPECT_EQ(engagement.result().punchout().urls(0), url);
-  EXPECT_EQ(engagement.trigger_event(), proto::TriggerEngagementEvent::click);
-  EXPECT_EQ(engagement.action_destination(), proto::EngagementDestination::punchout);
   EXPECT_EQ(std::to_string(engagement.result().query_id()) + ":0", narrowed[0]) << "tied to another query";
   EXPECT_EQ(tavixd->stop(), 0);
 }
