@@ -107,6 +107,30 @@ void DispatchPool::Impl::joinExited() {
 namespace {
 // The pool whose reactor the calling thread leads at the moment, if any.
 thread_local DispatchPool* tLeads = nullptr;
+
+// Work posted by the task running on this thread: a worker runs it itself once the task is done,
+// a reactor thread hands it to the pool in one piece once its call is done, so that work which
+// follows from work wakes no one. A thread about to wait gives it to the pool first.
+struct FollowUps {
+  DispatchPool* pool = nullptr;
+  std::deque<Task> tasks;
+};
+thread_local FollowUps* tFollowUps = nullptr;
+
+// Collects the calling thread's posts to `pool` while it lives.
+class CollectFollowUps {
+ public:
+  explicit CollectFollowUps(DispatchPool* pool) : outer_(tFollowUps) {
+    mine_.pool = pool;
+    tFollowUps = &mine_;
+  }
+  ~CollectFollowUps() { tFollowUps = outer_; }
+  std::deque<Task>& tasks() { return mine_.tasks; }
+
+ private:
+  FollowUps mine_;
+  FollowUps* outer_;
+};
 }  // namespace
 
 void DispatchPool::Impl::updateSpare() {
@@ -176,9 +200,17 @@ void DispatchPool::Impl::work() {
     Task task = std::move(tasks.front());
     tasks.pop_front();
     guard.unlock();
-    task();
-    task = nullptr;  // what it holds goes before the lock is taken again
-    finishedOne();
+    {
+      CollectFollowUps followUps(owner);
+      for (;;) {
+        task();
+        task = nullptr;  // what it holds goes before the next one runs
+        finishedOne();
+        if (followUps.tasks().empty()) break;
+        task = std::move(followUps.tasks().front());
+        followUps.tasks().pop_front();
+      }
+    }
     guard.lock();
   }
   --workers;
@@ -259,9 +291,17 @@ void DispatchPool::beginWork() { impl_->inFlight.fetch_add(1); }
 void DispatchPool::endWork() { impl_->finishedOne(); }
 
 void DispatchPool::post(Task task) {
+  ++impl_->inFlight;
+  if (tFollowUps && tFollowUps->pool == this) {
+    tFollowUps->tasks.push_back(std::move(task));
+    return;
+  }
+  enqueue(std::move(task));
+}
+
+void DispatchPool::enqueue(Task task) {
   Impl& p = *impl_;
   std::unique_lock<std::mutex> guard(p.lock);
-  ++p.inFlight;
   p.tasks.push_back(std::move(task));
   if (p.stopping) return;  // never runs; destroyed with the pool
   // Every waiting worker takes one task; beyond them a new worker starts, up to the limit.
@@ -295,6 +335,12 @@ bool DispatchPool::mayAnswerOnReactor() const {
 }
 
 void DispatchPool::aboutToWait() {
+  if (tFollowUps && !tFollowUps->tasks.empty()) {
+    // What it waits for may be among them.
+    auto pending = std::move(tFollowUps->tasks);
+    tFollowUps->tasks.clear();
+    for (auto& task : pending) tFollowUps->pool->enqueue(std::move(task));
+  }
   if (tLeads) tLeads->handOffReactor();
 }
 
@@ -441,10 +487,21 @@ void SerialQueue::runHereOrAsync(Task task) {
   guard.unlock();
   q.pool.beginWork();  // counted like queued work, so that drain() waits for it
   {
-    OnQueue on(&q);
-    task();
+    CollectFollowUps followUps(&q.pool);
+    {
+      OnQueue on(&q);
+      task();
+    }
+    task = nullptr;
+    // What the task posted goes to a worker in one piece (each was counted when posted), where it
+    // joins that worker's own follow-ups.
+    if (!followUps.tasks().empty()) {
+      q.pool.beginWork();
+      q.pool.enqueue([pending = std::make_shared<std::deque<Task>>(std::move(followUps.tasks()))] {
+        for (auto& t : *pending) tFollowUps->tasks.push_back(std::move(t));
+      });
+    }
   }
-  task = nullptr;
   q.pool.endWork();
   guard.lock();
   // Whatever was queued or began to wait meanwhile goes to a worker or to its waiter.

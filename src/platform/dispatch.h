@@ -46,6 +46,8 @@ class DispatchPool {
   DispatchPool& operator=(const DispatchPool&) = delete;
 
   // Runs `task` on some pool thread: the platform's "global queue". No ordering between tasks.
+  // Posted from a pool task, it runs on the same thread once that task is done (unless the task
+  // waits first): work that follows from work wakes no other thread.
   void post(Task task);
 
   // Waits until every task posted so far, and everything they post in turn, has run.
@@ -83,6 +85,8 @@ class DispatchPool {
   void beginWork();
   void endWork();
   void handOffReactor();
+  // Puts a task already counted in flight on the pool's list, waking or starting a worker.
+  void enqueue(Task task);
 
   struct Impl;
   std::unique_ptr<Impl> impl_;
