@@ -74,7 +74,7 @@ class DispatchPool {
 
   // The Asio io_context behind the pool's sockets and timers, as an opaque pointer for the few
   // platform pieces that need it. Cast with asioContext() in platform sources. The first call
-  // starts the reactor thread, so handlers on it must be short: they hand work to a queue.
+  // starts the reactor. Its handlers are short, or call aboutToWait() before they block.
   void* nativeContext();
 
  private:
