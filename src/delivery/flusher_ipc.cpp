@@ -87,6 +87,7 @@ void TavixFlusherIPC::removeRemote(const Remote& remote) {
   flusherIpcQueue_.async([self = shared_from_this(), remote] {
     if (self->receivingStreamListener_ == remote) {
       self->receivingStreamListener_.reset();
+      self->hasReceivingStreamListener_ = false;
       flusherLog().notice("Removed receiving stream listener");
     }
     if (self->sendingStreamListener_ == remote) {
@@ -111,7 +112,8 @@ void TavixFlusherIPC::handleMessage(const std::string& payload) {
 }
 
 void TavixFlusherIPC::sendDataToReceivingStreamListener(const proto::CTTavixFeedback& feedback) {
-  // The description is made here, on the caller's thread, while the record is still as it came.
+  // Every record passes here: with nobody listening, it costs no copy and no hop.
+  if (!hasReceivingStreamListener_.load()) return;
   flusherIpcQueue_.async([self = shared_from_this(), feedback] {
     if (!self->receivingStreamListener_) return;
     const std::string description = feedbackDescription(feedback);
@@ -146,6 +148,7 @@ void TavixFlusherIPC::initiateConnectionWithIntent(std::uint64_t intent) {
         break;
       case kSubscribeToFeedback:
         self->receivingStreamListener_ = self->remoteObject_;
+        self->hasReceivingStreamListener_ = true;
         flusherLog().notice("new listener for client feedbacks, delegate: {}", describe(self->remoteObject_));
         break;
       case kStopFlushing:

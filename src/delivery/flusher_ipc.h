@@ -10,6 +10,7 @@
 // methods are safe from any thread. Must be owned by a shared_ptr (made by create()).
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -98,6 +99,7 @@ class TavixFlusherIPC : public std::enable_shared_from_this<TavixFlusherIPC> {
   // On the queue:
   Remote remoteObject_;
   Remote receivingStreamListener_;
+  std::atomic<bool> hasReceivingStreamListener_{false};  // set and cleared with the one above
   Remote sendingStreamListener_;
   std::vector<Remote> connections_;  // every live tool connection, kept open here
 };

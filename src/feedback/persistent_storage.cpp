@@ -390,6 +390,7 @@ struct TavixPersistentStorage::Syncer {
   }
   void waitIdle() {
     std::unique_lock guard(lock);
+    platform::DispatchPool::aboutToWait();
     changed.wait(guard, [this] { return jobs.empty() && !busy; });
   }
   void run() {

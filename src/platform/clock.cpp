@@ -52,6 +52,8 @@ TimerHandle SystemClock::after(Duration delay, SerialQueue& queue, Task task) {
 
 bool SystemClock::waitFor(std::unique_lock<std::mutex>& lock, std::condition_variable& signal, Duration timeout,
                           const std::function<bool()>& ready) {
+  if (ready()) return true;
+  DispatchPool::aboutToWait();
   // The condition variable measures on the steady clock, like the timers.
   return signal.wait_for(lock, std::max(timeout, Duration::zero()), ready);
 }
@@ -61,6 +63,7 @@ VirtualClock::VirtualClock(TimePoint start) : now_(start) {}
 bool VirtualClock::waitFor(std::unique_lock<std::mutex>& lock, std::condition_variable& signal, Duration timeout,
                            const std::function<bool()>& ready) {
   if (ready()) return true;
+  DispatchPool::aboutToWait();
   auto parked = std::make_shared<Parked>();
   parked->mutex = lock.mutex();
   parked->signal = &signal;

@@ -30,12 +30,13 @@ namespace {
 void nameThisThread(const char* name) { pthread_setname_np(pthread_self(), name); }
 
 struct DispatchPool::Impl {
-  Impl(unsigned limit, Duration idleExit) : limit(limit), idleExit(idleExit) {}
+  Impl(DispatchPool* owner, unsigned limit, Duration idleExit) : owner(owner), limit(limit), idleExit(idleExit) {}
 
   void startWorker();  // with `lock` held
   void work();
   void joinExited();  // with `lock` held
 
+  DispatchPool* const owner;
   const unsigned limit;
   const Duration idleExit;
 
@@ -43,17 +44,40 @@ struct DispatchPool::Impl {
   std::condition_variable wake;     // a task arrived, or the pool stops
   std::condition_variable idle;     // inFlight fell to zero, or a worker left
   std::deque<Task> tasks;           // posted and not yet taken by a worker
-  std::size_t inFlight = 0;         // posted through post() or a queue and not yet finished
+  // Posted through post() or a queue and not yet finished. Counted without the lock, which is
+  // taken only by the step down to zero, to wake drain().
+  std::atomic<std::size_t> inFlight{0};
+  void finishedOne() {
+    if (inFlight.fetch_sub(1) != 1) return;
+    std::lock_guard<std::mutex> guard(lock);
+    idle.notify_all();
+  }
   unsigned workers = 0;             // alive
   unsigned waiting = 0;             // alive and blocked waiting for a task
   bool stopping = false;            // shutdown() has begun: workers leave, none starts
   std::map<std::thread::id, std::thread> threads;
   std::vector<std::thread::id> exited;  // left their loop; joined by the next start or shutdown
 
-  // The reactor: started by the first nativeContext(), stopped by shutdown().
+  // The reactor: started by the first nativeContext(), stopped by shutdown(). Concurrency hint 1
+  // keeps Asio's locking but stops it from waking a second thread for every event; the threads
+  // below take turns instead, one leading at a time.
+  void startReactorThread();  // with `lock` held
+  void reactorThread();
+  void updateSpare();  // with `lock` held
+
+  static constexpr unsigned kMaxReactorThreads = 4;
   asio::io_context context{1};
   std::optional<asio::executor_work_guard<asio::io_context::executor_type>> reactorWork;
-  std::thread reactor;
+  std::map<std::thread::id, std::thread> reactorThreads;  // under `lock`, like the rest below
+  std::vector<std::thread::id> reactorExited;
+  unsigned reactorAlive = 0;    // reactor threads that have not left their loop
+  bool reactorLed = false;      // a thread leads the reactor
+  unsigned reactorStandby = 0;  // waiting for their turn to lead
+  bool reactorStopping = false;
+  std::condition_variable reactorTurn;
+  // Threads that could take the reactor over now: standing by, or yet to start. Read without
+  // the lock by mayAnswerOnReactor().
+  std::atomic<unsigned> reactorSpare{0};
 
   // The queues made on the pool, so that tasks still queued when it stops can be dropped: a task
   // often holds the object that owns its queue, and would keep both alive for ever.
@@ -80,6 +104,85 @@ void DispatchPool::Impl::joinExited() {
   exited.clear();
 }
 
+namespace {
+// The pool whose reactor the calling thread leads at the moment, if any.
+thread_local DispatchPool* tLeads = nullptr;
+
+// Work posted by the task running on this thread: a worker runs it itself once the task is done,
+// a reactor thread hands it to the pool in one piece once its call is done, so that work which
+// follows from work wakes no one. A thread about to wait gives it to the pool first.
+struct FollowUps {
+  DispatchPool* pool = nullptr;
+  std::deque<Task> tasks;
+};
+thread_local FollowUps* tFollowUps = nullptr;
+
+// Collects the calling thread's posts to `pool` while it lives.
+class CollectFollowUps {
+ public:
+  explicit CollectFollowUps(DispatchPool* pool) : outer_(tFollowUps) {
+    mine_.pool = pool;
+    tFollowUps = &mine_;
+  }
+  ~CollectFollowUps() { tFollowUps = outer_; }
+  std::deque<Task>& tasks() { return mine_.tasks; }
+
+ private:
+  FollowUps mine_;
+  FollowUps* outer_;
+};
+}  // namespace
+
+void DispatchPool::Impl::updateSpare() {
+  reactorSpare.store(reactorStandby + (reactorAlive < kMaxReactorThreads ? kMaxReactorThreads - reactorAlive : 0));
+}
+
+void DispatchPool::Impl::startReactorThread() {
+  for (auto id : reactorExited) {
+    auto it = reactorThreads.find(id);
+    it->second.join();
+    reactorThreads.erase(it);
+  }
+  reactorExited.clear();
+  std::thread t([this] { reactorThread(); });
+  reactorThreads.emplace(t.get_id(), std::move(t));
+  ++reactorAlive;
+  updateSpare();
+}
+
+void DispatchPool::Impl::reactorThread() {
+  nameThisThread("tavixd-io");
+  DispatchPool* const pool = owner;
+  std::unique_lock<std::mutex> guard(lock);
+  for (;;) {
+    if (reactorLed && !reactorStopping) {
+      ++reactorStandby;
+      updateSpare();
+      // The only timed wait of the reactor, and it ends a standby thread: the leader never times out.
+      const bool turn = reactorTurn.wait_for(guard, idleExit, [this] { return !reactorLed || reactorStopping; });
+      --reactorStandby;
+      updateSpare();
+      if (!turn) break;
+    }
+    if (reactorStopping) break;
+    reactorLed = true;
+    guard.unlock();
+    tLeads = pool;
+    while (tLeads == pool && context.run_one() > 0) {
+    }
+    const bool stopped = tLeads == pool;  // run_one() answers 0 only once the context stopped
+    tLeads = nullptr;
+    // What the handler that handed the reactor over posted meanwhile is queued, and nobody was
+    // woken for it: run it here before standing by.
+    if (!stopped) context.poll();
+    guard.lock();
+    if (stopped) break;
+  }
+  reactorExited.push_back(std::this_thread::get_id());
+  --reactorAlive;
+  updateSpare();
+}
+
 void DispatchPool::Impl::work() {
   nameThisThread("tavixd-pool");
   std::unique_lock<std::mutex> guard(lock);
@@ -97,10 +200,18 @@ void DispatchPool::Impl::work() {
     Task task = std::move(tasks.front());
     tasks.pop_front();
     guard.unlock();
-    task();
-    task = nullptr;  // what it holds goes before the lock is taken again
+    {
+      CollectFollowUps followUps(owner);
+      for (;;) {
+        task();
+        task = nullptr;  // what it holds goes before the next one runs
+        finishedOne();
+        if (followUps.tasks().empty()) break;
+        task = std::move(followUps.tasks().front());
+        followUps.tasks().pop_front();
+      }
+    }
     guard.lock();
-    if (--inFlight == 0) idle.notify_all();
   }
   --workers;
   exited.push_back(std::this_thread::get_id());
@@ -117,7 +228,7 @@ DispatchPool::DispatchPool(unsigned threads, Duration idleExit) {
   // sync() parks a pool thread while it waits, so the pool must be allowed more threads than the
   // deepest chain of nested sync calls; eight is comfortably more than any such chain in the daemon.
   if (threads == 0) threads = std::max(8u, std::thread::hardware_concurrency());
-  impl_ = std::make_unique<Impl>(threads, idleExit);
+  impl_ = std::make_unique<Impl>(this, threads, idleExit);
 }
 
 DispatchPool::~DispatchPool() {
@@ -151,10 +262,17 @@ void DispatchPool::shutdown() {
     impl_->idle.wait(guard, [this] { return impl_->workers == 0; });
     impl_->joinExited();
   }
-  if (impl_->reactor.joinable()) {
+  std::map<std::thread::id, std::thread> reactorThreads;
+  {
+    std::lock_guard<std::mutex> guard(impl_->lock);
+    impl_->reactorStopping = true;
+    impl_->reactorTurn.notify_all();
+    reactorThreads.swap(impl_->reactorThreads);
+  }
+  if (!reactorThreads.empty()) {
     impl_->reactorWork.reset();
     impl_->context.stop();
-    impl_->reactor.join();
+    for (auto& [id, thread] : reactorThreads) thread.join();
   }
   // Tasks queued meanwhile will never run: destroy them now, while what they hold is alive.
   dropPending();
@@ -168,20 +286,22 @@ void DispatchPool::registerQueue(std::weak_ptr<void> queue, std::function<void()
   queues.push_back({std::move(queue), std::move(dropPending)});
 }
 
-void DispatchPool::beginWork() {
-  std::lock_guard<std::mutex> guard(impl_->lock);
-  ++impl_->inFlight;
-}
+void DispatchPool::beginWork() { impl_->inFlight.fetch_add(1); }
 
-void DispatchPool::endWork() {
-  std::lock_guard<std::mutex> guard(impl_->lock);
-  if (--impl_->inFlight == 0) impl_->idle.notify_all();
-}
+void DispatchPool::endWork() { impl_->finishedOne(); }
 
 void DispatchPool::post(Task task) {
+  ++impl_->inFlight;
+  if (tFollowUps && tFollowUps->pool == this) {
+    tFollowUps->tasks.push_back(std::move(task));
+    return;
+  }
+  enqueue(std::move(task));
+}
+
+void DispatchPool::enqueue(Task task) {
   Impl& p = *impl_;
   std::unique_lock<std::mutex> guard(p.lock);
-  ++p.inFlight;
   p.tasks.push_back(std::move(task));
   if (p.stopping) return;  // never runs; destroyed with the pool
   // Every waiting worker takes one task; beyond them a new worker starts, up to the limit.
@@ -203,14 +323,38 @@ unsigned DispatchPool::threadCount() const { return impl_->limit; }
 void* DispatchPool::nativeContext() {
   Impl& p = *impl_;
   std::lock_guard<std::mutex> guard(p.lock);
-  if (!p.reactor.joinable() && !p.stopping) {
+  if (p.reactorThreads.empty() && !p.stopping && !p.reactorStopping) {
     p.reactorWork.emplace(p.context.get_executor());
-    p.reactor = std::thread([&p] {
-      nameThisThread("tavixd-io");
-      p.context.run();
-    });
+    p.startReactorThread();
   }
   return &p.context;
+}
+
+bool DispatchPool::mayAnswerOnReactor() const {
+  return tLeads == this && impl_->reactorSpare.load(std::memory_order_relaxed) > 0;
+}
+
+void DispatchPool::aboutToWait() {
+  if (tFollowUps && !tFollowUps->tasks.empty()) {
+    // What it waits for may be among them.
+    auto pending = std::move(tFollowUps->tasks);
+    tFollowUps->tasks.clear();
+    for (auto& task : pending) tFollowUps->pool->enqueue(std::move(task));
+  }
+  if (tLeads) tLeads->handOffReactor();
+}
+
+void DispatchPool::handOffReactor() {
+  tLeads = nullptr;  // this thread stands by once its handler returns
+  Impl& p = *impl_;
+  std::lock_guard<std::mutex> guard(p.lock);
+  p.reactorLed = false;
+  if (p.reactorStopping) return;
+  if (p.reactorStandby > 0) {
+    p.reactorTurn.notify_one();
+  } else {
+    p.startReactorThread();  // past the limit too: a handler that waits must never hold the reactor
+  }
 }
 
 // A serial queue is a list of tasks and an owner: at most one thread at a time "is on" the queue
@@ -332,6 +476,38 @@ void SerialQueue::async(Task task) {
   if (!impl_->owned && !impl_->drainPosted) impl_->postDrain(impl_);
 }
 
+void SerialQueue::runHereOrAsync(Task task) {
+  Impl& q = *impl_;
+  std::unique_lock<std::mutex> guard(q.lock);
+  if (q.owned || !q.items.empty()) {
+    guard.unlock();
+    return async(std::move(task));
+  }
+  q.owned = true;
+  guard.unlock();
+  q.pool.beginWork();  // counted like queued work, so that drain() waits for it
+  {
+    CollectFollowUps followUps(&q.pool);
+    {
+      OnQueue on(&q);
+      task();
+    }
+    task = nullptr;
+    // What the task posted goes to a worker in one piece (each was counted when posted), where it
+    // joins that worker's own follow-ups.
+    if (!followUps.tasks().empty()) {
+      q.pool.beginWork();
+      q.pool.enqueue([pending = std::make_shared<std::deque<Task>>(std::move(followUps.tasks()))] {
+        for (auto& t : *pending) tFollowUps->tasks.push_back(std::move(t));
+      });
+    }
+  }
+  q.pool.endWork();
+  guard.lock();
+  // Whatever was queued or began to wait meanwhile goes to a worker or to its waiter.
+  q.release(guard, impl_);
+}
+
 void SerialQueue::sync(const Task& task) {
   if (isCurrent()) die("sync onto queue '" + label_ + "' from itself would deadlock");
   Impl& q = *impl_;
@@ -347,6 +523,7 @@ void SerialQueue::sync(const Task& task) {
       q.items.pop_front();                       // our own entry
       break;
     }
+    DispatchPool::aboutToWait();
     q.changed.wait(guard);
   }
   guard.unlock();
@@ -382,15 +559,26 @@ void ReaderWriterQueue::read(const Task& task) {
   {
     std::unique_lock<std::mutex> guard(progressLock_);
     const std::uint64_t mustSee = submittedWrites_;
-    progress_.wait(guard, [&] { return finishedWrites_ >= mustSee; });
+    if (finishedWrites_ < mustSee) {
+      DispatchPool::aboutToWait();
+      progress_.wait(guard, [&] { return finishedWrites_ >= mustSee; });
+    }
   }
-  std::shared_lock<std::shared_mutex> shared(access_);
+  std::shared_lock<std::shared_mutex> shared(access_, std::try_to_lock);
+  if (!shared.owns_lock()) {
+    DispatchPool::aboutToWait();
+    shared.lock();
+  }
   task();
 }
 
 void ReaderWriterQueue::runWrite(const Task& task) {
   {
-    std::unique_lock<std::shared_mutex> exclusive(access_);
+    std::unique_lock<std::shared_mutex> exclusive(access_, std::try_to_lock);
+    if (!exclusive.owns_lock()) {
+      DispatchPool::aboutToWait();
+      exclusive.lock();
+    }
     task();
   }
   std::lock_guard<std::mutex> guard(progressLock_);

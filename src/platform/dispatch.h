@@ -31,7 +31,13 @@ void nameThisThread(const char* name);
 //
 // Workers start as work needs them, up to the limit, and one that has found nothing to do for
 // `idleExit` leaves: an idle process keeps no worker and no timer. Sockets, timers and signals
-// (nativeContext()) run on one reactor thread of their own, started by the first that needs it.
+// (nativeContext()) run on a reactor of their own, started by the first that needs it.
+//
+// The reactor is led by one thread at a time, which waits on the sockets and timers and runs
+// their handlers; an event wakes no other thread. A handler may answer a call in place
+// (mayAnswerOnReactor()): should the call wait, its thread hands the reactor to a standby thread
+// first (aboutToWait()), so that no socket or timer ever waits with it, and stands by itself once
+// the call is done. Standby threads start as hand-offs need them and leave after `idleExit`.
 class DispatchPool {
  public:
   explicit DispatchPool(unsigned threads = 0, Duration idleExit = seconds(10));  // 0: a size fit for the machine
@@ -40,6 +46,8 @@ class DispatchPool {
   DispatchPool& operator=(const DispatchPool&) = delete;
 
   // Runs `task` on some pool thread: the platform's "global queue". No ordering between tasks.
+  // Posted from a pool task, it runs on the same thread once that task is done (unless the task
+  // waits first): work that follows from work wakes no other thread.
   void post(Task task);
 
   // Waits until every task posted so far, and everything they post in turn, has run.
@@ -55,9 +63,18 @@ class DispatchPool {
   // The most workers that run at once.
   unsigned threadCount() const;
 
+  // From a handler of the reactor: answers true when a call may run here, in place, because
+  // another thread can take the reactor over should the call wait. Elsewhere false: the caller
+  // hands its work to a queue.
+  bool mayAnswerOnReactor() const;
+
+  // Every wait of the daemon calls this just before it blocks: on the thread leading a reactor it
+  // hands the reactor to another thread first. Cheap, and a no-op on any other thread.
+  static void aboutToWait();
+
   // The Asio io_context behind the pool's sockets and timers, as an opaque pointer for the few
   // platform pieces that need it. Cast with asioContext() in platform sources. The first call
-  // starts the reactor thread, so handlers on it must be short: they hand work to a queue.
+  // starts the reactor. Its handlers are short, or call aboutToWait() before they block.
   void* nativeContext();
 
  private:
@@ -67,6 +84,9 @@ class DispatchPool {
   void dropPending();
   void beginWork();
   void endWork();
+  void handOffReactor();
+  // Puts a task already counted in flight on the pool's list, waking or starting a worker.
+  void enqueue(Task task);
 
   struct Impl;
   std::unique_ptr<Impl> impl_;
@@ -87,6 +107,11 @@ class SerialQueue {
 
   // Queues `task` and returns at once.
   void async(Task task);
+
+  // As async(), but when nobody is on the queue and nothing waits on it, runs `task` here and now
+  // instead: the same order, without waking a second thread. For a caller that would otherwise
+  // only hand the task over and wait for the next event (a reactor handler, for instance).
+  void runHereOrAsync(Task task);
 
   // Runs `task` on the queue and waits for it; the task runs on the calling thread, after every
   // task queued before it (which the caller may run too). Never call sync() on the queue you are running

@@ -16,6 +16,7 @@
 
 #include <asio/post.hpp>
 #include <asio/posix/stream_descriptor.hpp>
+#include <asio/strand.hpp>
 
 #include "platform/asio_context.h"
 
@@ -88,7 +89,7 @@ void raiseMemoryPressure(std::uint32_t event) {
 // the stall passed the threshold. Waited on by the pool's reactor; judged on the monitor's queue.
 struct PressureStallMonitor::Trigger : std::enable_shared_from_this<Trigger> {
   Trigger(SerialQueue& queue, Clock& clock, Duration window, int fd)
-      : descriptor(asioContext(queue.pool()), fd), queue(queue), clock(clock), window(window) {}
+      : descriptor(asio::make_strand(asioContext(queue.pool())), fd), queue(queue), clock(clock), window(window) {}
 
   void wait() {
     descriptor.async_wait(asio::posix::stream_descriptor::wait_error, [self = shared_from_this()](const std::error_code& ec) {
@@ -117,7 +118,7 @@ struct PressureStallMonitor::Trigger : std::enable_shared_from_this<Trigger> {
     });
   }
 
-  asio::posix::stream_descriptor descriptor;  // on the reactor once waiting
+  asio::posix::stream_descriptor descriptor;  // on its strand: the close may race the wait otherwise
   SerialQueue& queue;
   Clock& clock;
   const Duration window;

@@ -235,8 +235,7 @@ void ClientState::searchResponseArrived(const TVXSearchRequest& request, const T
       queryCache_->set(Ref<CachedResultSet>(new CachedResultSet(input, &httpRequest, *first, request.uuid, data, now)));
     }
   }
-  endNetworkFeedback(start, parsed ? &*parsed : nullptr, data.size(), status, timing, queryId);
-
+  const std::size_t responseSize = data.size();
   TVXReply result;
   result.scale = request.scale;
   if (request.verboseReply) {
@@ -247,6 +246,8 @@ void ClientState::searchResponseArrived(const TVXSearchRequest& request, const T
   result.geoSessionEntityString = geoSessionEntityString();
   result.localSuggestions = localSuggestions;
   reply(queryId, std::move(result), jsonError);
+  // The client has its answer; the bookkeeping follows.
+  endNetworkFeedback(start, parsed ? &*parsed : nullptr, responseSize, status, timing, queryId);
 
   if (auto forceFetch = response->headers.get("X-Norvel-ForceFetch")) {
     const auto value = platform::parseJson(*forceFetch);

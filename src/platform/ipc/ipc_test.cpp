@@ -6,8 +6,10 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <condition_variable>
 #include <mutex>
 
+#include "platform/clock.h"
 #include "platform/ipc/frame.h"
 #include "platform/ipc/server.h"
 #include "platform/ipc/unix_socket.h"
@@ -173,6 +175,56 @@ TEST(IpcServer, PeerThatStopsReadingIsDisconnected) {
   }
   EXPECT_TRUE(testing::waitFor([&] { return r.invalidations == 1; }));
   EXPECT_TRUE(capture.contains("peer does not read"));
+}
+
+TEST(IpcServer, CallsThatWaitNeverHoldEveryReactorThread) {
+  // A call may be answered on the reactor thread that read it; two calls that both wait must
+  // still leave a thread to read the third, which is what they wait for.
+  DispatchPool pool(4);
+  SystemClock clock(pool);
+  Logger log("test", "ipc");
+  std::mutex lock;
+  std::condition_variable changed;
+  int entered = 0;
+  bool thirdArrived = false;
+  std::vector<UniqueFd> peers;
+  std::vector<std::shared_ptr<IpcConnection>> connections;
+  for (int i = 0; i < 3; ++i) {
+    int pair[2];
+    ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair), 0);
+    peers.emplace_back(pair[1]);
+    auto c = IpcConnection::make(pool, UniqueFd(pair[0]), {::getpid(), ::getuid(), ::getgid()}, "test", log);
+    c->start(
+        [&, i](std::string) {
+          std::unique_lock guard(lock);
+          if (i == 2) {
+            thirdArrived = true;
+          } else {
+            ++entered;
+            changed.notify_all();
+            // Bounded only so that a failure ends the test instead of hanging it.
+            clock.waitFor(guard, changed, seconds(10), [&] { return thirdArrived; });
+          }
+          changed.notify_all();
+        },
+        [] {});
+    connections.push_back(c);
+  }
+  auto call = [&](int i) {
+    std::size_t sent = 0;
+    ASSERT_FALSE(sendWithFds(peers[i].get(), encodeFrame("wait"), {}, true, &sent));
+  };
+  for (int i = 0; i < 2; ++i) {
+    call(i);
+    std::unique_lock guard(lock);
+    changed.wait(guard, [&] { return entered == i + 1; });
+  }
+  call(2);
+  {
+    std::unique_lock guard(lock);
+    EXPECT_TRUE(changed.wait_for(guard, std::chrono::seconds(10), [&] { return thirdArrived; }));
+  }
+  pool.drain();
 }
 
 TEST(IpcServer, RefusesPeersOfAnotherUser) {

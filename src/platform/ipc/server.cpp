@@ -169,13 +169,18 @@ IpcConnection::Impl::Delivery IpcConnection::Impl::deliverFrames(const std::shar
     }
     impl.calls->unanswered.fetch_add(1);
     CallHold hold(impl.calls.get(), [calls = impl.calls](void*) { release(calls); });
-    // Never here: this is the reactor's one thread, and a call may wait (for the first bag, for
-    // the completion database) where every other socket and timer would wait with it.
-    self->queue_.async([self, hold = std::move(hold), p = std::move(*payload)]() mutable {
+    Task call = [self, hold = std::move(hold), p = std::move(*payload)]() mutable {
       self->currentCall_ = std::move(hold);
       if (self->impl_->onMessage) self->impl_->onMessage(std::move(p));
       self->currentCall_.reset();
-    });
+    };
+    // Answered here, on the thread that read it, when the connection's queue is free: a call that
+    // then waits (for the first bag, for the completion database) hands the reactor over first.
+    if (self->queue_.pool().mayAnswerOnReactor()) {
+      self->queue_.runHereOrAsync(std::move(call));
+    } else {
+      self->queue_.async(std::move(call));
+    }
   }
   if (!impl.paused) {
     impl.paused = true;
