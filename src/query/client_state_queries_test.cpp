@@ -1,13 +1,11 @@
-// The other query kinds and warming against the development server, including a back end that
-// hangs, resets the connection or answers garbage.
+// The other query kinds against the development server, including a back end that hangs, resets
+// the connection or answers garbage.
 #include <gtest/gtest.h>
 
 #include <fstream>
 #include <functional>
 #include <future>
 
-#include "core/diagnostics.h"
-#include "platform/counters.h"
 #include "core/names.h"
 #include "support/query_fixture.h"
 
@@ -110,8 +108,6 @@ TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
 TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
   serveBag(bagWith({{"more_results_url", server.baseURL() + "/more?q=camera%20bag"}}));
   auto state = make("com.norvel.seekara", "Seekara/1.0");
-  const std::string noConnection = createCounterKey("seekara", "fedapicall.noconnection");
-  const auto before = TavixDiagnosticDataReporter::store().value(noConnection);
 
   // They follow a result the client already has: without a bag of its own the state does not
   // wait for one, and the failure is recorded like any other.
@@ -125,7 +121,7 @@ TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
   EXPECT_EQ(recordsOfType(*state, kFeedbackTypeError).size(), 1u);
   ASSERT_TRUE(state->ensureBag());
 
-  // A transport failure is not retried: no deadline, no retry. It is counted against the client.
+  // A transport failure is not retried: no deadline, no retry.
   fault("/more", {{"reset", true}, {"times", 1}});
   auto more = std::make_shared<TVXMoreResultsRequest>();
   more->queryId = 43;
@@ -133,8 +129,6 @@ TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
   state->moreResults(more, lost.block());
   EXPECT_TRUE(lost.first().error);
   EXPECT_EQ(received("/more").size(), 1u);
-  EXPECT_TRUE(testing::waitFor(
-      [&] { return TavixDiagnosticDataReporter::store().value(noConnection) == before + 2; }, 5000));
   EXPECT_EQ(recordsOfType(*state, kFeedbackTypeError, 2).size(), 2u);
 
   card->queryId = 40;
@@ -160,15 +154,13 @@ TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
   ASSERT_TRUE(call.error);
   EXPECT_EQ(call.error->domain, kTVXHTTPStatusErrorDomain);
   EXPECT_EQ(call.error->code, 404);
-  // A failure without a transport error: an empty error record and the end record with the
-  // status, but the connection is not counted as lost.
+  // A failure without a transport error: an empty error record and the end record with the status.
   auto errors = recordsOfType(*state, kFeedbackTypeError, 3);
   ASSERT_EQ(errors.size(), 3u);
   EXPECT_EQ(errors[2].payload().error().code(), 0);
   auto ends = recordsOfType(*state, kFeedbackTypeNetworkSearchEnd, 3);
   ASSERT_EQ(ends.size(), 3u);
   EXPECT_EQ(ends[2].payload().network_search_end().status_code(), 404);
-  EXPECT_EQ(TavixDiagnosticDataReporter::store().value(noConnection), before + 2);
   EXPECT_EQ(received("/card").size(), 2u);
 
   // More results: an object where a list belongs is a failure.
@@ -307,27 +299,6 @@ TEST_F(VirtualTimeTest, ALookupIsRetriedOnlyUntilItsRenderDeadline) {
   send("POST", "/_reset");
   EXPECT_TRUE(late.first().error);
   EXPECT_TRUE(received("/search").empty()) << "retried past the deadline";
-}
-
-TEST_F(VirtualTimeTest, TwoWarmsWithin30SecondsSendOneRequest) {
-  serveBag(bagWith());
-  auto state = make("com.norvel.seekara", "Seekara/1.0");
-  state->warm();
-  state->warm();
-  auto ends = recordsOfType(*state, kFeedbackTypeNetworkSearchEnd);
-  ASSERT_EQ(ends.size(), 1u);
-  EXPECT_EQ(ends[0].payload().network_search_end().status_code(), 204);
-  auto starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart);
-  ASSERT_EQ(starts.size(), 1u);
-  EXPECT_EQ(starts[0].payload().network_search_start().trigger_event(), 19);
-  EXPECT_EQ(received("/warm").size(), 1u);
-
-  clock.advance(platform::seconds(29));
-  state->warm();
-  clock.advance(platform::seconds(2));
-  state->warm();
-  EXPECT_EQ(recordsOfType(*state, kFeedbackTypeNetworkSearchEnd, 2).size(), 2u);
-  EXPECT_EQ(received("/warm").size(), 2u);
 }
 
 }  // namespace
