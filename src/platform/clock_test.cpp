@@ -2,15 +2,10 @@
 
 #include <gtest/gtest.h>
 
-#include <atomic>
 #include <chrono>
 #include <cmath>
-#include <condition_variable>
-#include <future>
 #include <limits>
 #include <vector>
-
-#include "support/temp_home.h"
 
 namespace tavix::platform {
 namespace {
@@ -55,38 +50,6 @@ TEST_F(VirtualClockTest, FiresInDueOrderWithTiesInOrderSetAndFollowsTimersSetByT
   clock.after(seconds(20), queue, [&] { order.push_back("c@20"); });
   clock.advance(seconds(30));
   EXPECT_EQ(order, (std::vector<std::string>{"a@10", "nested@15", "b@20", "c@20"}));
-}
-
-TEST_F(VirtualClockTest, AWaitEndsWhenItsConditionHoldsOrWhenTimeReachesItsDeadline) {
-  std::mutex lock;
-  std::condition_variable signal;
-  bool ready = false;
-  auto wait = [&](double timeout) {
-    std::unique_lock hold(lock);
-    return clock.waitFor(hold, signal, seconds(timeout), [&] { return ready; });
-  };
-
-  // Time passes during the wait: only reaching the deadline ends it.
-  auto timedOut = std::async(std::launch::async, wait, 5.0);
-  clock.awaitParked(1);
-  const TimePoint parkedAt = clock.now();
-  clock.advance(seconds(4.999));
-  EXPECT_EQ(clock.parkedWaiters(), 1u);
-  clock.advance(seconds(0.001));
-  EXPECT_FALSE(timedOut.get());
-  EXPECT_EQ(clock.now() - parkedAt, seconds(5));
-
-  // A timer on the way that makes the condition true ends it long before its deadline.
-  auto signalled = std::async(std::launch::async, wait, 60.0);
-  clock.awaitParked(1);
-  clock.after(seconds(2), queue, [&] {
-    std::lock_guard hold(lock);
-    ready = true;
-    signal.notify_all();
-  });
-  clock.advance(seconds(3));
-  EXPECT_TRUE(signalled.get());
-  EXPECT_TRUE(wait(0)) << "a condition already true needs no time";
 }
 
 TEST_F(VirtualClockTest, RepeatingTimerRunsEveryIntervalUntilStopped) {

@@ -73,13 +73,6 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
   ASSERT_TRUE(call.reply);
   EXPECT_EQ(call.reply->localSuggestions.size(), 2u);
   EXPECT_EQ(seekara->completionCacheSuggestions().size(), 1u);
-  // One character short of the smart-history minimum: still looked for, marked as such.
-  Replies shorter;
-  seekara->search(request<TVXSearchRequest>(4, "z", 21), shorter.block());
-  shorter.first();
-  localStart = recordsOfType(*seekara, kFeedbackTypeLocalSearchStart, 2);
-  ASSERT_EQ(localStart.size(), 2u);
-  EXPECT_EQ(localStart[1].payload().local_search_start().trigger_event(), 19);
 }
 
 TEST_F(SearchTest, TheSameKeystrokeTwiceIsServedFromTheQueryCache) {

@@ -18,7 +18,6 @@ TEST(URL, LenientParsingTakesTypedAndSloppyAddresses) {
   const std::vector<std::pair<std::string, std::string>> cases = {
       // libcurl's scheme guess would give ftp, its default scheme https.
       {"ftp.example.com/x", "http|ftp.example.com|-|/x|-|-"},
-      {"HTTP://u:p@A.com:0080", "http|A.com|80|/|-|-"},
       // Blanks and non-ASCII bytes stay as written: "+" for a blank would make "a b" equal "a+b".
       {" http://a.com/x y?z w#v u\n", "http|a.com|-|/x y|z w|v u"},
       {"http://münchen.de/straße?ü", "http|münchen.de|-|/straße|ü|-"},
@@ -27,7 +26,6 @@ TEST(URL, LenientParsingTakesTypedAndSloppyAddresses) {
       // A scheme without an authority: not "user:password@host" with no scheme.
       {"mailto:a@b.com", "refused"},
       {"http://a b.com/", "refused"},
-      {"http://a.com:65536/", "refused"},
   };
   for (const auto& [text, parts] : cases) EXPECT_EQ(leniently(text), parts) << text;
   for (const char* strictlyRefused : {"a.com/x", "http://a.com/x y"}) {
