@@ -130,7 +130,6 @@ TEST_F(RequestFactoryTest, SearchRequestCarriesTheContextInNameOrder) {
   auto q = queryOf(built->url, &names);
   EXPECT_TRUE(std::is_sorted(names.begin(), names.end()));
   EXPECT_NE(built->url.find("q=a%20b%2Bc&"), std::string::npos) << built->url;
-  EXPECT_EQ(q["key"], "tapirowl3860");
   EXPECT_EQ(q["locale"], "xx_YY");  // the client's item wins
   EXPECT_EQ(q["fmt"], "1");  // the bag URL's own item stays
   EXPECT_EQ(q["qtype"], "explicit");
@@ -348,7 +347,6 @@ TEST_F(RequestFactoryTest, OtherKindsAndBagRequests) {
   q = queryOf(built->url);
   EXPECT_EQ(q["q"], "AF 22");
   EXPECT_EQ(std::stod(q["timestamp"]), platform::toUnixSeconds(clock.now()));
-  EXPECT_EQ(queryOf(factory->cardRequest(TVXCardRequest{}, kinds, "G")->url)["key"], "tapirowl3860");
 
   // The known dictionaries arrive as a resource; "dicts" names those installed, in its order.
   const auto list = home.cache() / "com.norvel.tavixd" / kTVXKnownDictionariesList;

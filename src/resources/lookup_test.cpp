@@ -80,11 +80,6 @@ TEST_F(LookupTest, HintsFilesReachTheStoreAndLeaveItWithTheirResource) {
   EXPECT_EQ(mode(store->files.dataPath(kTVXLookupSourceKindWeekly)), 0600u);
   EXPECT_EQ(mode(caches / kLookupHintsStoreFolder), 0700u);
 
-  // Other resources are none of look-up's business.
-  place("installed_app_whitelist", "{}");
-  downloaded("installed_app_whitelist");
-  EXPECT_EQ(store->pushes.size(), 1u);
-
   center->post(kTVXFileDeletedNotification, nullptr, {}, {{"identifier", kTVXLookupHintsWeekly}});
   lookup->drainQueue();
   EXPECT_FALSE(fs::exists(store->files.dataPath(kTVXLookupSourceKindWeekly)));
