@@ -305,7 +305,6 @@ TEST_F(RequestFactoryTest, FailuresAndAuthorisationChangesSetTheReason) {
   ASSERT_TRUE(delegate);
   delegate->didFailWithError("no fix");
   factory->flushContextAccessQueue();
-  EXPECT_EQ(factory->geoLocationSource(), "error.fail");
   EXPECT_EQ(queryOf(factory->searchRequest(TVXSearchRequest{}, searchBag, "G")->url)["geosrc"], "error.fail");
 
   location->status = TVXLocationAuthorizationWhenInUse;
