@@ -2,6 +2,7 @@
 // the connection or answers garbage.
 #include <gtest/gtest.h>
 
+#include <deque>
 #include <fstream>
 #include <functional>
 #include <future>
@@ -108,14 +109,19 @@ TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
 TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
   serveBag(bagWith({{"more_results_url", server.baseURL() + "/more?q=camera%20bag"}}));
   auto state = make("com.norvel.seekara", "Seekara/1.0");
+  std::deque<Replies> replies;  // kept alive: a second answer is a fault to see, not a crash
+  auto card = [&](std::uint64_t id, int ms = 10000) {
+    state->card(request<TVXCardRequest>(id, "", 14), replies.emplace_back().block());
+    return replies.back().first(ms);
+  };
+  auto more = [&](std::uint64_t id) {
+    state->moreResults(request<TVXMoreResultsRequest>(id, ""), replies.emplace_back().block());
+    return replies.back().first();
+  };
 
   // They follow a result the client already has: without a bag of its own the state does not
   // wait for one, and the failure is recorded like any other.
-  auto card = std::make_shared<TVXCardRequest>();
-  card->queryId = 39;
-  Replies noBag;
-  state->card(card, noBag.block());
-  auto call = noBag.first(0);
+  auto call = card(39, 0);
   ASSERT_TRUE(call.error) << "answered at once";
   EXPECT_EQ(call.error->domain, platform::http::kURLErrorDomain);
   EXPECT_EQ(recordsOfType(*state, kFeedbackTypeError).size(), 1u);
@@ -123,19 +129,11 @@ TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
 
   // A transport failure is not retried: no deadline, no retry.
   fault("/more", {{"reset", true}, {"times", 1}});
-  auto more = std::make_shared<TVXMoreResultsRequest>();
-  more->queryId = 43;
-  Replies lost;
-  state->moreResults(more, lost.block());
-  EXPECT_TRUE(lost.first().error);
+  EXPECT_TRUE(more(43).error);
   EXPECT_EQ(received("/more").size(), 1u);
   EXPECT_EQ(recordsOfType(*state, kFeedbackTypeError, 2).size(), 2u);
 
-  card->queryId = 40;
-  card->triggerEvent = 14;
-  Replies good;
-  state->card(card, good.block());
-  call = good.first();
+  call = card(40);
   ASSERT_TRUE(call.reply);
   EXPECT_EQ(call.reply->data.front(), '[');
   // The more-results record takes its input from the "q" of the URL the bag gives.
@@ -146,10 +144,7 @@ TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
 
   // A server's status is the server's: not in the daemon's own error domain.
   fault("/card", {{"status", 404}, {"body", ""}, {"times", 1}});
-  Replies missing;
-  card->queryId = 41;
-  state->card(card, missing.block());
-  call = missing.first();
+  call = card(41);
   EXPECT_FALSE(call.reply);
   ASSERT_TRUE(call.error);
   EXPECT_EQ(call.error->domain, kTVXHTTPStatusErrorDomain);
@@ -165,10 +160,7 @@ TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
 
   // More results: an object where a list belongs is a failure.
   fault("/more", {{"body", "{\"results\": []}"}, {"times", 1}});
-  more->queryId = 42;
-  Replies notAList;
-  state->moreResults(more, notAList.block());
-  EXPECT_TRUE(notAList.first().error);
+  EXPECT_TRUE(more(42).error);
   EXPECT_EQ(recordsOfType(*state, kFeedbackTypeError, 4).size(), 4u);
   EXPECT_EQ(received("/more").size(), 2u);
 }
@@ -176,24 +168,15 @@ TEST_F(QueriesTest, CardsAndMoreResultsNeedStatus200AndAListAndGoOutOnce) {
 TEST_F(QueriesTest, LookupsFlightsAndZeroKeywordRecordWhatTheyAskedFor) {
   serveBag(bagWith());
   auto state = make("com.norvel.lookup", "Lookup/1.0");
-  auto lookup = std::make_shared<TVXLookupRequest>();
-  lookup->queryId = 50;
-  lookup->queryString = "serendipity";
-  lookup->lookupSelectionType = TVXLookupSelectionTypeExplicit;
   Replies replies;
-  state->lookup(lookup, replies.block());
-  auto call = replies.first();
-  ASSERT_TRUE(call.reply);
-  auto zkw = std::make_shared<TVXZeroKeywordRequest>();
-  zkw->queryId = 51;
-  zkw->triggerEvent = 9;
+  state->lookup(request<TVXLookupRequest>(50, "serendipity"), replies.block());
+  ASSERT_TRUE(replies.first().reply);
   Replies suggestions;
-  state->zeroKeyword(zkw, suggestions.block());
-  call = suggestions.first();
+  state->zeroKeyword(request<TVXZeroKeywordRequest>(51, "", 9), suggestions.block());
+  auto call = suggestions.first();
   ASSERT_TRUE(call.reply);
   EXPECT_NE(call.reply->data.find("\"zkw\""), std::string::npos);
-  auto flight = std::make_shared<TVXFlightSearchRequest>();
-  flight->queryId = 52;
+  auto flight = request<TVXFlightSearchRequest>(52, "");
   flight->flightQuery = "UA 123";
   Replies flights;
   state->flightSearch(flight, flights.block());
@@ -227,8 +210,7 @@ TEST_F(QueriesTest, FlightDebugDataAnswersFromTheLocalFileWithoutTheNetwork) {
   defaults->setObject("TVXFlightUseDebugData", true);
   defaults->setObject("TVXFlightDebugDataLocation", "file://" + file.string());
   auto state = make("com.norvel.flightinfo", "FlightInfo/1.0");
-  auto flight = std::make_shared<TVXFlightSearchRequest>();
-  flight->queryId = 60;
+  auto flight = request<TVXFlightSearchRequest>(60, "");
   flight->flightQuery = "lh 400";
   Replies found;
   state->flightSearch(flight, found.block());
