@@ -259,14 +259,11 @@ TEST_F(VirtualTimeTest, ALookupIsRetriedOnlyUntilItsRenderDeadline) {
   // searchRenderTimeout 2000 ms: the deadline is 1.5 s after the request goes out.
   serveBag(bagWith({{"search_render_timeout_ms", 2000}}));
   auto state = make("com.norvel.lookup", "Lookup/1.0");
-  auto lookup = std::make_shared<TVXLookupRequest>();
-  lookup->queryString = "serendipity";
 
   // Before the deadline every reset is retried: the first attempt and three retries.
   fault("/search", {{"reset", true}});
   Replies inTime;
-  lookup->queryId = 70;
-  state->lookup(lookup, inTime.block());
+  state->lookup(request<TVXLookupRequest>(70, "serendipity"), inTime.block());
   EXPECT_TRUE(inTime.first().error);
   EXPECT_EQ(received("/search").size(), 4u);
 
@@ -274,8 +271,7 @@ TEST_F(VirtualTimeTest, ALookupIsRetriedOnlyUntilItsRenderDeadline) {
   // the deadline, then reset. A retry would now be answered.
   fault("/search", {{"hang", true}, {"reset", true}, {"times", 1}});
   Replies late;
-  lookup->queryId = 71;
-  state->lookup(lookup, late.block());
+  state->lookup(request<TVXLookupRequest>(71, "serendipity"), late.block());
   ASSERT_TRUE(testing::waitFor([&] { return received("/search").size() == 5; }));
   clock.advance(platform::seconds(1.6));
   send("POST", "/_reset");
