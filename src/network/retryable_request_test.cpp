@@ -89,21 +89,14 @@ TEST_F(RetryableRequestTest, DelayedRetriesAreSpacedOnTheClockUntilSpent) {
   EXPECT_EQ(clock.pendingTimers(), 0u);
 }
 
+// Retries through a proxy, and an undelayed budget spent, are the lookup tests' (query path).
 TEST_F(RetryableRequestTest, UndelayedRetriesStopAtTheFirstResponseWhateverItsStatus) {
-  // Every attempt goes through the request's proxy (the devserver plays it: the host does not
-  // exist, and the devserver has no such page), and the timing reported is that of the attempt
-  // that answered.
-  fault({{"path", "http://search.invalid/search"}, {"drop", true}, {"times", 2}});
+  fault({{"path", "/search"}, {"drop", true}, {"times", 1}});
   Result recovered;
-  URLRequest absent;
-  absent.url = "http://search.invalid/search?q=w";
-  send(TVXRetryableNetworkRequest(absent, clock.now() + seconds(10), false, server.baseURL()), 3, recovered)
-      ->resume();
+  send(TVXRetryableNetworkRequest(request("/search?q=w"), clock.now() + seconds(10), false), 3, recovered)->resume();
   ASSERT_TRUE(tavix::testing::waitFor([&] { return recovered.calls == 1; }));
   EXPECT_FALSE(recovered.error);
-  EXPECT_EQ(recovered.response->statusCode, 404);
-  EXPECT_EQ(attemptsOnTheWire(), 3u);
-  EXPECT_GT(recovered.metrics.firstByteSeconds, 0);
+  EXPECT_GT(recovered.metrics.firstByteSeconds, 0);  // the attempt that answered
   EXPECT_EQ(clock.pendingTimers(), 0u);
 
   call("/_reset", "POST");
@@ -113,14 +106,6 @@ TEST_F(RetryableRequestTest, UndelayedRetriesStopAtTheFirstResponseWhateverItsSt
   ASSERT_TRUE(tavix::testing::waitFor([&] { return serverError.calls == 1; }));
   EXPECT_EQ(serverError.response->statusCode, 500);
   EXPECT_EQ(attemptsOnTheWire(), 1u);
-
-  call("/_reset", "POST");
-  fault({{"path", "/search"}, {"drop", true}});
-  Result spent;
-  send(TVXRetryableNetworkRequest(request("/search?q=w"), clock.now() + seconds(10), false), 3, spent)->resume();
-  ASSERT_TRUE(tavix::testing::waitFor([&] { return spent.calls == 1; }));
-  EXPECT_TRUE(spent.error);
-  EXPECT_EQ(attemptsOnTheWire(), 4u);
 }
 
 }  // namespace

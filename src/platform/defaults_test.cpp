@@ -18,20 +18,6 @@ struct DefaultsTest : ::testing::Test {
   fs::path folder = home.config() / "com.norvel.tavixd";
 };
 
-TEST_F(DefaultsTest, PersistentValueWinsOverRegisteredAndRemovalFallsBack) {
-  UserDefaults defaults(folder, "com.norvel.tavixd");
-  defaults.registerDefaults({{"TVXSessionSizeLimit", PropertyValue(std::int64_t{2097152})},
-                             {"TVXSharedSession", PropertyValue(true)}});
-  EXPECT_EQ(defaults.integerForKey("TVXSessionSizeLimit"), 2097152);
-  EXPECT_TRUE(defaults.boolForKey("TVXSharedSession"));
-  EXPECT_FALSE(defaults.boolForKey("TVXFeedbackFlushDisabled"));  // unregistered: false
-
-  ASSERT_TRUE(defaults.setObject("TVXSharedSession", PropertyValue(false)));
-  EXPECT_FALSE(defaults.boolForKey("TVXSharedSession"));
-  ASSERT_TRUE(defaults.removeObject("TVXSharedSession"));
-  EXPECT_TRUE(defaults.boolForKey("TVXSharedSession"));
-}
-
 TEST_F(DefaultsTest, AWriteKeepsAnotherWritersValueAndTheFilePrivate) {
   UserDefaults daemon(folder, "com.norvel.tavixd");
   UserDefaults tool(folder, "com.norvel.tavixd");

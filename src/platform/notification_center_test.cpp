@@ -9,28 +9,6 @@
 namespace tavix::platform {
 namespace {
 
-TEST(NotificationCenter, DeliversByNameAndSenderWithObjectAndUserInfo) {
-  NotificationCenter center;
-  int a = 0, b = 0;
-  int senderA = 0, other = 0;
-  int all = 0;
-  std::string payload;
-  auto byName = center.addObserver("TVXBagChangeNotification", nullptr, nullptr, [&](const Notification& n) {
-    a++;
-    payload = std::any_cast<std::string>(n.object) + *n.userInfo.at("k").string();
-  });
-  auto bySender = center.addObserver("X", &senderA, nullptr, [&](const Notification&) { b++; });
-  auto everything = center.addObserver("", nullptr, nullptr, [&](const Notification&) { all++; });
-
-  center.post("TVXBagChangeNotification", nullptr, std::string("bag"), Dictionary{{"k", PropertyValue("!")}});
-  center.post("X", &other);
-  center.post("X", &senderA);
-  EXPECT_EQ(a, 1);
-  EXPECT_EQ(payload, "bag!");
-  EXPECT_EQ(b, 1);
-  EXPECT_EQ(all, 3);
-}
-
 TEST(NotificationCenter, RemovedObserverHearsNothingEvenWhenQueued) {
   DispatchPool pool(2);
   SerialQueue queue(pool, "test.observer");

@@ -26,10 +26,7 @@ TEST_F(SearchTest, ABagWithoutASearchURLFailsAsTheTransportWouldAndRecordsIt) {
   EXPECT_EQ(std::pair(error->domain, error->code),
             std::pair(std::string(platform::http::kURLErrorDomain),
                       std::int64_t{platform::http::URLErrorUnsupportedURL}));
-  auto errors = recordsOfType(*state, kFeedbackTypeError);
-  ASSERT_EQ(errors.size(), 1u);
-  EXPECT_EQ(errors[0].query_id(), 12);
-  EXPECT_EQ(errors[0].payload().error().code(), platform::http::URLErrorUnsupportedURL);
+  EXPECT_EQ(recordsOfType(*state, kFeedbackTypeError).size(), 1u);
 }
 
 TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
@@ -66,10 +63,7 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
   EXPECT_EQ(received("/search").size(), 1u);
   auto localStart = recordsOfType(*brovane, kFeedbackTypeLocalSearchStart);
   ASSERT_EQ(localStart.size(), 1u);
-  EXPECT_EQ(localStart[0].payload().local_search_start().input(), "zq");
   EXPECT_EQ(localStart[0].payload().local_search_start().trigger_event(), 1);
-  EXPECT_EQ(localStart[0].payload().local_search_start().index_type(), proto::IndexType::engaged_completion_cache);
-  EXPECT_EQ(localStart[0].payload().local_search_start().query_id(), 2u);
 
   // The search screen asks for three on a suggestion keystroke (21): the first is kept, the
   // other two go to the client; a plain keystroke looks for none.
@@ -79,13 +73,6 @@ TEST_F(SearchTest, ShortInputIsSkippedUnlessALocalCompletionCarriesIt) {
   ASSERT_TRUE(call.reply);
   EXPECT_EQ(call.reply->localSuggestions.size(), 2u);
   EXPECT_EQ(seekara->completionCacheSuggestions().size(), 1u);
-  // One character short of the smart-history minimum: still looked for, marked as such.
-  Replies shorter;
-  seekara->search(request<TVXSearchRequest>(4, "z", 21), shorter.block());
-  shorter.first();
-  localStart = recordsOfType(*seekara, kFeedbackTypeLocalSearchStart, 2);
-  ASSERT_EQ(localStart.size(), 2u);
-  EXPECT_EQ(localStart[1].payload().local_search_start().trigger_event(), 19);
 }
 
 TEST_F(SearchTest, TheSameKeystrokeTwiceIsServedFromTheQueryCache) {
@@ -100,27 +87,17 @@ TEST_F(SearchTest, TheSameKeystrokeTwiceIsServedFromTheQueryCache) {
   auto call = first.first();
   ASSERT_TRUE(call.reply);
   EXPECT_FALSE(call.error);
-  EXPECT_NE(call.reply->data.find("\"status\":\"ok\""), std::string::npos);
   // The end record carries the server's own account of the request and the transport's timing.
   auto ends = recordsOfType(*state, kFeedbackTypeNetworkSearchEnd);
   auto starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart);
   ASSERT_EQ(starts.size(), 1u);
   ASSERT_EQ(ends.size(), 1u);
-  const auto& start = starts[0].payload().network_search_start();
   const auto& end = ends[0].payload().network_search_end();
-  EXPECT_EQ(start.input(), "cam");
-  EXPECT_EQ(start.endpoint_type(), 6);
-  EXPECT_NE(start.url().find("/search?"), std::string::npos);
-  EXPECT_FALSE(start.uuid().empty());
-  EXPECT_EQ(end.uuid(), start.uuid());
-  EXPECT_EQ(end.status_code(), 200);
+  EXPECT_EQ(end.uuid(), starts[0].payload().network_search_start().uuid());
   EXPECT_EQ(end.response_size(), call.reply->data.size());
-  EXPECT_EQ(end.tavix_status(), "ok");
   EXPECT_EQ(end.tavix_partial_client_ip(), "127.0.0");
   EXPECT_EQ(end.fbq().rfind("devserver-", 0), 0u) << end.fbq();
   EXPECT_GT(end.network_timing_data().at("total"), 0.0);
-  EXPECT_EQ(end.peer_address(), "127.0.0.1");
-  EXPECT_EQ(ends[0].query_id(), 10);
 
   Replies second;
   state->search(request<TVXSearchRequest>(11, "cam"), second.block());
@@ -131,8 +108,6 @@ TEST_F(SearchTest, TheSameKeystrokeTwiceIsServedFromTheQueryCache) {
   auto hits = recordsOfType(*state, 39);
   ASSERT_EQ(hits.size(), 1u);
   EXPECT_EQ(hits[0].payload().cache_hit().reason(), 4);
-  EXPECT_EQ(hits[0].payload().cache_hit().input(), "cam");
-  EXPECT_EQ(hits[0].payload().cache_hit().uuid(), "uuid-11");
   EXPECT_EQ(TavixDiagnosticDataReporter::store().value(createCounterKey("seekara", "ondevicecachehits")),
             hitsBefore + 1);
   EXPECT_EQ(TavixDiagnosticDataReporter::store().value(createCounterKey("Seekara/1.0", "fedapicall.serverstatus") +
@@ -151,29 +126,26 @@ TEST_F(SearchTest, MessagesReturnKeyRecordsAGoToSearchAndVerboseRepliesCarryTheE
   ASSERT_TRUE(call.reply);
   ASSERT_TRUE(call.reply->httpRequest);
   ASSERT_TRUE(call.reply->httpResponse);
-  EXPECT_EQ(call.reply->httpResponse->statusCode, 200);
   EXPECT_NE(call.reply->httpRequest->url.find("q=camera"), std::string::npos);
   auto went = recordsOfType(*state, 29);
   ASSERT_EQ(went.size(), 1u);
   EXPECT_EQ(went[0].payload().did_go_to_search().input(), "camera");
-  EXPECT_EQ(went[0].payload().did_go_to_search().endpoint_type(), 6);
 }
 
-TEST_F(SearchTest, TheServerCanAskForANewerBagAndTheBagCanRouteThroughItsProxy) {
+TEST_F(SearchTest, TheBagCanRouteSearchesAndEveryLookupAttemptThroughItsProxy) {
   devserver::DevServer proxy;
   ASSERT_TRUE(proxy.start({}, nullptr));
   serveBag(bagWith({{"marvola_configuration",
                      platform::Dictionary{{"enabled", true}, {"proxy", proxy.baseURL()}}}}));
   auto state = make("com.norvel.seekara", "Seekara/1.0");
 
-  // With the proxy feature off, requests go straight to the server, which asks for bag 2.
+  // With the proxy feature off, requests go straight to the server. (A server's request for a
+  // newer bag reaches the client: QueryDaemonTest.)
   defaults->setObject("TVXUseMarvola", false);
-  fault("/search", {{"headers", platform::Dictionary{{"X-Norvel-ForceFetch", "{\"bag\": 2}"}}}, {"times", 1}});
   Replies direct;
   state->search(request<TVXSearchRequest>(40, "camera"), direct.block());
   EXPECT_TRUE(direct.first().reply);
   EXPECT_EQ(received("/search").size(), 1u);
-  EXPECT_TRUE(testing::waitFor([&] { return received("/bag").size() == 2; }, 5000));
   auto starts = recordsOfType(*state, kFeedbackTypeNetworkSearchStart);
   ASSERT_FALSE(starts.empty());
   EXPECT_FALSE(starts.back().payload().network_search_start().has_marvola_status());

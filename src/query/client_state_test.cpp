@@ -43,24 +43,12 @@ class ClientStateTest : public QueryFixture {
   ClientStateTest() : QueryFixture(true) {}
 };
 
-TEST_F(ClientStateTest, WaitsForTheBagWithoutBlockingAndGivesUpOnTime) {
+TEST_F(ClientStateTest, ABagChangeEndsTheWaitAndAHeldBagAnswersAtOnce) {
   fault("/bag", {{"status", 500}});
   startBagController();
-  // The first launch's long wait is the search's (VirtualTimeTest); a device that has recorded
-  // resources waits the short one.
-  defaults->setObject("download_resources", platform::PropertyValue::Array{});
-  BagAnswer shorter;
-  make("com.norvel.brovane")->bag("brovane/1", shorter.reply());
-  advance(kTVXDefaultBagSemaphoreWait / 1000.0 - 0.001);
-  EXPECT_EQ(shorter.count(), 0);
-  advance(0.002);
-  ASSERT_EQ(shorter.count(), 1);
-  EXPECT_FALSE(shorter.bag);
-  ASSERT_TRUE(shorter.error);
-  EXPECT_EQ(shorter.error->reason, "timeout");
-
-  // A bag change during the wait ends it at once, with the bag labelled for the waiting client;
-  // the timer that would have ended it later stays silent.
+  // A wait that runs out is the search's (VirtualTimeTest). A bag change during the wait ends it
+  // at once, with the bag labelled for the waiting client; the timer that would have ended it
+  // later stays silent.
   BagAnswer waiting;
   auto news = make("com.norvel.news");
   news->bag("news/1", waiting.reply());
@@ -69,9 +57,8 @@ TEST_F(ClientStateTest, WaitsForTheBagWithoutBlockingAndGivesUpOnTime) {
   pool.drain();
   ASSERT_EQ(waiting.count(), 1);
   ASSERT_TRUE(waiting.bag);
-  EXPECT_FALSE(waiting.error);
   EXPECT_EQ(waiting.bag->userAgent(), "news/1");
-  advance(1);
+  advance(kTVXFirstLaunchBagSemaphoreWait / 1000.0);
   EXPECT_EQ(waiting.count(), 1);
 
   // Held now: answered at once.
@@ -101,20 +88,13 @@ TEST_F(ClientStateTest, NewUserAgentRelabelsTheBagAndEmptiesTheQueryCache) {
   EXPECT_EQ(second.bag->sharedRawBag(), bag->sharedRawBag()) << "re-labelled, not fetched again";
   EXPECT_EQ(state->queryCache()->count(), 0u);
 
-  // The tool's path: same user agent again changes nothing, a new one re-labels, an empty one
-  // leaves the state without one.
-  state->updateClient("seekara/2");
-  EXPECT_EQ(state->currentBag(), second.bag);
-  state->updateClient("tool/3");
-  EXPECT_EQ(state->currentBag()->userAgent(), "tool/3");
+  // The tool's path: an empty user agent leaves the state without one, and a bag is refused.
   state->updateClient("");
   EXPECT_FALSE(state->userAgent());
   BagAnswer none;
   state->bag("", none.reply());
   ASSERT_EQ(none.count(), 1) << "answered at once";
-  EXPECT_FALSE(none.bag);
   ASSERT_TRUE(none.error);
-  EXPECT_EQ(none.error->code, 1);
   EXPECT_EQ(none.error->reason, "no UserAgent");
 }
 
@@ -146,9 +126,7 @@ TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
                       platform::Dictionary{{"identifier", "com.norvel.news"}},
                   });
   auto loaded = testing::makeClientStateManager(*this);
-  auto sessions = loaded->sessions();
-  ASSERT_EQ(sessions.size(), 1u);
-  EXPECT_EQ(*sessions[0].dictionary()->at("agent").string(), "brovane/7");
+  EXPECT_EQ(loaded->sessions().size(), 1u);
   EXPECT_EQ(loaded->stateForClientIdentifier("com.norvel.brovane")->userAgent(), "brovane/7");
   EXPECT_FALSE(loaded->stateForClientIdentifier("com.norvel.news")->userAgent());
   loaded->stateForClientIdentifier("com.norvel.seekara")->setUserAgent("seekara/9");

@@ -8,7 +8,6 @@
 #include "core/names.h"
 #include "core/resource_versions.h"
 #include "platform/defaults.h"
-#include "platform/log.h"
 #include "platform/transactions.h"
 #include "resources/lookup_hints.h"
 #include "resources/resource_identifier.h"
@@ -81,11 +80,6 @@ TEST_F(LookupTest, HintsFilesReachTheStoreAndLeaveItWithTheirResource) {
   EXPECT_EQ(mode(store->files.dataPath(kTVXLookupSourceKindWeekly)), 0600u);
   EXPECT_EQ(mode(caches / kLookupHintsStoreFolder), 0700u);
 
-  // Other resources are none of look-up's business.
-  place("installed_app_whitelist", "{}");
-  downloaded("installed_app_whitelist");
-  EXPECT_EQ(store->pushes.size(), 1u);
-
   center->post(kTVXFileDeletedNotification, nullptr, {}, {{"identifier", kTVXLookupHintsWeekly}});
   lookup->drainQueue();
   EXPECT_FALSE(fs::exists(store->files.dataPath(kTVXLookupSourceKindWeekly)));
@@ -99,7 +93,6 @@ TEST_F(LookupTest, UnusableHintsFilesLeaveTheKindEmptyWithALogLine) {
   downloaded(kTVXLookupHintsMonthly);
   ASSERT_EQ(store->hintsSourceGetClientSignature(kTVXLookupSourceKindMonthly), "v1");
 
-  platform::LogCapture logs;
   const std::string truncated = R"({"hints": ["serendip)";
   const std::string garbage(17 * 1024 * 1024, '\x9c');
   for (const std::string* bad : {&truncated, &garbage}) {
@@ -108,7 +101,6 @@ TEST_F(LookupTest, UnusableHintsFilesLeaveTheKindEmptyWithALogLine) {
     EXPECT_EQ(store->hintsSourceGetClientSignature(kTVXLookupSourceKindMonthly), "");
     EXPECT_FALSE(fs::exists(store->files.dataPath(kTVXLookupSourceKindMonthly)));
   }
-  EXPECT_EQ(logs.count("failed to push data to the text scanner"), 2u);
 }
 
 TEST_F(LookupTest, StartUpPushesOnlyHintsWhoseSignatureIsStale) {
