@@ -94,15 +94,20 @@ void DispatchPool::Impl::startWorker() {
   threads.emplace(t.get_id(), std::move(t));
 }
 
-void DispatchPool::Impl::joinExited() {
-  // Each of them has left its loop: joining waits for no task, at most for a last trim of the heap.
-  for (auto id : exited) {
+namespace {
+// Joins the threads that have left their loop: it waits for no task, at most for a last trim of
+// the heap.
+void joinLeft(std::map<std::thread::id, std::thread>& threads, std::vector<std::thread::id>& left) {
+  for (auto id : left) {
     auto it = threads.find(id);
     it->second.join();
     threads.erase(it);
   }
-  exited.clear();
+  left.clear();
 }
+}  // namespace
+
+void DispatchPool::Impl::joinExited() { joinLeft(threads, exited); }
 
 namespace {
 // The pool whose reactor the calling thread leads at the moment, if any.
@@ -138,12 +143,7 @@ void DispatchPool::Impl::updateSpare() {
 }
 
 void DispatchPool::Impl::startReactorThread() {
-  for (auto id : reactorExited) {
-    auto it = reactorThreads.find(id);
-    it->second.join();
-    reactorThreads.erase(it);
-  }
-  reactorExited.clear();
+  joinLeft(reactorThreads, reactorExited);
   std::thread t([this] { reactorThread(); });
   reactorThreads.emplace(t.get_id(), std::move(t));
   ++reactorAlive;
