@@ -57,10 +57,14 @@ struct TestWiring {
   std::shared_ptr<EngagedCompletionCache> engagedCompletionCache;
   std::shared_ptr<ResourceVersionsProvider> resourceVersions;
 
-  // The query and bag sessions, configured as start-up configures them; made on first use.
+  // The query and bag sessions, configured as start-up configures them; made on first use. Query
+  // completions run on the test's pool, so that draining it waits for the bookkeeping a search
+  // does after it has answered.
   std::shared_ptr<platform::http::URLSession> urlSession() {
     std::call_once(queryOnce_, [&] {
-      query_ = std::make_shared<platform::http::URLSession>(querySessionConfiguration(*userDefaults));
+      auto configuration = querySessionConfiguration(*userDefaults);
+      configuration.delegatePool = dispatchPool;
+      query_ = std::make_shared<platform::http::URLSession>(configuration);
     });
     return query_;
   }
