@@ -366,8 +366,11 @@ void DispatchPool::handOffReactor() {
 struct SerialQueue::Impl {
   explicit Impl(DispatchPool& p) : pool(p) {}
 
+  // A caller of sync() waiting on the queue. Each has its own condition, so that passing the
+  // queue on wakes the one thread it is passed to, not every thread waiting on the queue.
   struct Waiter {
     bool turn = false;  // ownership was handed to this caller
+    std::condition_variable wake;
   };
   struct Item {
     Task task;                // an async task
@@ -376,7 +379,6 @@ struct SerialQueue::Impl {
 
   DispatchPool& pool;
   std::mutex lock;
-  std::condition_variable changed;
   std::deque<Item> items;
   bool owned = false;        // a thread is on the queue
   bool drainPosted = false;  // a drain job is posted and has not started
@@ -387,6 +389,19 @@ struct SerialQueue::Impl {
   bool runFront(std::unique_lock<std::mutex>& guard, const Waiter* until);
   // Gives the queue up: to the waiter at the front, to a new drain job, or to nobody.
   void release(std::unique_lock<std::mutex>& guard, const std::shared_ptr<Impl>& self);
+  // With `lock` held: the queue is owned by `front`'s caller from now on.
+  void handTo(Waiter* front) {
+    front->turn = true;
+    items.pop_front();
+    front->wake.notify_one();
+  }
+  // With `lock` held, once nobody owns the queue: the first caller of sync() waiting behind
+  // queued tasks takes it and runs them itself rather than waiting for the drain job.
+  void wakeFirstWaiter() {
+    for (auto& item : items) {
+      if (item.waiter) return item.waiter->wake.notify_one();
+    }
+  }
   void postDrain(const std::shared_ptr<Impl>& self);
   // The pool has stopped: the tasks never to run are destroyed, outside the lock.
   void dropPending() {
@@ -413,9 +428,7 @@ bool SerialQueue::Impl::runFront(std::unique_lock<std::mutex>& guard, const Wait
     Item& front = items.front();
     if (until && front.waiter == until) return false;
     if (front.waiter) {
-      front.waiter->turn = true;
-      items.pop_front();
-      changed.notify_all();
+      handTo(front.waiter);
       return true;
     }
     Task task = std::move(front.task);
@@ -440,20 +453,14 @@ void SerialQueue::Impl::postDrain(const std::shared_ptr<Impl>& self) {
     self->owned = true;
     if (self->runFront(guard, nullptr)) return;
     self->owned = false;
-    self->changed.notify_all();
   });
 }
 
 void SerialQueue::Impl::release(std::unique_lock<std::mutex>& guard, const std::shared_ptr<Impl>& self) {
-  if (!items.empty() && items.front().waiter) {
-    items.front().waiter->turn = true;
-    items.pop_front();
-    changed.notify_all();
-    return;
-  }
+  if (!items.empty() && items.front().waiter) return handTo(items.front().waiter);
   owned = false;
   if (!items.empty() && !drainPosted) postDrain(self);
-  changed.notify_all();
+  wakeFirstWaiter();
 }
 
 SerialQueue::SerialQueue(DispatchPool& pool, std::string label)
@@ -524,7 +531,7 @@ void SerialQueue::sync(const Task& task) {
       break;
     }
     DispatchPool::aboutToWait();
-    q.changed.wait(guard);
+    waiter.wake.wait(guard);
   }
   guard.unlock();
   {
