@@ -285,7 +285,13 @@ std::shared_ptr<TavixFlusherIPC> makeFlusherChannel(Assembly& assembly, TavixSer
 // The client states, their query session and their one shared environment. After the feedback
 // services: a client state may share their GUID controller and session manager.
 void assembleClientStates(Assembly& assembly) {
-  assembly.querySession = std::make_shared<platform::http::URLSession>(querySessionConfiguration(*assembly.userDefaults));
+  // Query completions run on the daemon's pool: what a search posts once answered (its end record)
+  // then follows on the same thread instead of waking a second pool. Nothing on the pool waits
+  // for a query's answer, so the pool cannot starve its own completions. The bag session keeps
+  // a thread of its own: searches do wait for the first bag.
+  auto queryConfiguration = querySessionConfiguration(*assembly.userDefaults);
+  queryConfiguration.delegatePool = assembly.dispatchPool;
+  assembly.querySession = std::make_shared<platform::http::URLSession>(queryConfiguration);
   auto env = std::make_shared<ClientState::Environment>();
   env->pool = assembly.dispatchPool;
   env->clock = assembly.clock;
