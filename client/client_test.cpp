@@ -117,6 +117,12 @@ TEST(Client, ACallWithoutAnAnswerFailsAtItsDeadlineOnceAndTheLateAnswerIsDropped
   ASSERT_TRUE(error);
   EXPECT_EQ(error->domain, kClientErrorDomain);
   EXPECT_EQ(error->code, kTimedOut);
+  // A blocking call keeps its deadline on its own thread.
+  proto::Envelope late;
+  late.mutable_notify()->set_name("late");
+  error = client.callSync(late, nullptr);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, kTimedOut);
   ASSERT_TRUE(server.answerLate());
   // A later call's answer comes after the late one on the same stream: by then it has been read.
   EXPECT_TRUE(client.callSync(proto::Envelope(), nullptr));
