@@ -6,52 +6,21 @@
 #include <future>
 #include <nlohmann/json.hpp>
 
-#include "bag/tavix_bag_controller.h"
 #include "bagview/tvx_bag.h"
-#include "context/user_guid_controller.h"
-#include "devserver/devserver.h"
-#include "feedback/client_session_manager.h"
-#include "feedback/persistent_storage.h"
-#include "network/request_factory.h"
-#include "bagview/user_agent.h"
-#include "platform/clock.h"
-#include "platform/defaults.h"
-#include "platform/dispatch.h"
-#include "platform/http/url_session.h"
-#include "platform/notification_center.h"
-#include "support/devserver_control.h"
-#include "support/temp_home.h"
-#include "support/test_assembly.h"
+#include "support/query_fixture.h"
 
 namespace tavix {
 namespace {
 
 using tavix::testing::waitFor;
 
-class BagFeedbackTest : public ::testing::Test, protected testing::TestAssembly {
+class BagFeedbackTest : public query_testing::QueryFixture {
  protected:
-  BagFeedbackTest() : testing::TestAssembly(4) {
-    EXPECT_TRUE(server.start({}, nullptr));
-    defaults->registerDefaults({{"TVXSessionSoftLimitOverride", platform::PropertyValue(std::int64_t{600})},
-                                {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
-    defaults->setObject("TVXBagURL", server.baseURL() + "/bag");
-    makeRequestFactory();
-    makeStorage();
-    assembly.guidController = makeGUIDController();
-    assembly.bagController = TavixBagController::create(bagControllerEnvironment(assembly));
-    assembly.clientSessionManager =
-        std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), assembly.guidController, assembly.bagController, "tavix");
-  }
-  ~BagFeedbackTest() override {
-    assembly.bagController->invalidate();
-    pool.drain();
-    assembly.clientSessionManager.reset();
-    assembly.bagController.reset();
-    assembly.requestFactory.reset();
-  }
-
-  void fault(const nlohmann::json& f) {
-    testing::devserverCall(*control, server.baseURL(), "/_faults", "POST", f.dump());
+  // A session manager that asks the bag whether each client's feedback is wanted.
+  BagFeedbackTest() : QueryFixture(true) {
+    startBagController();
+    assembly.clientSessionManager = std::make_shared<ClientSessionManager>(
+        sessionManagerEnvironment(assembly), assembly.guidController, assembly.bagController, "tavix");
   }
 
   std::optional<TVXBagError> fetch() {
@@ -80,9 +49,6 @@ class BagFeedbackTest : public ::testing::Test, protected testing::TestAssembly 
     hit.set_input("x");
     return makeTavixFeedbackWithCodable(hit, 3, "", agent);
   }
-
-  devserver::DevServer server;
-  std::shared_ptr<platform::http::URLSession> control = std::make_shared<platform::http::URLSession>();
 };
 
 TEST_F(BagFeedbackTest, EachFetchIsASessionOfItsOwnWithStartEndAndFailure) {
@@ -105,7 +71,7 @@ TEST_F(BagFeedbackTest, EachFetchIsASessionOfItsOwnWithStartEndAndFailure) {
   EXPECT_EQ(end.peer_address(), "127.0.0.1");
 
   // A server error: the end record carries the status, then the failure follows.
-  fault({{"path", "/bag"}, {"status", 503}, {"body", "busy"}, {"times", 1}});
+  fault("/bag", {{"status", 503}, {"body", "busy"}, {"times", 1}});
   ASSERT_TRUE(fetch());
   sessions = takeSessions();
   ASSERT_EQ(sessions.size(), 1u);
@@ -128,7 +94,7 @@ TEST_F(BagFeedbackTest, ABagThatDisablesFeedbackForAClientDropsItsEvents) {
   const nlohmann::json bag = {{"version", "7"},
                               {"feedback_enabled", true},
                               {"clients", {{"brovane", {{"feedback_enabled", false}}}}}};
-  fault({{"path", "/bag"}, {"body", bag.dump()}, {"times", 1}});
+  fault("/bag", {{"body", bag.dump()}, {"times", 1}});
   ASSERT_FALSE(fetch());
   ASSERT_TRUE(assembly.bagController->inMemoryBag());
   takeSessions();
@@ -146,7 +112,7 @@ TEST_F(BagFeedbackTest, ABagThatDisablesFeedbackForAClientDropsItsEvents) {
   for (const auto& f : sessions[0].feedbacks()) EXPECT_NE(f.user_agent(), "com.norvel.Brovane/17");
 
   // A bag without the key disables feedback for everyone.
-  fault({{"path", "/bag"}, {"body", nlohmann::json({{"version", "8"}}).dump()}, {"times", 1}});
+  fault("/bag", {{"body", R"({"version": "8"})"}, {"times", 1}});
   ASSERT_FALSE(fetch());
   takeSessions();
   manager.addTavixFeedback(event("seekara/3"));
