@@ -10,7 +10,7 @@
 #include "platform/http/url_session.h"
 #include "platform/json_value.h"
 #include "platform/property_value.h"
-#include "support/daemon_process.h"
+#include "support/tavixd.h"
 #include "support/devserver_control.h"
 #include "support/devserver_process.h"
 
@@ -46,12 +46,7 @@ class BagDaemonTest : public ::testing::Test {
 
 TEST_F(BagDaemonTest, FetchedOnceAtStartThenServedFromDiskAfterARestart) {
   ASSERT_FALSE(server.base.empty());
-  {
-    UserDefaults defaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
-    defaults.setObject("TVXBagURL", server.base + "/bag");
-    ASSERT_TRUE(defaults.synchronize());
-  }
-
+  tavix::testing::setDaemonDefaults(home, {{"TVXBagURL", server.base + "/bag"}});
   {
     auto daemon = start("first.log");
     ASSERT_TRUE(daemon.waitForLog("Got bag")) << daemon.log();

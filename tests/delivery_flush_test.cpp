@@ -64,8 +64,7 @@ class DeliveryDaemon : public ::testing::Test, protected testing::TestAssembly {
  protected:
   DeliveryDaemon() {
     home.exportEnvironment();
-    platform::UserDefaults daemonDefaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
-    daemonDefaults.setObject("TVXBagURL", server.base + "/bag");
+    testing::setDaemonDefaults(home, {{"TVXBagURL", server.base + "/bag"}});
   }
   // Finished sessions of two error events each, one per agent.
   void writeSessions(const std::vector<std::string>& agents) {
@@ -263,11 +262,7 @@ TEST_F(DeliveryDaemon, EventsOfEveryShapeReachTheServerWithTheirOwnFields) {
   Daemon d(home, "tavixd-types.log");
   auto watcher = backgroundTool(home, {"watch"}, "watch.log");
   ASSERT_TRUE(d.waitForLog("new listener for client feedbacks")) << d.log();
-  client::Client::Options options;
-  options.socketPath = d.socket;
-  options.configuration.set_identifier("com.norvel.seekara");
-  options.configuration.set_user_agent("seekara/types");
-  client::Client app(options);
+  client::Client app(d.clientOptions("com.norvel.seekara", "seekara/types"));
   ASSERT_FALSE(app.connect()) << d.log();
   for (const auto& c : cases) {
     Payload payload;

@@ -31,13 +31,8 @@ using tavix::testing::rawSend;
 using Daemon = tavix::testing::Tavixd;
 using tavix::testing::runTool;
 
-Client::Options options(const Daemon& d, std::string identifier = "tests", std::string userAgent = "tests/1") {
-  Client::Options o;
-  o.socketPath = d.socket;
-  o.configuration.set_identifier(std::move(identifier));
-  o.configuration.set_user_agent(std::move(userAgent));
-  o.timeoutMs = 5000;
-  return o;
+Client::Options options(const Daemon& d, const std::string& userAgent = "tests/1") {
+  return d.clientOptions("tests", userAgent, 5000);
 }
 
 TEST(IpcDaemon, BadFramesAndVanishingClientsDoNotStopTheDaemon) {
@@ -101,7 +96,7 @@ TEST(IpcDaemon, BadConfigurationGetsNoReplyAndAClosedConnection) {
     EXPECT_TRUE(d.waitForLog(message)) << d.log();
   }
 
-  Client refused(options(d, "tests", ""));
+  Client refused(options(d, ""));
   auto error = refused.connect();
   ASSERT_TRUE(error);
   EXPECT_EQ(error->code, tavix::client::kConnectionLost);

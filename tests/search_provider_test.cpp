@@ -11,8 +11,7 @@
 #include <map>
 #include <optional>
 
-#include "platform/defaults.h"
-#include "support/daemon_process.h"
+#include "support/tavixd.h"
 #include "support/devserver_process.h"
 #include "support/temp_home.h"
 #include "tavix_proto/feedback_session.pb.h"
@@ -33,13 +32,9 @@ class SearchProviderTest : public ::testing::Test {
   void SetUp() override {
     if (::access(kDbusDaemon, X_OK) != 0) GTEST_SKIP() << "dbus-daemon is not installed";
     ASSERT_FALSE(server.base.empty()) << server.firstLine;
-    {
-      platform::UserDefaults defaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
-      defaults.setObject("TVXBagURL", server.base + "/bag");
-      // Each client's session ends with its connection, so the provider's is written when it goes.
-      defaults.setObject("TVXSharedSession", platform::PropertyValue(false));
-      ASSERT_TRUE(defaults.synchronize());
-    }
+    // Each client's session ends with its connection, so the provider's is written when it goes.
+    tavix::testing::setDaemonDefaults(
+        home, {{"TVXBagURL", server.base + "/bag"}, {"TVXSharedSession", platform::PropertyValue(false)}});
     tavixd.emplace(TAVIXD_BINARY, home, std::vector<std::string>{"--log-level", "debug"});
     ASSERT_TRUE(tavixd->waitForLog("bag change notification received", 10000)) << tavixd->log();
 

@@ -147,16 +147,6 @@ TEST(ClientConnection, OneBagPerClientHoweverOftenItConfiguresAndLateRepliesAreL
   EXPECT_TRUE(capture.contains("(pid:" + std::to_string(::getpid()) + ") remote proxy error: connection invalidated"));
 }
 
-// Delivered launch events and activity runs are checked over the daemon's socket; here the stream
-// nobody registered.
-TEST(ClientConnection, ANotifyOnAnUnknownStreamIsRefused) {
-  Harness h;
-  auto reply = h.call(notify("x", "no.such.stream"), 5);
-  EXPECT_EQ(reply.call_id(), 5u);
-  EXPECT_FALSE(reply.notify_reply().delivered());
-  EXPECT_EQ(reply.notify_reply().error().code(), 404);
-}
-
 TEST(ClientConnection, RelaysResourceNotificationsThatNameAResource) {
   Harness h;
   auto& center = *h.assembly.notificationCenter;
@@ -175,25 +165,12 @@ TEST(ClientConnection, RelaysResourceNotificationsThatNameAResource) {
   EXPECT_EQ(got, (std::vector<std::string>{"+hints", "-old"}));
 }
 
-TEST(ClientConnection, QueriesBeforeAValidConfigurationAndOfUnknownKindAreNotAnswered) {
-  Harness h;
-  proto::Envelope request;
-  request.mutable_request()->mutable_request()->set_query_id(9);
-  request.mutable_request()->mutable_request()->mutable_flight_search()->set_flight_query("NV 12");
-  h.post(request, 3);  // no state bound yet
-  request.mutable_request()->mutable_request()->clear_kind();
-  h.post(request, 4);  // no kind
-  EXPECT_EQ(h.call(notify("after"), 5).call_id(), 5u) << "neither request got a reply";
-}
-
 TEST(ClientConnection, RefusesConfigurationsThatWouldInjectHeaders) {
   platform::LogCapture capture;
-  proto::Envelope configure;
-  configure.mutable_configure()->mutable_configuration()->set_identifier("com.norvel.seekara");
-  configure.mutable_configure()->mutable_configuration()->set_user_agent("seekara/1.0\r\nX-Injected: agent");
   {
     Harness h;
-    EXPECT_FALSE(h.call(configure).has_configure_reply()) << "closed without a reply";
+    EXPECT_FALSE(h.call(configure("com.norvel.seekara", "seekara/1.0\r\nX-Injected: agent")).has_configure_reply())
+        << "closed without a reply";
     EXPECT_TRUE(capture.contains("configuration carries a control character"));
     EXPECT_TRUE(capture.contains("seekara/1.0\\x0d\\x0aX-Injected: agent")) << "logged, escaped";
     EXPECT_TRUE(h.assembly.clientStateManager->sessions().empty()) << "no state for a refused client";
@@ -202,8 +179,7 @@ TEST(ClientConnection, RefusesConfigurationsThatWouldInjectHeaders) {
   capture.clear();
   Harness h;
   h.assembly.userDefaults->setObject("TVXDeviceModel", "Desk\nX-Injected: model");
-  configure.mutable_configure()->mutable_configuration()->set_user_agent("seekara/1.0");
-  EXPECT_FALSE(h.call(configure).has_configure_reply());
+  EXPECT_FALSE(h.call(configure("com.norvel.seekara", "seekara/1.0")).has_configure_reply());
   EXPECT_TRUE(capture.contains("configuration carries a control character"));
 }
 
@@ -224,9 +200,23 @@ TEST(ClientConnection, AnswersTooLargeForAFrameAndDatesThatAreNotNumbersAreRefus
   EXPECT_TRUE(capture.contains("are not both numbers"));
 }
 
-// The full user agent a client is known by is checked over the daemon's socket, in its bag.
-TEST(ClientConnection, KeepsItsFirstIdentifier) {
+// Delivered launch events and activity runs, and the full user agent a client is known by, are
+// checked over the daemon's socket.
+TEST(ClientConnection, RefusesWhatItCannotServeAndKeepsItsFirstIdentifier) {
   Harness h;
+  auto reply = h.call(notify("x", "no.such.stream"), 2);
+  EXPECT_EQ(reply.call_id(), 2u);
+  EXPECT_FALSE(reply.notify_reply().delivered());
+  EXPECT_EQ(reply.notify_reply().error().code(), 404) << "a stream nobody registered";
+
+  proto::Envelope request;
+  request.mutable_request()->mutable_request()->set_query_id(9);
+  request.mutable_request()->mutable_request()->mutable_flight_search()->set_flight_query("NV 12");
+  h.post(request, 3);  // no state bound yet
+  request.mutable_request()->mutable_request()->clear_kind();
+  h.post(request, 4);  // no kind
+  EXPECT_EQ(h.call(notify("after"), 5).call_id(), 5u) << "neither request got a reply";
+
   EXPECT_TRUE(h.call(configure("first", "client/2")).has_configure_reply());
   EXPECT_TRUE(h.call(configure("second", "client/2")).has_configure_reply());
   h.connection->queue().sync([&] {
