@@ -2,8 +2,9 @@
 // the client gets back, what reached the server, and the records left in the client's session.
 #include <gtest/gtest.h>
 
+#include <google/protobuf/text_format.h>
+
 #include <filesystem>
-#include <fstream>
 #include <future>
 #include <mutex>
 #include <optional>
@@ -80,7 +81,9 @@ TEST_F(QueryDaemonTest, FeedbackIsTiedToItsQueryWarmsTheConnectionAndFeedsEngage
   ASSERT_FALSE(server.base.empty());
   serveBag({{"smart_history_enabled", true}});
   startDaemon();
-  auto report = [&](const proto::CTFeedbackPayload& payload, std::uint64_t id) {
+  auto report = [&](const std::string& text, std::uint64_t id) {
+    proto::CTFeedbackPayload payload;
+    ASSERT_TRUE(google::protobuf::TextFormat::ParseFromString(text, &payload)) << text;
     proto::Envelope e;
     e.mutable_report_feedback_payload_data()->set_data(payload.SerializeAsString());
     e.mutable_report_feedback_payload_data()->set_query_id(id);
@@ -89,40 +92,28 @@ TEST_F(QueryDaemonTest, FeedbackIsTiedToItsQueryWarmsTheConnectionAndFeedsEngage
 
   // The search view appears from the today view: a search is likely, so the connection is warmed
   // once; a second appearance within 30 seconds does not warm again.
-  proto::CTFeedbackPayload appear;
-  appear.set_type(1);
-  appear.mutable_search_view_appear()->set_trigger_event(proto::AppearEvent::today_view);
-  report(appear, 1);
-  report(appear, 2);
+  report("type: 1 search_view_appear { trigger_event: today_view }", 1);
+  report("type: 1 search_view_appear { trigger_event: today_view }", 2);
   ASSERT_TRUE(waitForRecord("search_view_appear", 2)) << dumpRecords();
   EXPECT_TRUE(tavix::testing::waitFor([&] { return served("/warm") == 1; })) << tavixd->log();
   EXPECT_EQ(served("/warm"), 1);
 
   // An engaged completion: the record takes the query id of its result, not the one sent beside
   // it, and the completion goes into the device's history and a completion-feature file.
-  proto::CTFeedbackPayload engaged;
-  engaged.set_type(7);
-  auto* engagement = engaged.mutable_result_engagement();
-  engagement->set_input("wea");
-  engagement->mutable_result()->set_query_id(777);
-  engagement->mutable_result()->set_completion("weather in lisbon");
-  engagement->mutable_result()->set_result_type(proto::ResultType::server_suggest);
-  report(engaged, 5);
-  auto record = waitForRecord("result_engagement", 777);
-  ASSERT_TRUE(record) << dumpRecords();
+  report(R"(type: 7 result_engagement { input: "wea" result { query_id: 777 completion: "weather in lisbon"
+            result_type: server_suggest } })",
+         5);
+  ASSERT_TRUE(waitForRecord("result_engagement", 777)) << dumpRecords();
   const auto folder = home.cache() / "com.norvel.tavixd" / "CustomFeedback" / "EngagedCompletion";
-  std::optional<json> feature;
+  json feature;
   tavix::testing::waitFor([&] {
     std::error_code ec;
     for (const auto& file : std::filesystem::directory_iterator(folder, ec)) {
-      std::ifstream in(file.path());
-      feature = json::parse(in, nullptr, false);
-      return true;
+      feature = json::parse(tavix::testing::readFile(file.path()), nullptr, false);
     }
-    return false;
+    return !feature.is_null();
   });
-  ASSERT_TRUE(feature) << tavixd->log();
-  EXPECT_EQ(*feature, (json{{"lc", "weather in lisbon"}, {"q", "wea"}, {"e", true}, {"c", 2}}));
+  EXPECT_EQ(feature, (json{{"lc", "weather in lisbon"}, {"q", "wea"}, {"e", true}, {"c", 2}})) << tavixd->log();
 
   // Undecodable payloads are refused with a log line; the daemon goes on.
   proto::Envelope bad;

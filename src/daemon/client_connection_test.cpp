@@ -10,7 +10,6 @@
 
 #include "platform/activity.h"
 #include "platform/defaults.h"
-#include "platform/ipc/frame.h"
 #include "platform/ipc/launch_events.h"
 #include "platform/ipc/server.h"
 #include "platform/log.h"
@@ -18,6 +17,7 @@
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
 #include "support/connection_services.h"
+#include "support/raw_frames.h"
 #include "tavix_proto/ipc.pb.h"
 #include "cache/engaged_completion_cache.h"
 
@@ -37,12 +37,14 @@ struct Harness : testing::TestAssembly {
   ipc::UniqueFd client;
   std::shared_ptr<ipc::IpcConnection> connection;
   std::shared_ptr<ClientConnection> subject;
-  ipc::FrameDecoder decoder;
 
   explicit Harness(std::size_t maxFrame = ipc::kMaxFrameSize) {
     int fds[2];
     EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
     client.reset(fds[1]);
+    // A missing reply fails the test instead of hanging it.
+    const timeval timeout{10, 0};
+    ::setsockopt(fds[1], SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
     connection = ipc::IpcConnection::make(pool, ipc::UniqueFd(fds[0]), {::getpid(), ::getuid(), ::getgid()},
                                           "test.connection", log, maxFrame);
     subject = std::make_shared<ClientConnection>(services.env, connection);
@@ -58,27 +60,19 @@ struct Harness : testing::TestAssembly {
 
   void post(proto::Envelope e, std::uint64_t id = 0) {
     e.set_call_id(id);
-    auto frame = ipc::encodeFrame(e.SerializeAsString());
-    std::size_t sent = 0;
-    EXPECT_FALSE(ipc::sendWithFds(client.get(), frame, {}, true, &sent));
+    testing::rawSend(client.get(), e.SerializeAsString());
   }
   proto::Envelope call(proto::Envelope e, std::uint64_t id = 1) {
     post(std::move(e), id);
     return receive();
   }
+  // The next message; an empty one when the connection was closed.
   proto::Envelope receive() {
     proto::Envelope reply;
-    char buf[4096];
-    for (;;) {
-      if (auto p = decoder.next()) {
-        EXPECT_TRUE(reply.ParseFromString(*p));
-        return reply;
-      }
-      std::vector<int> fds;
-      std::size_t n = 0;
-      if (ipc::receiveWithFds(client.get(), buf, sizeof buf, true, &fds, &n) || n == 0) return reply;
-      decoder.append(buf, n);
-    }
+    const std::string bytes = testing::rawReceive(client.get());
+    EXPECT_NE(bytes, "<timeout>");
+    if (bytes != "<eof>" && bytes != "<timeout>") EXPECT_TRUE(reply.ParseFromString(bytes));
+    return reply;
   }
   // The connection's keep-alive transactions (a bag fetch holds one of its own).
   std::size_t keepAlives() { return transactions.open()["com.norvel.tavixd.ipc"]; }
