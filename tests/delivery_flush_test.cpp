@@ -6,6 +6,8 @@
 #include <signal.h>
 #include <unistd.h>
 
+#include <filesystem>
+#include <fstream>
 #include <map>
 #include <nlohmann/json.hpp>
 #include <random>
@@ -36,6 +38,8 @@ using testing::occurrences;
 using testing::runTool;
 using testing::testSeed;
 using testing::waitFor;
+using std::filesystem::exists;
+using namespace std::chrono_literals;
 
 constexpr const char* kFlusherActivity = "com.norvel.tavixd.flusher.background";
 
@@ -143,6 +147,45 @@ TEST_F(DeliveryDaemon, SessionsWaitAcrossARestartAndWhileFlushingIsStoppedUntilA
 
   // (Periodic runs after a restart, and racing a dump, are the two tests below.)
   EXPECT_EQ(uploadsByAgent(), (std::map<std::string, int>{{"brovane/2", 1}, {"news/3", 1}, {"seekara/1", 1}}));
+}
+
+// Custom feedback items wait in their type's folder: the custom-feedback activity uploads each
+// one up to the size limit, reports a larger one in an error session, and deletes both; an item
+// written a moment ago is left for a later run, as its writer may not be done with it.
+TEST_F(DeliveryDaemon, CustomFeedbackIsUploadedOrReportedThenDeleted) {
+  ASSERT_FALSE(server.base.empty()) << server.firstLine;
+  const auto root = home.cache() / "com.norvel.tavixd" / "CustomFeedback";
+  auto write = [&](const std::string& item, std::size_t size, bool settled = true) {
+    std::filesystem::create_directories((root / item).parent_path());
+    std::ofstream(root / item) << std::string(size, 'a');
+    if (settled) std::filesystem::last_write_time(root / item, std::filesystem::last_write_time(root / item) - 1h);
+  };
+  write("BrovaneAutoFill/fits", 2097152);
+  write("Quillet/over", 2097153);
+  write("Quillet/fresh", 10, false);
+  Daemon d(home, "tavixd-custom.log");
+  std::string out;
+  ASSERT_EQ(runTool("activity run com.norvel.tavixd.dp.flush", &out), 0) << out << d.log();
+  EXPECT_TRUE(waitFor([&] { return !exists(root / "BrovaneAutoFill/fits") && !exists(root / "Quillet/over"); }))
+      << d.log();
+  EXPECT_TRUE(d.waitForLog("Quillet/fresh is still being written; left for later")) << d.log();
+  EXPECT_TRUE(exists(root / "Quillet/fresh"));
+
+  // The oversize item's error goes out with the next sessions, its size and type as numbers and text.
+  ASSERT_EQ(runTool("dump", &out), 0) << out << d.log();
+  json fits, oversize;
+  EXPECT_TRUE(waitFor([&] {
+    for (const auto& upload : serverGet("/_feedback")) {
+      if (upload.value("type", "") == "BrovaneAutoFill") fits = upload;
+      for (const auto& event : upload.contains("json") ? upload["json"].value("fb", json::array()) : json::array()) {
+        if (event.value("code", 0) == 4 && event.value("domain", "") == "kTVXErrorDomain") oversize = event;
+      }
+    }
+    return !fits.is_null() && !oversize.is_null();
+  }, 10000)) << d.log();
+  EXPECT_EQ(fits["size"], 2097152);
+  EXPECT_EQ(oversize["user_info"], (json{{"size", 2097153}, {"type", "Quillet"}})) << oversize;
+  EXPECT_EQ(d.stop(), 0);
 }
 
 // tavix_tool running in the background, its output (stdout and stderr) in home/`logName`.
