@@ -112,6 +112,12 @@ class DeliveryDaemon : public ::testing::Test, protected testing::TestAssembly {
   testing::DevServerProcess server{DEVSERVER_BINARY};
 };
 
+// tavix_tool running in the background, its output (stdout and stderr) in home/`logName`.
+testing::DaemonProcess backgroundTool(const testing::TempHome& home, std::vector<std::string> args,
+                                      const std::string& logName) {
+  return testing::DaemonProcess(TAVIX_TOOL_BINARY, home, std::move(args), logName, [] { ::dup2(2, 1); });
+}
+
 TEST_F(DeliveryDaemon, SessionsWaitAcrossARestartAndWhileFlushingIsStoppedUntilADump) {
   ASSERT_FALSE(server.base.empty()) << server.firstLine;
   std::string out;
@@ -171,7 +177,10 @@ TEST_F(DeliveryDaemon, CustomFeedbackIsUploadedOrReportedThenDeleted) {
   EXPECT_TRUE(d.waitForLog("Quillet/fresh is still being written; left for later")) << d.log();
   EXPECT_TRUE(exists(root / "Quillet/fresh"));
 
-  // The oversize item's error goes out with the next sessions, its size and type as numbers and text.
+  // The oversize item's error goes out with the next sessions, its size and type as numbers and
+  // text; a watcher subscribed before the dump is shown the body, inflated back to the records.
+  auto watcher = backgroundTool(home, {"watch-uploads", "--inflate"}, "watch-uploads.log");
+  ASSERT_TRUE(d.waitForLog("new listener for flusher client sessions")) << d.log();
   ASSERT_EQ(runTool("dump", &out), 0) << out << d.log();
   json fits, oversize;
   EXPECT_TRUE(waitFor([&] {
@@ -185,34 +194,17 @@ TEST_F(DeliveryDaemon, CustomFeedbackIsUploadedOrReportedThenDeleted) {
   }, 10000)) << d.log();
   EXPECT_EQ(fits["size"], 2097152);
   EXPECT_EQ(oversize["user_info"], (json{{"size", 2097153}, {"type", "Quillet"}})) << oversize;
-  EXPECT_EQ(d.stop(), 0);
-}
-
-// tavix_tool running in the background, its output (stdout and stderr) in home/`logName`.
-testing::DaemonProcess backgroundTool(const testing::TempHome& home, std::vector<std::string> args,
-                                      const std::string& logName) {
-  return testing::DaemonProcess(TAVIX_TOOL_BINARY, home, std::move(args), logName, [] { ::dup2(2, 1); });
-}
-
-TEST_F(DeliveryDaemon, WatchUploadsShowsEachBodyAsItIsSent) {
-  ASSERT_FALSE(server.base.empty()) << server.firstLine;
-  writeSessions({"messages/7"});
-  Daemon d(home, "tavixd-watch.log");
-  auto watcher = backgroundTool(home, {"watch-uploads", "--inflate"}, "watch-uploads.log");
-  ASSERT_TRUE(d.waitForLog("new listener for flusher client sessions")) << d.log();
-
-  std::string out;
-  ASSERT_EQ(runTool("dump", &out), 0) << out << d.log();
-  // The watcher subscribed first, so the bodies go to it, inflated back to the records sent.
   EXPECT_TRUE(waitFor([&] {
     std::istringstream lines(watcher.log());
     for (std::string line; std::getline(lines, line);) {
       const json upload = json::parse(line, nullptr, false);
-      if (upload.is_object() && upload["compressed_size"].get<int>() > 0 && upload["json"]["agent"] == "messages/7") return true;
+      if (upload.is_object() && upload["compressed_size"].get<int>() > 0 &&
+          upload["json"].dump().find(R"("type":"Quillet")") != std::string::npos) {
+        return true;
+      }
     }
     return false;
   }, 10000)) << watcher.log();
-  EXPECT_TRUE(waitFor([&] { return uploadsByAgent().count("messages/7") == 1; }, 10000));
   EXPECT_EQ(d.stop(), 0);
 }
 
