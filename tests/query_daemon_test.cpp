@@ -23,7 +23,7 @@ TEST_F(QueryDaemonTest, ClientsHearTheBagWhenTheyConfigureWhenTheyAskAndWhenItCh
   // A second client of the same identifier hears the bag in its own right.
   std::mutex lock;
   std::vector<proto::BagDidLoad> loads;
-  client::Client second(clientOptions("com.norvel.seekara", "seekara/1.0"));
+  client::Client second(tavixd->clientOptions("com.norvel.seekara", "seekara/1.0"));
   second.setBagDidLoadHandler([&](const proto::BagDidLoad& load) {
     std::lock_guard hold(lock);
     loads.push_back(load);

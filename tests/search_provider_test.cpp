@@ -46,13 +46,10 @@ class SearchProviderTest : public ::testing::Test {
     const auto start = log.find("unix:");
     const std::string address = log.substr(start, log.find('\n', start) - start);
     ::setenv("DBUS_SESSION_BUS_ADDRESS", address.c_str(), 1);
-    ASSERT_GE(sd_bus_new(&shell), 0);
-    ASSERT_GE(sd_bus_set_address(shell, address.c_str()), 0);
-    ASSERT_GE(sd_bus_set_bus_client(shell, 1), 0);
-    ASSERT_GE(sd_bus_start(shell), 0);
+    ASSERT_GE(sd_bus_open_user(&shell), 0);
 
     // The opener writes what it was asked to open where the test can read it.
-    opener = home.root() / "opener";
+    const auto opener = home.root() / "opener";
     std::ofstream(opener) << "#!/bin/sh\necho \"$1\" >> " << (home.root() / "opened").string() << "\n";
     std::filesystem::permissions(opener, std::filesystem::perms::owner_all);
     provider.emplace(PROVIDER_BINARY, home, std::vector<std::string>{"--opener", opener.string()}, "provider.log");
@@ -139,7 +136,6 @@ class SearchProviderTest : public ::testing::Test {
   std::optional<tavix::testing::DaemonProcess> tavixd;
   std::optional<tavix::testing::DaemonProcess> bus;
   std::optional<tavix::testing::DaemonProcess> provider;
-  std::filesystem::path opener;
   sd_bus* shell = nullptr;
   sd_bus_error error = SD_BUS_ERROR_NULL;
 };

@@ -57,11 +57,8 @@ class QueryDaemonTest : public ::testing::Test {
     tavixd.emplace(home);
     // With the bag in, no client waits for it (a wait counts as network use and delays warming).
     ASSERT_TRUE(tavixd->waitForLog("bag change notification received")) << tavixd->log();
-    app.emplace(clientOptions("com.norvel.seekara", "seekara/1.0"));
+    app.emplace(tavixd->clientOptions("com.norvel.seekara", "seekara/1.0"));
     ASSERT_FALSE(app->connect());
-  }
-  client::Client::Options clientOptions(const std::string& identifier, const std::string& userAgent) const {
-    return tavixd->clientOptions(identifier, userAgent);
   }
 
   proto::TVXRequest request(const std::string& input) {
