@@ -170,4 +170,28 @@ TEST_F(HTTPSessionTest, CancelCompletesOnceWithCancelled) {
   EXPECT_EQ(endedWithSession, 2);
 }
 
+// Replies the server lets keep are served from memory while fresh, asked for again conditionally
+// once stale, and asked for afresh once purged; uncacheable replies always go to the server.
+TEST_F(HTTPSessionTest, MemoryCacheServesFreshEntriesRevalidatesStaleOnesAndPurges) {
+  VirtualClock clock;
+  URLSession session{URLSessionConfiguration{.memoryCacheCapacity = 4 << 20, .delegatePool = &pool, .clock = &clock}};
+  const std::string resource = url("/resources/hints?max_age=60");
+  std::shared_ptr<URLSessionDataTask> second;
+  const Outcome first = run(session, {resource});
+  EXPECT_EQ(run(session, {resource}, &second).data, first.data);
+  EXPECT_TRUE(second->metrics().fromCache);
+  clock.advance(seconds(61));
+  const Outcome stale = run(session, {resource});
+  EXPECT_EQ(stale.response->statusCode, 200) << "the 304 stays inside the session";
+  EXPECT_EQ(stale.data, first.data);
+  session.purgeMemoryCache();
+  run(session, {resource});
+  run(session, {url("/bag")});
+  run(session, {url("/bag")});
+  const json wire = recorded();
+  ASSERT_EQ(wire.size(), 5u) << wire;
+  EXPECT_TRUE(wire[1]["headers"].contains("if-none-match")) << "stale: asked again, conditionally";
+  EXPECT_FALSE(wire[2]["headers"].contains("if-none-match")) << "purged: asked afresh";
+}
+
 }  // namespace

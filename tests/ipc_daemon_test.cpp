@@ -22,21 +22,16 @@
 
 namespace {
 
+using namespace tavix::testing;
 using tavix::client::Client;
-using tavix::testing::configureFrame;
-using tavix::testing::rawConnect;
-using tavix::testing::rawReceive;
-using tavix::testing::rawSend;
-
-using Daemon = tavix::testing::Tavixd;
-using tavix::testing::runTool;
+using Daemon = Tavixd;
 
 Client::Options options(const Daemon& d, const std::string& userAgent = "tests/1") {
   return d.clientOptions("tests", userAgent, 5000);
 }
 
 TEST(IpcDaemon, BadFramesAndVanishingClientsDoNotStopTheDaemon) {
-  tavix::testing::TempHome home;
+  TempHome home;
   Daemon d(home);
 
   int fd = rawConnect(d.socket);
@@ -84,7 +79,7 @@ TEST(IpcDaemon, BadFramesAndVanishingClientsDoNotStopTheDaemon) {
 }
 
 TEST(IpcDaemon, BadConfigurationGetsNoReplyAndAClosedConnection) {
-  tavix::testing::TempHome home;
+  TempHome home;
   Daemon d(home);
   for (auto [identifier, userAgent, message] :
        {std::tuple{"", "ua/1", "configuration requires identifier"}, std::tuple{"id", "", "configuration requires userAgent"}}) {
@@ -105,14 +100,14 @@ TEST(IpcDaemon, BadConfigurationGetsNoReplyAndAClosedConnection) {
   // Each refusal is recorded as an error in the daemon's own feedback session.
   EXPECT_EQ(d.stop(), 0);
   int recorded = 0;
-  for (const auto& bytes : tavix::testing::sessionFileContents(home)) {
-    recorded += static_cast<int>(tavix::testing::occurrences(bytes, "invalid configuration"));
+  for (const auto& bytes : sessionFileContents(home)) {
+    recorded += static_cast<int>(occurrences(bytes, "invalid configuration"));
   }
   EXPECT_EQ(recorded, 3);
 }
 
 TEST(IpcDaemon, ClientFailsCallsInFlightOnceAndReconnectsToTheNextDaemon) {
-  tavix::testing::TempHome home;
+  TempHome home;
   auto d = std::make_unique<Daemon>(home, "first.log");
   Client client(options(*d));
   ASSERT_FALSE(client.connect());
@@ -141,7 +136,7 @@ TEST(IpcDaemon, ClientFailsCallsInFlightOnceAndReconnectsToTheNextDaemon) {
 }
 
 TEST(IpcDaemon, ToolReadsDefaultsAndCountersWithTheDaemonStoppedAndRunsActivities) {
-  tavix::testing::TempHome home;
+  TempHome home;
   home.exportEnvironment();  // the tool runs in this environment
   std::string out;
   EXPECT_EQ(runTool("defaults write TVXFeedbackFlushDisabled --bool true", &out), 0) << out;
@@ -174,7 +169,7 @@ TEST(IpcDaemon, ToolReadsDefaultsAndCountersWithTheDaemonStoppedAndRunsActivitie
 }
 
 TEST(IpcDaemon, ClearDataLaunchEventForgetsTheSystemSearchCompletionsOnly) {
-  tavix::testing::TempHome home;
+  TempHome home;
   tavix::platform::DispatchPool pool(2);
   tavix::platform::SystemClock clock(pool);
   auto open = [&] {
@@ -199,7 +194,7 @@ TEST(IpcDaemon, ClearDataLaunchEventForgetsTheSystemSearchCompletionsOnly) {
 
 // The client reads a resource through the descriptor the daemon opened for it, never by path.
 TEST(IpcDaemon, ResourceFilesTravelAsReadOnlyDescriptors) {
-  tavix::testing::TempHome home;
+  TempHome home;
   home.exportEnvironment();  // the tool runs in this environment
   const auto caches = home.cache() / "com.norvel.tavixd";
   std::filesystem::create_directories(caches);

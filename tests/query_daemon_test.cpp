@@ -8,7 +8,6 @@
 #include <optional>
 
 #include "support/query_daemon.h"
-#include "tavix_proto/feedback_session.pb.h"
 
 namespace {
 

@@ -157,8 +157,7 @@ TEST_F(SearchProviderTest, AnswersTheShellFromTheDaemonAndReportsWhatTheUserOpen
   }
 
   // More typed: the subsearch asks again and narrows to one result.
-  const auto narrowed =
-      strings(call("GetSubsearchResultSet", initial, std::vector<std::string>{"weather", "r"}));
+  const auto narrowed = strings(call("GetSubsearchResultSet", initial, std::vector<std::string>{"weather", "r"}));
   ASSERT_EQ(narrowed.size(), 1u) << error.message;
   const auto meta = metas(narrowed);
   ASSERT_EQ(meta.size(), 1u);

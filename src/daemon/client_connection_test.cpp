@@ -19,7 +19,6 @@
 #include "support/connection_services.h"
 #include "support/raw_frames.h"
 #include "tavix_proto/ipc.pb.h"
-#include "cache/engaged_completion_cache.h"
 
 namespace tavix {
 namespace {

@@ -44,11 +44,7 @@ class BlackHole {
     ::getsockname(fd_, reinterpret_cast<sockaddr*>(&address), &size);
     port_ = ntohs(address.sin_port);
   }
-  ~BlackHole() { close(); }
-  void close() {
-    if (fd_ >= 0) ::close(fd_);
-    fd_ = -1;
-  }
+  ~BlackHole() { ::close(fd_); }
   int port() const { return port_; }
   std::string url() const { return "http://127.0.0.1:" + std::to_string(port_); }
 

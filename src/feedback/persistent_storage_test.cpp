@@ -35,10 +35,8 @@ struct StorageFixture : testing::TestAssembly {
   void touch(const std::string& name, double ageSeconds = 0) {
     fs::create_directories(folder());
     std::ofstream(folder() / name) << "x";
-    const double when = platform::toUnixSeconds(clock.now()) - ageSeconds;
-    struct timespec times[2];
-    times[0].tv_sec = times[1].tv_sec = static_cast<time_t>(when);
-    times[0].tv_nsec = times[1].tv_nsec = 0;
+    const timespec when{static_cast<time_t>(platform::toUnixSeconds(clock.now()) - ageSeconds), 0};
+    const timespec times[2] = {when, when};
     ::utimensat(AT_FDCWD, (folder() / name).c_str(), times, 0);
   }
 };

@@ -107,11 +107,7 @@ class QueryDaemonTest : public ::testing::Test {
     for (const auto& text : reply.feedback_reply().feedbacks()) out.push_back(json::parse(text));
     return out;
   }
-  std::string dumpRecords() {
-    std::string out;
-    for (const auto& r : records()) out += r.dump() + "\n";
-    return out;
-  }
+  std::string dumpRecords() { return json(records()).dump(); }
   // Waits until the session holds a record of `type` for `queryId`; answers it.
   std::optional<json> waitForRecord(const std::string& type, std::uint64_t id) {
     std::optional<json> found;
