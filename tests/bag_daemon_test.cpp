@@ -10,9 +10,10 @@
 #include "platform/http/url_session.h"
 #include "platform/json_value.h"
 #include "platform/property_value.h"
-#include "support/daemon_process.h"
 #include "support/devserver_control.h"
 #include "support/devserver_process.h"
+#include "support/tavixd.h"
+#include "tavix_proto/feedback_session.pb.h"
 
 namespace {
 
@@ -46,12 +47,7 @@ class BagDaemonTest : public ::testing::Test {
 
 TEST_F(BagDaemonTest, FetchedOnceAtStartThenServedFromDiskAfterARestart) {
   ASSERT_FALSE(server.base.empty());
-  {
-    UserDefaults defaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
-    defaults.setObject("TVXBagURL", server.base + "/bag");
-    ASSERT_TRUE(defaults.synchronize());
-  }
-
+  tavix::testing::setDaemonDefaults(home, {{"TVXBagURL", server.base + "/bag"}});
   {
     auto daemon = start("first.log");
     ASSERT_TRUE(daemon.waitForLog("Got bag")) << daemon.log();
@@ -59,6 +55,17 @@ TEST_F(BagDaemonTest, FetchedOnceAtStartThenServedFromDiskAfterARestart) {
     EXPECT_EQ(daemon.stop(), 0);
     EXPECT_EQ(bagFetches(), 1u) << daemon.log();
   }
+  // The fetch is a feedback session of its own: its start, then its end with the status.
+  int fetchSessions = 0;
+  for (const auto& file : tavix::testing::sessionFileContents(home)) {
+    tavix::proto::CTClientSession s;
+    if (!s.ParseFromString(file) || s.feedbacks_size() < 2) continue;
+    const auto& start = s.feedbacks(0).payload().network_search_start();
+    const auto& end = s.feedbacks(1).payload().network_search_end();
+    fetchSessions += start.endpoint_type() == tavix::proto::EndpointType::tavix_bag && end.uuid() == start.uuid() &&
+                     !end.uuid().empty() && end.status_code() == 200;
+  }
+  EXPECT_EQ(fetchSessions, 1);
   std::string bytes;
   const Dictionary bag = readBag(&bytes);
   EXPECT_EQ(bytes.rfind("bplist00", 0), 0u);

@@ -24,26 +24,21 @@ namespace {
 
 using tavix::testing::DaemonProcess;
 
-TEST(DaemonStartup, CreatesItsFoldersLogsItsStartAndExitsCleanlyOnSigterm) {
+// (Every daemon test ends with a clean exit on SIGTERM.)
+TEST(DaemonStartup, CreatesItsFoldersExitsCleanlyOnSigintAndCountsItsStarts) {
   tavix::testing::TempHome home;
-  {
-    DaemonProcess d(TAVIXD_BINARY, home, {"--log-level", "debug"}, "first.log");
-    ASSERT_TRUE(d.waitForLog("tavixd started")) << d.log();
-    for (const char* name : {"BrovaneAutoFill", "SeekaraResultFeatures", "BrovaneAutoPlay", "Quillet",
-                             "EngagedCompletion", "ProactiveEventTracker"}) {
-      EXPECT_TRUE(std::filesystem::is_directory(home.cache() / "com.norvel.tavixd" / "CustomFeedback" / name)) << name;
-    }
-    d.signal(SIGTERM);
-    EXPECT_EQ(d.waitExit(10000), 0) << d.log();
-  }
-  {
-    DaemonProcess d(TAVIXD_BINARY, home, {}, "second.log");
+  for (const char* logName : {"first.log", "second.log"}) {
+    DaemonProcess d(TAVIXD_BINARY, home, {}, logName);
     ASSERT_TRUE(d.waitForLog("tavixd started")) << d.log();
     d.signal(SIGINT);
     EXPECT_EQ(d.waitExit(10000), 0);
     EXPECT_EQ(d.log().find("failed"), std::string::npos) << d.log();
   }
-  // Each start counted, and the counters kept across runs.
+  for (const char* name : {"BrovaneAutoFill", "SeekaraResultFeatures", "BrovaneAutoPlay", "Quillet",
+                           "EngagedCompletion", "ProactiveEventTracker"}) {
+    EXPECT_TRUE(std::filesystem::is_directory(home.cache() / "com.norvel.tavixd" / "CustomFeedback" / name)) << name;
+  }
+  // The counters are kept across runs.
   const auto counters = tavix::testing::readFile(home.cache() / "com.norvel.tavixd" / "counters.plist");
   EXPECT_NE(counters.find("<key>com.norvel.tavixd.launch</key>\n\t<integer>2</integer>"), std::string::npos)
       << counters;
@@ -91,20 +86,19 @@ class DatagramSocket {
     buffer.resize(static_cast<std::size_t>(n));
     return buffer;
   }
-  // The first datagram that contains `text`, among those `seen` so far or those that come next
-  // (which are added to `seen`); nothing when none comes.
-  std::optional<std::string> receiveUntil(const std::string& text, std::vector<std::string>* seen = nullptr) {
-    std::vector<std::string> local;
-    if (!seen) seen = &local;
-    for (const auto& d : *seen) {
+  // The first datagram that contains `text`, among those `seen` so far or those that come next;
+  // nothing when none comes.
+  std::optional<std::string> receiveUntil(const std::string& text) {
+    for (const auto& d : seen) {
       if (d.find(text) != std::string::npos) return d;
     }
     while (auto d = receive()) {
-      seen->push_back(*d);
+      seen.push_back(*d);
       if (d->find(text) != std::string::npos) return d;
     }
     return std::nullopt;
   }
+  std::vector<std::string> seen;
 
  private:
   std::filesystem::path path_;
@@ -183,8 +177,7 @@ TEST(DaemonStartup, LogsToTheJournalWithPrioritiesAndTheCategoryInAFieldOfItsOwn
   tavix::testing::TempHome home;
   DatagramSocket journal(home.root() / "journal");
   DaemonProcess d(TAVIXD_BINARY, home, {"--log-level", "debug"}, "journal.log", [&] { redirectJournalTo(journal.path()); });
-  std::vector<std::string> entries;
-  const auto started = journal.receiveUntil("MESSAGE=tavixd started", &entries);
+  const auto started = journal.receiveUntil("MESSAGE=tavixd started");
   if (!started && d.waitExit(0) == 77) GTEST_SKIP() << "no private mount namespace for a journal of our own";
   ASSERT_TRUE(started) << d.log();
   auto fields = journalFields(*started);
@@ -194,15 +187,15 @@ TEST(DaemonStartup, LogsToTheJournalWithPrioritiesAndTheCategoryInAFieldOfItsOwn
   EXPECT_EQ(fields["SYSLOG_IDENTIFIER"], "tavixd");
 
   // The bag request (logged before or after the start) is at the "default" level, the journal's notice.
-  const auto bagFetch = journal.receiveUntil("MESSAGE=Initiating bag fetch attempt", &entries);
-  ASSERT_TRUE(bagFetch) << entries.size() << " entries";
+  const auto bagFetch = journal.receiveUntil("MESSAGE=Initiating bag fetch attempt");
+  ASSERT_TRUE(bagFetch) << journal.seen.size() << " entries";
   fields = journalFields(*bagFetch);
   EXPECT_EQ(fields["PRIORITY"], "5");
   EXPECT_EQ(fields["CATEGORY"], "Tavix_Protocol");
 
   d.signal(SIGTERM);
-  const auto signalled = journal.receiveUntil("MESSAGE=SIGTERM", &entries);
-  ASSERT_TRUE(signalled) << entries.size() << " entries";
+  const auto signalled = journal.receiveUntil("MESSAGE=SIGTERM");
+  ASSERT_TRUE(signalled) << journal.seen.size() << " entries";
   EXPECT_EQ(journalFields(*signalled)["PRIORITY"], "7");
   EXPECT_EQ(d.waitExit(5000), 0) << d.log();
   EXPECT_EQ(d.log().find("tavixd started"), std::string::npos) << "logged twice: " << d.log();

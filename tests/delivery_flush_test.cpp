@@ -6,6 +6,9 @@
 #include <signal.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <filesystem>
+#include <fstream>
 #include <map>
 #include <nlohmann/json.hpp>
 #include <random>
@@ -16,15 +19,10 @@
 #include "feedback/persistent_storage.h"
 #include "feedback/tavix_feedback.h"
 #include "feedback/vocabulary.h"
-#include "platform/clock.h"
-#include "platform/defaults.h"
-#include "platform/dispatch.h"
 #include "support/devserver_process.h"
 #include "support/tavixd.h"
-#include "support/temp_home.h"
 #include "support/test_assembly.h"
 #include "support/test_seed.h"
-#include "tavix/client.h"
 #include "tavix_proto/feedback_records.pb.h"
 #include "tavix_proto/feedback_session.pb.h"
 
@@ -36,16 +34,17 @@ using testing::occurrences;
 using testing::runTool;
 using testing::testSeed;
 using testing::waitFor;
+using std::filesystem::exists;
+using namespace std::chrono_literals;
 
 constexpr const char* kFlusherActivity = "com.norvel.tavixd.flusher.background";
 
-// The session files of the test's own clients: the daemon's bag fetches leave sessions of
-// their own (agent "... tavixd/0.1"), which are not counted.
-std::size_t sessionFiles(const testing::TempHome& home) {
+// The session files of `agents`: the daemon's bag fetches and the tool's connections leave
+// sessions of their own, which are not counted.
+std::size_t sessionFiles(const testing::TempHome& home, const std::vector<std::string>& agents) {
   std::size_t n = 0;
   for (const auto& bytes : testing::sessionFileContents(home)) {
-    n += bytes.find("seekara/1") != std::string::npos || bytes.find("brovane/2") != std::string::npos ||
-         bytes.find("news/3") != std::string::npos;
+    n += std::any_of(agents.begin(), agents.end(), [&](const auto& a) { return bytes.find(a) != std::string::npos; });
   }
   return n;
 }
@@ -64,8 +63,7 @@ class DeliveryDaemon : public ::testing::Test, protected testing::TestAssembly {
  protected:
   DeliveryDaemon() {
     home.exportEnvironment();
-    platform::UserDefaults daemonDefaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
-    daemonDefaults.setObject("TVXBagURL", server.base + "/bag");
+    testing::setDaemonDefaults(home, {{"TVXBagURL", server.base + "/bag"}});
   }
   // Finished sessions of two error events each, one per agent.
   void writeSessions(const std::vector<std::string>& agents) {
@@ -109,18 +107,25 @@ class DeliveryDaemon : public ::testing::Test, protected testing::TestAssembly {
   testing::DevServerProcess server{DEVSERVER_BINARY};
 };
 
+// tavix_tool running in the background, its output (stdout and stderr) in home/`logName`.
+testing::DaemonProcess backgroundTool(const testing::TempHome& home, std::vector<std::string> args,
+                                      const std::string& logName) {
+  return testing::DaemonProcess(TAVIX_TOOL_BINARY, home, std::move(args), logName, [] { ::dup2(2, 1); });
+}
+
 TEST_F(DeliveryDaemon, SessionsWaitAcrossARestartAndWhileFlushingIsStoppedUntilADump) {
   ASSERT_FALSE(server.base.empty()) << server.firstLine;
   std::string out;
-  writeSessions({"seekara/1", "brovane/2", "news/3"});
-  ASSERT_EQ(sessionFiles(home), 3u);
+  const std::vector<std::string> agents = {"seekara/1", "brovane/2", "news/3"};
+  writeSessions(agents);
+  ASSERT_EQ(sessionFiles(home, agents), 3u);
 
   {
     // A start and a stop leave waiting sessions where they are.
     Daemon d(home, "tavixd-1.log");
     EXPECT_EQ(d.stop(), 0);
   }
-  ASSERT_EQ(sessionFiles(home), 3u);
+  ASSERT_EQ(sessionFiles(home, agents), 3u);
 
   {
     Daemon d(home, "tavixd-2.log");
@@ -129,8 +134,7 @@ TEST_F(DeliveryDaemon, SessionsWaitAcrossARestartAndWhileFlushingIsStoppedUntilA
     EXPECT_NE(out.find("periodic flushing stopped"), std::string::npos) << out;
     ASSERT_EQ(runTool(std::string("activity run ") + kFlusherActivity, &out), 0) << out;
     EXPECT_TRUE(d.waitForLog("Flusher bailing because periodic flush is disabled")) << d.log();
-    // (The tool's own connections leave sessions of the daemon's beside the written ones.)
-    EXPECT_GE(sessionFiles(home), 3u);
+    EXPECT_EQ(sessionFiles(home, agents), 3u);
     EXPECT_TRUE(uploadsByAgent().empty());
 
     // A dump sends everything, shows each body as it goes, and turns periodic flushing back on.
@@ -146,31 +150,56 @@ TEST_F(DeliveryDaemon, SessionsWaitAcrossARestartAndWhileFlushingIsStoppedUntilA
   EXPECT_EQ(uploadsByAgent(), (std::map<std::string, int>{{"brovane/2", 1}, {"news/3", 1}, {"seekara/1", 1}}));
 }
 
-// tavix_tool running in the background, its output (stdout and stderr) in home/`logName`.
-testing::DaemonProcess backgroundTool(const testing::TempHome& home, std::vector<std::string> args,
-                                      const std::string& logName) {
-  return testing::DaemonProcess(TAVIX_TOOL_BINARY, home, std::move(args), logName, [] { ::dup2(2, 1); });
-}
-
-TEST_F(DeliveryDaemon, WatchUploadsShowsEachBodyAsItIsSent) {
+// Custom feedback items wait in their type's folder: the custom-feedback activity uploads each
+// one up to the size limit, reports a larger one in an error session, and deletes both; an item
+// written a moment ago is left for a later run, as its writer may not be done with it.
+TEST_F(DeliveryDaemon, CustomFeedbackIsUploadedOrReportedThenDeleted) {
   ASSERT_FALSE(server.base.empty()) << server.firstLine;
-  writeSessions({"messages/7"});
-  Daemon d(home, "tavixd-watch.log");
+  const auto root = home.cache() / "com.norvel.tavixd" / "CustomFeedback";
+  auto write = [&](const std::string& item, std::size_t size, bool settled = true) {
+    std::filesystem::create_directories((root / item).parent_path());
+    std::ofstream(root / item) << std::string(size, 'a');
+    if (settled) std::filesystem::last_write_time(root / item, std::filesystem::last_write_time(root / item) - 1h);
+  };
+  write("BrovaneAutoFill/fits", 2097152);
+  write("Quillet/over", 2097153);
+  write("Quillet/fresh", 10, false);
+  Daemon d(home, "tavixd-custom.log");
+  std::string out;
+  ASSERT_EQ(runTool("activity run com.norvel.tavixd.dp.flush", &out), 0) << out << d.log();
+  EXPECT_TRUE(waitFor([&] { return !exists(root / "BrovaneAutoFill/fits") && !exists(root / "Quillet/over"); }))
+      << d.log();
+  EXPECT_TRUE(d.waitForLog("Quillet/fresh is still being written; left for later")) << d.log();
+  EXPECT_TRUE(exists(root / "Quillet/fresh"));
+
+  // The oversize item's error goes out with the next sessions, its size and type as numbers and
+  // text; a watcher subscribed before the dump is shown the body, inflated back to the records.
   auto watcher = backgroundTool(home, {"watch-uploads", "--inflate"}, "watch-uploads.log");
   ASSERT_TRUE(d.waitForLog("new listener for flusher client sessions")) << d.log();
-
-  std::string out;
   ASSERT_EQ(runTool("dump", &out), 0) << out << d.log();
-  // The watcher subscribed first, so the bodies go to it, inflated back to the records sent.
+  json fits, oversize;
+  EXPECT_TRUE(waitFor([&] {
+    for (const auto& upload : serverGet("/_feedback")) {
+      if (upload.value("type", "") == "BrovaneAutoFill") fits = upload;
+      for (const auto& event : upload.contains("json") ? upload["json"].value("fb", json::array()) : json::array()) {
+        if (event.value("code", 0) == 4 && event.value("domain", "") == "kTVXErrorDomain") oversize = event;
+      }
+    }
+    return !fits.is_null() && !oversize.is_null();
+  }, 10000)) << d.log();
+  EXPECT_EQ(fits["size"], 2097152);
+  EXPECT_EQ(oversize["user_info"], (json{{"size", 2097153}, {"type", "Quillet"}})) << oversize;
   EXPECT_TRUE(waitFor([&] {
     std::istringstream lines(watcher.log());
     for (std::string line; std::getline(lines, line);) {
       const json upload = json::parse(line, nullptr, false);
-      if (upload.is_object() && upload["compressed_size"].get<int>() > 0 && upload["json"]["agent"] == "messages/7") return true;
+      if (upload.is_object() && upload["compressed_size"].get<int>() > 0 &&
+          upload["json"].dump().find(R"("type":"Quillet")") != std::string::npos) {
+        return true;
+      }
     }
     return false;
   }, 10000)) << watcher.log();
-  EXPECT_TRUE(waitFor([&] { return uploadsByAgent().count("messages/7") == 1; }, 10000));
   EXPECT_EQ(d.stop(), 0);
 }
 
@@ -232,7 +261,7 @@ TEST_F(DeliveryDaemon, ASessionIsNeverLostWhereverAFlushIsKilled) {
   const auto uploads = uploadsByAgent();
   for (const auto& agent : agents) EXPECT_EQ(uploads.count(agent) ? uploads.at(agent) : 0, 1) << agent;
   RecordProperty("repeats", std::to_string(repeats()));
-  EXPECT_EQ(sessionFiles(home), 0u);
+  EXPECT_EQ(sessionFiles(home, agents), 0u);
   EXPECT_EQ(last.stop(), 0);
 }
 
@@ -263,11 +292,7 @@ TEST_F(DeliveryDaemon, EventsOfEveryShapeReachTheServerWithTheirOwnFields) {
   Daemon d(home, "tavixd-types.log");
   auto watcher = backgroundTool(home, {"watch"}, "watch.log");
   ASSERT_TRUE(d.waitForLog("new listener for client feedbacks")) << d.log();
-  client::Client::Options options;
-  options.socketPath = d.socket;
-  options.configuration.set_identifier("com.norvel.seekara");
-  options.configuration.set_user_agent("seekara/types");
-  client::Client app(options);
+  client::Client app(d.clientOptions("com.norvel.seekara", "seekara/types"));
   ASSERT_FALSE(app.connect()) << d.log();
   for (const auto& c : cases) {
     Payload payload;

@@ -41,7 +41,7 @@ TEST_P(HostileBackEndTest, OneAnswerByTheDeadlineAndTheDaemonServesOn) {
   ASSERT_TRUE(tavix::testing::waitFor([&] { return served("/search") == 1; })) << tavixd->log();
 
   // Another client is served while the hostile answer is dealt with.
-  client::Client other(clientOptions("com.norvel.brovane", "brovane/1.0"));
+  client::Client other(tavixd->clientOptions("com.norvel.brovane", "brovane/1.0"));
   auto card = request("");
   card.mutable_card();
   const auto otherAnswer = send(other, card);
@@ -113,7 +113,7 @@ TEST_F(QueryDaemonTest, AFloodingClientWaitsOnItsOwnSocketWhileOthersAreServed) 
   ASSERT_TRUE(tavixd->waitForLog("calls unanswered")) << tavixd->log();
   ASSERT_TRUE(tavix::testing::waitFor([&] { return served("/search") == 64; })) << served("/search");
 
-  client::Client other(clientOptions("com.norvel.brovane", "brovane/1.0"));
+  client::Client other(tavixd->clientOptions("com.norvel.brovane", "brovane/1.0"));
   auto card = request("");
   card.mutable_card();
   const auto otherAnswer = send(other, card);

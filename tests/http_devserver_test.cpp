@@ -1,4 +1,4 @@
-// The tavix-devserver program as a newcomer runs it: a free port, its bag, search and records.
+// The tavix-devserver program as a newcomer runs it: a free port, the requests it records and keeps.
 #include <signal.h>
 #include <sys/wait.h>
 
@@ -24,7 +24,7 @@ std::pair<long, json> get(URLSession& session, const std::string& url) {
   return {outcome.response ? outcome.response->statusCode : 0, json::parse(outcome.data, nullptr, false)};
 }
 
-TEST(HTTPDevServerTest, ServesItsBagAndSearchAndKeepsWhatItRecords) {
+TEST(HTTPDevServerTest, KeepsWhatItRecordsAndStopsCleanly) {
   tavix::testing::TempHome home;
   tavix::testing::DevServerProcess server(DEVSERVER_BINARY, {"--data-dir", (home.root() / "data").string()});
   const std::string prefix = "listening on http://127.0.0.1:";
@@ -34,19 +34,10 @@ TEST(HTTPDevServerTest, ServesItsBagAndSearchAndKeepsWhatItRecords) {
 
   DispatchPool pool(1);
   URLSession session{URLSessionConfiguration{.delegatePool = &pool}};
-  // The bag's addresses and resources are used by every daemon test; here what the server keeps.
-  auto [bagStatus, bag] = get(session, base + "/bag");
-  ASSERT_EQ(bagStatus, 200);
-  ASSERT_EQ(bag["search_url"], base + "/search");
-  auto [searchStatus, reply] = get(session, bag["search_url"].get<std::string>() + "?q=Fli");
-  ASSERT_EQ(searchStatus, 200);
-  EXPECT_EQ(reply[0]["query"], "flight status");
-  EXPECT_EQ(reply[0]["results"].size(), 1u);
-  // No completion in the corpus: the query comes back as it was, with no results.
-  auto [_, none] = get(session, base + "/search?q=zzz");
-  EXPECT_EQ(none[0]["query"], "zzz");
-  EXPECT_TRUE(none[0]["results"].empty());
-
+  // What it serves is used by every daemon test; here what it keeps of the requests.
+  get(session, base + "/bag");
+  get(session, base + "/search?q=Fli");
+  get(session, base + "/search?q=zzz");
   auto [recordedStatus, recorded] = get(session, base + "/_recorded");
   ASSERT_EQ(recorded.size(), 3u);  // control endpoints are not recorded
   EXPECT_EQ(recorded[1]["query"]["q"], "Fli");

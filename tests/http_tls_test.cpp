@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
+#include <memory>
 #include <thread>
 
 #include "platform/dispatch.h"
@@ -34,14 +35,11 @@ TEST(HTTPTLSTest, PeersAreVerifiedAgainstTheTrustedCertificates) {
   const int port = server.bind_to_any_port("127.0.0.1");
   ASSERT_GT(port, 0);
   std::thread listener([&] { server.listen_after_bind(); });
-  struct StopOnExit {
-    httplib::SSLServer& server;
-    std::thread& listener;
-    ~StopOnExit() {
-      server.stop();
-      listener.join();
-    }
-  } stopOnExit{server, listener};
+  // Stopped and joined however the test ends.
+  const std::shared_ptr<void> stopOnExit(nullptr, [&](void*) {
+    server.stop();
+    listener.join();
+  });
   const std::string url = "https://127.0.0.1:" + std::to_string(port) + "/bag";
 
   DispatchPool pool(1);

@@ -22,26 +22,16 @@
 
 namespace {
 
+using namespace tavix::testing;
 using tavix::client::Client;
-using tavix::testing::configureFrame;
-using tavix::testing::rawConnect;
-using tavix::testing::rawReceive;
-using tavix::testing::rawSend;
+using Daemon = Tavixd;
 
-using Daemon = tavix::testing::Tavixd;
-using tavix::testing::runTool;
-
-Client::Options options(const Daemon& d, std::string identifier = "tests", std::string userAgent = "tests/1") {
-  Client::Options o;
-  o.socketPath = d.socket;
-  o.configuration.set_identifier(std::move(identifier));
-  o.configuration.set_user_agent(std::move(userAgent));
-  o.timeoutMs = 5000;
-  return o;
+Client::Options options(const Daemon& d, const std::string& userAgent = "tests/1") {
+  return d.clientOptions("tests", userAgent, 5000);
 }
 
 TEST(IpcDaemon, BadFramesAndVanishingClientsDoNotStopTheDaemon) {
-  tavix::testing::TempHome home;
+  TempHome home;
   Daemon d(home);
 
   int fd = rawConnect(d.socket);
@@ -89,7 +79,7 @@ TEST(IpcDaemon, BadFramesAndVanishingClientsDoNotStopTheDaemon) {
 }
 
 TEST(IpcDaemon, BadConfigurationGetsNoReplyAndAClosedConnection) {
-  tavix::testing::TempHome home;
+  TempHome home;
   Daemon d(home);
   for (auto [identifier, userAgent, message] :
        {std::tuple{"", "ua/1", "configuration requires identifier"}, std::tuple{"id", "", "configuration requires userAgent"}}) {
@@ -101,7 +91,7 @@ TEST(IpcDaemon, BadConfigurationGetsNoReplyAndAClosedConnection) {
     EXPECT_TRUE(d.waitForLog(message)) << d.log();
   }
 
-  Client refused(options(d, "tests", ""));
+  Client refused(options(d, ""));
   auto error = refused.connect();
   ASSERT_TRUE(error);
   EXPECT_EQ(error->code, tavix::client::kConnectionLost);
@@ -110,14 +100,14 @@ TEST(IpcDaemon, BadConfigurationGetsNoReplyAndAClosedConnection) {
   // Each refusal is recorded as an error in the daemon's own feedback session.
   EXPECT_EQ(d.stop(), 0);
   int recorded = 0;
-  for (const auto& bytes : tavix::testing::sessionFileContents(home)) {
-    recorded += static_cast<int>(tavix::testing::occurrences(bytes, "invalid configuration"));
+  for (const auto& bytes : sessionFileContents(home)) {
+    recorded += static_cast<int>(occurrences(bytes, "invalid configuration"));
   }
   EXPECT_EQ(recorded, 3);
 }
 
 TEST(IpcDaemon, ClientFailsCallsInFlightOnceAndReconnectsToTheNextDaemon) {
-  tavix::testing::TempHome home;
+  TempHome home;
   auto d = std::make_unique<Daemon>(home, "first.log");
   Client client(options(*d));
   ASSERT_FALSE(client.connect());
@@ -146,7 +136,7 @@ TEST(IpcDaemon, ClientFailsCallsInFlightOnceAndReconnectsToTheNextDaemon) {
 }
 
 TEST(IpcDaemon, ToolReadsDefaultsAndCountersWithTheDaemonStoppedAndRunsActivities) {
-  tavix::testing::TempHome home;
+  TempHome home;
   home.exportEnvironment();  // the tool runs in this environment
   std::string out;
   EXPECT_EQ(runTool("defaults write TVXFeedbackFlushDisabled --bool true", &out), 0) << out;
@@ -179,7 +169,7 @@ TEST(IpcDaemon, ToolReadsDefaultsAndCountersWithTheDaemonStoppedAndRunsActivitie
 }
 
 TEST(IpcDaemon, ClearDataLaunchEventForgetsTheSystemSearchCompletionsOnly) {
-  tavix::testing::TempHome home;
+  TempHome home;
   tavix::platform::DispatchPool pool(2);
   tavix::platform::SystemClock clock(pool);
   auto open = [&] {
@@ -204,7 +194,7 @@ TEST(IpcDaemon, ClearDataLaunchEventForgetsTheSystemSearchCompletionsOnly) {
 
 // The client reads a resource through the descriptor the daemon opened for it, never by path.
 TEST(IpcDaemon, ResourceFilesTravelAsReadOnlyDescriptors) {
-  tavix::testing::TempHome home;
+  TempHome home;
   home.exportEnvironment();  // the tool runs in this environment
   const auto caches = home.cache() / "com.norvel.tavixd";
   std::filesystem::create_directories(caches);
@@ -233,8 +223,7 @@ TEST(IpcDaemon, ResourceFilesTravelAsReadOnlyDescriptors) {
   EXPECT_EQ(read(found.fd, buffer, sizeof buffer), 6);
   EXPECT_STREQ(buffer, "[\"wn\"]");
   close(found.fd);
-  EXPECT_NE(found.attributes.find("<key>fileSize</key>"), std::string::npos) << found.attributes;
-  EXPECT_NE(found.attributes.find("<integer>6</integer>"), std::string::npos) << found.attributes;
+  EXPECT_NE(found.attributes.find("<key>fileSize</key>\n\t<integer>6</integer>"), std::string::npos) << found.attributes;
 
   for (const char* identifier : {"missing", "../outside"}) {
     auto refused = ask(identifier);

@@ -2,14 +2,12 @@
 // the client gets back, what reached the server, and the records left in the client's session.
 #include <gtest/gtest.h>
 
-#include <filesystem>
-#include <fstream>
+#include <algorithm>
 #include <future>
 #include <mutex>
 #include <optional>
 
 #include "support/query_daemon.h"
-#include "tavix_proto/feedback_session.pb.h"
 
 namespace {
 
@@ -19,11 +17,12 @@ using tavix::testing::QueryDaemonTest;
 
 TEST_F(QueryDaemonTest, ClientsHearTheBagWhenTheyConfigureWhenTheyAskAndWhenItChanges) {
   ASSERT_FALSE(server.base.empty());
+  tavix::testing::setDaemonDefaults(home, {{"TVXStorefrontIdentifier", "143441-1,29"}});
   startDaemon();
   // A second client of the same identifier hears the bag in its own right.
   std::mutex lock;
   std::vector<proto::BagDidLoad> loads;
-  client::Client second(clientOptions("com.norvel.seekara", "seekara/1.0"));
+  client::Client second(tavixd->clientOptions("com.norvel.seekara", "seekara/1.0"));
   second.setBagDidLoadHandler([&](const proto::BagDidLoad& load) {
     std::lock_guard hold(lock);
     loads.push_back(load);
@@ -55,6 +54,10 @@ TEST_F(QueryDaemonTest, ClientsHearTheBagWhenTheyConfigureWhenTheyAskAndWhenItCh
   serveBag({{"version", "2"}});
   fault({{"path", "/search"}, {"headers", {{"X-Norvel-ForceFetch", R"({"bag": 2})"}}}, {"times", 1}});
   EXPECT_TRUE(send(request("weather")).reply);
+  const json searches = json::parse(call("/_recorded"));
+  EXPECT_TRUE(std::any_of(searches.begin(), searches.end(), [](const json& r) {
+    return r["path"] == "/search" && r["query"].value("storefront", "") == "143441-1,29";
+  })) << "the store front from the defaults goes with each search";
   ASSERT_TRUE(waitForLoads(2)) << tavixd->log();
   std::lock_guard hold(lock);
   EXPECT_EQ(loads.back().bag().version(), "2");
@@ -74,62 +77,6 @@ TEST_F(QueryDaemonTest, DisabledBagAnswersNothingAndNeverAsksTheServer) {
   ASSERT_TRUE(skip) << dumpRecords() << tavixd->log();
   EXPECT_EQ((*skip)["reason"], "bag_disabled") << skip->dump();
   EXPECT_EQ(served("/search"), 0);
-}
-
-TEST_F(QueryDaemonTest, FeedbackIsTiedToItsQueryWarmsTheConnectionAndFeedsEngagedCompletions) {
-  ASSERT_FALSE(server.base.empty());
-  serveBag({{"smart_history_enabled", true}});
-  startDaemon();
-  auto report = [&](const proto::CTFeedbackPayload& payload, std::uint64_t id) {
-    proto::Envelope e;
-    e.mutable_report_feedback_payload_data()->set_data(payload.SerializeAsString());
-    e.mutable_report_feedback_payload_data()->set_query_id(id);
-    ASSERT_TRUE(app->post(e));
-  };
-
-  // The search view appears from the today view: a search is likely, so the connection is warmed
-  // once; a second appearance within 30 seconds does not warm again.
-  proto::CTFeedbackPayload appear;
-  appear.set_type(1);
-  appear.mutable_search_view_appear()->set_trigger_event(proto::AppearEvent::today_view);
-  report(appear, 1);
-  report(appear, 2);
-  ASSERT_TRUE(waitForRecord("search_view_appear", 2)) << dumpRecords();
-  EXPECT_TRUE(tavix::testing::waitFor([&] { return served("/warm") == 1; })) << tavixd->log();
-  EXPECT_EQ(served("/warm"), 1);
-
-  // An engaged completion: the record takes the query id of its result, not the one sent beside
-  // it, and the completion goes into the device's history and a completion-feature file.
-  proto::CTFeedbackPayload engaged;
-  engaged.set_type(7);
-  auto* engagement = engaged.mutable_result_engagement();
-  engagement->set_input("wea");
-  engagement->mutable_result()->set_query_id(777);
-  engagement->mutable_result()->set_completion("weather in lisbon");
-  engagement->mutable_result()->set_result_type(proto::ResultType::server_suggest);
-  report(engaged, 5);
-  auto record = waitForRecord("result_engagement", 777);
-  ASSERT_TRUE(record) << dumpRecords();
-  const auto folder = home.cache() / "com.norvel.tavixd" / "CustomFeedback" / "EngagedCompletion";
-  std::optional<json> feature;
-  tavix::testing::waitFor([&] {
-    std::error_code ec;
-    for (const auto& file : std::filesystem::directory_iterator(folder, ec)) {
-      std::ifstream in(file.path());
-      feature = json::parse(in, nullptr, false);
-      return true;
-    }
-    return false;
-  });
-  ASSERT_TRUE(feature) << tavixd->log();
-  EXPECT_EQ(*feature, (json{{"lc", "weather in lisbon"}, {"q", "wea"}, {"e", true}, {"c", 2}}));
-
-  // Undecodable payloads are refused with a log line; the daemon goes on.
-  proto::Envelope bad;
-  bad.mutable_report_feedback_payload_data()->set_data("\xff\xff not a payload");
-  ASSERT_TRUE(app->post(bad));
-  EXPECT_TRUE(tavixd->waitForLog("Failed deserializing _CTFeedbackPayload."));
-  EXPECT_TRUE(send(request("weather")).replied);
 }
 
 }  // namespace

@@ -11,8 +11,7 @@
 #include <map>
 #include <optional>
 
-#include "platform/defaults.h"
-#include "support/daemon_process.h"
+#include "support/tavixd.h"
 #include "support/devserver_process.h"
 #include "support/temp_home.h"
 #include "tavix_proto/feedback_session.pb.h"
@@ -33,13 +32,9 @@ class SearchProviderTest : public ::testing::Test {
   void SetUp() override {
     if (::access(kDbusDaemon, X_OK) != 0) GTEST_SKIP() << "dbus-daemon is not installed";
     ASSERT_FALSE(server.base.empty()) << server.firstLine;
-    {
-      platform::UserDefaults defaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
-      defaults.setObject("TVXBagURL", server.base + "/bag");
-      // Each client's session ends with its connection, so the provider's is written when it goes.
-      defaults.setObject("TVXSharedSession", platform::PropertyValue(false));
-      ASSERT_TRUE(defaults.synchronize());
-    }
+    // Each client's session ends with its connection, so the provider's is written when it goes.
+    tavix::testing::setDaemonDefaults(
+        home, {{"TVXBagURL", server.base + "/bag"}, {"TVXSharedSession", platform::PropertyValue(false)}});
     tavixd.emplace(TAVIXD_BINARY, home, std::vector<std::string>{"--log-level", "debug"});
     ASSERT_TRUE(tavixd->waitForLog("bag change notification received", 10000)) << tavixd->log();
 
@@ -51,32 +46,17 @@ class SearchProviderTest : public ::testing::Test {
     const auto start = log.find("unix:");
     const std::string address = log.substr(start, log.find('\n', start) - start);
     ::setenv("DBUS_SESSION_BUS_ADDRESS", address.c_str(), 1);
-    ASSERT_GE(sd_bus_new(&shell), 0);
-    ASSERT_GE(sd_bus_set_address(shell, address.c_str()), 0);
-    ASSERT_GE(sd_bus_set_bus_client(shell, 1), 0);
-    ASSERT_GE(sd_bus_start(shell), 0);
+    ASSERT_GE(sd_bus_open_user(&shell), 0);
 
     // The opener writes what it was asked to open where the test can read it.
-    opener = home.root() / "opener";
+    const auto opener = home.root() / "opener";
     std::ofstream(opener) << "#!/bin/sh\necho \"$1\" >> " << (home.root() / "opened").string() << "\n";
     std::filesystem::permissions(opener, std::filesystem::perms::owner_all);
     provider.emplace(PROVIDER_BINARY, home, std::vector<std::string>{"--opener", opener.string()}, "provider.log");
-    ASSERT_TRUE(tavix::testing::waitFor([&] { return nameHasOwner(); })) << provider->log();
   }
   void TearDown() override {
     sd_bus_error_free(&error);  // the last call's error, if it failed
     sd_bus_flush_close_unref(shell);
-  }
-
-  bool nameHasOwner() {
-    sd_bus_message* reply = nullptr;
-    int owned = 0;
-    if (sd_bus_call_method(shell, "org.freedesktop.DBus", "/org/freedesktop/DBus", "org.freedesktop.DBus",
-                           "NameHasOwner", nullptr, &reply, "s", kName) >= 0) {
-      sd_bus_message_read(reply, "b", &owned);
-    }
-    sd_bus_message_unref(reply);
-    return owned != 0;
   }
 
   // Calls `method` with `args`; the reply (null with `error` set on failure) is the caller's to unref.
@@ -121,12 +101,12 @@ class SearchProviderTest : public ::testing::Test {
     sd_bus_message_enter_container(reply, 'a', "a{sv}");
     while (sd_bus_message_enter_container(reply, 'a', "{sv}") > 0) {
       Meta meta;
+      const char* key = nullptr;
+      const char* value = nullptr;
       while (sd_bus_message_enter_container(reply, 'e', "sv") > 0) {
-        const char* key = nullptr;
-        const char* value = nullptr;
-        sd_bus_message_read(reply, "s", &key);
-        std::string k = key;
-        if (sd_bus_message_read(reply, "v", "s", &value) >= 0) meta[k] = value;
+        if (sd_bus_message_read(reply, "s", &key) >= 0 && sd_bus_message_read(reply, "v", "s", &value) >= 0) {
+          meta[key] = value;
+        }
         sd_bus_message_exit_container(reply);
       }
       sd_bus_message_exit_container(reply);
@@ -156,15 +136,17 @@ class SearchProviderTest : public ::testing::Test {
   std::optional<tavix::testing::DaemonProcess> tavixd;
   std::optional<tavix::testing::DaemonProcess> bus;
   std::optional<tavix::testing::DaemonProcess> provider;
-  std::filesystem::path opener;
   sd_bus* shell = nullptr;
   sd_bus_error error = SD_BUS_ERROR_NULL;
 };
 
 TEST_F(SearchProviderTest, AnswersTheShellFromTheDaemonAndReportsWhatTheUserOpens) {
-  // The shell's first keystrokes: results from the devserver's corpus, through the daemon.
-  const auto initial = strings(call("GetInitialResultSet", std::vector<std::string>{"wea"}));
-  ASSERT_FALSE(initial.empty()) << error.message << provider->log() << tavixd->log();
+  // The shell's first keystrokes, once the provider owns its name: results from the devserver's
+  // corpus, through the daemon.
+  std::vector<std::string> initial;
+  ASSERT_TRUE(tavix::testing::waitFor([&] {
+    return !(initial = strings(call("GetInitialResultSet", std::vector<std::string>{"wea"}))).empty();
+  })) << error.message << provider->log() << tavixd->log();
   auto asked = initial;
   asked.push_back("no-such-result");
   const auto initialMetas = metas(asked);
@@ -175,8 +157,7 @@ TEST_F(SearchProviderTest, AnswersTheShellFromTheDaemonAndReportsWhatTheUserOpen
   }
 
   // More typed: the subsearch asks again and narrows to one result.
-  const auto narrowed =
-      strings(call("GetSubsearchResultSet", initial, std::vector<std::string>{"weather", "r"}));
+  const auto narrowed = strings(call("GetSubsearchResultSet", initial, std::vector<std::string>{"weather", "r"}));
   ASSERT_EQ(narrowed.size(), 1u) << error.message;
   const auto meta = metas(narrowed);
   ASSERT_EQ(meta.size(), 1u);

@@ -10,7 +10,6 @@
 
 #include "platform/activity.h"
 #include "platform/defaults.h"
-#include "platform/ipc/frame.h"
 #include "platform/ipc/launch_events.h"
 #include "platform/ipc/server.h"
 #include "platform/log.h"
@@ -18,8 +17,8 @@
 #include "query/client_state.h"
 #include "query/client_state_manager.h"
 #include "support/connection_services.h"
+#include "support/raw_frames.h"
 #include "tavix_proto/ipc.pb.h"
-#include "cache/engaged_completion_cache.h"
 
 namespace tavix {
 namespace {
@@ -37,12 +36,14 @@ struct Harness : testing::TestAssembly {
   ipc::UniqueFd client;
   std::shared_ptr<ipc::IpcConnection> connection;
   std::shared_ptr<ClientConnection> subject;
-  ipc::FrameDecoder decoder;
 
   explicit Harness(std::size_t maxFrame = ipc::kMaxFrameSize) {
     int fds[2];
     EXPECT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
     client.reset(fds[1]);
+    // A missing reply fails the test instead of hanging it.
+    const timeval timeout{10, 0};
+    ::setsockopt(fds[1], SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
     connection = ipc::IpcConnection::make(pool, ipc::UniqueFd(fds[0]), {::getpid(), ::getuid(), ::getgid()},
                                           "test.connection", log, maxFrame);
     subject = std::make_shared<ClientConnection>(services.env, connection);
@@ -58,27 +59,19 @@ struct Harness : testing::TestAssembly {
 
   void post(proto::Envelope e, std::uint64_t id = 0) {
     e.set_call_id(id);
-    auto frame = ipc::encodeFrame(e.SerializeAsString());
-    std::size_t sent = 0;
-    EXPECT_FALSE(ipc::sendWithFds(client.get(), frame, {}, true, &sent));
+    testing::rawSend(client.get(), e.SerializeAsString());
   }
   proto::Envelope call(proto::Envelope e, std::uint64_t id = 1) {
     post(std::move(e), id);
     return receive();
   }
+  // The next message; an empty one when the connection was closed.
   proto::Envelope receive() {
     proto::Envelope reply;
-    char buf[4096];
-    for (;;) {
-      if (auto p = decoder.next()) {
-        EXPECT_TRUE(reply.ParseFromString(*p));
-        return reply;
-      }
-      std::vector<int> fds;
-      std::size_t n = 0;
-      if (ipc::receiveWithFds(client.get(), buf, sizeof buf, true, &fds, &n) || n == 0) return reply;
-      decoder.append(buf, n);
-    }
+    const std::string bytes = testing::rawReceive(client.get());
+    EXPECT_NE(bytes, "<timeout>");
+    if (bytes != "<eof>" && bytes != "<timeout>") EXPECT_TRUE(reply.ParseFromString(bytes));
+    return reply;
   }
   // The connection's keep-alive transactions (a bag fetch holds one of its own).
   std::size_t keepAlives() { return transactions.open()["com.norvel.tavixd.ipc"]; }
@@ -147,16 +140,6 @@ TEST(ClientConnection, OneBagPerClientHoweverOftenItConfiguresAndLateRepliesAreL
   EXPECT_TRUE(capture.contains("(pid:" + std::to_string(::getpid()) + ") remote proxy error: connection invalidated"));
 }
 
-// Delivered launch events and activity runs are checked over the daemon's socket; here the stream
-// nobody registered.
-TEST(ClientConnection, ANotifyOnAnUnknownStreamIsRefused) {
-  Harness h;
-  auto reply = h.call(notify("x", "no.such.stream"), 5);
-  EXPECT_EQ(reply.call_id(), 5u);
-  EXPECT_FALSE(reply.notify_reply().delivered());
-  EXPECT_EQ(reply.notify_reply().error().code(), 404);
-}
-
 TEST(ClientConnection, RelaysResourceNotificationsThatNameAResource) {
   Harness h;
   auto& center = *h.assembly.notificationCenter;
@@ -175,25 +158,12 @@ TEST(ClientConnection, RelaysResourceNotificationsThatNameAResource) {
   EXPECT_EQ(got, (std::vector<std::string>{"+hints", "-old"}));
 }
 
-TEST(ClientConnection, QueriesBeforeAValidConfigurationAndOfUnknownKindAreNotAnswered) {
-  Harness h;
-  proto::Envelope request;
-  request.mutable_request()->mutable_request()->set_query_id(9);
-  request.mutable_request()->mutable_request()->mutable_flight_search()->set_flight_query("NV 12");
-  h.post(request, 3);  // no state bound yet
-  request.mutable_request()->mutable_request()->clear_kind();
-  h.post(request, 4);  // no kind
-  EXPECT_EQ(h.call(notify("after"), 5).call_id(), 5u) << "neither request got a reply";
-}
-
 TEST(ClientConnection, RefusesConfigurationsThatWouldInjectHeaders) {
   platform::LogCapture capture;
-  proto::Envelope configure;
-  configure.mutable_configure()->mutable_configuration()->set_identifier("com.norvel.seekara");
-  configure.mutable_configure()->mutable_configuration()->set_user_agent("seekara/1.0\r\nX-Injected: agent");
   {
     Harness h;
-    EXPECT_FALSE(h.call(configure).has_configure_reply()) << "closed without a reply";
+    EXPECT_FALSE(h.call(configure("com.norvel.seekara", "seekara/1.0\r\nX-Injected: agent")).has_configure_reply())
+        << "closed without a reply";
     EXPECT_TRUE(capture.contains("configuration carries a control character"));
     EXPECT_TRUE(capture.contains("seekara/1.0\\x0d\\x0aX-Injected: agent")) << "logged, escaped";
     EXPECT_TRUE(h.assembly.clientStateManager->sessions().empty()) << "no state for a refused client";
@@ -202,8 +172,7 @@ TEST(ClientConnection, RefusesConfigurationsThatWouldInjectHeaders) {
   capture.clear();
   Harness h;
   h.assembly.userDefaults->setObject("TVXDeviceModel", "Desk\nX-Injected: model");
-  configure.mutable_configure()->mutable_configuration()->set_user_agent("seekara/1.0");
-  EXPECT_FALSE(h.call(configure).has_configure_reply());
+  EXPECT_FALSE(h.call(configure("com.norvel.seekara", "seekara/1.0")).has_configure_reply());
   EXPECT_TRUE(capture.contains("configuration carries a control character"));
 }
 
@@ -224,9 +193,23 @@ TEST(ClientConnection, AnswersTooLargeForAFrameAndDatesThatAreNotNumbersAreRefus
   EXPECT_TRUE(capture.contains("are not both numbers"));
 }
 
-// The full user agent a client is known by is checked over the daemon's socket, in its bag.
-TEST(ClientConnection, KeepsItsFirstIdentifier) {
+// Delivered launch events and activity runs, and the full user agent a client is known by, are
+// checked over the daemon's socket.
+TEST(ClientConnection, RefusesWhatItCannotServeAndKeepsItsFirstIdentifier) {
   Harness h;
+  auto reply = h.call(notify("x", "no.such.stream"), 2);
+  EXPECT_EQ(reply.call_id(), 2u);
+  EXPECT_FALSE(reply.notify_reply().delivered());
+  EXPECT_EQ(reply.notify_reply().error().code(), 404) << "a stream nobody registered";
+
+  proto::Envelope request;
+  request.mutable_request()->mutable_request()->set_query_id(9);
+  request.mutable_request()->mutable_request()->mutable_flight_search()->set_flight_query("NV 12");
+  h.post(request, 3);  // no state bound yet
+  request.mutable_request()->mutable_request()->clear_kind();
+  h.post(request, 4);  // no kind
+  EXPECT_EQ(h.call(notify("after"), 5).call_id(), 5u) << "neither request got a reply";
+
   EXPECT_TRUE(h.call(configure("first", "client/2")).has_configure_reply());
   EXPECT_TRUE(h.call(configure("second", "client/2")).has_configure_reply());
   h.connection->queue().sync([&] {

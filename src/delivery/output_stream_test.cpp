@@ -68,7 +68,6 @@ TEST(CompressedOutputStreamTest, RoundTripsThroughZlibInPiecesOfAtMost4096Bytes)
       {"", 1},
       {"hello, feedback", 3},
       {jsonLikeText(300000), 8192},
-      {jsonLikeText(70000), 70000},
       {randomBytes(50000, 1), 50000},  // incompressible: the output buffer fills many times in one write
   };
   for (const auto& c : cases) {
@@ -113,7 +112,6 @@ TEST(CompressedOutputStreamTest, DigestHashesTheInputOncePerCompressorPass) {
     for (std::size_t offset = 0; offset < text.size(); offset += 1000) stream.write(std::string_view(text).substr(offset, 1000));
     stream.close();
     EXPECT_EQ(stream.dataDigestForStream(), sha512Hex(text));
-    EXPECT_EQ(stream.dataDigestForStream().size(), 128u);
   }
   // One write of incompressible bytes fills the 4096-byte buffer several times: the input is
   // hashed once per pass, and the byte count adds what was consumed so far on every pass.
@@ -126,8 +124,6 @@ TEST(CompressedOutputStreamTest, DigestHashesTheInputOncePerCompressorPass) {
     EXPECT_NE(stream.dataDigestForStream(), sha512Hex(noise));
     EXPECT_GT(reported, static_cast<long>(noise.size()));
     EXPECT_EQ(stream.dataDigestForStream(), devserver::expectedFeedbackDigest(noise, noise.size()));
-    std::string twice = noise + noise;
-    EXPECT_NE(stream.dataDigestForStream(), sha512Hex(twice)) << "more than two passes for 300000 random bytes";
   }
 }
 

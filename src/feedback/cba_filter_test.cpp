@@ -37,21 +37,23 @@ TEST(CBAFilter, MatchTypesFromIdenticalDownToNone) {
   EXPECT_EQ(match("mailto:a", "mailto:b"), kCBAMatchNone);  // no host: nothing to compare by domain
 }
 
-FeedbackRef visible(std::int64_t queryId, const std::vector<std::pair<std::string, std::string>>& results) {
+FeedbackRef visible(std::int64_t queryId, const std::vector<std::pair<std::string, std::string>>& results,
+                    const std::string& agent = "Brovane/17") {
   proto::CTVisibleResultsFeedback v;
   for (const auto& [section, url] : results) {
     auto* r = v.add_results();
     r->set_section_bundle_id(section);
     r->mutable_punchout()->add_urls(url);
   }
-  return makeTavixFeedbackWithCodable(v, queryId, "", "Brovane/17");
+  return makeTavixFeedbackWithCodable(v, queryId, "", agent);
 }
 
-FeedbackRef cba(std::int64_t queryId, const std::string& url, std::uint64_t ms = 0) {
+FeedbackRef cba(std::int64_t queryId, const std::string& url, std::uint64_t ms = 0,
+                const std::string& agent = "Brovane/17") {
   proto::CTCBAEngagementFeedback e;
   e.set_timestamp(ms * 1000000);
   e.set_url(url);
-  return makeTavixFeedbackWithCodable(e, queryId, "", "Brovane/17");
+  return makeTavixFeedbackWithCodable(e, queryId, "", agent);
 }
 
 constexpr const char* kWebSuggest = "com.norvel.tavix.web_suggest";
@@ -74,12 +76,7 @@ TEST(CBAFilter, EngagementsAreGradedAgainstEarlierWebResultsOfTheirQuery) {
   const std::vector<FeedbackRef> in = {early, shown, withQuery, keepMe, amp, otherSection, otherQuery, unrelated,
                                        lateVisible, nullptr};
   const auto out = CBAFilterController().arrayOfCBAFilteredFeedback(in);
-  ASSERT_EQ(out.size(), 5u);
-  EXPECT_EQ(out[0], shown);
-  EXPECT_EQ(out[1], withQuery);
-  EXPECT_EQ(out[2], keepMe);
-  EXPECT_EQ(out[3], amp);
-  EXPECT_EQ(out[4], lateVisible);
+  EXPECT_EQ(out, (std::vector<FeedbackRef>{shown, withQuery, keepMe, amp, lateVisible}));
 
   EXPECT_EQ(withQuery->payload().cba_engagement().cba_type(), kCBAMatchWithoutQuery);
   EXPECT_EQ(withQuery->payload().cba_engagement().url(), "");
@@ -97,15 +94,10 @@ TEST(CBAFilter, OnlyBrowserSessionsAreFilteredOnTheirWayOut) {
   auto& assembly = f.assembly;
 
   auto upload = [&](const std::string& agent) {
-    auto first = visible(4, {{kWebIndex, "https://a.com/x"}});
-    first->set_user_agent(agent);
-    auto session = ClientSession::open(feedbackEnvironment(assembly), first);
-    auto matched = cba(4, "https://a.com/x", 1);
-    auto unmatched = cba(4, "https://nowhere.com/", 2);
-    matched->set_user_agent(agent);
-    unmatched->set_user_agent(agent);
-    session->addFeedback(matched);
-    session->addFeedback(unmatched);
+    auto session =
+        ClientSession::open(feedbackEnvironment(assembly), visible(4, {{kWebIndex, "https://a.com/x"}}, agent));
+    session->addFeedback(cba(4, "https://a.com/x", 1, agent));
+    session->addFeedback(cba(4, "https://nowhere.com/", 2, agent));
     session->sessionComplete();
     auto handles = assembly.persistentStorage->getAvailableSessionHandles();
     auto record = handles.back()->readRecord();

@@ -114,7 +114,7 @@ TEST(ClientSession, UploadRecordIsPrivacyFilteredWithMissingObjectsFirst) {
   EXPECT_EQ(upload.dump().find("device-result-7"), std::string::npos);
 }
 
-TEST(ClientSession, EventsWithoutTimeStampsAllSitAtZero) {
+TEST(ClientSession, UploadTimesCountFromTheTruncatedStartAndEventsWithoutOneSitAtZero) {
   SessionFixture f;
   auto appear = [](proto::AppearEvent::Value how) {
     proto::CTSearchViewAppearFeedback record;
@@ -127,10 +127,8 @@ TEST(ClientSession, EventsWithoutTimeStampsAllSitAtZero) {
   auto upload = nlohmann::json::parse(ClientSession::fromRecord(feedbackEnvironment(f.assembly), f.readBack(*session))->getFeedbacksToSend());
   ASSERT_EQ(upload["fb"].size(), 3u);
   for (const auto& event : upload["fb"]) EXPECT_EQ(event["timestamp"], 0) << event;
-}
 
-TEST(ClientSession, BaseTimeIsTheTruncatedStartOrNothingForADamagedOne) {
-  SessionFixture f;
+  // A damaged start leaves no base time.
   auto baseTime = [&](double start) {
     proto::CTClientSession record;
     record.set_session_start(start);

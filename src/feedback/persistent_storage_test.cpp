@@ -35,10 +35,8 @@ struct StorageFixture : testing::TestAssembly {
   void touch(const std::string& name, double ageSeconds = 0) {
     fs::create_directories(folder());
     std::ofstream(folder() / name) << "x";
-    const double when = platform::toUnixSeconds(clock.now()) - ageSeconds;
-    struct timespec times[2];
-    times[0].tv_sec = times[1].tv_sec = static_cast<time_t>(when);
-    times[0].tv_nsec = times[1].tv_nsec = 0;
+    const timespec when{static_cast<time_t>(platform::toUnixSeconds(clock.now()) - ageSeconds), 0};
+    const timespec times[2] = {when, when};
     ::utimensat(AT_FDCWD, (folder() / name).c_str(), times, 0);
   }
 };
@@ -60,6 +58,15 @@ FeedbackRef event(int n) {
 }
 
 std::size_t encodedSize(const proto::CTTavixFeedback& f) { return f.ByteSizeLong() + 3; }  // tag 2 + length 1
+
+// A session of `events` events, written and closed: it waits to be sent.
+std::shared_ptr<FileContainer> writeSession(TavixPersistentStorage& storage, int events) {
+  auto container = storage.createFileContainerForWriting();
+  container->writeSessionHeader(header(storage.version()));
+  for (int i = 1; i <= events; ++i) container->writeFeedback(*event(i));
+  storage.closeSessionWithFileContainer(container);
+  return container;
+}
 
 TEST(TavixPersistentStorage, ScanListsSessionsAndNumbersNewFilesAfterTheLargest) {
   StorageFixture f;
@@ -110,10 +117,7 @@ TEST(TavixPersistentStorage, FilesPastTheAgeLimitAreDeletedAtStart) {
 TEST(TavixPersistentStorage, SessionWrittenEventByEventReadsBack) {
   StorageFixture f;
   TavixPersistentStorage storage(f.storageEnvironment());
-  auto container = storage.createFileContainerForWriting();
-  container->writeSessionHeader(header(storage.version()));
-  for (int i = 1; i <= 3; ++i) container->writeFeedback(*event(i));
-  storage.closeSessionWithFileContainer(container);
+  auto container = writeSession(storage, 3);
   ASSERT_EQ(storage.getAvailableSessionHandles().size(), 1u);
   EXPECT_FALSE(container->isOpen());
   container->writeFeedback(*event(4), [](bool) { ADD_FAILURE() << "a closed file takes no events"; });
@@ -133,11 +137,8 @@ TEST(TavixPersistentStorage, SessionWrittenEventByEventReadsBack) {
 TEST(FileContainer, CutOffOrEmptyFilesKeepOnlyWhatIsWhole) {
   StorageFixture f;
   TavixPersistentStorage storage(f.storageEnvironment());
-  auto container = storage.createFileContainerForWriting();
   const auto head = header(storage.version());
-  container->writeSessionHeader(head);
-  for (int i = 1; i <= 3; ++i) container->writeFeedback(*event(i));
-  container->close();
+  auto container = writeSession(storage, 3);
   ASSERT_FALSE(container->isOpen());  // also waits for the queued appends
   const fs::path url = container->fileUrl();
   const auto full = fs::file_size(url);
@@ -267,10 +268,8 @@ TEST(FileContainer, AFullDiskLosesNoEventItAcknowledged) {
   EXPECT_EQ(read, acknowledged);
 
   // A session closed whole is synced before it waits to be sent.
-  auto other = storage.createFileContainerForWriting();
-  other->writeSessionHeader(header(storage.version()));
   const int before = disk->syncs;
-  storage.closeSessionWithFileContainer(other);
+  writeSession(storage, 0);
   EXPECT_EQ(storage.getAvailableSessionHandles().size(), 2u);
   EXPECT_EQ(disk->syncs, before + 1);
 }
@@ -278,12 +277,7 @@ TEST(FileContainer, AFullDiskLosesNoEventItAcknowledged) {
 TEST(TavixPersistentStorage, AClaimedSessionIsTakenOnceAndWaitsAgainWhenGivenBack) {
   StorageFixture f;
   auto storage = std::make_unique<TavixPersistentStorage>(f.storageEnvironment());
-  for (int i = 0; i < 2; ++i) {
-    auto container = storage->createFileContainerForWriting();
-    container->writeSessionHeader(header(storage->version()));
-    container->writeFeedback(*event(i));
-    storage->closeSessionWithFileContainer(container);
-  }
+  for (int i = 0; i < 2; ++i) writeSession(*storage, 1);
   const auto waiting = storage->getAvailableSessionHandles();
   ASSERT_EQ(waiting.size(), 2u);
   const fs::path name = waiting[0]->fileUrl();

@@ -20,6 +20,15 @@ void keepBagFetchesLocal(const TempHome& home) {
          "\t<key>TVXBagURL</key>\n\t<string>http://127.0.0.1:9/bag</string>\n</dict>\n</plist>\n";
 }
 
+void execChild(const std::string& binary, std::vector<std::string> args) {
+  args.insert(args.begin(), binary);
+  std::vector<char*> argv;
+  for (auto& a : args) argv.push_back(a.data());
+  argv.push_back(nullptr);
+  execv(binary.c_str(), argv.data());
+  _exit(127);
+}
+
 std::vector<std::string> sessionFileContents(const TempHome& home) {
   std::vector<std::string> files;
   std::error_code ec;
@@ -39,13 +48,7 @@ DaemonProcess::DaemonProcess(const std::string& binary, const TempHome& home, st
     int fd = open(logFile_.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
     dup2(fd, 2);
     if (inChild) inChild();
-    std::vector<std::string> all{binary};
-    all.insert(all.end(), args.begin(), args.end());
-    std::vector<char*> argv;
-    for (auto& a : all) argv.push_back(a.data());
-    argv.push_back(nullptr);
-    execv(binary.c_str(), argv.data());
-    _exit(127);
+    execChild(binary, std::move(args));
   }
 }
 

@@ -16,6 +16,9 @@ namespace tavix::testing {
 // at once (and holds the daemon for its retries, about 8 s). DaemonProcess does it by itself.
 void keepBagFetchesLocal(const TempHome& home);
 
+// In a forked child: runs `binary` with `args`, or exits with 127.
+[[noreturn]] void execChild(const std::string& binary, std::vector<std::string> args);
+
 // The bytes of each feedback session file, waiting or claimed, in the daemon's caches folder.
 std::vector<std::string> sessionFileContents(const TempHome& home);
 

@@ -5,6 +5,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include "support/daemon_process.h"
+
 namespace tavix::testing {
 
 DevServerProcess::DevServerProcess(const std::string& binary, std::vector<std::string> args) {
@@ -14,13 +16,8 @@ DevServerProcess::DevServerProcess(const std::string& binary, std::vector<std::s
   if (pid == 0) {
     dup2(out[1], 1);
     close(out[0]);
-    std::vector<std::string> all{binary, "--port", "0", "--max-lifetime", "60"};
-    all.insert(all.end(), args.begin(), args.end());
-    std::vector<char*> argv;
-    for (auto& a : all) argv.push_back(a.data());
-    argv.push_back(nullptr);
-    execv(binary.c_str(), argv.data());
-    _exit(127);
+    args.insert(args.begin(), {"--port", "0", "--max-lifetime", "60"});
+    execChild(binary, std::move(args));
   }
   close(out[1]);
   pollfd fd{out[0], POLLIN, 0};

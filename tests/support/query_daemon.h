@@ -53,25 +53,12 @@ class QueryDaemonTest : public ::testing::Test {
   }
 
   void startDaemon() {
-    {
-      platform::UserDefaults defaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
-      defaults.setObject("TVXBagURL", server.base + "/bag");
-      ASSERT_TRUE(defaults.synchronize());
-    }
+    setDaemonDefaults(home, {{"TVXBagURL", server.base + "/bag"}});
     tavixd.emplace(home);
     // With the bag in, no client waits for it (a wait counts as network use and delays warming).
     ASSERT_TRUE(tavixd->waitForLog("bag change notification received")) << tavixd->log();
-    app.emplace(clientOptions("com.norvel.seekara", "seekara/1.0"));
+    app.emplace(tavixd->clientOptions("com.norvel.seekara", "seekara/1.0"));
     ASSERT_FALSE(app->connect());
-  }
-  // A client of the daemon; its calls fail with kTimedOut after 10 s without an answer.
-  client::Client::Options clientOptions(const std::string& identifier, const std::string& userAgent) const {
-    client::Client::Options options;
-    options.socketPath = tavixd->socket;
-    options.configuration.set_identifier(identifier);
-    options.configuration.set_user_agent(userAgent);
-    options.timeoutMs = 10000;
-    return options;
   }
 
   proto::TVXRequest request(const std::string& input) {
@@ -120,11 +107,7 @@ class QueryDaemonTest : public ::testing::Test {
     for (const auto& text : reply.feedback_reply().feedbacks()) out.push_back(json::parse(text));
     return out;
   }
-  std::string dumpRecords() {
-    std::string out;
-    for (const auto& r : records()) out += r.dump() + "\n";
-    return out;
-  }
+  std::string dumpRecords() { return json(records()).dump(); }
   // Waits until the session holds a record of `type` for `queryId`; answers it.
   std::optional<json> waitForRecord(const std::string& type, std::uint64_t id) {
     std::optional<json> found;

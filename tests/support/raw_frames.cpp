@@ -38,20 +38,26 @@ void rawSend(int fd, const std::string& payload) {
   ASSERT_EQ(::send(fd, frame.data(), frame.size(), MSG_NOSIGNAL), static_cast<ssize_t>(frame.size()));
 }
 
-std::string rawReceive(int fd) {
-  std::string bytes;
-  char buf[4096];
-  for (;;) {
-    if (bytes.size() >= 4) {
-      const auto* p = reinterpret_cast<const unsigned char*>(bytes.data());
-      const std::size_t n = (std::size_t{p[0]} << 24) | (p[1] << 16) | (p[2] << 8) | p[3];
-      if (bytes.size() >= 4 + n) return bytes.substr(4, n);
-    }
-    const ssize_t r = ::recv(fd, buf, sizeof buf, 0);
+// Reads `n` bytes into `out`: "" once read, else "<eof>" or "<timeout>".
+static const char* readExactly(int fd, std::size_t n, std::string* out) {
+  out->resize(n);
+  for (std::size_t got = 0; got < n;) {
+    const ssize_t r = ::recv(fd, out->data() + got, n - got, 0);
     if (r == 0) return "<eof>";
     if (r < 0) return "<timeout>";
-    bytes.append(buf, static_cast<std::size_t>(r));
+    got += static_cast<std::size_t>(r);
   }
+  return "";
+}
+
+// Reads one frame and no more: a frame right behind it stays in the socket for the next call.
+std::string rawReceive(int fd) {
+  std::string header, payload;
+  if (const char* end = readExactly(fd, 4, &header); *end) return end;
+  const auto* p = reinterpret_cast<const unsigned char*>(header.data());
+  const std::size_t n = (std::size_t{p[0]} << 24) | (p[1] << 16) | (p[2] << 8) | p[3];
+  if (const char* end = readExactly(fd, n, &payload); *end) return end;
+  return payload;
 }
 
 std::string configureFrame(const std::string& identifier, const std::string& userAgent, std::uint64_t callId) {

@@ -5,13 +5,24 @@
 
 #include <sys/wait.h>
 
+#include <gtest/gtest.h>
+
 #include <cstdio>
 #include <string>
 #include <vector>
 
+#include "platform/defaults.h"
 #include "support/daemon_process.h"
+#include "tavix/client.h"
 
 namespace tavix::testing {
+
+// Sets `values` in the daemon's defaults in `home`, for the next daemon started there.
+inline void setDaemonDefaults(const TempHome& home, const platform::Dictionary& values) {
+  platform::UserDefaults defaults(home.config() / "com.norvel.tavixd", "com.norvel.tavixd");
+  for (const auto& [key, value] : values) defaults.setObject(key, value);
+  EXPECT_TRUE(defaults.synchronize());
+}
 
 #ifdef TAVIXD_BINARY
 // tavixd with debug logging, once start-up is complete: signal handling included, not merely
@@ -23,6 +34,17 @@ struct Tavixd : DaemonProcess {
       : DaemonProcess(TAVIXD_BINARY, home, withDebugLog(std::move(extra)), logName),
         socket((home.runtime() / "com.norvel.tavixd" / "socket").string()) {
     waitForLog("tavixd started");
+  }
+
+  // A client of this daemon; its calls fail with kTimedOut after `timeoutMs` without an answer.
+  client::Client::Options clientOptions(const std::string& identifier, const std::string& userAgent,
+                                        int timeoutMs = 10000) const {
+    client::Client::Options options;
+    options.socketPath = socket;
+    options.configuration.set_identifier(identifier);
+    options.configuration.set_user_agent(userAgent);
+    options.timeoutMs = timeoutMs;
+    return options;
   }
 
   static std::vector<std::string> withDebugLog(std::vector<std::string> extra) {
