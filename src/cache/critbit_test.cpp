@@ -54,26 +54,6 @@ TEST(CritbitTree, HoldsExactlyOneReferencePerStoredValue) {
   EXPECT_EQ(destroyed, 4);
 }
 
-// Order and prefixes in general are the random churn's below; these are the edges it may miss.
-TEST(CritbitTree, EnumerationStopsWhenAskedAndTheEmptyKeyComesFirst) {
-  CritbitTree tree;
-  const std::vector<std::string> keys = {"", "ab", "abc", "\xC3\xA9t\xC3\xA9", "a"};
-  for (const auto& k : keys) tree.setObject(makeRef<Item>(0), k);
-  EXPECT_EQ(tree.count(), keys.size());
-  EXPECT_TRUE(keysWithPrefix(tree, "abcde").empty());
-
-  std::vector<std::string> first;
-  tree.keysMatchingPrefix("", [&](std::string_view key, bool* stop) {
-    first.emplace_back(key);
-    *stop = true;
-  });
-  EXPECT_EQ(first, std::vector<std::string>{""});
-
-  tree.removeAllObjects();
-  EXPECT_EQ(tree.count(), 0u);
-  EXPECT_TRUE(keysWithPrefix(tree, "").empty());
-}
-
 // Random inserts and deletes against std::map: catches splice and delete faults that hand-picked
 // keys miss.
 TEST(CritbitTree, AgreesWithStdMapUnderRandomChurn) {

@@ -33,13 +33,16 @@ struct Recorder final : LocationManagerDelegate, MotionManagerDelegate {
   std::atomic<int> failures{0};
 };
 
-TEST(DefaultsLocationManager, DeliversTheConfiguredFixOrAFailure) {
+struct StandInTest : ::testing::Test {
   testing::TempHome home;
-  platform::DispatchPool pool(1);
+  platform::DispatchPool pool{1};
+  platform::UserDefaults defaults{home.config(), "com.norvel.tavixd"};
+  std::shared_ptr<Recorder> recorder = std::make_shared<Recorder>();
+};
+
+TEST_F(StandInTest, LocationDeliversTheConfiguredFixOrAFailure) {
   platform::VirtualClock clock;
-  platform::UserDefaults defaults(home.config(), "com.norvel.tavixd");
   DefaultsLocationManager manager(defaults, clock, pool);
-  auto recorder = std::make_shared<Recorder>();
 
   EXPECT_EQ(manager.authorizationStatus(), TVXLocationAuthorizationDenied);
   manager.startUpdatingLocation(recorder);
@@ -71,22 +74,17 @@ TEST(DefaultsLocationManager, DeliversTheConfiguredFixOrAFailure) {
   DefaultsRoutineManager routine(defaults);
   std::optional<int> mode = 5;
   defaults.setObject("TVXRoutineMode", -1);
-  EXPECT_TRUE(routine.modeForLocation({}, &mode));
-  EXPECT_EQ(mode, -1);
-  defaults.setObject("TVXRoutineMode", "often");
+  EXPECT_TRUE(routine.modeForLocation({}, &mode) && mode == -1);
+  defaults.setObject("TVXRoutineMode", "often");  // not a number: a failure, not "no mode"
   EXPECT_FALSE(routine.modeForLocation({}, &mode));
 }
 
-TEST(MotionManager, MapsActivitiesInPrecedenceOrderAndStopDropsPendingDeliveries) {
+TEST_F(StandInTest, MotionMapsActivitiesInPrecedenceOrderAndStopDropsPendingDeliveries) {
   EXPECT_EQ(transportationModeForActivity({}), 1);
   EXPECT_EQ(transportationModeForActivity({.stationary = true, .automotive = true}), 2);
   EXPECT_EQ(transportationModeForActivity({.automotive = true, .walking = true}), 6);
 
-  testing::TempHome home;
-  platform::DispatchPool pool(1);
-  platform::UserDefaults defaults(home.config(), "com.norvel.tavixd");
   DefaultsMotionManager manager(defaults, pool);
-  auto recorder = std::make_shared<Recorder>();
   defaults.setObject("TVXMotionActivity", "cycling");
   manager.startUpdatingMotionActivity(recorder);
   pool.drain();

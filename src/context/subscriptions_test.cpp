@@ -4,6 +4,7 @@
 
 #include "platform/defaults.h"
 #include "platform/log.h"
+#include "support/temp_home.h"
 
 namespace tavix {
 namespace {
@@ -67,15 +68,11 @@ TEST(Subscriptions, ABagWithoutEitherWhitelistReportsNothing) {
 }
 
 TEST(Subscriptions, DefaultsProviderSkipsEntriesItCannotRead) {
-  std::string pattern = (std::filesystem::temp_directory_path() / "tavix-subs-XXXXXX").string();
-  const std::filesystem::path folder = ::mkdtemp(pattern.data());
-  platform::UserDefaults defaults(folder, "com.norvel.tavixd");
+  testing::TempHome home;
+  platform::UserDefaults defaults(home.config(), "com.norvel.tavixd");
   DefaultsVideoSubscriptionProvider video(defaults);
   std::vector<VideoSubscription> out;
   std::string error;
-  EXPECT_TRUE(video.activeSubscriptions({"a"}, {"b.example"}, &out, &error));
-  EXPECT_TRUE(out.empty());
-
   // Entries the ordinary path (the daemon's context test) never sees are skipped one by one.
   using D = platform::Dictionary;
   defaults.setObject(kTVXVideoSubscriptionsKey,
@@ -94,7 +91,6 @@ TEST(Subscriptions, DefaultsProviderSkipsEntriesItCannotRead) {
   defaults.setObject(kTVXVideoSubscriptionsKey, "not an array");
   EXPECT_FALSE(video.activeSubscriptions({"a"}, {}, &out, &error));
   EXPECT_FALSE(error.empty());
-  std::filesystem::remove_all(folder);
 }
 
 }  // namespace

@@ -17,22 +17,14 @@ TEST(LocaleContext, SettingsComeFromDefaultsBeforeTheEnvironment) {
   ::setenv("LC_MESSAGES", "de_AT.UTF-8@euro", 1);
   ::setenv("LANGUAGE", "pt_BR:en::C", 1);
   ::setenv("TZ", ":Asia/Tokyo", 1);
-  TVXLocaleSettings fromEnvironment = TVXCurrentLocaleSettings(&defaults);
-  EXPECT_EQ(fromEnvironment.locale, "de_AT");
-  EXPECT_EQ(fromEnvironment.languages, (std::vector<std::string>{"pt-BR", "en"}));
-  EXPECT_EQ(fromEnvironment.timeZone, "Asia/Tokyo");
+  EXPECT_EQ(TVXCurrentLocaleSettings(&defaults), (TVXLocaleSettings{"de_AT", {"pt-BR", "en"}, "Asia/Tokyo"}));
 
   defaults.setObject("TVXLocale", "ja_JP@calendar=japanese");
   defaults.setObject("TVXPreferredLanguages", platform::PropertyValue::Array{"ja-JP", 3, "en-US"});
   defaults.setObject("TVXTimeZone", "Europe/Berlin");
-  TVXLocaleSettings fromDefaults = TVXCurrentLocaleSettings(&defaults);
-  EXPECT_EQ(fromDefaults.locale, "ja_JP@calendar=japanese");
-  EXPECT_EQ(fromDefaults.languages, (std::vector<std::string>{"ja-JP", "en-US"}));
-  EXPECT_EQ(fromDefaults.timeZone, "Europe/Berlin");
-  ::unsetenv("LC_MESSAGES");
-  ::unsetenv("LANGUAGE");
-  ::unsetenv("TZ");
-  ::unsetenv("LC_ALL");
+  EXPECT_EQ(TVXCurrentLocaleSettings(&defaults),
+            (TVXLocaleSettings{"ja_JP@calendar=japanese", {"ja-JP", "en-US"}, "Europe/Berlin"}));
+  for (const char* name : {"LC_MESSAGES", "LANGUAGE", "TZ", "LC_ALL"}) ::unsetenv(name);
 }
 
 TEST(LocaleContext, IcuAnswersForSeveralLocales) {
