@@ -1,7 +1,5 @@
 #include "cache/engaged_completion_cache.h"
 
-#include <sys/stat.h>
-
 #include <gtest/gtest.h>
 
 #include <fstream>
@@ -51,9 +49,7 @@ TEST_F(EngagedCompletionCacheTest, APrivateDatabaseInTheCachesFolderKeepsItsRows
   auto cache = open();
   const std::string expected = (home_.cache() / "com.norvel.tavixd/EngagedCompletions/Cache.db").string();
   EXPECT_EQ(cache->databasePath(), expected);
-  struct stat st {};
-  ASSERT_EQ(::stat(expected.c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  EXPECT_EQ(platform::fs::status(expected).permissions(), platform::fs::perms(0600));
   cache->addCompletion("kept", "ke");
   cache.reset();
 

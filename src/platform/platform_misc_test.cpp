@@ -1,6 +1,4 @@
 // Smaller platform pieces: property lists, files, counters.
-#include <sys/stat.h>
-
 #include <gtest/gtest.h>
 
 #include <fstream>
@@ -81,9 +79,7 @@ TEST(Files, AtomicWriteReplacesWholeFilesWithTheAskedModeAndLeavesNoTemporaries)
   std::string read;
   ASSERT_FALSE(readFile(file, &read));
   EXPECT_EQ(read, "second");
-  struct stat st {};
-  ASSERT_EQ(stat(file.c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  EXPECT_EQ(fs::status(file).permissions(), fs::perms(0600));
   int entries = 0;
   for (auto& e : fs::directory_iterator(home.root())) entries += e.path().filename() == "bag.plist" ? 0 : 1;
   EXPECT_EQ(entries, 3);  // cache, config, runtime: no temporary left behind
