@@ -89,14 +89,19 @@ class BagControllerTest : public ::testing::Test, protected testing::TestAssembl
     auto value = platform::parsePlist(bytes);
     return value && value->dictionary() ? *value->dictionary() : Dictionary{};
   }
-  void writeBagFile(const Dictionary& d) const {
+  void writeBagFile(const PropertyValue& d) const {
     ASSERT_FALSE(platform::createDirectory(bagFile().parent_path(), true));
-    ASSERT_FALSE(platform::writeFileAtomically(bagFile(), platform::toBinaryPlist(PropertyValue(d))));
+    ASSERT_FALSE(platform::writeFileAtomically(bagFile(), platform::toBinaryPlist(d)));
   }
   double now() const { return platform::toUnixSeconds(clock.now()); }
   std::size_t postedCount() {
     std::lock_guard hold(lock);
     return posted.size();
+  }
+  void clearPosted() {
+    std::lock_guard hold(lock);
+    posted.clear();
+    newsPosts.clear();
   }
 
   devserver::DevServer server;
@@ -161,13 +166,9 @@ TEST_F(BagControllerTest, DiskBagServesAndIsRefetchedOnlyWhenDue) {
   // A restart over `d` as the bag file: the fetches it made.
   auto restart = [&](Dictionary d) {
     controller.reset();
-    writeBagFile(d);
+    writeBagFile(PropertyValue(d));
     const auto before = bagRequests().size();
-    {
-      std::lock_guard hold(lock);
-      posted.clear();
-      newsPosts.clear();
-    }
+    clearPosted();
     make();
     settle();
     waitForIdle();
@@ -208,12 +209,8 @@ TEST_F(BagControllerTest, DiskBagServesAndIsRefetchedOnlyWhenDue) {
   EXPECT_EQ(bagRequests().size(), before + 1);
   // A file whose top is not a dictionary is left: nothing is installed from it.
   controller.reset();
-  const PropertyValue notADictionary(PropertyValue::Array{"a"});
-  ASSERT_FALSE(platform::writeFileAtomically(bagFile(), platform::toBinaryPlist(notADictionary)));
-  {
-    std::lock_guard hold(lock);
-    posted.clear();
-  }
+  writeBagFile(PropertyValue::Array{"a"});
+  clearPosted();
   make();
   settle();
   EXPECT_FALSE(controller->inMemoryBag());
@@ -235,9 +232,8 @@ TEST_F(BagControllerTest, FailedFetchesReportTheirReasonAndKeepTheOldBag) {
     fault(f);
     auto error = fetch();
     ASSERT_TRUE(error) << reason;
-    EXPECT_EQ(error->domain, "kTVXErrorDomain");
-    EXPECT_EQ(error->code, 2);
-    EXPECT_EQ(error->reason, reason);
+    EXPECT_EQ(std::tuple(error->domain, error->code, error->reason),
+              std::tuple(std::string("kTVXErrorDomain"), 2L, reason));
     EXPECT_EQ(controller->currentBag(), old);
   }
   EXPECT_EQ(readBagFile(), oldFile);

@@ -33,6 +33,13 @@ class EngagedCompletionCacheTest : public ::testing::Test {
     return results ? *results : std::vector<TVXSearchSuggestion>{};
   }
 
+  // The row count of each of `clients`.
+  std::vector<int> rows(EngagedCompletionCache& cache, std::vector<unsigned long> clients) {
+    std::vector<int> out;
+    for (auto client : clients) out.push_back(cache.rowCountForClient(client));
+    return out;
+  }
+
   std::vector<std::string> names(const std::vector<TVXSearchSuggestion>& found) {
     std::vector<std::string> out;
     for (const auto& s : found) out.push_back(s.suggestion);
@@ -89,12 +96,10 @@ TEST_F(EngagedCompletionCacheTest, ScoresByRecencyBucketsAndDropsBelowThreshold)
   auto found = find(*cache, "tw");
   ASSERT_EQ(found.size(), 2u);
   EXPECT_EQ(found[0].suggestion, "twin");
-  // One engagement in the last hour: 10, plus the recency term just under 1.
-  EXPECT_GT(found[0].score, 10.99);
-  EXPECT_LT(found[0].score, 11.0);
-  // Two engagements two days ago fall in the week bucket: 0.1 each.
-  EXPECT_GT(found[1].score, 1.19);
-  EXPECT_LT(found[1].score, 1.2);
+  // One engagement in the last hour: 10, plus the recency term just under 1. Two engagements two
+  // days ago fall in the week bucket: 0.1 each, plus that term.
+  EXPECT_NEAR(found[0].score, 10.995, 0.005);
+  EXPECT_NEAR(found[1].score, 1.195, 0.005);
 
   EngagedCompletionParameters p;
   p.minThresholdToSend = 5;
@@ -117,8 +122,7 @@ TEST_F(EngagedCompletionCacheTest, AgesOutOldRowsAndTrimsEachClientToItsLimit) {
   cache->addCompletion("old", "o", 0, 2);
   clock_.advance(seconds(40 * 86400));
   cache->addCompletion("new", "n", 0, 1);  // any client's add ages out every client's rows
-  EXPECT_EQ(cache->rowCountForClient(2), 0);
-  EXPECT_EQ(cache->rowCountForClient(1), 1);
+  EXPECT_EQ(rows(*cache, {2, 1}), (std::vector<int>{0, 1}));
 
   for (int i = 0; i < 3; ++i) {
     cache->addCompletion("row" + std::to_string(i), "r", 0, 5, 3);
@@ -146,14 +150,11 @@ TEST_F(EngagedCompletionCacheTest, ClearsByDateOrEverything) {
   cache->addCompletion("d", "d", 0, 2);
 
   cache->clearCompletionsFromDate(t0, t0, 1);  // widened to 5 s either side: a and b
-  EXPECT_EQ(cache->rowCountForClient(1), 1);
-  EXPECT_EQ(cache->rowCountForClient(2), 1);
+  EXPECT_EQ(rows(*cache, {1, 2}), (std::vector<int>{1, 1}));
 
   cache->addCompletion("e", "e", 0, 3);
   cache->clearAllClientCompletionsFromDate(clock_.now() - seconds(1), clock_.now() + seconds(1));
-  EXPECT_EQ(cache->rowCountForClient(1), 0);
-  EXPECT_EQ(cache->rowCountForClient(2), 0);
-  EXPECT_EQ(cache->rowCountForClient(3), 0);
+  EXPECT_EQ(rows(*cache, {1, 2, 3}), (std::vector<int>{0, 0, 0}));
 }
 
 TEST_F(EngagedCompletionCacheTest, DisabledByDefaultsStoresAndFindsNothing) {
