@@ -86,17 +86,13 @@ TEST(AppSignature, LongZeroRunsSplitAt256Bits) {
 }
 
 TEST(AppSignature, CodeExpandsBackToTheBitmap) {
+  // One full run of zeros, two of ones, a kind change right after a run of 32, then bitmaps mostly
+  // empty with a few set bits: the shape of a real installed-app bitmap.
+  std::vector<Bytes> bitmaps = {Bytes(32, 0x00), Bytes(64, 0xff), {0x00, 0x00, 0x00, 0x00, 0xff, 0xff}};
   std::mt19937 random(7);
-  std::vector<Bytes> bitmaps = {
-      Bytes(32, 0x00),                       // exactly one 256-bit run: no trailing empty entry
-      Bytes(64, 0xff),                       // two full runs of ones
-      {0x00, 0x00, 0x00, 0x00, 0xff, 0xff},  // a kind change right after a run of 32
-  };
   for (int i = 0; i < 200; ++i) {
-    Bytes bitmap(1 + random() % 300, 0);
-    // Mostly empty with a few set bits: the shape of a real installed-app bitmap.
-    for (auto& byte : bitmap) byte = (random() % 17 == 0) ? static_cast<std::uint8_t>(random()) : 0;
-    bitmaps.push_back(bitmap);
+    for (auto& byte : bitmaps.emplace_back(1 + random() % 300, 0))
+      byte = (random() % 17 == 0) ? static_cast<std::uint8_t>(random()) : 0;
   }
   int coded = 0;
   for (const Bytes& bitmap : bitmaps) {
@@ -115,6 +111,7 @@ TEST(AppSignature, CodeExpandsBackToTheBitmap) {
     EXPECT_FALSE(rle_expand(code.payload.data(), code.payload.size(), expanded.data(), expanded.size() - 1));
   }
   EXPECT_GT(coded, 100);
+  // Exactly one 256-bit run: no trailing empty entry.
   EXPECT_EQ(encode(Bytes(32, 0x00)).payload, (Bytes{0x00, 0x01, 255, 0x00}));
 }
 

@@ -62,15 +62,6 @@ TEST_F(StandInTest, LocationDeliversTheConfiguredFixOrAFailure) {
   defaults.setObject("TVXFixedLocation", Dictionary{{"latitude", 91}, {"longitude", 0}});
   EXPECT_FALSE(manager.fixedLocation());  // out of range is no location
 
-  std::weak_ptr<Recorder> gone;
-  {
-    auto temporary = std::make_shared<Recorder>();
-    gone = temporary;
-    manager.startUpdatingLocation(temporary);
-  }
-  pool.drain();  // a delegate that went away hears nothing, and nothing breaks
-  EXPECT_TRUE(gone.expired());
-
   DefaultsRoutineManager routine(defaults);
   std::optional<int> mode = 5;
   defaults.setObject("TVXRoutineMode", -1);

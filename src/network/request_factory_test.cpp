@@ -174,21 +174,6 @@ TEST_F(RequestFactoryTest, SearchRequestCarriesTheContextInNameOrder) {
   EXPECT_EQ(q["du_enabled"], "1");
 }
 
-TEST_F(RequestFactoryTest, DebugParametersAreAllOrNothingAndForced) {
-  defaults->setObject("TVXDebugParameters", "key=dev&x=1");
-  make();
-  EXPECT_EQ(factory->debuggingQueryItems(), (std::vector<TVXQueryItem>{{"key", "dev"}, {"x", "1"}}));
-  auto q = searchQuery();
-  EXPECT_EQ(q["key"] + q["x"], "dev1");
-
-  defaults->setObject("TVXDebugParameters", "");  // emptied: the old items stay
-  factory->flushContextAccessQueue();
-  EXPECT_EQ(factory->debuggingQueryItems().size(), 2u);
-  defaults->setObject("TVXDebugParameters", "a=1&b");
-  factory->flushContextAccessQueue();
-  EXPECT_TRUE(factory->debuggingQueryItems().empty());
-}
-
 TEST_F(RequestFactoryTest, MissingURLsBuildNothingAndLeaveLocationAlone) {
   make();
   TVXBag empty = bag("{}");

@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <deque>
-#include <fstream>
 #include <functional>
 #include <future>
 
@@ -187,30 +186,6 @@ TEST_F(QueriesTest, LookupsFlightsAndZeroKeywordRecordWhatTheyAskedFor) {
   const auto sent = received("/search");
   ASSERT_EQ(sent.size(), 2u);
   EXPECT_EQ(sent[1].at("qtype"), platform::PropertyValue("zkw"));
-}
-
-TEST_F(QueriesTest, FlightDebugDataAnswersFromTheLocalFileWithoutTheNetwork) {
-  serveBag(bagWith());
-  const auto file = home.cache() / "flights.json";
-  std::ofstream(file) << R"([{"carrier_code": "UA", "flight_number": "123", "status": "landed"},
-                             {"carrier_code": "LH", "flight_number": 400, "status": "boarding"}])";
-  defaults->setObject("TVXFlightUseDebugData", true);
-  defaults->setObject("TVXFlightDebugDataLocation", "file://" + file.string());
-  auto state = make("com.norvel.flightinfo", "FlightInfo/1.0");
-  auto flight = request<TVXFlightSearchRequest>(60, "");
-  flight->flightQuery = "lh 400";
-  Replies found;
-  state->flightSearch(flight, found.block());
-  auto call = found.first();
-  ASSERT_TRUE(call.reply);
-  EXPECT_NE(call.reply->data.find("boarding"), std::string::npos);
-  EXPECT_EQ(call.reply->data.find("landed"), std::string::npos);
-
-  defaults->setObject("TVXFlightDebugDataLocation", "file://" + (home.cache() / "missing.json").string());
-  Replies missing;
-  state->flightSearch(flight, missing.block());
-  EXPECT_TRUE(missing.first().error);
-  EXPECT_TRUE(received("/flight").empty());
 }
 
 // Timers and deadlines on a clock the test moves.
