@@ -157,17 +157,6 @@ TEST_F(EngagedCompletionCacheTest, ClearsByDateOrEverything) {
   EXPECT_EQ(rows(*cache, {1, 2, 3}), (std::vector<int>{0, 0, 0}));
 }
 
-TEST_F(EngagedCompletionCacheTest, DisabledByDefaultsStoresAndFindsNothing) {
-  auto cache = open();
-  cache->addCompletion("before", "be");
-  defaults_.setObject("TVXDisableLocalCompletions", true);
-  cache->addCompletion("during", "du");
-  EXPECT_FALSE(cache->completionsForInput("be", 0, 5, 2000));
-  defaults_.setObject("TVXDisableLocalCompletions", false);
-  EXPECT_EQ(cache->rowCountForClient(0), 1);
-  EXPECT_EQ(names(find(*cache, "be")), std::vector<std::string>{"before"});
-}
-
 TEST(EngagedCompletionCacheTimeout, SearchThatOutlivesItsTimeoutReturnsNothing) {
   testing::TempHome home;
   platform::DispatchPool pool(1);

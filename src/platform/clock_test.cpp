@@ -43,18 +43,6 @@ TEST_F(VirtualClockTest, TimersFireOnceInDueOrderWithTiesInOrderSetAndFollowTime
   EXPECT_EQ(clock.pendingTimers(), 0u);
 }
 
-TEST_F(VirtualClockTest, RepeatingTimerRunsEveryIntervalUntilStopped) {
-  std::vector<double> at;
-  const double t0 = toUnixSeconds(clock.now());
-  RepeatingTimer timer(clock, queue);
-  queue.sync([&] { timer.start(seconds(60), [&] { at.push_back(toUnixSeconds(clock.now()) - t0); }); });
-  clock.advance(seconds(185));
-  EXPECT_EQ(at, (std::vector<double>{60, 120, 180}));
-  queue.sync([&] { timer.stop(); });
-  clock.advance(seconds(600));
-  EXPECT_EQ(at.size(), 3u);
-}
-
 TEST(Seconds, ValuesFromOutsideSaturateInsteadOfOverflowing) {
   EXPECT_EQ(seconds(std::nan("")), Duration::zero());
   EXPECT_GT(seconds(1e300), seconds(9e9));
