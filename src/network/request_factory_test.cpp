@@ -179,13 +179,19 @@ TEST_F(RequestFactoryTest, SearchRequestCarriesTheContextInNameOrder) {
   EXPECT_EQ(q["du_enabled"], "1");
 }
 
-TEST_F(RequestFactoryTest, MissingURLsBuildNothingAndLeaveLocationAlone) {
+TEST_F(RequestFactoryTest, MissingURLsLeaveLocationAloneAndANewUserIdentifierStartsANewMapsSession) {
   make();
   TVXBag empty = bag("{}");
   EXPECT_FALSE(factory->searchRequest(TVXSearchRequest{}, empty, "G"));
   EXPECT_FALSE(factory->lookupRequest(TVXLookupRequest{}, empty, "G"));
   EXPECT_EQ(location->starts.load(), 0);
   EXPECT_FALSE(factory->searchRequest(TVXSearchRequest{}, bag(R"({"search_url":"not a url"})"), "G"));
+
+  searchQuery();
+  EXPECT_EQ(location->sessionResets.load(), 0) << "building a request reads the session without a reset";
+  center->post("TVXUserGUIDChangeNotification");
+  factory->flushContextAccessQueue();
+  EXPECT_EQ(location->sessionResets.load(), 1);
 }
 
 TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
@@ -383,15 +389,6 @@ TEST_F(RequestFactoryTest, TheBagsProxyConfigurationDecidesEveryTasksProxy) {
   defaults->setObject("TVXUseMarvola", false);
   EXPECT_EQ(factory->proxyGetStatus(), 0);
   EXPECT_FALSE(factory->proxyURL());
-}
-
-TEST_F(RequestFactoryTest, ANewUserIdentifierStartsANewMapsSession) {
-  make();
-  searchQuery();
-  EXPECT_EQ(location->sessionResets.load(), 0) << "building a request reads the session without a reset";
-  center->post("TVXUserGUIDChangeNotification");
-  factory->flushContextAccessQueue();
-  EXPECT_EQ(location->sessionResets.load(), 1);
 }
 
 TEST_F(RequestFactoryTest, SilhouetteTopicsWeighTheEngagedSuggestion) {
