@@ -98,7 +98,7 @@ TEST_F(ClientStateTest, NewUserAgentRelabelsTheBagAndEmptiesTheQueryCache) {
   EXPECT_EQ(none.error->reason, "no UserAgent");
 }
 
-TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
+TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsNothingUnlessAsked) {
   startBagController();
   auto manager = testing::makeClientStateManager(*this);
   EXPECT_EQ(manager->stateForClientIdentifier(""), nullptr);
@@ -114,24 +114,6 @@ TEST_F(ClientStateTest, ManagerSharesStatesAndPersistsOnlyWhenAsked) {
   pool.drain();
   EXPECT_FALSE(defaults->objectForKey("sessions")) << "persistence is off by default";
   ASSERT_EQ(manager->sessions().size(), 1u);
-
-  // Persisted: an element without identifier is skipped; one without agent makes a state that the
-  // next save leaves out.
-  defaults->setObject("TVXPersistSessions", true);
-  using D = platform::Dictionary;
-  defaults->setObject("sessions", platform::PropertyValue::Array{D{{"agent", "lost/1"}},
-                                                                 D{{"identifier", "com.norvel.brovane"}, {"agent", "brovane/7"}},
-                                                                 D{{"identifier", "com.norvel.news"}}});
-  auto loaded = testing::makeClientStateManager(*this);
-  EXPECT_EQ(loaded->sessions().size(), 1u);
-  EXPECT_EQ(loaded->stateForClientIdentifier("com.norvel.brovane")->userAgent(), "brovane/7");
-  EXPECT_FALSE(loaded->stateForClientIdentifier("com.norvel.news")->userAgent());
-  loaded->stateForClientIdentifier("com.norvel.seekara")->setUserAgent("seekara/9");
-  loaded->saveState();
-  pool.drain();
-  auto saved = defaults->objectForKey("sessions");
-  ASSERT_TRUE(saved && saved->array());
-  EXPECT_EQ(saved->array()->size(), 2u);
 }
 
 }  // namespace
