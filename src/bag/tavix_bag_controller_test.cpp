@@ -192,15 +192,8 @@ TEST_F(BagControllerTest, DiskBagServesAndIsRefetchedOnlyWhenDue) {
   d["__bagurl"] = PropertyValue("https://elsewhere.example/bag?locale=de_DE");
   EXPECT_EQ(restart(d), 1u) << "a bag fetched for another context is refetched";
 
-  d = good;
-  d["__expiration"] = PropertyValue(now() - 100000);
-  d["__refresh_disabled"] = PropertyValue(false);
-  EXPECT_EQ(restart(d), 0u) << "the developer's switch wins over expiry";
-
   // Time passes: the bag in memory turns stale and the next read refetches in the background.
-  d = good;
-  d.erase("__refresh_disabled");
-  EXPECT_EQ(restart(d), 0u);
+  EXPECT_EQ(restart(good), 0u);
   const auto before = bagRequests().size();
   clock.advance(platform::seconds(14400 - 599));
   EXPECT_TRUE(controller->currentBag()) << "a stale bag still serves";
