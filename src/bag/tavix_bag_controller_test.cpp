@@ -47,6 +47,7 @@ class BagControllerTest : public ::testing::Test, protected testing::TestAssembl
       std::lock_guard hold(lock);
       newsPosts.push_back(n.name);
     });
+    make();
   }
   ~BagControllerTest() override {
     controller.reset();
@@ -116,7 +117,6 @@ class BagControllerTest : public ::testing::Test, protected testing::TestAssembl
 };
 
 TEST_F(BagControllerTest, BagURLHonoursTheOverrideOnlyWhenUsable) {
-  make();
   EXPECT_EQ(controller->bagFetchURLWithCountry("FR"), server.baseURL() + "/bag");
 
   for (const char* url : {"not a url", "http://bag.example.com/bag", "ftp://127.0.0.1/bag"}) {
@@ -132,7 +132,6 @@ TEST_F(BagControllerTest, BagURLHonoursTheOverrideOnlyWhenUsable) {
 }
 
 TEST_F(BagControllerTest, FirstFetchStoresTheAugmentedBagAndAnnouncesIt) {
-  make();
   EXPECT_EQ(controller->currentBag(), nullptr) << "nothing cached yet";
   ASSERT_TRUE(waitFor([&] { return postedCount() == 1; }));
   waitForIdle();
@@ -157,7 +156,6 @@ TEST_F(BagControllerTest, FirstFetchStoresTheAugmentedBagAndAnnouncesIt) {
 }
 
 TEST_F(BagControllerTest, DiskBagServesAndIsRefetchedOnlyWhenDue) {
-  make();
   ASSERT_FALSE(fetch());
   const Dictionary good = readBagFile();
   controller.reset();
@@ -211,7 +209,6 @@ TEST_F(BagControllerTest, DiskBagServesAndIsRefetchedOnlyWhenDue) {
 }
 
 TEST_F(BagControllerTest, FailedFetchesReportTheirReasonAndKeepTheOldBag) {
-  make();
   ASSERT_FALSE(fetch());
   auto old = controller->currentBag();
   const Dictionary oldFile = readBagFile();
@@ -235,7 +232,6 @@ TEST_F(BagControllerTest, FailedFetchesReportTheirReasonAndKeepTheOldBag) {
 }
 
 TEST_F(BagControllerTest, TriggersDuringAFetchMergeIntoItAndTransportFailuresAreRetried) {
-  make();
   // The first fetch is held at the server while the triggers come; the reset lets it answer.
   fault({{"path", "/bag"}, {"hang", true}, {"times", 1}});
   platform::LogCapture attempts;
@@ -293,7 +289,6 @@ TEST_F(BagControllerTest, TriggersDuringAFetchMergeIntoItAndTransportFailuresAre
 }
 
 TEST_F(BagControllerTest, ForcedFetchComparesVersionsNumerically) {
-  make();
   controller->forceFetchBag({{"bag", PropertyValue(12)}});
   settle();
   EXPECT_FALSE(controller->fetchInProgress()) << "no bag, no version to compare";
@@ -322,7 +317,6 @@ TEST_F(BagControllerTest, ForcedFetchComparesVersionsNumerically) {
 }
 
 TEST_F(BagControllerTest, LocaleChangeRefetchesThroughTheFactorysRequest) {
-  make();
   ASSERT_FALSE(fetch());
   // A context notice that changes nothing leaves the bag alone.
   center->post(kTVXBagRefreshRequiredNotification, assembly.requestFactory.get());

@@ -50,10 +50,10 @@ class EngagedCompletionCacheTest : public ::testing::Test {
   platform::DispatchPool pool_;
   platform::VirtualClock clock_;
   platform::UserDefaults defaults_;
+  std::shared_ptr<EngagedCompletionCache> cache = open();
 };
 
 TEST_F(EngagedCompletionCacheTest, APrivateDatabaseInTheCachesFolderKeepsItsRowsAcrossOpens) {
-  auto cache = open();
   const std::string expected = (home_.cache() / "com.norvel.tavixd/EngagedCompletions/Cache.db").string();
   EXPECT_EQ(cache->databasePath(), expected);
   EXPECT_EQ(platform::fs::status(expected).permissions(), platform::fs::perms(0600));
@@ -66,7 +66,6 @@ TEST_F(EngagedCompletionCacheTest, APrivateDatabaseInTheCachesFolderKeepsItsRows
 }
 
 TEST_F(EngagedCompletionCacheTest, FindsCompletionsByTypedInputOrNormalisedCompletion) {
-  auto cache = open();
   cache->addCompletion("Café Rouge", "Cafe", 1);
   cache->addCompletion("camera", "cam", 2);
   cache->addCompletion("carrot", "car", 0, 1);  // another client
@@ -86,7 +85,6 @@ TEST_F(EngagedCompletionCacheTest, FindsCompletionsByTypedInputOrNormalisedCompl
 }
 
 TEST_F(EngagedCompletionCacheTest, ScoresByRecencyBucketsAndDropsBelowThreshold) {
-  auto cache = open();
   cache->addCompletion("twice", "tw");
   cache->addCompletion("twice", "tw");
   clock_.advance(seconds(2 * 86400));
@@ -118,7 +116,6 @@ TEST_F(EngagedCompletionCacheTest, ScoresByRecencyBucketsAndDropsBelowThreshold)
 }
 
 TEST_F(EngagedCompletionCacheTest, AgesOutOldRowsAndTrimsEachClientToItsLimit) {
-  auto cache = open();
   cache->addCompletion("old", "o", 0, 2);
   clock_.advance(seconds(40 * 86400));
   cache->addCompletion("new", "n", 0, 1);  // any client's add ages out every client's rows
@@ -140,7 +137,6 @@ TEST_F(EngagedCompletionCacheTest, AgesOutOldRowsAndTrimsEachClientToItsLimit) {
 }
 
 TEST_F(EngagedCompletionCacheTest, ClearsByDateOrEverything) {
-  auto cache = open();
   const auto t0 = clock_.now();
   cache->addCompletion("a", "a", 0, 1);
   clock_.advance(seconds(4));
@@ -210,10 +206,9 @@ TEST(EngagedCompletionCacheTimeout, SearchOnTheCallersThreadIsHeldToItsDeadline)
 
 TEST_F(EngagedCompletionCacheTest, RebuildsACorruptDatabaseAndGoesOn) {
   const auto dir = home_.cache() / "com.norvel.tavixd/EngagedCompletions";
-  platform::createDirectory(dir, true);
-  { std::ofstream(dir / "Cache.db") << std::string(8192, 'x'); }
-
-  auto cache = open();
+  cache.reset();
+  { std::ofstream(dir / "Cache.db", std::ios::binary | std::ios::trunc) << std::string(8192, 'x'); }
+  cache = open();
   cache->addCompletion("fresh", "fr");
   EXPECT_EQ(names(find(*cache, "fr")), std::vector<std::string>{"fresh"});
 
@@ -225,7 +220,6 @@ TEST_F(EngagedCompletionCacheTest, RebuildsACorruptDatabaseAndGoesOn) {
 }
 
 TEST_F(EngagedCompletionCacheTest, CountsRecentEngagementsAndReportsRoundedStatistics) {
-  auto cache = open();
   for (int i = 0; i < 123; ++i) cache->addCompletion("stat" + std::to_string(i), "st");
   EXPECT_EQ(TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.brovane.localCompletionIndex.entries"), 120);
   EXPECT_GT(TavixDiagnosticDataReporter::store().value("com.norvel.tavixd.brovane.localCompletionIndex.size"), 0);
