@@ -137,8 +137,7 @@ TEST_F(BagControllerTest, FirstFetchStoresTheAugmentedBagAndAnnouncesIt) {
   waitForIdle();
 
   auto bag = controller->currentBag();
-  ASSERT_TRUE(bag);
-  ASSERT_TRUE(posted.front());
+  ASSERT_TRUE(bag && posted.front());
   EXPECT_EQ(posted.front()->rawBag(), bag->rawBag()) << "the notification carries the installed bag";
   EXPECT_EQ(bag->version(), "1");
   EXPECT_EQ(bag->warmURL(), server.baseURL() + "/warm");

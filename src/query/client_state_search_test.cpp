@@ -121,9 +121,7 @@ TEST_F(SearchTest, MessagesReturnKeyRecordsAGoToSearchAndVerboseRepliesCarryTheE
   Replies replies;
   state->search(typed, replies.block());
   auto call = replies.first();
-  ASSERT_TRUE(call.reply);
-  ASSERT_TRUE(call.reply->httpRequest);
-  ASSERT_TRUE(call.reply->httpResponse);
+  ASSERT_TRUE(call.reply && call.reply->httpRequest && call.reply->httpResponse);
   EXPECT_NE(call.reply->httpRequest->url.find("q=camera"), std::string::npos);
   auto went = recordsOfType(*state, 29);
   ASSERT_EQ(went.size(), 1u);

@@ -123,8 +123,7 @@ TEST(IpcServer, DeliversFramesAndDescriptorsBothWaysWithPeerCredentials) {
     EXPECT_EQ(c, 'z');
   }
   const std::shared_ptr<IpcConnection> s = accepted.get_future().get();
-  EXPECT_EQ(s->peer().pid, ::getpid());
-  EXPECT_EQ(s->peer().uid, ::geteuid());
+  EXPECT_EQ(std::pair(s->peer().pid, s->peer().uid), std::pair(::getpid(), ::geteuid()));
 
   // A reply larger than the socket buffer must arrive whole, and in order.
   const std::string large(3 * 1024 * 1024, 'L');
