@@ -35,7 +35,7 @@ class FakeLocationManager final : public LocationManager {
   }
   void stopUpdatingLocation() override { ++stops; }
   int authorizationStatus() const override { return status; }
-  int newsAuthorizationStatus() const override { return newsStatus; }
+  int newsAuthorizationStatus() const override { return TVXLocationAuthorizationDenied; }
   bool locationServicesEnabled() const override { return true; }
   std::optional<std::string> mapsEnvironment() const override { return "prod"; }
   std::optional<std::string> getMapsClientMetadata() const override { return "bWV0YQ=="; }
@@ -59,7 +59,6 @@ class FakeLocationManager final : public LocationManager {
   std::atomic<int> stops{0};
   std::atomic<int> sessionResets{0};
   std::atomic<int> status{TVXLocationAuthorizationWhenInUse};
-  std::atomic<int> newsStatus{TVXLocationAuthorizationDenied};
   std::mutex lock;
   std::weak_ptr<LocationManagerDelegate> delegate;
 };

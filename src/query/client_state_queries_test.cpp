@@ -14,17 +14,16 @@ namespace {
 
 using QueriesTest = QueryFixture;
 
-// Sends one query of each kind; `path` is the devserver path that kind reaches.
+// Sends one query of each kind.
 struct Kind {
   const char* name;
-  const char* path;
   std::function<void(ClientState&, std::uint64_t, TVXReplyBlock)> send;
 };
 
 template <typename Request>
-Kind kind(const char* name, const char* path, void (ClientState::*method)(std::shared_ptr<const Request>, TVXReplyBlock),
+Kind kind(const char* name, void (ClientState::*method)(std::shared_ptr<const Request>, TVXReplyBlock),
           std::string text, std::function<void(Request&)> adjust = {}) {
-  return {name, path, [=](ClientState& state, std::uint64_t id, TVXReplyBlock reply) {
+  return {name, [=](ClientState& state, std::uint64_t id, TVXReplyBlock reply) {
             auto request = std::make_shared<Request>();
             request->queryId = id;
             request->queryString = text;
@@ -36,13 +35,11 @@ Kind kind(const char* name, const char* path, void (ClientState::*method)(std::s
 
 std::vector<Kind> allKinds() {
   // Searches differ by id, so that none is answered from the query cache.
-  return {kind<TVXSearchRequest>("search", "/search", &ClientState::search, "",
+  return {kind<TVXSearchRequest>("search", &ClientState::search, "",
                                  [](auto& r) { r.queryString = "camera" + std::to_string(r.queryId); }),
-          kind("zero-keyword", "/search", &ClientState::zeroKeyword, ""),
-          kind("more results", "/more", &ClientState::moreResults, "ca"),
-          kind("card", "/card", &ClientState::card, ""),
-          kind("look-up", "/search", &ClientState::lookup, "serendipity"),
-          kind<TVXFlightSearchRequest>("flight", "/flight", &ClientState::flightSearch, "",
+          kind("zero-keyword", &ClientState::zeroKeyword, ""), kind("more results", &ClientState::moreResults, "ca"),
+          kind("card", &ClientState::card, ""), kind("look-up", &ClientState::lookup, "serendipity"),
+          kind<TVXFlightSearchRequest>("flight", &ClientState::flightSearch, "",
                                        [](auto& f) { f.flightQuery = "UA 123"; })};
 }
 
