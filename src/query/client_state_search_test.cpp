@@ -158,10 +158,7 @@ TEST_F(SearchTest, TheBagCanRouteSearchesAndEveryLookupAttemptThroughItsProxy) {
   EXPECT_EQ(starts.back().payload().network_search_start().marvola_status(), 1);
 
   // A retried look-up goes through the proxy on every attempt.
-  send("POST", "/_faults",
-       platform::toJson(platform::PropertyValue(
-           platform::Dictionary{{"path", server.baseURL() + "/search"}, {"reset", true}, {"times", 1}})),
-       &proxy);
+  send("POST", "/_faults", R"({"path":")" + server.baseURL() + R"(/search","reset":true,"times":1})", &proxy);
   auto lookup = request<TVXLookupRequest>(42, "lens");
   Replies lookedUp;
   state->lookup(lookup, lookedUp.block());
