@@ -19,12 +19,6 @@ struct Item : RefCounted {
   int* destroyed;
 };
 
-std::vector<std::string> keysWithPrefix(CritbitTree& tree, const std::string& prefix) {
-  std::vector<std::string> keys;
-  tree.keysMatchingPrefix(prefix, [&](std::string_view key, bool*) { keys.emplace_back(key); });
-  return keys;
-}
-
 TEST(CritbitTree, HoldsExactlyOneReferencePerStoredValue) {
   int destroyed = 0;
   {
@@ -84,7 +78,9 @@ TEST(CritbitTree, AgreesWithStdMapUnderRandomChurn) {
     std::vector<std::string> expected;
     for (auto it = model.lower_bound(prefix); it != model.end() && it->first.compare(0, prefix.size(), prefix) == 0; ++it)
       expected.push_back(it->first);
-    EXPECT_EQ(keysWithPrefix(tree, prefix), expected) << prefix;
+    std::vector<std::string> found;
+    tree.keysMatchingPrefix(prefix, [&](std::string_view key, bool*) { found.emplace_back(key); });
+    EXPECT_EQ(found, expected) << prefix;
   }
 }
 
