@@ -33,22 +33,18 @@ Kind kind(const char* name, void (ClientState::*method)(std::shared_ptr<const Re
           }};
 }
 
-std::vector<Kind> allKinds() {
-  // Searches differ by id, so that none is answered from the query cache.
-  return {kind<TVXSearchRequest>("search", &ClientState::search, "",
-                                 [](auto& r) { r.queryString = "camera" + std::to_string(r.queryId); }),
-          kind("zero-keyword", &ClientState::zeroKeyword, ""), kind("more results", &ClientState::moreResults, "ca"),
-          kind("card", &ClientState::card, ""), kind("look-up", &ClientState::lookup, "serendipity"),
-          kind<TVXFlightSearchRequest>("flight", &ClientState::flightSearch, "",
-                                       [](auto& f) { f.flightQuery = "UA 123"; })};
-}
-
 TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
   // Short timeouts so that a hanging back end ends quickly: 0.4 s without progress per attempt,
   // and for look-ups and flights a deadline of 1.0 - 0.5 s.
   serveBag(bagWith({{"request_timeout_s", 0.4}, {"search_render_timeout_ms", 1000}}));
   auto state = make("com.norvel.seekara", "Seekara/1.0");
-  const auto kinds = allKinds();
+  // Searches differ by id, so that none is answered from the query cache.
+  const std::vector<Kind> kinds = {
+      kind<TVXSearchRequest>("search", &ClientState::search, "",
+                             [](auto& r) { r.queryString = "camera" + std::to_string(r.queryId); }),
+      kind("zero-keyword", &ClientState::zeroKeyword, ""), kind("more results", &ClientState::moreResults, "ca"),
+      kind("card", &ClientState::card, ""), kind("look-up", &ClientState::lookup, "serendipity"),
+      kind<TVXFlightSearchRequest>("flight", &ClientState::flightSearch, "", [](auto& f) { f.flightQuery = "UA 123"; })};
 
   struct Outcome {
     std::string what;
