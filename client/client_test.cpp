@@ -77,15 +77,6 @@ struct ScriptedServer {
   }
 };
 
-Client::Options optionsFor(const ScriptedServer& s) {
-  Client::Options o;
-  o.socketPath = s.path;
-  o.configuration.set_identifier("tests");
-  o.configuration.set_user_agent("tests/1");
-  o.timeoutMs = 5000;
-  return o;
-}
-
 // Clients and daemons of different builds must understand each other: these bytes never change.
 TEST(Client, WireFormatOfAConfigureCallIsStable) {
   proto::Envelope e;
@@ -104,7 +95,10 @@ TEST(Client, WireFormatOfAConfigureCallIsStable) {
 TEST(Client, ACallWithoutAnAnswerFailsAtItsDeadlineOnceAndTheLateAnswerIsDropped) {
   testing::TempHome home;
   ScriptedServer server(home);
-  auto options = optionsFor(server);
+  Client::Options options;
+  options.socketPath = server.path;
+  options.configuration.set_identifier("tests");
+  options.configuration.set_user_agent("tests/1");
   options.timeoutMs = 100;
   Client client(options);
   ASSERT_FALSE(client.connect());

@@ -45,7 +45,6 @@ TEST(TVXBag, ClientOverridesApplyOnlyToTheirClientAndNotToRawKeys) {
   TVXBag brovaneNews(raw, "Brovane News/3");
   TVXBag unknown(raw, "curl/8");
 
-  EXPECT_EQ(news.clientName(), "news");
   EXPECT_FALSE(news.isEnabled());
   EXPECT_FALSE(news.searchURL());  // the override wins even when it is of the wrong type
   EXPECT_EQ(news.downloadResourcesList(), (std::vector<std::string>{"dict", "hints"}));

@@ -24,7 +24,7 @@ struct DeviceRoot {
   }
 };
 
-TEST(UserAgent, BuildsFromSystemFilesAndDefaultsOverrideThem) {
+TEST(UserAgent, BuildsFromSystemFilesWithDefaultsOverridingThemAndFallsBackWithoutThem) {
   DeviceRoot sys;
   platform::UserDefaults defaults(sys.home.config(), "com.norvel.tavixd");
   DeviceInformation device(&defaults, sys.root);
@@ -41,12 +41,10 @@ TEST(UserAgent, BuildsFromSystemFilesAndDefaultsOverrideThem) {
   DeviceInformation fresh(&defaults, sys.root);
   EXPECT_EQ(fresh.answer("OSVersion"), "99");
   EXPECT_EQ(fresh.answer("Serial"), "");
-}
 
-TEST(UserAgent, MissingSystemFilesFallBack) {
-  testing::TempHome home;
-  DeviceInformation device(nullptr, home.root() / "empty");
-  EXPECT_EQ(createUserAgentString("c/1", device), "tavixd/0.1 (Linux; Linux 0 0) c/1");
+  // Without the system files (nor defaults), plain fallbacks.
+  EXPECT_EQ(createUserAgentString("c/1", DeviceInformation(nullptr, sys.root / "empty")),
+            "tavixd/0.1 (Linux; Linux 0 0) c/1");
 }
 
 TEST(UserAgent, ClientNamesComeFromTheFirstKnownNameInTableOrder) {

@@ -4,7 +4,6 @@
 #include <openssl/evp.h>
 #include <zlib.h>
 
-#include <random>
 
 #include "platform/json_value.h"
 
@@ -83,39 +82,6 @@ TEST(AppSignature, LongZeroRunsSplitAt256Bits) {
   // Flag 1 in the top bit of version byte 0x00, then the bitmap's length, 65.
   EXPECT_EQ(Bytes(bytes.begin() + 4, bytes.begin() + 8), (Bytes{0x80, 0xc1, 0x00, 65}));
   EXPECT_EQ(Bytes(bytes.begin() + 12, bytes.end()), code.payload);
-}
-
-TEST(AppSignature, CodeExpandsBackToTheBitmap) {
-  std::mt19937 random(7);
-  std::vector<Bytes> bitmaps = {
-      Bytes(32, 0x00),                       // exactly one 256-bit run: no trailing empty entry
-      Bytes(64, 0xff),                       // two full runs of ones
-      {0x00, 0x00, 0x00, 0x00, 0xff, 0xff},  // a kind change right after a run of 32
-  };
-  for (int i = 0; i < 200; ++i) {
-    Bytes bitmap(1 + random() % 300, 0);
-    // Mostly empty with a few set bits: the shape of a real installed-app bitmap.
-    for (auto& byte : bitmap) byte = (random() % 17 == 0) ? static_cast<std::uint8_t>(random()) : 0;
-    bitmaps.push_back(bitmap);
-  }
-  int coded = 0;
-  for (const Bytes& bitmap : bitmaps) {
-    const Encoded code = encode(bitmap);
-    if (code.flag == 0) {
-      EXPECT_EQ(code.payload, bitmap);
-      continue;
-    }
-    ++coded;
-    EXPECT_LT(code.payload.size(), bitmap.size());
-    Bytes expanded(bitmap.size());
-    ASSERT_TRUE(rle_expand(code.payload.data(), code.payload.size(), expanded.data(), expanded.size()));
-    EXPECT_EQ(expanded, bitmap);
-    // One byte short, or one run too many, must not decode.
-    EXPECT_FALSE(rle_expand(code.payload.data(), code.payload.size() - 1, expanded.data(), expanded.size()));
-    EXPECT_FALSE(rle_expand(code.payload.data(), code.payload.size(), expanded.data(), expanded.size() - 1));
-  }
-  EXPECT_GT(coded, 100);
-  EXPECT_EQ(encode(Bytes(32, 0x00)).payload, (Bytes{0x00, 0x01, 255, 0x00}));
 }
 
 TEST(AppSignature, BitmapSizingLeavesOutALargestIdOnAByteBoundary) {

@@ -1,12 +1,9 @@
 #include <gtest/gtest.h>
 
-#include <atomic>
 #include <future>
 #include <mutex>
 
-#include "context/location.h"
 #include "context/motion.h"
-#include "platform/clock.h"
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
 #include "support/temp_home.h"
@@ -14,68 +11,14 @@
 namespace tavix {
 namespace {
 
-using platform::Dictionary;
-
-struct Recorder final : LocationManagerDelegate, MotionManagerDelegate {
-  void didUpdateLocations(const std::vector<TVXLocation>& l) override {
-    std::lock_guard<std::mutex> hold(lock);
-    locations.insert(locations.end(), l.begin(), l.end());
-  }
-  void didFailWithError(const std::string&) override { ++failures; }
-  void didChangeAuthorization(int) override {}
+struct Recorder final : MotionManagerDelegate {
   void didUpdateMotionActivity(const TVXMotionActivity& a) override {
     std::lock_guard<std::mutex> hold(lock);
     modes.push_back(transportationModeForActivity(a));
   }
   std::mutex lock;
-  std::vector<TVXLocation> locations;
   std::vector<int> modes;
-  std::atomic<int> failures{0};
 };
-
-TEST(DefaultsLocationManager, DeliversTheConfiguredFixOrAFailure) {
-  testing::TempHome home;
-  platform::DispatchPool pool(1);
-  platform::VirtualClock clock;
-  platform::UserDefaults defaults(home.config(), "com.norvel.tavixd");
-  DefaultsLocationManager manager(defaults, clock, pool);
-  auto recorder = std::make_shared<Recorder>();
-
-  EXPECT_EQ(manager.authorizationStatus(), TVXLocationAuthorizationDenied);
-  manager.startUpdatingLocation(recorder);
-  pool.drain();
-  EXPECT_EQ(recorder->failures.load(), 1);
-
-  defaults.setObject("TVXFixedLocation", Dictionary{{"latitude", 48.5}, {"longitude", -2}, {"type", 1}});
-  EXPECT_EQ(manager.authorizationStatus(), TVXLocationAuthorizationWhenInUse);
-  defaults.setObject("TVXNewsLocationAuthorizationStatus", 2);
-  EXPECT_EQ(manager.newsAuthorizationStatus(), TVXLocationAuthorizationDenied);
-  manager.startUpdatingLocation(recorder);
-  pool.drain();
-  ASSERT_EQ(recorder->locations.size(), 1u);
-  EXPECT_DOUBLE_EQ(recorder->locations[0].longitude, -2);
-  EXPECT_DOUBLE_EQ(recorder->locations[0].horizontalAccuracy, 1000);  // none given: a city's
-
-  defaults.setObject("TVXFixedLocation", Dictionary{{"latitude", 91}, {"longitude", 0}});
-  EXPECT_FALSE(manager.fixedLocation());  // out of range is no location
-
-  std::weak_ptr<Recorder> gone;
-  {
-    auto temporary = std::make_shared<Recorder>();
-    gone = temporary;
-    manager.startUpdatingLocation(temporary);
-  }
-  pool.drain();  // a delegate that went away hears nothing, and nothing breaks
-  EXPECT_TRUE(gone.expired());
-
-  DefaultsRoutineManager routine(defaults);
-  std::optional<int> mode = 5;
-  defaults.setObject("TVXRoutineMode", -1);
-  EXPECT_TRUE(routine.modeForLocation({}, &mode));
-  EXPECT_EQ(mode, -1);
-  defaults.setObject("TVXRoutineMode", "often");
-  EXPECT_FALSE(routine.modeForLocation({}, &mode));
-}
 
 TEST(MotionManager, MapsActivitiesInPrecedenceOrderAndStopDropsPendingDeliveries) {
   EXPECT_EQ(transportationModeForActivity({}), 1);
@@ -85,8 +28,8 @@ TEST(MotionManager, MapsActivitiesInPrecedenceOrderAndStopDropsPendingDeliveries
   testing::TempHome home;
   platform::DispatchPool pool(1);
   platform::UserDefaults defaults(home.config(), "com.norvel.tavixd");
-  DefaultsMotionManager manager(defaults, pool);
   auto recorder = std::make_shared<Recorder>();
+  DefaultsMotionManager manager(defaults, pool);
   defaults.setObject("TVXMotionActivity", "cycling");
   manager.startUpdatingMotionActivity(recorder);
   pool.drain();

@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include "platform/defaults.h"
 #include "platform/log.h"
 
 namespace tavix {
@@ -64,37 +63,6 @@ TEST(Subscriptions, ABagWithoutEitherWhitelistReportsNothing) {
   EXPECT_EQ(records.size(), 1u);
   EXPECT_TRUE(records.count("tarn"));
   EXPECT_TRUE(capture.contains("Error fetching third party subscription information from daemon: service gone"));
-}
-
-TEST(Subscriptions, DefaultsProviderSkipsEntriesItCannotRead) {
-  std::string pattern = (std::filesystem::temp_directory_path() / "tavix-subs-XXXXXX").string();
-  const std::filesystem::path folder = ::mkdtemp(pattern.data());
-  platform::UserDefaults defaults(folder, "com.norvel.tavixd");
-  DefaultsVideoSubscriptionProvider video(defaults);
-  std::vector<VideoSubscription> out;
-  std::string error;
-  EXPECT_TRUE(video.activeSubscriptions({"a"}, {"b.example"}, &out, &error));
-  EXPECT_TRUE(out.empty());
-
-  // Entries the ordinary path (the daemon's context test) never sees are skipped one by one.
-  using D = platform::Dictionary;
-  defaults.setObject(kTVXVideoSubscriptionsKey,
-                     platform::PropertyValue::Array{
-                         D{{"identifier", "a"}, {"type", "app"}, {"modified", platform::Date{kNow}}},
-                         D{{"identifier", "b.example"}, {"type", "web"}, {"modified", 1767225000}},
-                         D{{"identifier", "a"}, {"modified", 1767225000}, {"active", false}},
-                         D{{"identifier", "not.listed"}, {"modified", 1767225000}},
-                         D{{"identifier", "a"}, {"modified", "yesterday"}},
-                         D{{"type", "app"}, {"modified", 1767225000}}, "junk"});
-  ASSERT_TRUE(video.activeSubscriptions({"a"}, {"b.example"}, &out, &error));
-  ASSERT_EQ(out.size(), 2u);
-  EXPECT_EQ(out[0].modified, kNow);
-  EXPECT_EQ(out[1].sourceIdentifier, "b.example");
-
-  defaults.setObject(kTVXVideoSubscriptionsKey, "not an array");
-  EXPECT_FALSE(video.activeSubscriptions({"a"}, {}, &out, &error));
-  EXPECT_FALSE(error.empty());
-  std::filesystem::remove_all(folder);
 }
 
 }  // namespace

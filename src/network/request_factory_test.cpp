@@ -1,5 +1,6 @@
 #include "network/request_factory.h"
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <atomic>
@@ -34,11 +35,11 @@ class FakeLocationManager final : public LocationManager {
   }
   void stopUpdatingLocation() override { ++stops; }
   int authorizationStatus() const override { return status; }
-  int newsAuthorizationStatus() const override { return newsStatus; }
+  int newsAuthorizationStatus() const override { return TVXLocationAuthorizationDenied; }
   bool locationServicesEnabled() const override { return true; }
   std::optional<std::string> mapsEnvironment() const override { return "prod"; }
   std::optional<std::string> getMapsClientMetadata() const override { return "bWV0YQ=="; }
-  std::optional<std::string> getDeviceCountryCode() const override { return country; }
+  std::optional<std::string> getDeviceCountryCode() const override { return "FR"; }
   std::optional<TVXMapsUserSession> getMapsUserSessionEntityAndReset(bool reset) override {
     if (reset) ++sessionResets;
     return TVXMapsUserSession{"S1", 4, 2.5};
@@ -58,8 +59,6 @@ class FakeLocationManager final : public LocationManager {
   std::atomic<int> stops{0};
   std::atomic<int> sessionResets{0};
   std::atomic<int> status{TVXLocationAuthorizationWhenInUse};
-  std::atomic<int> newsStatus{TVXLocationAuthorizationDenied};
-  std::optional<std::string> country = "FR";
   std::mutex lock;
   std::weak_ptr<LocationManagerDelegate> delegate;
 };
@@ -103,15 +102,35 @@ class RequestFactoryTest : public ::testing::Test, protected testing::TestAssemb
   static TVXBag bag(const char* json, std::string agent = "Seekara/1 (test)") {
     return TVXBag(*platform::parseJson(json)->dictionary(), std::move(agent));
   }
+  // Announces a new bag and waits until the factory has taken it.
+  void postBag(const char* json) {
+    center->post("TVXBagChangeNotification", nullptr, {}, bagChangeUserInfo(bag(json)));
+    factory->flushContextAccessQueue();
+  }
+  // A fix from the location service, taken by the factory.
+  void deliver(const TVXLocation& fix) {
+    location->deliver(fix);
+    factory->flushContextAccessQueue();
+  }
+  // The query items of a search built from `request` against a bag with only a search URL.
+  std::map<std::string, std::string> searchQuery(const TVXSearchRequest& request = {}) {
+    return queryOf(factory->searchRequest(request, searchOnly, "G")->url);
+  }
 
   std::shared_ptr<FakeLocationManager> location = std::make_shared<FakeLocationManager>();
   std::shared_ptr<FakeRoutine> routine = std::make_shared<FakeRoutine>();
   TVXRequestFactoryProviders providers;
   std::shared_ptr<TVXNetworkRequestFactory> factory;
+  TVXBag searchOnly = bag(R"({"search_url":"https://s.example/"})");
 };
 
+// The names of `names` that `items` holds.
+std::vector<std::string> present(const std::map<std::string, std::string>& items, std::vector<std::string> names) {
+  std::erase_if(names, [&](const std::string& name) { return !items.count(name); });
+  return names;
+}
+
 TEST_F(RequestFactoryTest, SearchRequestCarriesTheContextInNameOrder) {
-  providers.appWhitelistSignature = [] { return std::optional<std::string>("sig"); };
   make();
   TVXSearchRequest request;
   request.queryString = "a b+c";
@@ -130,31 +149,23 @@ TEST_F(RequestFactoryTest, SearchRequestCarriesTheContextInNameOrder) {
   auto q = queryOf(built->url, &names);
   EXPECT_TRUE(std::is_sorted(names.begin(), names.end()));
   EXPECT_NE(built->url.find("q=a%20b%2Bc&"), std::string::npos) << built->url;
-  EXPECT_EQ(q["locale"], "xx_YY");  // the client's item wins
-  EXPECT_EQ(q["fmt"], "1");  // the bag URL's own item stays
-  EXPECT_EQ(q["qtype"], "explicit");
-  EXPECT_EQ(q.count("suggest_queries"), 0u);
-  EXPECT_EQ(q["cc"], "FR");
-  EXPECT_EQ(q["esl"], "fr-FR");
-  EXPECT_EQ(q["l2"], "7");
-  EXPECT_EQ(q["lcs"], R"(["a b, c","ab"])");
-  EXPECT_EQ(q["lco"], "se-0.50,en-1.00");
-  EXPECT_EQ(q["geosrc"], "slow");  // authorised, but the first request came before any fix
-  EXPECT_EQ(q.count("latlng"), 0u);
-  EXPECT_EQ(q.count("rm"), 0u);
-  EXPECT_EQ(q.count("mode") + q.count("du_enabled"), 0u);
+  // The client's "locale" wins; the bag URL's own "fmt" stays. Authorised, but the first request
+  // came before any fix: "slow".
+  const std::map<std::string, std::string> items = {{"locale", "xx_YY"}, {"fmt", "1"}, {"qtype", "explicit"},
+      {"cc", "FR"}, {"esl", "fr-FR"}, {"l2", "7"}, {"lcs", R"(["a b, c","ab"])"}, {"lco", "se-0.50,en-1.00"},
+      {"geosrc", "slow"}};
+  EXPECT_THAT(q, ::testing::IsSupersetOf(items));
+  EXPECT_EQ(present(q, {"suggest_queries", "latlng", "rm", "mode", "du_enabled"}), std::vector<std::string>{});
 
-  const auto& h = built->headers;
-  EXPECT_EQ(h.get("X-Norvel-Languages"), R"(["fr-FR","en-GB","de"])");
-  EXPECT_EQ(h.get("X-Norvel-UserGuid"), "GUID-1");
-  EXPECT_EQ(h.get("X-Norvel-UI-Scale"), "2.0");
-  EXPECT_EQ(h.get("X-Norvel-TopTopics"), R"({"t":1})");
-  EXPECT_EQ(h.get("X-Norvel-GeoSession"), "S1 4 2.500000");
-  EXPECT_EQ(h.get("X-Norvel-Whitelisted-App-Signature"), "sig");
+  // The app signature header is the daemon's context test's.
+  const std::map<std::string, std::string> headers = {{"X-Norvel-Languages", R"(["fr-FR","en-GB","de"])"},
+      {"X-Norvel-UserGuid", "GUID-1"}, {"X-Norvel-UI-Scale", "2.0"}, {"X-Norvel-TopTopics", R"({"t":1})"},
+      {"X-Norvel-GeoSession", "S1 4 2.500000"}};
+  for (const auto& [name, value] : headers) EXPECT_EQ(built->headers.get(name), value) << name;
   EXPECT_DOUBLE_EQ(built->timeoutInterval, 4);
 
   request.triggerEvent = 21;
-  q = queryOf(factory->searchRequest(request, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
+  q = searchQuery(request);
   EXPECT_EQ(q["suggest_queries"], "withtop");
   EXPECT_EQ(q.count("qtype"), 0u);
 
@@ -162,61 +173,44 @@ TEST_F(RequestFactoryTest, SearchRequestCarriesTheContextInNameOrder) {
   defaults->setObject("TVXManagedAccount", true);
   defaults->setObject("TVXDiagnosticsSubmissionAllowed", true);
   factory->flushContextAccessQueue();
-  q = queryOf(factory->searchRequest(request, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
+  q = searchQuery(request);
   EXPECT_EQ(q["mode"], "managed");
   EXPECT_EQ(q["du_enabled"], "1");
 }
 
-TEST_F(RequestFactoryTest, DebugParametersAreAllOrNothingAndForced) {
-  defaults->setObject("TVXDebugParameters", "key=dev&x=1");
-  make();
-  EXPECT_EQ(factory->debuggingQueryItems(), (std::vector<TVXQueryItem>{{"key", "dev"}, {"x", "1"}}));
-  TVXSearchRequest request;
-  request.queryString = "q";
-  auto q = queryOf(factory->searchRequest(request, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
-  EXPECT_EQ(q["key"], "dev");
-  EXPECT_EQ(q["x"], "1");
-
-  defaults->setObject("TVXDebugParameters", "");  // emptied: the old items stay
-  factory->flushContextAccessQueue();
-  EXPECT_EQ(factory->debuggingQueryItems().size(), 2u);
-  defaults->setObject("TVXDebugParameters", "a=1&b");
-  factory->flushContextAccessQueue();
-  EXPECT_TRUE(factory->debuggingQueryItems().empty());
-}
-
-TEST_F(RequestFactoryTest, MissingURLsBuildNothingAndLeaveLocationAlone) {
+TEST_F(RequestFactoryTest, MissingURLsLeaveLocationAloneAndANewUserIdentifierStartsANewMapsSession) {
   make();
   TVXBag empty = bag("{}");
   EXPECT_FALSE(factory->searchRequest(TVXSearchRequest{}, empty, "G"));
   EXPECT_FALSE(factory->lookupRequest(TVXLookupRequest{}, empty, "G"));
   EXPECT_EQ(location->starts.load(), 0);
   EXPECT_FALSE(factory->searchRequest(TVXSearchRequest{}, bag(R"({"search_url":"not a url"})"), "G"));
+
+  searchQuery();
+  EXPECT_EQ(location->sessionResets.load(), 0) << "building a request reads the session without a reset";
+  center->post("TVXUserGUIDChangeNotification");
+  factory->flushContextAccessQueue();
+  EXPECT_EQ(location->sessionResets.load(), 1);
 }
 
 TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
   defaults->setObject("TVXMotionActivity", "walking");
   providers.motionManager = std::make_shared<DefaultsMotionManager>(*defaults, pool);
-  std::vector<PropertyValue> proxies;
+  PropertyValue::Array proxies;
   providers.proxySetCurrentConfiguration = [&](const Dictionary& configuration, const std::string& name) {
     EXPECT_EQ(name, "tavixd");
     proxies.emplace_back(configuration);
   };
   make();
-  center->post("TVXBagChangeNotification", nullptr, {},
-               bagChangeUserInfo(bag(R"({"supported_geo_location_sources":["gps"]})")));
-  factory->flushContextAccessQueue();
+  postBag(R"({"supported_geo_location_sources":["gps"]})");
   ASSERT_GE(location->starts.load(), 1);
 
-  TVXLocation wifi{48.85, 2.35, 65, 4, clock.now()};
-  location->deliver(wifi);
-  factory->flushContextAccessQueue();
+  deliver({48.85, 2.35, 65, 4, clock.now()});  // wifi
   EXPECT_EQ(factory->geoLocationSource(), "bagno.wifi");
   EXPECT_FALSE(factory->geoLocationLatLng());
 
   TVXLocation gps{-33.9, 151.2, 10, 1, clock.now()};
-  location->deliver(gps);
-  factory->flushContextAccessQueue();
+  deliver(gps);
   EXPECT_EQ(factory->geoLocationLatLng(), "-33.900000,151.200000");
   EXPECT_EQ(factory->geoLocationSource(), "gps,10.000000");
   EXPECT_EQ(factory->lookupGeoLocationLatLng(), "-33.000000,151.000000");  // toward zero, not -34
@@ -231,12 +225,11 @@ TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
   clock.advance(platform::seconds(299));
   auto q = queryOf(factory->searchRequest(request, searchBag, "G")->url);
   EXPECT_EQ(location->starts.load(), starts);  // a fix 299 s old is still good
-  EXPECT_EQ(q["latlng"], "-33.900000,151.200000");
-  EXPECT_EQ(q["geosrc"], "gps,10.000000");
-  EXPECT_EQ(q["rm"], "2");
-  EXPECT_EQ(q["tm"], "3");  // walking
+  const std::map<std::string, std::string> located = {
+      {"latlng", "-33.900000,151.200000"}, {"geosrc", "gps,10.000000"}, {"rm", "2"}, {"tm", "3"}};  // tm 3: walking
+  EXPECT_THAT(q, ::testing::IsSupersetOf(located));
   q = queryOf(factory->searchRequest(request, searchBag, "G", TVXFieldMaskNoLocation)->url);
-  EXPECT_EQ(q.count("latlng") + q.count("geosrc") + q.count("rm") + q.count("tm"), 0u);
+  EXPECT_EQ(present(q, {"latlng", "geosrc", "rm", "tm"}), std::vector<std::string>{});
 
   clock.advance(platform::seconds(2));
   factory->searchRequest(request, searchBag, "G");
@@ -251,44 +244,37 @@ TEST_F(RequestFactoryTest, LocationFollowsTheBagTheAgeLimitAndSearches) {
   EXPECT_EQ(built->headers.get("X-Norvel-FuzzedLatLong"), "-33.000000,151.000000");
   q = queryOf(built->url);
   EXPECT_EQ(q.count("latlng"), 0u);
-  EXPECT_EQ(q["ltype"], "hint");
-  EXPECT_EQ(q["qlang"], "zh");
-  EXPECT_EQ(q["lctxlang"], "en");  // a phrase: the identifier judges it whole
-  EXPECT_EQ(q["context"], "org.example.reader");
+  // The context is a phrase: the identifier judges it whole.
+  const std::map<std::string, std::string> lookedUp = {
+      {"ltype", "hint"}, {"qlang", "zh"}, {"lctxlang", "en"}, {"context", "org.example.reader"}};
+  EXPECT_THAT(q, ::testing::IsSupersetOf(lookedUp));
 
   factory->setPerformedSearch();
   EXPECT_EQ(factory->lookupGeoLocationLatLng(), "-33.900000,151.200000");
   auto download = factory->fileDownloadRequest("https://r.example/f", "etag1", true);
   EXPECT_EQ(download->headers.get("X-Norvel-FuzzedLatLong"), "-33.900000,151.200000");
 
-  center->post("TVXBagChangeNotification", nullptr, {},
-               bagChangeUserInfo(bag(R"({"marvola_configuration":{"enabled":true}})")));
-  factory->flushContextAccessQueue();
+  postBag(R"({"marvola_configuration":{"enabled":true}})");
   EXPECT_EQ(factory->geoLocationSource(), "bagno.all");
-  ASSERT_EQ(proxies.size(), 2u);
-  EXPECT_EQ(platform::toJson(proxies[0]), R"({"appRule":{"enable":{"Enabled":false}}})");  // none in the bag: off
-  EXPECT_EQ(platform::toJson(proxies[1]), R"({"enabled":true})");
+  // The first bag had no proxy configuration: off.
+  EXPECT_EQ(platform::toJson(proxies), R"([{"appRule":{"enable":{"Enabled":false}}},{"enabled":true}])");
   EXPECT_FALSE(factory->lookupGeoLocationLatLng());
   EXPECT_GE(location->stops.load(), 1);
 }
 
 TEST_F(RequestFactoryTest, NewsWithoutAuthorisationAndDeniedUsersSendUserno) {
   make();
-  center->post("TVXBagChangeNotification", nullptr, {},
-               bagChangeUserInfo(bag(R"({"supported_geo_location_sources":"all"})")));
-  factory->flushContextAccessQueue();
-  location->deliver({1.5, 2.5, 100, 6, clock.now()});
-  factory->flushContextAccessQueue();
+  postBag(R"({"supported_geo_location_sources":"all"})");
+  deliver({1.5, 2.5, 100, 6, clock.now()});
   EXPECT_EQ(factory->geoLocationSource(), "cell,100.000000");
 
   auto q = queryOf(factory->searchRequest(TVXSearchRequest{}, bag(R"({"search_url":"https://s.example/"})", "News/5"), "G")->url);
   EXPECT_EQ(q["geosrc"], "userno");
-  EXPECT_EQ(q.count("latlng"), 0u);
-  EXPECT_EQ(q.count("rm"), 0u);  // routine mode 2 is not a mode the server knows
+  EXPECT_EQ(present(q, {"latlng", "rm"}), std::vector<std::string>{});  // routine mode 2 is not a mode the server knows
 
   location->status = TVXLocationAuthorizationDenied;
   clock.advance(platform::seconds(400));
-  q = queryOf(factory->searchRequest(TVXSearchRequest{}, bag(R"({"search_url":"https://s.example/"})"), "G")->url);
+  q = searchQuery();
   EXPECT_EQ(q["geosrc"], "userno");
   EXPECT_EQ(q.count("latlng"), 0u);
 }
@@ -297,15 +283,14 @@ TEST_F(RequestFactoryTest, FailuresAndAuthorisationChangesSetTheReason) {
   location->status = TVXLocationAuthorizationNotDetermined;
   make();
   EXPECT_EQ(factory->geoLocationSource(), "userno");
-  TVXBag searchBag = bag(R"({"search_url":"https://s.example/"})");
-  factory->searchRequest(TVXSearchRequest{}, searchBag, "G");
+  searchQuery();
   EXPECT_EQ(location->starts.load(), 1);  // not determined is not a refusal: ask
 
   std::shared_ptr<LocationManagerDelegate> delegate = location->delegate.lock();
   ASSERT_TRUE(delegate);
   delegate->didFailWithError("no fix");
   factory->flushContextAccessQueue();
-  EXPECT_EQ(queryOf(factory->searchRequest(TVXSearchRequest{}, searchBag, "G")->url)["geosrc"], "error.fail");
+  EXPECT_EQ(searchQuery()["geosrc"], "error.fail");
 
   location->status = TVXLocationAuthorizationWhenInUse;
   int starts = location->starts.load();
@@ -336,9 +321,8 @@ TEST_F(RequestFactoryTest, OtherKindsAndBagRequests) {
   more.queryString = "ignored";
   more.queryItems = {{"page", "2"}};
   auto q = queryOf(factory->moreResultsRequest(more, kinds, "G")->url);
-  EXPECT_EQ(q["latlng"], "1,2");
-  EXPECT_EQ(q["page"], "2");
-  EXPECT_EQ(q.count("q") + q.count("geosrc"), 0u);
+  EXPECT_EQ(q["latlng"] + " " + q["page"], "1,2 2");
+  EXPECT_EQ(present(q, {"q", "geosrc"}), std::vector<std::string>{});
   TVXFlightSearchRequest flight;
   flight.flightQuery = "AF 22";
   auto built = factory->flightSearchRequest(flight, kinds, "G");
@@ -372,33 +356,25 @@ TEST_F(RequestFactoryTest, OtherKindsAndBagRequests) {
 TEST_F(RequestFactoryTest, BagSwitchesForNewsAndMessagesReachManagedConfiguration) {
   make();
   platform::UserDefaults managed(home.config(), kTVXManagedConfigurationDomain);
-  auto blacklisted = [&] {
+  // (news allowed, blacklisted apps) once the bag is taken.
+  auto announce = [&](const char* json) {
+    postBag(json);
+    pool.drain();
     managed.synchronize();
-    auto v = managed.objectForKey(kTVXBlacklistedAppBundleIDsKey);
-    return v && v->array() ? platform::toJson(*v) : std::string("absent");
+    auto news = managed.objectForKey(kTVXFeatureSeekaraNewsAllowed);
+    auto blacklisted = managed.objectForKey(kTVXBlacklistedAppBundleIDsKey);
+    return (news ? platform::toJson(*news) : "absent") + " " + (blacklisted ? platform::toJson(*blacklisted) : "absent");
   };
-
-  center->post("TVXBagChangeNotification", nullptr, {},
-               bagChangeUserInfo(bag(R"({"clients":{"news":{"enabled":false}}})")));
-  pool.drain();
-  managed.synchronize();
-  EXPECT_EQ(managed.objectForKey(kTVXFeatureSeekaraNewsAllowed), PropertyValue(false));
-  EXPECT_EQ(blacklisted(), "[]");
-
-  center->post("TVXBagChangeNotification", nullptr, {},
-               bagChangeUserInfo(bag(R"({"enabled":false,"clients":{"news":{"enabled":true}}})")));
-  pool.drain();
-  managed.synchronize();
-  EXPECT_EQ(managed.objectForKey(kTVXFeatureSeekaraNewsAllowed), PropertyValue(true));
-  EXPECT_EQ(blacklisted(), std::string("[\"") + kTVXSTSAppBundleIdentifier + "\"]");
+  EXPECT_EQ(announce(R"({"clients":{"news":{"enabled":false}}})"), "false []");
+  EXPECT_EQ(announce(R"({"enabled":false,"clients":{"news":{"enabled":true}}})"),
+            std::string("true [\"") + kTVXSTSAppBundleIdentifier + "\"]");
 }
 
 TEST_F(RequestFactoryTest, TheBagsProxyConfigurationDecidesEveryTasksProxy) {
   defaults->setObject("TVXUseMarvola", true);
   make();
   auto configure = [&](const char* json) {
-    center->post("TVXBagChangeNotification", nullptr, {},
-               bagChangeUserInfo(bag(json)));
+    postBag(json);
     return std::pair{factory->proxyGetStatus(), factory->proxyURL()};
   };
   EXPECT_EQ(configure(R"({"marvola_configuration":{"enabled":true}})"), std::pair(0, std::optional<std::string>()));
@@ -413,28 +389,17 @@ TEST_F(RequestFactoryTest, TheBagsProxyConfigurationDecidesEveryTasksProxy) {
   EXPECT_FALSE(factory->proxyURL());
 }
 
-TEST_F(RequestFactoryTest, ANewUserIdentifierStartsANewMapsSession) {
-  make();
-  auto search = factory->searchRequest(TVXSearchRequest{}, bag(R"({"search_url":"https://s.example/search"})"), "G");
-  ASSERT_TRUE(search);
-  EXPECT_EQ(location->sessionResets.load(), 0) << "building a request reads the session without a reset";
-  center->post("TVXUserGUIDChangeNotification");
-  factory->flushContextAccessQueue();
-  EXPECT_EQ(location->sessionResets.load(), 1);
-}
-
 TEST_F(RequestFactoryTest, SilhouetteTopicsWeighTheEngagedSuggestion) {
   make();
-  TVXBag searchBag = bag(R"({"search_url":"https://s.example/"})");
   factory->setSilhouetteTopics("plain-topics");
   TVXSearchRequest request;
-  EXPECT_EQ(queryOf(factory->searchRequest(request, searchBag, "G")->url)["sil"], "plain-topics");
+  EXPECT_EQ(searchQuery(request)["sil"], "plain-topics");
 
   factory->setSilhouetteTopics(R"({"sil":"s1","pv":3,"all":{"sport":0.5,"news":2}})");
   request.engagedSuggestion = TVXEngagedSuggestion{"x", platform::base64Encode(R"({"si":{"sport":4,"art":3}})")};
-  EXPECT_EQ(queryOf(factory->searchRequest(request, searchBag, "G")->url)["sil"], R"({"art":0.0,"sport":2.0})");
+  EXPECT_EQ(searchQuery(request)["sil"], R"({"art":0.0,"sport":2.0})");
   request.engagedSuggestion->fbr = "not base64!";
-  EXPECT_EQ(queryOf(factory->searchRequest(request, searchBag, "G")->url)["sil"], "s1");
+  EXPECT_EQ(searchQuery(request)["sil"], "s1");
 }
 
 }  // namespace

@@ -2,67 +2,11 @@
 
 #include <gtest/gtest.h>
 
-#include <chrono>
 #include <cmath>
 #include <limits>
-#include <vector>
 
 namespace tavix::platform {
 namespace {
-
-using namespace std::chrono_literals;
-
-struct VirtualClockTest : ::testing::Test {
-  DispatchPool pool{2};
-  SerialQueue queue{pool, "test.clock"};
-  VirtualClock clock;
-};
-
-TEST_F(VirtualClockTest, WorkScheduled900SecondsAheadFiresOnceWhenTimePassesIt) {
-  const TimePoint start = clock.now();
-  int fired = 0;
-  TimePoint firedAt{};
-  clock.after(seconds(900), queue, [&] {
-    fired++;
-    firedAt = clock.now();
-  });
-  // Cancelling through a copy of the handle cancels the one timer they share.
-  TimerHandle copy = clock.after(seconds(5), queue, [&] { fired += 100; });
-  copy.cancel();
-  clock.advance(seconds(899.999));
-  EXPECT_EQ(fired, 0);
-  clock.advance(1ms);
-  EXPECT_EQ(fired, 1);
-  EXPECT_EQ(firedAt, start + seconds(900));
-  clock.advance(seconds(3600));
-  EXPECT_EQ(fired, 1);
-  EXPECT_EQ(clock.pendingTimers(), 0u);
-}
-
-TEST_F(VirtualClockTest, FiresInDueOrderWithTiesInOrderSetAndFollowsTimersSetByTimers) {
-  std::vector<std::string> order;
-  clock.after(seconds(20), queue, [&] { order.push_back("b@20"); });
-  clock.after(seconds(10), queue, [&] {
-    order.push_back("a@10");
-    // Falls inside the same advance: must fire within it, before c.
-    clock.after(seconds(5), queue, [&] { order.push_back("nested@15"); });
-  });
-  clock.after(seconds(20), queue, [&] { order.push_back("c@20"); });
-  clock.advance(seconds(30));
-  EXPECT_EQ(order, (std::vector<std::string>{"a@10", "nested@15", "b@20", "c@20"}));
-}
-
-TEST_F(VirtualClockTest, RepeatingTimerRunsEveryIntervalUntilStopped) {
-  std::vector<double> at;
-  const double t0 = toUnixSeconds(clock.now());
-  RepeatingTimer timer(clock, queue);
-  queue.sync([&] { timer.start(seconds(60), [&] { at.push_back(toUnixSeconds(clock.now()) - t0); }); });
-  clock.advance(seconds(185));
-  EXPECT_EQ(at, (std::vector<double>{60, 120, 180}));
-  queue.sync([&] { timer.stop(); });
-  clock.advance(seconds(600));
-  EXPECT_EQ(at.size(), 3u);
-}
 
 TEST(Seconds, ValuesFromOutsideSaturateInsteadOfOverflowing) {
   EXPECT_EQ(seconds(std::nan("")), Duration::zero());

@@ -49,11 +49,8 @@ TEST(JsonValue, WritesTextThatReadsBackAndReplacesBadUTF8) {
 }
 
 TEST(JsonValue, Base64RoundTripsAndRejectsForeignCharacters) {
-  for (std::string s : std::vector<std::string>{"", "fo", "foo", "foob", std::string("\0\xff\x10", 3)}) {
-    auto back = base64Decode(base64Encode(s));
-    ASSERT_TRUE(back.has_value()) << s;
-    EXPECT_EQ(*back, s);
-  }
+  for (std::string s : std::vector<std::string>{"", "fo", "foo", "foob", std::string("\0\xff\x10", 3)})
+    EXPECT_EQ(base64Decode(base64Encode(s)), s);
   EXPECT_EQ(*base64Decode("Zm9vYg"), "foob");
   EXPECT_FALSE(base64Decode("Zm9v YmFy").has_value());
   EXPECT_FALSE(base64Decode("Z").has_value());

@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <deque>
-#include <fstream>
 #include <functional>
 #include <future>
 
@@ -15,17 +14,16 @@ namespace {
 
 using QueriesTest = QueryFixture;
 
-// Sends one query of each kind; `path` is the devserver path that kind reaches.
+// Sends one query of each kind.
 struct Kind {
   const char* name;
-  const char* path;
   std::function<void(ClientState&, std::uint64_t, TVXReplyBlock)> send;
 };
 
 template <typename Request>
-Kind kind(const char* name, const char* path, void (ClientState::*method)(std::shared_ptr<const Request>, TVXReplyBlock),
+Kind kind(const char* name, void (ClientState::*method)(std::shared_ptr<const Request>, TVXReplyBlock),
           std::string text, std::function<void(Request&)> adjust = {}) {
-  return {name, path, [=](ClientState& state, std::uint64_t id, TVXReplyBlock reply) {
+  return {name, [=](ClientState& state, std::uint64_t id, TVXReplyBlock reply) {
             auto request = std::make_shared<Request>();
             request->queryId = id;
             request->queryString = text;
@@ -35,24 +33,18 @@ Kind kind(const char* name, const char* path, void (ClientState::*method)(std::s
           }};
 }
 
-std::vector<Kind> allKinds() {
-  // Searches differ by id, so that none is answered from the query cache.
-  return {kind<TVXSearchRequest>("search", "/search", &ClientState::search, "",
-                                 [](auto& r) { r.queryString = "camera" + std::to_string(r.queryId); }),
-          kind("zero-keyword", "/search", &ClientState::zeroKeyword, ""),
-          kind("more results", "/more", &ClientState::moreResults, "ca"),
-          kind("card", "/card", &ClientState::card, ""),
-          kind("look-up", "/search", &ClientState::lookup, "serendipity"),
-          kind<TVXFlightSearchRequest>("flight", "/flight", &ClientState::flightSearch, "",
-                                       [](auto& f) { f.flightQuery = "UA 123"; })};
-}
-
 TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
   // Short timeouts so that a hanging back end ends quickly: 0.4 s without progress per attempt,
   // and for look-ups and flights a deadline of 1.0 - 0.5 s.
   serveBag(bagWith({{"request_timeout_s", 0.4}, {"search_render_timeout_ms", 1000}}));
   auto state = make("com.norvel.seekara", "Seekara/1.0");
-  const auto kinds = allKinds();
+  // Searches differ by id, so that none is answered from the query cache.
+  const std::vector<Kind> kinds = {
+      kind<TVXSearchRequest>("search", &ClientState::search, "",
+                             [](auto& r) { r.queryString = "camera" + std::to_string(r.queryId); }),
+      kind("zero-keyword", &ClientState::zeroKeyword, ""), kind("more results", &ClientState::moreResults, "ca"),
+      kind("card", &ClientState::card, ""), kind("look-up", &ClientState::lookup, "serendipity"),
+      kind<TVXFlightSearchRequest>("flight", &ClientState::flightSearch, "", [](auto& f) { f.flightQuery = "UA 123"; })};
 
   struct Outcome {
     std::string what;
@@ -60,29 +52,16 @@ TEST_F(QueriesTest, EveryKindRepliesExactlyOnceWhateverTheBackEndDoes) {
   };
   std::vector<Outcome> outcomes;
   std::uint64_t id = 100;
-  auto sendAll = [&](const std::string& backEnd) {
+  // Each kind's good answer is checked in a test of its own.
+  for (const auto& [backEnd, settings] : std::vector<std::pair<std::string, platform::Dictionary>>{
+           {"hanging", {{"hang", true}}}, {"resetting", {{"reset", true}}}, {"garbage", {{"body", "\x01garbage\xff"}}}}) {
+    for (const char* path : {"/search", "/more", "/card", "/flight"}) fault(path, settings);
     for (const auto& kind : kinds) {
       outcomes.push_back({backEnd + " " + kind.name});
       kind.send(*state, ++id, outcomes.back().replies->block());
     }
-  };
-  auto waitAll = [&] {
     for (auto& outcome : outcomes) outcome.replies->first(15000);
-  };
-  auto onEveryPath = [&](platform::Dictionary settings) {
-    for (const char* path : {"/search", "/more", "/card", "/flight"}) fault(path, settings);
-  };
-
-  // Each kind's good answer is checked in a test of its own.
-  onEveryPath({{"hang", true}});
-  sendAll("hanging");
-  waitAll();
-  onEveryPath({{"reset", true}});
-  sendAll("resetting");
-  waitAll();
-  onEveryPath({{"body", "\x01garbage\xff"}});
-  sendAll("garbage");
-  waitAll();
+  }
 
   for (std::size_t i = 0; i < outcomes.size(); ++i) {
     const auto call = outcomes[i].replies->first(0);
@@ -200,30 +179,6 @@ TEST_F(QueriesTest, LookupsFlightsAndZeroKeywordRecordWhatTheyAskedFor) {
   const auto sent = received("/search");
   ASSERT_EQ(sent.size(), 2u);
   EXPECT_EQ(sent[1].at("qtype"), platform::PropertyValue("zkw"));
-}
-
-TEST_F(QueriesTest, FlightDebugDataAnswersFromTheLocalFileWithoutTheNetwork) {
-  serveBag(bagWith());
-  const auto file = home.cache() / "flights.json";
-  std::ofstream(file) << R"([{"carrier_code": "UA", "flight_number": "123", "status": "landed"},
-                             {"carrier_code": "LH", "flight_number": 400, "status": "boarding"}])";
-  defaults->setObject("TVXFlightUseDebugData", true);
-  defaults->setObject("TVXFlightDebugDataLocation", "file://" + file.string());
-  auto state = make("com.norvel.flightinfo", "FlightInfo/1.0");
-  auto flight = request<TVXFlightSearchRequest>(60, "");
-  flight->flightQuery = "lh 400";
-  Replies found;
-  state->flightSearch(flight, found.block());
-  auto call = found.first();
-  ASSERT_TRUE(call.reply);
-  EXPECT_NE(call.reply->data.find("boarding"), std::string::npos);
-  EXPECT_EQ(call.reply->data.find("landed"), std::string::npos);
-
-  defaults->setObject("TVXFlightDebugDataLocation", "file://" + (home.cache() / "missing.json").string());
-  Replies missing;
-  state->flightSearch(flight, missing.block());
-  EXPECT_TRUE(missing.first().error);
-  EXPECT_TRUE(received("/flight").empty());
 }
 
 // Timers and deadlines on a clock the test moves.

@@ -2,8 +2,6 @@
 // change downloads, with which headers, and what it leaves in the caches folder.
 #include "resources/download_manager.h"
 
-#include <sys/stat.h>
-
 #include <gtest/gtest.h>
 
 #include <mutex>
@@ -118,9 +116,7 @@ TEST_F(DownloadManagerTest, FetchesAfterTheBeginDateThenOnlyWhatChangedOrWentMis
   EXPECT_EQ(requests[0]["headers"]["x-norvel-download-reason"], "update");
   EXPECT_FALSE(requests[0]["headers"].contains("if-none-match"));
   EXPECT_EQ(d.file("dicts"), "[\"wn\",\"gcide\",\"moby-thesaurus\"]\n");
-  struct stat st {};
-  ASSERT_EQ(::stat((caches / "dicts").c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  EXPECT_EQ(platform::fs::status(caches / "dicts").permissions(), platform::fs::perms(0600));
   EXPECT_EQ(takePosted(), std::vector<std::string>{"TVXFileDownloadCompletedNotification dicts"});
   EXPECT_EQ(postedURL, "file://" + (caches / "dicts").string());
   EXPECT_EQ(d.manager->resourceVersions(), (std::map<std::string, std::string>{{"dicts", "3"}}));

@@ -1,7 +1,6 @@
 #include "resources/lookup.h"
 
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 
 #include <fstream>
 
@@ -35,15 +34,7 @@ struct CountingStore final : LookupHintsStore {
   std::map<int, int> pushes;
 };
 
-std::string contents(const fs::path& path) {
-  std::ifstream in(path, std::ios::binary);
-  return std::string(std::istreambuf_iterator<char>(in), {});
-}
-
-unsigned mode(const fs::path& path) {
-  struct stat st {};
-  return ::stat(path.c_str(), &st) == 0 ? st.st_mode & 0777 : 0;
-}
+using testing::readFile;
 
 class LookupTest : public ::testing::Test {
  protected:
@@ -75,10 +66,10 @@ TEST_F(LookupTest, HintsFilesReachTheStoreAndLeaveItWithTheirResource) {
   versions->versions[kTVXLookupHintsWeekly] = "c-d-b";
   place(kTVXLookupHintsWeekly, R"({"hints": ["serendipity"]})");
   downloaded(kTVXLookupHintsWeekly);
-  EXPECT_EQ(contents(store->files.dataPath(kTVXLookupSourceKindWeekly)), R"({"hints": ["serendipity"]})");
+  EXPECT_EQ(readFile(store->files.dataPath(kTVXLookupSourceKindWeekly)), R"({"hints": ["serendipity"]})");
   EXPECT_EQ(store->hintsSourceGetClientSignature(kTVXLookupSourceKindWeekly), "c-d-b");
-  EXPECT_EQ(mode(store->files.dataPath(kTVXLookupSourceKindWeekly)), 0600u);
-  EXPECT_EQ(mode(caches / kLookupHintsStoreFolder), 0700u);
+  EXPECT_EQ(fs::status(store->files.dataPath(kTVXLookupSourceKindWeekly)).permissions(), fs::perms(0600));
+  EXPECT_EQ(fs::status(caches / kLookupHintsStoreFolder).permissions(), fs::perms(0700));
 
   center->post(kTVXFileDeletedNotification, nullptr, {}, {{"identifier", kTVXLookupHintsWeekly}});
   lookup->drainQueue();
@@ -121,7 +112,7 @@ TEST_F(LookupTest, StartUpPushesOnlyHintsWhoseSignatureIsStale) {
   center->post(kTVXStartupNotification);
   lookup->drainQueue();
   EXPECT_EQ(store->pushes, (std::map<int, int>{{kTVXLookupSourceKindMonthly, 1}}));
-  EXPECT_EQ(contents(store->files.dataPath(kTVXLookupSourceKindMonthly)), R"({"month": 2})");
+  EXPECT_EQ(readFile(store->files.dataPath(kTVXLookupSourceKindMonthly)), R"({"month": 2})");
   EXPECT_EQ(store->hintsSourceGetClientSignature(kTVXLookupSourceKindMonthly), "m2");
 }
 

@@ -53,8 +53,7 @@ TEST(URL, AppendedQueryItemGoesAfterTheOthersAndBeforeTheFragment) {
   url->appendQueryItem("ty pe", "a b+c/é&=x");
   const auto items = decodedQueryItems(url->query().value_or(""));
   ASSERT_EQ(items.size(), 2u);
-  EXPECT_EQ(items[1].first, "ty pe");
-  EXPECT_EQ(items[1].second, "a b+c/é&=x");
+  EXPECT_EQ(items[1], std::pair(std::string("ty pe"), std::optional<std::string>("a b+c/é&=x")));
 }
 
 }  // namespace

@@ -1,5 +1,4 @@
 #include <sys/socket.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -7,6 +6,7 @@
 
 #include <atomic>
 #include <condition_variable>
+#include <future>
 #include <mutex>
 
 #include "platform/clock.h"
@@ -27,10 +27,7 @@ TEST(FrameDecoder, ReassemblesFramesSplitAnywhereAndRefusesOversizeHeaders) {
     decoder.append(&c, 1);
     while (auto p = decoder.next()) got.push_back(*p);
   }
-  ASSERT_EQ(got.size(), 3u);
-  EXPECT_EQ(got[0], "hello");
-  EXPECT_EQ(got[1], "");
-  EXPECT_EQ(got[2], std::string(300, 'x'));
+  EXPECT_EQ(got, (std::vector<std::string>{"hello", "", std::string(300, 'x')}));
   EXPECT_EQ(decoder.buffered(), 0u);
 
   FrameDecoder small(8);
@@ -95,21 +92,13 @@ TEST(IpcServer, DeliversFramesAndDescriptorsBothWaysWithPeerCredentials) {
   auto listener = IpcListener::listen(pool, path, log, &ec);
   ASSERT_TRUE(listener) << ec.message();
 
-  struct stat st{};
-  ASSERT_EQ(::stat(path.c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0600u);
-  ASSERT_EQ(::stat((home.runtime() / "svc").c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0700u);
+  EXPECT_EQ(std::filesystem::status(path).permissions(), std::filesystem::perms(0600));
+  EXPECT_EQ(std::filesystem::status(home.runtime() / "svc").permissions(), std::filesystem::perms(0700));
 
   Received r;
-  std::mutex lock;
-  std::shared_ptr<IpcConnection> server;
-  listener->resume(
-      [&](const std::shared_ptr<IpcConnection>& c) {
-        std::lock_guard l(lock);
-        server = startRecording(c, r);
-      },
-      "test.connection");
+  std::promise<std::shared_ptr<IpcConnection>> accepted;
+  listener->resume([&](const std::shared_ptr<IpcConnection>& c) { accepted.set_value(startRecording(c, r)); },
+                   "test.connection");
 
   UniqueFd client;
   ASSERT_FALSE(connectTo(path, &client));
@@ -133,13 +122,8 @@ TEST(IpcServer, DeliversFramesAndDescriptorsBothWaysWithPeerCredentials) {
     ASSERT_EQ(::read(readEnd.get(), &c, 1), 1);
     EXPECT_EQ(c, 'z');
   }
-  std::shared_ptr<IpcConnection> s;
-  {
-    std::lock_guard l(lock);
-    s = server;
-  }
-  EXPECT_EQ(s->peer().pid, ::getpid());
-  EXPECT_EQ(s->peer().uid, ::geteuid());
+  const std::shared_ptr<IpcConnection> s = accepted.get_future().get();
+  EXPECT_EQ(std::pair(s->peer().pid, s->peer().uid), std::pair(::getpid(), ::geteuid()));
 
   // A reply larger than the socket buffer must arrive whole, and in order.
   const std::string large(3 * 1024 * 1024, 'L');
@@ -238,10 +222,8 @@ TEST(IpcServer, RefusesPeersOfAnotherUser) {
   auto listener = IpcListener::listen(pool, (dir / "socket").string(), log, &ec);
   ASSERT_TRUE(listener);
   // Let the other user reach the socket, so that only the credential check stands in the way.
-  std::filesystem::permissions(home.root(), std::filesystem::perms::all);
-  std::filesystem::permissions(home.runtime(), std::filesystem::perms::all);
-  std::filesystem::permissions(dir, std::filesystem::perms::all);
-  std::filesystem::permissions(dir / "socket", std::filesystem::perms::all);
+  for (const auto& path : {home.root(), home.runtime(), dir, dir / "socket"})
+    std::filesystem::permissions(path, std::filesystem::perms::all);
   std::atomic<int> accepted{0};
   listener->resume([&](const std::shared_ptr<IpcConnection>&) { ++accepted; }, "test.connection");
 
