@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include "bagview/tvx_bag.h"
 #include "context/user_guid_controller.h"
 #include "feedback/persistent_storage.h"
 #include "platform/defaults.h"
@@ -15,13 +16,15 @@ struct ManagerFixture : testing::TestAssembly {
   std::shared_ptr<TavixUserGUIDController> guid;
   std::shared_ptr<ClientSessionManager> manager;
 
-  explicit ManagerFixture(bool shared = false, std::int64_t softLimit = 600) : testing::TestAssembly(4) {
+  explicit ManagerFixture(bool shared = false, std::int64_t softLimit = 600,
+                          std::shared_ptr<TVXInMemoryBagSource> bag = nullptr)
+      : testing::TestAssembly(4) {
     assembly.sharedSession = shared;
     defaults->registerDefaults({{"TVXSessionSoftLimitOverride", platform::PropertyValue(softLimit)},
                                 {"TVXSessionIdleTimeOverride", platform::PropertyValue(std::int64_t{180})}});
     makeStorage();
     guid = makeGUIDController();
-    manager = std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), guid, nullptr, "tavix");
+    manager = std::make_shared<ClientSessionManager>(sessionManagerEnvironment(assembly), guid, bag, "tavix");
   }
   ~ManagerFixture() { pool.drain(); }
 
@@ -191,6 +194,32 @@ TEST(ClientSessionManager, SharedSessionKeepsOneMemberPerClientAndClosesThemToge
       EXPECT_TRUE(s.feedbacks(1).payload().has_connection_invalidated());
     }
   }
+}
+
+// What a user shares is the bag's to allow, client by client; a bag that does not say so allows
+// nothing.
+TEST(ClientSessionManager, OnlyTheClientsTheBagAllowsHaveTheirFeedbackKept) {
+  struct Bag : TVXInMemoryBagSource {
+    std::shared_ptr<const TVXBag> bag;
+    std::shared_ptr<const TVXBag> inMemoryBag() override { return bag; }
+  };
+  using platform::Dictionary;
+  auto source = std::make_shared<Bag>();
+  source->bag = std::make_shared<const TVXBag>(
+      Dictionary{{"feedback_enabled", true}, {"clients", Dictionary{{"brovane", Dictionary{{"feedback_enabled", false}}}}}},
+      "");
+  ManagerFixture f(true, 600, source);
+  f.send(39, 0, "seekara/1");
+  f.send(39, 10, "brovane/2");
+  f.manager->flushSession();
+  auto sessions = f.closed();
+  ASSERT_EQ(sessions.size(), 1u);
+  EXPECT_EQ(sessions[0].agent(), "seekara/1");
+
+  source->bag = std::make_shared<const TVXBag>(Dictionary{}, "");
+  f.send(39, 20, "seekara/1");
+  f.manager->flushSession();
+  EXPECT_EQ(f.closed().size(), 1u);
 }
 
 }  // namespace

@@ -131,6 +131,7 @@ std::vector<std::string> present(const std::map<std::string, std::string>& items
 }
 
 TEST_F(RequestFactoryTest, SearchRequestCarriesTheContextInNameOrder) {
+  providers.appWhitelistSignature = [] { return std::optional<std::string>("sig"); };
   make();
   TVXSearchRequest request;
   request.queryString = "a b+c";
@@ -157,10 +158,9 @@ TEST_F(RequestFactoryTest, SearchRequestCarriesTheContextInNameOrder) {
   EXPECT_THAT(q, ::testing::IsSupersetOf(items));
   EXPECT_EQ(present(q, {"suggest_queries", "latlng", "rm", "mode", "du_enabled"}), std::vector<std::string>{});
 
-  // The app signature header is the daemon's context test's.
   const std::map<std::string, std::string> headers = {{"X-Norvel-Languages", R"(["fr-FR","en-GB","de"])"},
       {"X-Norvel-UserGuid", "GUID-1"}, {"X-Norvel-UI-Scale", "2.0"}, {"X-Norvel-TopTopics", R"({"t":1})"},
-      {"X-Norvel-GeoSession", "S1 4 2.500000"}};
+      {"X-Norvel-GeoSession", "S1 4 2.500000"}, {"X-Norvel-Whitelisted-App-Signature", "sig"}};
   for (const auto& [name, value] : headers) EXPECT_EQ(built->headers.get(name), value) << name;
   EXPECT_DOUBLE_EQ(built->timeoutInterval, 4);
 

@@ -57,9 +57,9 @@ class RetryableRequestTest : public ::testing::Test {
   }();
 };
 
-// Retries through a proxy, an undelayed budget spent and a status that ends the retries are the
-// query and bag tests'; here, the bag fetch's whole delayed budget, and the timing of the attempt
-// that answered.
+// Retries through a proxy and an undelayed budget spent are the query tests'; here, the bag
+// fetch's whole delayed budget, the timing of the attempt that answered, and a server error that
+// ends the retries.
 TEST_F(RetryableRequestTest, DelayedRetriesAreSpacedOnTheClockAndTheAnsweringAttemptIsTimed) {
   call("/_faults", "POST", R"({"path":"/bag","drop":true})");
   Result spent;
@@ -83,8 +83,15 @@ TEST_F(RetryableRequestTest, DelayedRetriesAreSpacedOnTheClockAndTheAnsweringAtt
   ASSERT_TRUE(waitFor([&] { return recovered.calls == 1; }));
   EXPECT_FALSE(recovered.error);
   EXPECT_GT(recovered.metrics.firstByteSeconds, 0);
+
+  call("/_reset", "POST");
+  call("/_faults", "POST", R"({"path":"/search","status":500})");
+  Result serverError;
+  send("/search?q=w", clock.now() + seconds(10), false, 3, serverError);
+  ASSERT_TRUE(waitFor([&] { return serverError.calls == 1; }));
+  EXPECT_EQ(attemptsOnTheWire(), 1u);
   pool.drain();
-  EXPECT_EQ(spent.calls + recovered.calls, 2);
+  EXPECT_EQ(spent.calls + recovered.calls + serverError.calls, 3);
   EXPECT_EQ(clock.pendingTimers(), 0u);
 }
 
