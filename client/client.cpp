@@ -1,8 +1,8 @@
 #include "tavix/client.h"
 
 #include <poll.h>
+#include <sys/eventfd.h>
 #include <sys/socket.h>
-#include <sys/timerfd.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -52,23 +52,9 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
   struct Link {
     ipc::UniqueFd fd;
     std::mutex writeLock;
-    // Wakes the reader at the earliest deadline of its calls. A caller arms it for a sooner one,
-    // which wakes no one now: the reader sleeps until an answer comes or a call is due.
-    ipc::UniqueFd timer{::timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC | TFD_NONBLOCK)};
-    Steady::time_point armedFor = Steady::time_point::max();  // guarded by Impl::lock
-
-    // With Impl::lock held. The steady clock is CLOCK_MONOTONIC.
-    void arm(Steady::time_point deadline) {
-      armedFor = deadline;
-      itimerspec at{};  // all zero: disarmed
-      if (deadline != Steady::time_point::max()) {
-        const auto ns = std::chrono::duration_cast<std::chrono::nanoseconds>(deadline.time_since_epoch()).count();
-        at.it_value.tv_sec = std::max<std::int64_t>(ns / 1000000000, 0);
-        at.it_value.tv_nsec = ns % 1000000000;
-        if (at.it_value.tv_sec == 0 && at.it_value.tv_nsec == 0) at.it_value.tv_nsec = 1;  // zero would disarm
-      }
-      ::timerfd_settime(timer.get(), TFD_TIMER_ABSTIME, &at, nullptr);
-    }
+    // Wakes the reader when a call comes due before the time it sleeps until.
+    ipc::UniqueFd wake{::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)};
+    Steady::time_point sleepsUntil = Steady::time_point::max();  // guarded by Impl::lock
   };
   struct Pending {
     std::shared_ptr<Link> link;
@@ -109,7 +95,6 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
                      for (int fd : fds) ::close(fd);
                    },
                    deadlineFromNow()};
-    fresh->arm(pending[id].deadline);
     link = fresh;
     everConnected = true;
     ++readers;
@@ -130,13 +115,14 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
     // announces, oldest first.
     std::deque<ipc::UniqueFd> received;
     for (;;) {
-      pollfd fds[2] = {{l->fd.get(), POLLIN, 0}, {l->timer.get(), POLLIN, 0}};
-      if (::poll(fds, 2, -1) < 0 && errno != EINTR) break;
+      pollfd fds[2] = {{l->fd.get(), POLLIN, 0}, {l->wake.get(), POLLIN, 0}};
+      if (::poll(fds, 2, millisecondsToNextDeadline(l)) < 0 && errno != EINTR) break;
       if (fds[1].revents & POLLIN) {
-        std::uint64_t expirations;
-        [[maybe_unused]] auto ignored = ::read(l->timer.get(), &expirations, sizeof expirations);
-        expireCalls(l);
+        std::uint64_t ignored;
+        while (::read(l->wake.get(), &ignored, sizeof ignored) > 0) {
+        }
       }
+      expireCalls(l);
       if (!(fds[0].revents & (POLLIN | POLLHUP | POLLERR))) continue;
       std::vector<int> passed;
       std::size_t n = 0;
@@ -151,24 +137,33 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
     tCurrentReader = nullptr;
   }
 
-  // Fails the calls of `l` whose deadline has passed (a reply that comes later finds nothing),
-  // and arms the timer for the next one.
+  // How long the reader may sleep before a call of `l` is due; -1 for as long as it likes.
+  int millisecondsToNextDeadline(const std::shared_ptr<Link>& l) {
+    std::lock_guard g(lock);
+    auto next = Steady::time_point::max();
+    for (const auto& [id, call] : pending) {
+      if (call.link == l) next = std::min(next, call.deadline);
+    }
+    l->sleepsUntil = next;
+    if (next == Steady::time_point::max()) return -1;
+    const auto left = std::chrono::ceil<std::chrono::milliseconds>(next - Steady::now()).count();
+    return static_cast<int>(std::clamp<std::int64_t>(left, 0, 60 * 60 * 1000));
+  }
+
+  // Fails the calls of `l` whose deadline has passed; a reply that comes later finds nothing.
   void expireCalls(const std::shared_ptr<Link>& l) {
     std::vector<DescriptorReply> expired;
     {
       std::lock_guard g(lock);
       const auto now = Steady::now();
-      auto next = Steady::time_point::max();
       for (auto it = pending.begin(); it != pending.end();) {
         if (it->second.link == l && it->second.deadline <= now) {
           expired.push_back(std::move(it->second.reply));
           it = pending.erase(it);
         } else {
-          if (it->second.link == l) next = std::min(next, it->second.deadline);
           ++it;
         }
       }
-      l->arm(next);
     }
     for (auto& reply : expired) {
       reply(nullptr, {}, clientError(kTimedOut, "no reply from tavixd in " + std::to_string(options.timeoutMs) + " ms"));
@@ -260,8 +255,12 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
     auto target = link;
     const auto deadline = deadlineFromNow();
     pending[id] = {target, std::move(reply), deadline};
-    if (deadline < target->armedFor) target->arm(deadline);
+    const bool sooner = deadline < target->sleepsUntil;
     l.unlock();
+    if (sooner) {
+      const std::uint64_t one = 1;
+      [[maybe_unused]] auto ignored = ::write(target->wake.get(), &one, sizeof one);
+    }
     if (!write(target, message)) {
       DescriptorReply failed;
       {
