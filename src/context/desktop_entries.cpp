@@ -26,10 +26,15 @@ std::string_view trim(std::string_view s) {
 std::optional<std::string> readBounded(const fs::path& path) {
   std::ifstream in(path, std::ios::binary);
   if (!in) return std::nullopt;
-  std::string text(kMaxDesktopFileSize + 1, '\0');
-  in.read(text.data(), static_cast<std::streamsize>(text.size()));
-  if (in.bad() || static_cast<std::size_t>(in.gcount()) > kMaxDesktopFileSize) return std::nullopt;
-  text.resize(static_cast<std::size_t>(in.gcount()));
+  // Read as it comes: entries are a few kilobytes, and a buffer the size of the limit would be
+  // written through for each one, and kept by the allocator once the scan is over.
+  std::string text;
+  char chunk[8192];
+  while (in.read(chunk, sizeof chunk) || in.gcount() > 0) {
+    text.append(chunk, static_cast<std::size_t>(in.gcount()));
+    if (text.size() > kMaxDesktopFileSize) return std::nullopt;
+  }
+  if (in.bad()) return std::nullopt;
   return text;
 }
 
