@@ -11,6 +11,7 @@
 #include <unistd.h>
 
 #include <benchmark/benchmark.h>
+#include <nlohmann/json.hpp>
 
 #include <algorithm>
 #include <atomic>
@@ -27,8 +28,10 @@
 
 #include "platform/defaults.h"
 #include "platform/dispatch.h"
+#include "platform/http/url.h"
 #include "platform/http/url_session.h"
 #include "support/daemon_process.h"
+#include "support/devserver_control.h"
 #include "support/devserver_process.h"
 #include "support/temp_home.h"
 #include "tavix/client.h"
@@ -118,6 +121,38 @@ std::string uniqueInput(std::uint64_t n) {
 
 std::atomic<std::uint64_t> nextInput{1};
 
+// A search as the daemon sends it, taken from the devserver's record of one: the direct baselines
+// send the same query items and headers with their own input, so that the devserver does the
+// same work per search on both sides of a ratio.
+class DirectSearch {
+ public:
+  static const DirectSearch& get();
+  tavix::platform::http::URLRequest request(const std::string& input) const {
+    tavix::platform::http::URLRequest r;
+    r.url = environment().server.base + "/search?q=" + tavix::platform::http::percentEncode(input) + items_;
+    for (const auto& [name, value] : headers_) r.headers.set(name, value);
+    return r;
+  }
+  bool valid() const { return valid_; }
+
+ private:
+  std::string items_;  // "&name=value…", every item but q
+  std::vector<std::pair<std::string, std::string>> headers_;
+  bool valid_ = false;
+};
+
+// The devserver keeps a record of every request; cleared between iterations so that what it
+// costs stays the same from the first iteration to the last.
+void clearDevserverRecord() {
+  static tavix::platform::DispatchPool pool(1);
+  static tavix::platform::http::URLSession session([] {
+    tavix::platform::http::URLSessionConfiguration c;
+    c.delegatePool = &pool;
+    return c;
+  }());
+  tavix::testing::devserverCall(session, environment().server.base, "/_reset", "POST");
+}
+
 client::Client* connectedClient(benchmark::State& state, std::unique_ptr<client::Client>& holder) {
   auto& env = environment();
   if (!env.error.empty()) {
@@ -132,6 +167,41 @@ client::Client* connectedClient(benchmark::State& state, std::unique_ptr<client:
   // The first search waits for the bag; keep it out of the figures.
   search(*holder, 0, "warm up");
   return holder.get();
+}
+
+const DirectSearch& DirectSearch::get() {
+  static const DirectSearch direct = [] {
+    DirectSearch d;
+    auto& env = environment();
+    if (!env.error.empty()) return d;
+    tavix::platform::DispatchPool pool(1);
+    tavix::platform::http::URLSessionConfiguration config;
+    config.delegatePool = &pool;
+    tavix::platform::http::URLSession session(config);
+    tavix::testing::devserverCall(session, env.server.base, "/_reset", "POST");
+    client::Client c(env.options());
+    if (c.connect() || !search(c, 0, uniqueInput(nextInput++))) return d;
+    const auto recorded = nlohmann::json::parse(tavix::testing::devserverCall(session, env.server.base, "/_recorded"),
+                                                nullptr, false);
+    if (!recorded.is_array()) return d;
+    for (const auto& entry : recorded) {
+      if (entry.value("path", "") != "/search") continue;
+      d.items_.clear();
+      d.headers_.clear();
+      for (const auto& [name, value] : entry["query"].items()) {
+        if (name != "q") d.items_ += "&" + tavix::platform::http::percentEncode(name) + "=" +
+                                     tavix::platform::http::percentEncode(value.get<std::string>());
+      }
+      for (const auto& [name, value] : entry["headers"].items()) {
+        // What the HTTP stack writes itself.
+        if (name == "host" || name == "accept-encoding" || name == "connection" || name == "content-length") continue;
+        d.headers_.emplace_back(name, value.get<std::string>());
+      }
+      d.valid_ = true;
+    }
+    return d;
+  }();
+  return direct;
 }
 
 void BM_KeystrokeThroughDaemon(benchmark::State& state) {
@@ -152,19 +222,22 @@ void BM_KeystrokeThroughDaemon(benchmark::State& state) {
 }
 BENCHMARK(BM_KeystrokeThroughDaemon)->UseRealTime()->Iterations(3000);
 
-// The floor of the line above: the same search straight to the devserver through the same HTTP
-// stack the daemon uses.
+// The floor of the line above: the same search, query items and headers as the daemon sends them,
+// straight to the devserver through the same HTTP stack.
 void BM_KeystrokeDirectHTTP(benchmark::State& state) {
-  auto& env = environment();
   tavix::platform::DispatchPool pool(1);
   tavix::platform::http::URLSessionConfiguration config;
   config.delegatePool = &pool;
   config.memoryCacheCapacity = 0;
   tavix::platform::http::URLSession session(config);
+  const auto& direct = DirectSearch::get();
+  if (!direct.valid()) {
+    state.SkipWithError("no search of the daemon's to copy");
+    return;
+  }
   std::vector<double> micros;
   for (auto _ : state) {
-    tavix::platform::http::URLRequest request;
-    request.url = env.server.base + "/search?q=" + uniqueInput(nextInput++);
+    const auto request = direct.request(uniqueInput(nextInput++));
     const auto start = Clock::now();
     std::promise<long> done;
     session.dataTask(request, [&](std::string, auto response, auto) { done.set_value(response ? response->statusCode : 0); })
@@ -387,6 +460,9 @@ void typeConcurrently(benchmark::State& state, pid_t daemon,
   double seconds = 0;
   LoadProbe probe(env.server.pid, portOf(env.server.base), daemon);
   for (auto _ : state) {
+    state.PauseTiming();
+    clearDevserverRecord();
+    state.ResumeTiming();
     const auto start = Clock::now();
     std::vector<std::thread> typists;
     for (int i = 0; i < kClients; ++i) {
@@ -422,8 +498,8 @@ void BM_FiftyClientsTyping(benchmark::State& state) {
 }
 BENCHMARK(BM_FiftyClientsTyping)->UseRealTime()->Iterations(10);
 
-// The floor of the line above: the same 50 typists' searches straight to the devserver, through
-// one session configured as the daemon's own (one transfer thread, connections kept 10 s,
+// The floor of the line above: the same 50 typists' searches, as the daemon sends them, straight to
+// the devserver through one session configured as the daemon's own (one transfer thread, connections kept 10 s,
 // multiplexing where the server offers it), as the daemon sends every client's searches.
 void BM_FiftyClientsDirectHTTP(benchmark::State& state) {
   auto& env = environment();
@@ -438,9 +514,13 @@ void BM_FiftyClientsDirectHTTP(benchmark::State& state) {
   config.multiplexing = true;
   config.requestTimeoutIsDeadline = true;
   tavix::platform::http::URLSession session(config);
+  const auto& direct = DirectSearch::get();
+  if (!direct.valid()) {
+    state.SkipWithError("no search of the daemon's to copy");
+    return;
+  }
   typeConcurrently(state, -1, [&](int, std::uint64_t n) {
-    tavix::platform::http::URLRequest request;
-    request.url = env.server.base + "/search?q=" + uniqueInput(n);
+    const auto request = direct.request(uniqueInput(n));
     std::promise<long> done;
     session.dataTask(request, [&](std::string, auto response, auto) { done.set_value(response ? response->statusCode : 0); })
         ->resume();
