@@ -61,7 +61,9 @@ struct IpcConnection::Impl {
   // which the close also takes, so that no write ever reaches a descriptor number reused since.
   asio::posix::stream_descriptor socket;
   FrameDecoder decoder;
-  std::string readBuffer;  // on `strand`; kept, so that a wake-up costs no allocation
+  // On `strand`; kept, so that a wake-up costs no allocation. Left uninitialized: only the pages
+  // a read writes into become resident, a few kilobytes for a client that sends small calls.
+  std::unique_ptr<char[]> readBuffer;
   std::size_t maxFrame;
   std::mutex writeLock;
   std::deque<Outgoing> outbox;  // under writeLock; not empty exactly while `writing`
@@ -125,12 +127,12 @@ void IpcConnection::Impl::armRead(const std::shared_ptr<IpcConnection>& self) {
 
 void IpcConnection::Impl::onReadable(const std::shared_ptr<IpcConnection>& self) {
   Impl& impl = *self->impl_;
-  std::string& buffer = impl.readBuffer;
-  if (buffer.empty()) buffer.resize(kReadChunk);
+  if (!impl.readBuffer) impl.readBuffer.reset(new char[kReadChunk]);
+  char* const buffer = impl.readBuffer.get();
   for (int round = 0; round < kReadsPerWakeup; ++round) {
     std::vector<int> fds;
     std::size_t n = 0;
-    auto ec = receiveWithFds(impl.socket.native_handle(), buffer.data(), buffer.size(), false, &fds, &n);
+    auto ec = receiveWithFds(impl.socket.native_handle(), buffer, kReadChunk, false, &fds, &n);
     if (!fds.empty()) {
       std::lock_guard lock(self->fdLock_);
       for (int fd : fds) self->receivedFds_.emplace_back(fd);
@@ -146,11 +148,11 @@ void IpcConnection::Impl::onReadable(const std::shared_ptr<IpcConnection>& self)
       close(self);
       return;
     }
-    impl.decoder.append(buffer.data(), n);
+    impl.decoder.append(buffer, n);
     // Paused, the read is not armed again: the peer's further bytes wait in its socket until a
     // call is answered.
     if (deliverFrames(self) != Delivery::More || self->closed_) return;
-    if (n < buffer.size()) break;  // drained for now
+    if (n < kReadChunk) break;  // drained for now
   }
   armRead(self);
 }
