@@ -110,7 +110,9 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
   void readLoop(const std::shared_ptr<Link>& l) {
     tCurrentReader = this;
     ipc::FrameDecoder decoder;
-    std::string buffer(64 * 1024, '\0');
+    // Uninitialized: only what reads write into becomes resident in the app.
+    constexpr std::size_t kChunk = 64 * 1024;
+    std::unique_ptr<char[]> buffer(new char[kChunk]);
     // Descriptors arrive with the first byte of their frame; each frame takes as many as it
     // announces, oldest first.
     std::deque<ipc::UniqueFd> received;
@@ -126,10 +128,10 @@ struct Client::Impl : std::enable_shared_from_this<Client::Impl> {
       if (!(fds[0].revents & (POLLIN | POLLHUP | POLLERR))) continue;
       std::vector<int> passed;
       std::size_t n = 0;
-      auto ec = ipc::receiveWithFds(l->fd.get(), buffer.data(), buffer.size(), true, &passed, &n);
+      auto ec = ipc::receiveWithFds(l->fd.get(), buffer.get(), kChunk, true, &passed, &n);
       for (int fd : passed) received.emplace_back(fd);
       if (ec || n == 0) break;
-      decoder.append(buffer.data(), n);
+      decoder.append(buffer.get(), n);
       while (auto payload = decoder.next()) dispatch(*payload, received);
       if (decoder.failed()) break;
     }
