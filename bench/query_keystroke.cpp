@@ -141,17 +141,20 @@ class DirectSearch {
   bool valid_ = false;
 };
 
-// The devserver keeps a record of every request; cleared between iterations so that what it
-// costs stays the same from the first iteration to the last.
-void clearDevserverRecord() {
+// The body of the devserver's answer to one of its control routes.
+std::string devserverControl(const std::string& path, const std::string& method = "GET") {
   static tavix::platform::DispatchPool pool(1);
   static tavix::platform::http::URLSession session([] {
     tavix::platform::http::URLSessionConfiguration c;
     c.delegatePool = &pool;
     return c;
   }());
-  tavix::testing::devserverCall(session, environment().server.base, "/_reset", "POST");
+  return tavix::testing::devserverCall(session, environment().server.base, path, method);
 }
+
+// The devserver keeps a record of every request; cleared between iterations so that what it
+// costs stays the same from the first iteration to the last.
+void clearDevserverRecord() { devserverControl("/_reset", "POST"); }
 
 client::Client* connectedClient(benchmark::State& state, std::unique_ptr<client::Client>& holder) {
   auto& env = environment();
@@ -174,20 +177,13 @@ const DirectSearch& DirectSearch::get() {
     DirectSearch d;
     auto& env = environment();
     if (!env.error.empty()) return d;
-    tavix::platform::DispatchPool pool(1);
-    tavix::platform::http::URLSessionConfiguration config;
-    config.delegatePool = &pool;
-    tavix::platform::http::URLSession session(config);
-    tavix::testing::devserverCall(session, env.server.base, "/_reset", "POST");
+    clearDevserverRecord();
     client::Client c(env.options());
     if (c.connect() || !search(c, 0, uniqueInput(nextInput++))) return d;
-    const auto recorded = nlohmann::json::parse(tavix::testing::devserverCall(session, env.server.base, "/_recorded"),
-                                                nullptr, false);
+    const auto recorded = nlohmann::json::parse(devserverControl("/_recorded"), nullptr, false);
     if (!recorded.is_array()) return d;
     for (const auto& entry : recorded) {
       if (entry.value("path", "") != "/search") continue;
-      d.items_.clear();
-      d.headers_.clear();
       for (const auto& [name, value] : entry["query"].items()) {
         if (name != "q") d.items_ += "&" + tavix::platform::http::percentEncode(name) + "=" +
                                      tavix::platform::http::percentEncode(value.get<std::string>());
@@ -198,6 +194,7 @@ const DirectSearch& DirectSearch::get() {
         d.headers_.emplace_back(name, value.get<std::string>());
       }
       d.valid_ = true;
+      break;  // the record was cleared just before: this is the search made above
     }
     return d;
   }();
